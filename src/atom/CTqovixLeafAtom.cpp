@@ -1,0 +1,139 @@
+#include "atom/CTqovixLeafAtom.h"
+
+#include <algorithm>
+#include <new>
+
+#include "atom/CTqovixAtomVisitor.h"
+#include "file/CTqovixFile.h"
+
+namespace {
+
+// The largest count one file read or write takes.
+constexpr uint64_t kMaxPiece = 4294967295ULL;
+
+}  // namespace
+
+CTqovixLeafAtom::CTqovixLeafAtom(eTqovixAtomType type, CTqovixFile* file, long long offset, uint64_t size,
+                                 bool largeHeader)
+    : m_type(type), m_pFile(file), m_offset(offset), m_size(size), m_bLargeHeader(largeHeader)
+{
+}
+
+uint64_t CTqovixLeafAtom::GetDataSize() const
+{
+    return m_pFile != nullptr ? m_size : m_data.size();
+}
+
+uint64_t CTqovixLeafAtom::GetSize() const
+{
+    return SizeWithHeader(GetDataSize(), m_bLargeHeader);
+}
+
+eTqovixErrorCode CTqovixLeafAtom::LoadData() const
+{
+    if (m_pFile == nullptr) {
+        return eTqovixSuccess;
+    }
+    const uint64_t size = GetDataSize();
+    if (size == 0) {
+        return eTqovixSuccess;
+    }
+    // A size that the file cannot hold must not turn into an allocation.
+    long long fileSize = 0;
+    eTqovixErrorCode result = m_pFile->GetFileSize(&fileSize);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    if (m_offset < 0 || m_offset > fileSize || size > static_cast<uint64_t>(fileSize - m_offset)) {
+        return eTqovixErrorInvalidMovie;
+    }
+    result = m_pFile->Seek(m_offset, CTqovixFile::eTqovixSeekBegin);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+
+    std::vector<uint8_t> data;
+    try {
+        data.resize(size);
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    } catch (const std::length_error&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    for (uint64_t done = 0; done < size;) {
+        const auto piece = static_cast<unsigned int>(std::min(kMaxPiece, size - done));
+        unsigned int readSize = 0;
+        result = m_pFile->Read(data.data() + done, &readSize, piece);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        if (readSize < piece) {
+            break;  // the file shrank under us; the tail stays zero
+        }
+        done += piece;
+    }
+    m_data = std::move(data);
+    m_pFile = nullptr;
+    return eTqovixSuccess;
+}
+
+const uint8_t* CTqovixLeafAtom::GetData() const
+{
+    if (TqovixFailed(LoadData()) || m_data.empty()) {
+        return nullptr;
+    }
+    return m_data.data();
+}
+
+void CTqovixLeafAtom::SetData(const void* data, uint64_t size)
+{
+    m_pFile = nullptr;
+    m_offset = 0;
+    m_size = 0;
+    if (data == nullptr || size == 0) {
+        m_data.clear();
+        return;
+    }
+    const auto* bytes = static_cast<const uint8_t*>(data);
+    m_data.assign(bytes, bytes + size);
+}
+
+eTqovixErrorCode CTqovixLeafAtom::Analyze(CTqovixAtomVisitor& visitor, const TqovixAtomPath& path) const
+{
+    TqovixAtomPath leafPath = path;
+    leafPath.push_back(m_type);
+    return visitor.Analyze(leafPath, *this);
+}
+
+eTqovixErrorCode CTqovixLeafAtom::Update(const CTqovixAtomVisitor& visitor, const TqovixAtomPath& path)
+{
+    TqovixAtomPath leafPath = path;
+    leafPath.push_back(m_type);
+    return visitor.Update(leafPath, *this);
+}
+
+eTqovixErrorCode CTqovixLeafAtom::Write(CTqovixFile& file) const
+{
+    if (!file.IsOpened()) {
+        return eTqovixErrorInternal;
+    }
+    // Load before the header goes out, so an unreadable payload leaves nothing half-written.
+    eTqovixErrorCode result = LoadData();
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    result = WriteHeader(file, m_bLargeHeader);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    const uint64_t size = m_data.size();
+    for (uint64_t done = 0; done < size;) {
+        const auto piece = static_cast<unsigned int>(std::min(kMaxPiece, size - done));
+        result = file.Write(m_data.data() + done, piece);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        done += piece;
+    }
+    return eTqovixSuccess;
+}

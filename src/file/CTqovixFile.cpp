@@ -1,0 +1,356 @@
+// Movies larger than 4 GiB are the norm, so positions must never pass through a 32-bit off_t.
+#ifndef _FILE_OFFSET_BITS
+#define _FILE_OFFSET_BITS 64
+#endif
+
+#include "file/CTqovixFile.h"
+
+#include <atomic>
+#include <cerrno>
+#include <cstring>
+#include <libgen.h>
+#include <linux/magic.h>
+#include <sys/statfs.h>
+#include <sys/types.h>
+#include <unistd.h>
+#include <vector>
+
+static_assert(sizeof(off_t) == 8, "file positions must be 64-bit");
+
+namespace {
+
+#ifndef EXFAT_SUPER_MAGIC
+#define EXFAT_SUPER_MAGIC 0x2011BAB0
+#endif
+constexpr uint32_t kNtfsMagic = 0x5346544e;  // ntfs3 and ntfs-3g's kernel side
+constexpr uint32_t kZfsMagic = 0x2fc12fc1;
+
+struct FileSystemName {
+    uint32_t magic;
+    const char* name;
+};
+
+// Only MSDOS_SUPER_MAGIC changes a decision; the rest names the volume for diagnostics.
+constexpr FileSystemName kFileSystemNames[] = {
+    {MSDOS_SUPER_MAGIC, "msdos"},
+    {EXT4_SUPER_MAGIC, "ext4"},  // ext2 and ext3 share the magic
+    {TMPFS_MAGIC, "tmpfs"},
+    {RAMFS_MAGIC, "ramfs"},
+    {XFS_SUPER_MAGIC, "xfs"},
+    {BTRFS_SUPER_MAGIC, "btrfs"},
+    {EXFAT_SUPER_MAGIC, "exfat"},
+    {F2FS_SUPER_MAGIC, "f2fs"},
+    {kNtfsMagic, "ntfs"},
+    {kZfsMagic, "zfs"},
+    {OVERLAYFS_SUPER_MAGIC, "overlay"},
+    {FUSE_SUPER_MAGIC, "fuse"},
+    {NFS_SUPER_MAGIC, "nfs"},
+    {CIFS_SUPER_MAGIC, "cifs"},
+    {SMB2_SUPER_MAGIC, "smb2"},
+    {SQUASHFS_MAGIC, "squashfs"},
+    {ISOFS_SUPER_MAGIC, "iso9660"},
+    {PROC_SUPER_MAGIC, "proc"},
+    {SYSFS_MAGIC, "sysfs"},
+};
+
+const char* FileSystemTypeName(uint32_t magic)
+{
+    for (const FileSystemName& entry : kFileSystemNames) {
+        if (entry.magic == magic) {
+            return entry.name;
+        }
+    }
+    return "unknown";
+}
+
+std::atomic<TqovixVolumeQuery> g_volumeQuery{&CTqovixFile::QueryVolume};
+
+// A 4 GiB file cannot exist on FAT: its size field is 32 bits wide.
+constexpr double kMsdosLargestFile = 4294967295.0;
+
+bool IsEmptyPath(const char* path) { return path == nullptr || path[0] == '\0'; }
+
+}  // namespace
+
+CTqovixFile::~CTqovixFile()
+{
+    Close();
+}
+
+eTqovixErrorCode CTqovixFile::Open(const char* path, int mode)
+{
+    if (m_bOpened) {
+        // Reopening would leak the held stream; callers close first.
+        return eTqovixErrorInternal;
+    }
+    if (IsEmptyPath(path)) {
+        if (mode == 1) {
+            return eTqovixErrorSourceNotFound;
+        }
+        return mode == 2 ? eTqovixErrorGeneral : eTqovixErrorInternal;
+    }
+
+    // "e" keeps the descriptor out of processes a host may spawn while a job runs.
+    const char* streamMode = "w+e";
+    if (mode == 1) {
+        if (access(path, R_OK) != 0) {
+            return ConvertErrnoToLocalError(errno, m_bReadOnly);
+        }
+        // fopen accepts a directory for reading and only the first read would fail.
+        if (chdir(path) == 0) {
+            return eTqovixErrorIsDirectory;
+        }
+        streamMode = "re";
+        m_bReadOnly = true;
+    } else {
+        m_bReadOnly = false;
+    }
+
+    FILE* stream = std::fopen(path, streamMode);
+    if (stream == nullptr) {
+        return ConvertErrnoToLocalError(errno, m_bReadOnly);
+    }
+    m_stream = stream;
+    m_bOpened = true;
+    return eTqovixSuccess;
+}
+
+void CTqovixFile::Close()
+{
+    if (m_stream != nullptr) {
+        std::fclose(m_stream);
+        m_stream = nullptr;
+    }
+    m_bOpened = false;
+}
+
+eTqovixErrorCode CTqovixFile::Read(void* buffer, unsigned int* readSize, unsigned int size)
+{
+    if (readSize == nullptr) {
+        return eTqovixErrorInternal;
+    }
+    *readSize = 0;
+    if (size == 0) {
+        return eTqovixSuccess;
+    }
+    if (m_stream == nullptr || buffer == nullptr) {
+        return eTqovixErrorInternal;
+    }
+
+    // Single-byte items, so a partial read reports its exact count.
+    const size_t count = std::fread(buffer, 1, size, m_stream);
+    const int error = errno;
+    *readSize = static_cast<unsigned int>(count);
+    if (count < size && !std::feof(m_stream) && std::ferror(m_stream)) {
+        std::clearerr(m_stream);
+        return ConvertErrnoToLocalError(error, m_bReadOnly);
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixFile::Write(const void* buffer, unsigned int size)
+{
+    if (size == 0) {
+        return eTqovixSuccess;
+    }
+    if (m_stream == nullptr || buffer == nullptr) {
+        return eTqovixErrorInternal;
+    }
+
+    if (std::fwrite(buffer, size, 1, m_stream) == 1) {
+        return eTqovixSuccess;
+    }
+    const int error = errno;
+    if (std::feof(m_stream)) {
+        return eTqovixErrorEndOfFile;
+    }
+    if (std::ferror(m_stream)) {
+        std::clearerr(m_stream);
+        return ConvertErrnoToLocalError(error, m_bReadOnly);
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixFile::Flush()
+{
+    if (m_stream == nullptr) {
+        return eTqovixErrorInternal;
+    }
+    if (std::fflush(m_stream) != 0) {
+        const int error = errno;
+        std::clearerr(m_stream);
+        return ConvertErrnoToLocalError(error, m_bReadOnly);
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixFile::GetPosition(long long* position) const
+{
+    if (m_stream == nullptr || position == nullptr) {
+        return eTqovixErrorInternal;
+    }
+    const off_t current = ftello(m_stream);
+    if (current < 0) {
+        return ConvertErrnoToLocalError(errno, m_bReadOnly);
+    }
+    *position = current;
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixFile::Seek(long long offset, eTqovixSeek origin)
+{
+    if (m_stream == nullptr) {
+        return eTqovixErrorInternal;
+    }
+    if (fseeko(m_stream, static_cast<off_t>(offset), origin) != 0) {
+        return ConvertErrnoToLocalError(errno, m_bReadOnly);
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixFile::GetFileSize(long long* size)
+{
+    if (size == nullptr) {
+        return eTqovixErrorInternal;
+    }
+    long long position = 0;
+    eTqovixErrorCode code = GetPosition(&position);
+    if (TqovixFailed(code)) {
+        return code;
+    }
+    code = Seek(0, eTqovixSeekEnd);
+    if (TqovixFailed(code)) {
+        return code;
+    }
+    code = GetPosition(size);
+    if (TqovixFailed(code)) {
+        return code;
+    }
+    return Seek(position, eTqovixSeekBegin);
+}
+
+eTqovixErrorCode CTqovixFile::SetFileSize(long long size)
+{
+    if (m_stream == nullptr) {
+        return eTqovixErrorInternal;
+    }
+    // Bytes still in the stream's buffer would land after the truncation and
+    // re-extend the file; a read buffer could hold bytes that no longer exist.
+    if (ftruncate(fileno(m_stream), static_cast<off_t>(size)) != 0) {
+        return ConvertErrnoToLocalError(errno, m_bReadOnly);
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixFile::ComfirmWritable(long long size, const char* path)
+{
+    if (IsEmptyPath(path)) {
+        return eTqovixErrorGeneral;
+    }
+
+    // dirname may write into its argument.
+    std::vector<char> copy(path, path + std::strlen(path) + 1);
+    const char* directory = dirname(copy.data());
+
+    TqovixVolumeInformation information;
+    const TqovixVolumeQuery query = g_volumeQuery.load();
+    if (!query(directory, &information)) {
+        return eTqovixErrorDestinationNotFound;
+    }
+
+    const uint64_t availableBytes = static_cast<uint64_t>(information.blockSize) * information.blocksAvailable;
+    const double available = static_cast<double>(availableBytes);
+    const double required = static_cast<double>(size) * 0.9;
+    if (required >= available) {
+        return eTqovixErrorDiskFull;
+    }
+    if (information.typeName == "msdos" && required >= kMsdosLargestFile) {
+        return eTqovixErrorFileTooLarge;
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixFile::Delete(const char* path)
+{
+    if (IsEmptyPath(path)) {
+        return eTqovixErrorGeneral;
+    }
+    if (unlink(path) != 0) {
+        return ConvertErrnoToLocalError(errno, false);
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixFile::ConvertErrnoToLocalError(int errorNumber, bool readOnly)
+{
+    switch (errorNumber) {
+    case EPERM:
+    case EACCES:
+        return readOnly ? eTqovixErrorSourceAccessDenied : eTqovixErrorDestinationAccessDenied;
+    case ENOENT:
+        return readOnly ? eTqovixErrorSourceNotFound : eTqovixErrorDestinationNotFound;
+    case ENOMEM:
+        return eTqovixErrorOutOfMemory;
+    case ENOSPC:
+        return eTqovixErrorDiskFull;
+    case EEXIST:
+        return eTqovixErrorFileExists;
+    case ENFILE:
+    case EMFILE:
+        return eTqovixErrorTooManyFiles;
+    case EISDIR:
+        return eTqovixErrorIsDirectory;
+    case E2BIG:
+    case EINVAL:
+    case EFBIG:
+    case ESPIPE:
+    case EROFS:
+    case EDOM:
+    case ENAMETOOLONG:
+    case EOVERFLOW:
+        return eTqovixErrorInvalidArgument;
+    case ENXIO:
+    case ENOTBLK:
+    case EBUSY:
+    case EXDEV:
+    case ENODEV:
+#ifdef EPWROFF
+    case EPWROFF:
+#endif
+#ifdef EDEVERR
+    case EDEVERR:
+#endif
+        return eTqovixErrorDevice;
+    case ENOTEMPTY:
+        return eTqovixErrorInternal;
+    default:
+        break;
+    }
+    // EHWPOISON is the highest error number Linux defines.
+    if (errorNumber >= 1 && errorNumber <= EHWPOISON) {
+        return eTqovixErrorGeneral;
+    }
+    return eTqovixErrorInternal;
+}
+
+TqovixVolumeQuery CTqovixFile::SetVolumeQuery(TqovixVolumeQuery query)
+{
+    return g_volumeQuery.exchange(query != nullptr ? query : &CTqovixFile::QueryVolume);
+}
+
+bool CTqovixFile::QueryVolume(const char* directory, TqovixVolumeInformation* information)
+{
+    if (directory == nullptr || information == nullptr) {
+        errno = EINVAL;
+        return false;
+    }
+    struct statfs statistics;
+    std::memset(&statistics, 0, sizeof statistics);
+    if (statfs(directory, &statistics) != 0) {
+        return false;
+    }
+    information->blockSize = static_cast<uint32_t>(statistics.f_bsize);
+    information->blocksAvailable = static_cast<uint64_t>(statistics.f_bavail);
+    information->typeName = FileSystemTypeName(static_cast<uint32_t>(statistics.f_type));
+    return true;
+}

@@ -1,0 +1,58 @@
+// The one way the system touches a file's bytes: a buffered stream with 64-bit
+// positions whose failures come back as eTqovixErrorCode, never as exceptions.
+#pragma once
+
+#include <cstdint>
+#include <cstdio>
+#include <string>
+
+#include "bridge/TqovixErrorCode.h"
+
+// What ComfirmWritable needs to know about the destination's volume.
+struct TqovixVolumeInformation {
+    uint32_t blockSize = 0;
+    uint64_t blocksAvailable = 0;
+    std::string typeName;  // "msdos" for FAT volumes
+};
+
+// Fills the record for the volume holding `directory`; returns false with errno set on failure.
+using TqovixVolumeQuery = bool (*)(const char* directory, TqovixVolumeInformation* information);
+
+class CTqovixFile {
+public:
+    enum eTqovixSeek { eTqovixSeekBegin = SEEK_SET, eTqovixSeekCurrent = SEEK_CUR, eTqovixSeekEnd = SEEK_END };
+
+    CTqovixFile() = default;
+    ~CTqovixFile();
+    CTqovixFile(const CTqovixFile&) = delete;
+    CTqovixFile& operator=(const CTqovixFile&) = delete;
+
+    eTqovixErrorCode Open(const char* path, int mode);
+    void Close();
+    bool IsOpened() const { return m_bOpened; }
+
+    eTqovixErrorCode Read(void* buffer, unsigned int* readSize, unsigned int size);
+    eTqovixErrorCode Write(const void* buffer, unsigned int size);
+    eTqovixErrorCode GetPosition(long long* position) const;
+    eTqovixErrorCode Seek(long long offset, eTqovixSeek origin);
+    eTqovixErrorCode GetFileSize(long long* size);
+    eTqovixErrorCode SetFileSize(long long size);
+    // A buffered Write may succeed and the device refuse the bytes later: a writer
+    // that must know its output reached the file calls this before Close.
+    eTqovixErrorCode Flush();
+
+    eTqovixErrorCode ComfirmWritable(long long size, const char* path);
+    static eTqovixErrorCode Delete(const char* path);
+    static eTqovixErrorCode ConvertErrnoToLocalError(int errorNumber, bool readOnly);
+
+    // Replaces the volume query (tests use it to fake free space and FAT volumes);
+    // null restores the real one. Returns the previous query.
+    static TqovixVolumeQuery SetVolumeQuery(TqovixVolumeQuery query);
+    // The real query (statfs); what a null SetVolumeQuery restores.
+    static bool QueryVolume(const char* directory, TqovixVolumeInformation* information);
+
+private:
+    bool m_bOpened = false;
+    bool m_bReadOnly = true;
+    FILE* m_stream = nullptr;
+};

@@ -1,0 +1,54 @@
+// Copies one maker data atom out of the tree, header and all, in an Analyze
+// walk, and replaces its payload with a block set by the caller in an Update walk.
+// The AF information and audio level visitors are this with their own path.
+#pragma once
+
+#include <cstdint>
+#include <vector>
+
+#include "atom/CTqovixAtomVisitor.h"
+
+class CTqovixMakerBlockVisitor : public CTqovixAtomVisitor {
+public:
+    eTqovixErrorCode Analyze(const TqovixAtomPath& path, const CTqovixContainerAtom& atom) const override;
+    eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixContainerAtom& atom) const override;
+    eTqovixErrorCode Analyze(const TqovixAtomPath& path, const CTqovixLeafAtom& atom) const override;
+    eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixLeafAtom& atom) const override;
+    void SetNeedAnalyzeMediaTime(bool) const override {}
+
+    bool IsNecessary(const TqovixAtomPath& path, bool isLeaf) const { return m_target.IsNecessary(path, isLeaf); }
+
+protected:
+    CTqovixMakerBlockVisitor(eTqovixAtomType leafType, eTqovixErrorCode emptyAtomCode);
+    ~CTqovixMakerBlockVisitor() = default;
+
+    // Keeps the payload of a block laid out as an atom (8-byte header, or 16
+    // when the size field is 0).
+    void SetBlock(const void* data, uint64_t size);
+    const uint8_t* GetBlock() const { return m_block.empty() ? nullptr : m_block.data(); }
+    uint64_t GetBlockSize() const { return m_block.size(); }
+
+private:
+    CTqovixPathTarget m_target;
+    eTqovixErrorCode m_emptyAtomCode;
+    mutable std::vector<uint8_t> m_block;
+};
+
+class CTqovixAFInformationVisitor : public CTqovixMakerBlockVisitor {
+public:
+    CTqovixAFInformationVisitor();
+
+    void SetAFInformation(const void* data, uint64_t size) { SetBlock(data, size); }
+    const uint8_t* GetAFInformation() const { return GetBlock(); }
+    uint64_t GetAFInformationSize() const { return GetBlockSize(); }
+};
+
+class CTqovixAudioLevelInformationVisitor : public CTqovixMakerBlockVisitor {
+public:
+    CTqovixAudioLevelInformationVisitor();
+    virtual ~CTqovixAudioLevelInformationVisitor() = default;
+
+    void SetAudioLevelInformation(const void* data, uint64_t size) { SetBlock(data, size); }
+    const uint8_t* GetAudioLevelInformation() const { return GetBlock(); }
+    uint64_t GetAudioLevelInformationSize() const { return GetBlockSize(); }
+};

@@ -1,0 +1,34 @@
+// Shared test helpers: a per-test scratch directory, file I/O shortcuts and a
+// way to run external judges such as ffprobe.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace testsupport {
+
+// A fresh directory under the system's temporary directory, removed with everything in it.
+class TempDir {
+public:
+    TempDir();
+    ~TempDir();
+    TempDir(const TempDir&) = delete;
+    TempDir& operator=(const TempDir&) = delete;
+
+    const std::string& Path() const { return m_path; }
+    std::string File(const std::string& name) const { return m_path + "/" + name; }
+
+private:
+    std::string m_path;
+};
+
+bool WriteFile(const std::string& path, const std::vector<uint8_t>& bytes);
+std::vector<uint8_t> ReadFile(const std::string& path);
+
+// Runs a shell command; returns its exit status and fills `output` with its standard output.
+int RunCommand(const std::string& command, std::string* output);
+bool HaveCommand(const std::string& name);
+std::string ShellQuote(const std::string& text);
+
+}  // namespace testsupport
