@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "ByteWriter.h"
+#include "Movie.h"
 #include "atom/CTqovixAtomControl.h"
 #include "atom/CTqovixAtomVisitor.h"
 #include "atom/CTqovixContainerAtom.h"
@@ -258,6 +259,42 @@ TEST_F(AtomFileTest, ParsedTreeWritesBackByteIdentical)
 
     m_control.Close();
     EXPECT_FALSE(m_control.IsInitialized());
+}
+
+TEST_F(AtomFileTest, CameraMoviesWriteBackByteIdentical)
+{
+    moviekit::MovieSpec plain;
+    moviekit::MovieSpec wide = plain;
+    wide.largeMdatHeader = true;
+    wide.co64 = true;
+    wide.mdatCount = 2;
+    wide.sound.codec = moviekit::SoundCodec::Aac;
+    moviekit::MovieSpec reordered = plain;
+    reordered.ftypAfterMoov = true;
+    reordered.majorBrand = "mp42";
+    reordered.soundTrackFirst = true;
+    for (const moviekit::MovieSpec& spec : {plain, wide, reordered}) {
+        std::string error;
+        const Bytes movie = moviekit::BuildMovie(spec, nullptr, &error);
+        ASSERT_FALSE(movie.empty()) << error;
+        CTqovixFile source;
+        CTqovixAtomControl tree;
+        const std::string sourcePath = m_dir.File("camera.mov");
+        ASSERT_TRUE(testsupport::WriteFile(sourcePath, movie));
+        ASSERT_EQ(source.Open(sourcePath.c_str(), 1), eTqovixSuccess);
+        ASSERT_EQ(tree.Initialize(source), eTqovixSuccess);
+
+        TqovixAtomList atoms;
+        tree.GetAtoms(atoms);
+        CTqovixFile out;
+        const std::string path = m_dir.File("copy.mov");
+        ASSERT_EQ(out.Open(path.c_str(), 2), eTqovixSuccess);
+        for (const auto& atom : atoms) {
+            ASSERT_EQ(atom->Write(out), eTqovixSuccess);
+        }
+        out.Close();
+        EXPECT_EQ(testsupport::ReadFile(path), movie);
+    }
 }
 
 TEST_F(AtomFileTest, ShortUserDataBecomesALeafAndLongerOneAContainer)

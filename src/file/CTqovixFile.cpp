@@ -236,6 +236,11 @@ eTqovixErrorCode CTqovixFile::SetFileSize(long long size)
     }
     // Bytes still in the stream's buffer would land after the truncation and
     // re-extend the file; a read buffer could hold bytes that no longer exist.
+    if (std::fflush(m_stream) != 0) {
+        const int error = errno;
+        std::clearerr(m_stream);
+        return ConvertErrnoToLocalError(error, m_bReadOnly);
+    }
     if (ftruncate(fileno(m_stream), static_cast<off_t>(size)) != 0) {
         return ConvertErrnoToLocalError(errno, m_bReadOnly);
     }
