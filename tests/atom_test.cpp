@@ -349,6 +349,16 @@ const ParseCase kParseCases[] = {
     {"NoFtyp", [] { return Container("moov", {Atom("mvhd", Filled(20, 0))}); }, eTqovixErrorInvalidMovie},
     {"FtypPayloadOfThreeBytes", [] { return moviekit::Concat({Atom("ftyp", {'q', 't', ' '}), Atom("moov", {})}); },
      eTqovixErrorInvalidMovie},
+    {"HugeFileTypeAtom",
+     [] {
+         Bytes ftyp = Ftyp("qt  ");
+         moviekit::PutBytes(ftyp, Bytes(2 << 20, 0));
+         ftyp[1] = static_cast<uint8_t>(ftyp.size() >> 16);
+         ftyp[2] = static_cast<uint8_t>(ftyp.size() >> 8);
+         ftyp[3] = static_cast<uint8_t>(ftyp.size());
+         return moviekit::Concat({ftyp, Container("moov", {Atom("mvhd", {})})});
+     },
+     eTqovixErrorInvalidMovie},
     {"EmptyFile", [] { return Bytes{}; }, eTqovixErrorInvalidMovie},
     {"TruncatedHeader", [] { return moviekit::Concat({Ftyp("qt  "), Bytes{0, 0, 0}}); }, eTqovixErrorInvalidMovie},
     {"TruncatedExtendedHeader", [] { return moviekit::Concat({Ftyp("qt  "), Bytes{0, 0, 0, 1, 'm', 'd', 'a', 't', 0}}); },

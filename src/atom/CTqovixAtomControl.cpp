@@ -9,6 +9,8 @@
 
 namespace {
 
+constexpr uint64_t kMaxFileTypeSize = 1 << 20;
+
 struct ParseState {
     CTqovixFile& file;
     size_t atomCount = 0;
@@ -136,7 +138,8 @@ eTqovixErrorCode CTqovixAtomControl::Initialize(CTqovixFile& file)
             return result;
         }
         if (atom->GetType() == TqovixAtom::kFtyp) {
-            if (atom->GetDataSize() < 4) {
+            // A file-type atom holds a few brands; a huge one is not worth loading to refuse.
+            if (atom->GetDataSize() < 4 || atom->GetDataSize() > kMaxFileTypeSize) {
                 break;
             }
             const uint8_t* brand = atom->GetData();
