@@ -1,0 +1,147 @@
+#include "SoundPlan.h"
+
+#include <algorithm>
+
+namespace moviekit {
+
+namespace {
+
+bool ResolveSoundSamples(const MovieSpec& spec, MoviePlan& plan, std::vector<uint32_t>& counts,
+                         std::string* error)
+{
+    const SoundSpec& sound = spec.sound;
+    const VideoSpec& video = spec.video;
+    uint64_t samples = sound.sampleCount;
+    if (plan.aac && !sound.aacPackets.empty()) {
+        if (samples != 0 && samples != sound.aacPackets.size()) {
+            return PlanFail(error, "sampleCount differs from the number of AAC packets given");
+        }
+        samples = sound.aacPackets.size();
+    } else if (!plan.aac && !sound.pcm.empty()) {
+        if (sound.pcm.size() % sound.channels != 0) {
+            return PlanFail(error, "PCM sample count is not a multiple of the channel count");
+        }
+        if (samples != 0 && samples != sound.pcm.size() / sound.channels) {
+            return PlanFail(error, "sampleCount differs from the PCM frames given");
+        }
+        samples = sound.pcm.size() / sound.channels;
+    }
+    if (!sound.chunkSampleCounts.empty()) {
+        uint64_t sum = 0;
+        for (uint32_t count : sound.chunkSampleCounts) {
+            if (count == 0) {
+                return PlanFail(error, "a sound chunk without samples");
+            }
+            sum += count;
+        }
+        if (samples != 0 && samples != sum) {
+            return PlanFail(error, "chunkSampleCounts do not add up to the sample count");
+        }
+        samples = sum;
+    }
+    if (samples == 0) {
+        const uint64_t frames =
+            video.present ? FramesForVideo(video, video.frameCount, sound.sampleRate) : sound.sampleRate;
+        samples = plan.aac ? DivCeil(frames, kAacFramesPerPacket) : frames;
+    }
+    if (samples == 0 || samples > UINT32_MAX) {
+        return PlanFail(error, "sound sample count out of range");
+    }
+    plan.soundSamples = samples;
+    plan.soundFrames = plan.aac ? samples * kAacFramesPerPacket : samples;
+
+    counts = sound.chunkSampleCounts;
+    if (counts.empty()) {
+        uint64_t perChunk = sound.samplesPerChunk;
+        if (perChunk == 0) {
+            const uint64_t frames = video.present ? FramesForVideo(video, video.framesPerChunk, sound.sampleRate)
+                                                  : sound.sampleRate / 2;
+            perChunk = plan.aac ? DivCeil(frames, kAacFramesPerPacket) : frames;
+        }
+        counts = SplitIntoChunks(samples, static_cast<uint32_t>(std::clamp<uint64_t>(perChunk, 1, UINT32_MAX)));
+    }
+    return true;
+}
+
+void BuildSoundChunks(MoviePlan& plan, const std::vector<uint32_t>& counts)
+{
+    uint64_t first = 0;
+    for (uint32_t count : counts) {
+        ChunkLayout chunk;
+        chunk.firstSample = first;
+        chunk.sampleCount = count;
+        if (plan.aac) {
+            for (uint32_t i = 0; i < count; ++i) {
+                chunk.sampleSizes.push_back(plan.aacPacketSizes[first + i]);
+                chunk.size += plan.aacPacketSizes[first + i];
+            }
+        } else {
+            chunk.size = uint64_t{count} * plan.bytesPerFrame;
+        }
+        first += count;
+        plan.soundChunks.push_back(std::move(chunk));
+    }
+}
+
+void ResolveAac(const MovieSpec& spec, MoviePlan& plan)
+{
+    const SoundSpec& sound = spec.sound;
+    uint64_t totalBytes = 0;
+    uint32_t largest = 0;
+    for (uint64_t i = 0; i < plan.soundSamples; ++i) {
+        uint32_t size = 0;
+        if (!sound.aacPackets.empty()) {
+            size = static_cast<uint32_t>(sound.aacPackets[i].size());
+        } else {
+            // Sizes wander like an encoder's around 128 kbit/s stereo.
+            const uint32_t fill = 120 + static_cast<uint32_t>(SplitMix64(i) % 150);
+            plan.aacFillBytes.push_back(fill);
+            size = SilentAacPacketSize(sound.channels, fill);
+        }
+        plan.aacPacketSizes.push_back(size);
+        totalBytes += size;
+        largest = std::max(largest, size);
+    }
+    plan.audioSpecificConfig = sound.esds.audioSpecificConfig
+                                   ? *sound.esds.audioSpecificConfig
+                                   : MakeAudioSpecificConfig(sound.sampleRate, sound.channels);
+    const uint64_t seconds1024 = plan.soundSamples * kAacFramesPerPacket;
+    const uint32_t average =
+        static_cast<uint32_t>(Wide{totalBytes} * 8 * sound.sampleRate / std::max<uint64_t>(seconds1024, 1));
+    const uint32_t peak = static_cast<uint32_t>(uint64_t{largest} * 8 * sound.sampleRate / kAacFramesPerPacket);
+    plan.esdsPayload = MakeEsdsPayload(sound.esds, plan.audioSpecificConfig,
+                                       sound.esds.maxBitRate.value_or(peak),
+                                       sound.esds.averageBitRate.value_or(average));
+}
+
+}  // namespace
+
+bool PlanSound(const MovieSpec& spec, MoviePlan& plan, std::string* error)
+{
+    const SoundSpec& sound = spec.sound;
+    if (sound.channels == 0 || sound.sampleRate == 0 || sound.sampleRate > 0xFFFF) {
+        return PlanFail(error, "sound needs 1 or more channels and a rate of 1 to 65535 Hz");
+    }
+    plan.aac = sound.codec == SoundCodec::Aac;
+    plan.littleEndianPcm = sound.codec == SoundCodec::Sowt;
+    plan.soundFormat = plan.aac ? "mp4a" : plan.littleEndianPcm ? "sowt" : "twos";
+    if (!sound.formatOverride.empty()) {
+        plan.soundFormat = sound.formatOverride;
+    }
+    plan.bytesPerFrame = 2U * sound.channels;
+    if (plan.aac && sound.aacPackets.empty() && sound.channels > 2) {
+        return PlanFail(error, "generated AAC packets are mono or stereo; give packets for more channels");
+    }
+    std::vector<uint32_t> counts;
+    if (!ResolveSoundSamples(spec, plan, counts, error)) {
+        return false;
+    }
+    if (plan.aac) {
+        ResolveAac(spec, plan);
+    }
+    BuildSoundChunks(plan, counts);
+    plan.soundMediaTime = sound.mediaTime.value_or(plan.littleEndianPcm ? 0 : kAacFramesPerPacket);
+    return true;
+}
+
+}  // namespace moviekit
