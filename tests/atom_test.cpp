@@ -319,6 +319,9 @@ struct ParseCase {
     eTqovixErrorCode expected;
 };
 
+void PrintTo(const ParseCase& c, std::ostream* os) { *os << c.name; }
+
+
 Bytes WithSize(const char* type, uint32_t sizeField, size_t payloadBytes)
 {
     return Atom(type, Bytes(payloadBytes, 0), AtomOptions{.overrideSize = true, .sizeOverride = sizeField});

@@ -184,6 +184,9 @@ struct TrimCase {
     uint32_t forward, backward, numerator, denominator;
 };
 
+void PrintTo(const TrimCase& c, std::ostream* os) { *os << c.name; }
+
+
 class TrimTest : public TagTreeTest, public ::testing::WithParamInterface<TrimCase> {};
 
 TEST_P(TrimTest, ReadsTheThreeTrimTags)
