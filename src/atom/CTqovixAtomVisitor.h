@@ -39,3 +39,31 @@ public:
 private:
     TqovixAtomPath m_target;
 };
+
+// Base of the visitors that look for one atom at a fixed path: containers on
+// the way lead in (in both walks), nothing is told about media time.
+class CTqovixPathTargetVisitor : public CTqovixAtomVisitor {
+public:
+    eTqovixErrorCode Analyze(const TqovixAtomPath& path, const CTqovixContainerAtom&) const override
+    {
+        return m_target.ContainerAnswer(path);
+    }
+    eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixContainerAtom&) const override
+    {
+        return m_target.ContainerAnswer(path);
+    }
+    using CTqovixAtomVisitor::Analyze;
+    using CTqovixAtomVisitor::Update;
+    void SetNeedAnalyzeMediaTime(bool) const override {}
+
+    bool IsNecessary(const TqovixAtomPath& path, bool isLeaf) const { return m_target.IsNecessary(path, isLeaf); }
+
+protected:
+    explicit CTqovixPathTargetVisitor(TqovixAtomPath target) : m_target(std::move(target)) {}
+    ~CTqovixPathTargetVisitor() = default;
+
+    bool IsTarget(const TqovixAtomPath& path) const { return m_target.IsNecessary(path, true); }
+
+private:
+    CTqovixPathTarget m_target;
+};

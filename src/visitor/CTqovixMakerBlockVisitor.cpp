@@ -6,24 +6,14 @@
 #include "atom/TqovixEndian.h"
 
 CTqovixMakerBlockVisitor::CTqovixMakerBlockVisitor(eTqovixAtomType leafType, eTqovixErrorCode emptyAtomCode)
-    : m_target({TqovixAtom::kMoov, TqovixAtom::kUdta, TqovixAtom::kTCDT, TqovixAtom::kTCDB, leafType}),
+    : CTqovixPathTargetVisitor({TqovixAtom::kMoov, TqovixAtom::kUdta, TqovixAtom::kTCDT, TqovixAtom::kTCDB, leafType}),
       m_emptyAtomCode(emptyAtomCode)
 {
 }
 
-eTqovixErrorCode CTqovixMakerBlockVisitor::Analyze(const TqovixAtomPath& path, const CTqovixContainerAtom&) const
-{
-    return m_target.ContainerAnswer(path);
-}
-
-eTqovixErrorCode CTqovixMakerBlockVisitor::Update(const TqovixAtomPath& path, CTqovixContainerAtom&) const
-{
-    return m_target.ContainerAnswer(path);
-}
-
 eTqovixErrorCode CTqovixMakerBlockVisitor::Analyze(const TqovixAtomPath& path, const CTqovixLeafAtom& atom) const
 {
-    if (!m_target.IsNecessary(path, true)) {
+    if (!IsTarget(path)) {
         return eTqovixVisitSkip;
     }
     // The block always carries an 8-byte header, even for an atom stored with a
@@ -49,7 +39,7 @@ eTqovixErrorCode CTqovixMakerBlockVisitor::Analyze(const TqovixAtomPath& path, c
 
 eTqovixErrorCode CTqovixMakerBlockVisitor::Update(const TqovixAtomPath& path, CTqovixLeafAtom& atom) const
 {
-    if (!m_target.IsNecessary(path, true)) {
+    if (!IsTarget(path)) {
         return eTqovixVisitSkip;
     }
     if (m_block.empty()) {

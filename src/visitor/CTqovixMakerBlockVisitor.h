@@ -8,15 +8,12 @@
 
 #include "atom/CTqovixAtomVisitor.h"
 
-class CTqovixMakerBlockVisitor : public CTqovixAtomVisitor {
+class CTqovixMakerBlockVisitor : public CTqovixPathTargetVisitor {
 public:
-    eTqovixErrorCode Analyze(const TqovixAtomPath& path, const CTqovixContainerAtom& atom) const override;
-    eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixContainerAtom& atom) const override;
+    using CTqovixPathTargetVisitor::Analyze;
+    using CTqovixPathTargetVisitor::Update;
     eTqovixErrorCode Analyze(const TqovixAtomPath& path, const CTqovixLeafAtom& atom) const override;
     eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixLeafAtom& atom) const override;
-    void SetNeedAnalyzeMediaTime(bool) const override {}
-
-    bool IsNecessary(const TqovixAtomPath& path, bool isLeaf) const { return m_target.IsNecessary(path, isLeaf); }
 
 protected:
     CTqovixMakerBlockVisitor(eTqovixAtomType leafType, eTqovixErrorCode emptyAtomCode);
@@ -29,7 +26,6 @@ protected:
     uint64_t GetBlockSize() const { return m_block.size(); }
 
 private:
-    CTqovixPathTarget m_target;
     eTqovixErrorCode m_emptyAtomCode;
     mutable std::vector<uint8_t> m_block;
 };

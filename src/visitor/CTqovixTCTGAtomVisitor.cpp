@@ -25,7 +25,7 @@ TCTG::TqovixTCTGTag SoftwareNameTag()
 }  // namespace
 
 CTqovixTCTGAtomVisitor::CTqovixTCTGAtomVisitor()
-    : m_target({TqovixAtom::kMoov, TqovixAtom::kUdta, TqovixAtom::kTCDT, TqovixAtom::kTCTG})
+    : CTqovixPathTargetVisitor({TqovixAtom::kMoov, TqovixAtom::kUdta, TqovixAtom::kTCDT, TqovixAtom::kTCTG})
 {
 }
 
@@ -39,14 +39,9 @@ eTqovixErrorCode CTqovixTCTGAtomVisitor::Analyze(const TqovixAtomPath&, const CT
     return eTqovixErrorInternal;
 }
 
-eTqovixErrorCode CTqovixTCTGAtomVisitor::Update(const TqovixAtomPath& path, CTqovixContainerAtom&) const
-{
-    return m_target.ContainerAnswer(path);
-}
-
 eTqovixErrorCode CTqovixTCTGAtomVisitor::Update(const TqovixAtomPath& path, CTqovixLeafAtom& atom) const
 {
-    if (!m_target.IsNecessary(path, true) || atom.GetDataSize() == 0) {
+    if (!IsTarget(path) || atom.GetDataSize() == 0) {
         return eTqovixVisitSkip;
     }
     const uint8_t* payload = atom.GetData();

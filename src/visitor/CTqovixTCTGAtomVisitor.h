@@ -4,18 +4,13 @@
 
 #include "atom/CTqovixAtomVisitor.h"
 
-class CTqovixTCTGAtomVisitor : public CTqovixAtomVisitor {
+class CTqovixTCTGAtomVisitor : public CTqovixPathTargetVisitor {
 public:
     CTqovixTCTGAtomVisitor();
 
+    using CTqovixPathTargetVisitor::Update;
+    // Updates only: every analysis answers 36864.
     eTqovixErrorCode Analyze(const TqovixAtomPath& path, const CTqovixContainerAtom& atom) const override;
-    eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixContainerAtom& atom) const override;
     eTqovixErrorCode Analyze(const TqovixAtomPath& path, const CTqovixLeafAtom& atom) const override;
     eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixLeafAtom& atom) const override;
-    void SetNeedAnalyzeMediaTime(bool) const override {}
-
-    bool IsNecessary(const TqovixAtomPath& path, bool isLeaf) const { return m_target.IsNecessary(path, isLeaf); }
-
-private:
-    CTqovixPathTarget m_target;
 };

@@ -16,13 +16,8 @@ constexpr uint16_t kTypeRational = 5;
 }  // namespace
 
 CTqovixTrimInformationVisitor::CTqovixTrimInformationVisitor()
-    : m_target({TqovixAtom::kMoov, TqovixAtom::kUdta, TqovixAtom::kTCDT, TqovixAtom::kTCTG})
+    : CTqovixPathTargetVisitor({TqovixAtom::kMoov, TqovixAtom::kUdta, TqovixAtom::kTCDT, TqovixAtom::kTCTG})
 {
-}
-
-eTqovixErrorCode CTqovixTrimInformationVisitor::Analyze(const TqovixAtomPath& path, const CTqovixContainerAtom&) const
-{
-    return m_target.ContainerAnswer(path);
 }
 
 eTqovixErrorCode CTqovixTrimInformationVisitor::Update(const TqovixAtomPath&, CTqovixContainerAtom&) const
@@ -37,7 +32,7 @@ eTqovixErrorCode CTqovixTrimInformationVisitor::Update(const TqovixAtomPath&, CT
 
 eTqovixErrorCode CTqovixTrimInformationVisitor::Analyze(const TqovixAtomPath& path, const CTqovixLeafAtom& atom) const
 {
-    if (!m_target.IsNecessary(path, true) || atom.GetDataSize() == 0) {
+    if (!IsTarget(path) || atom.GetDataSize() == 0) {
         return eTqovixVisitSkip;
     }
     CTqovixTCTGAtom tags(atom.GetData(), atom.GetDataSize());

@@ -6,17 +6,15 @@
 
 #include "atom/CTqovixAtomVisitor.h"
 
-class CTqovixTrimInformationVisitor : public CTqovixAtomVisitor {
+class CTqovixTrimInformationVisitor : public CTqovixPathTargetVisitor {
 public:
     CTqovixTrimInformationVisitor();
 
-    eTqovixErrorCode Analyze(const TqovixAtomPath& path, const CTqovixContainerAtom& atom) const override;
+    using CTqovixPathTargetVisitor::Analyze;
+    // Reads only: every update answers 36864.
     eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixContainerAtom& atom) const override;
     eTqovixErrorCode Analyze(const TqovixAtomPath& path, const CTqovixLeafAtom& atom) const override;
     eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixLeafAtom& atom) const override;
-    void SetNeedAnalyzeMediaTime(bool) const override {}
-
-    bool IsNecessary(const TqovixAtomPath& path, bool isLeaf) const { return m_target.IsNecessary(path, isLeaf); }
     uint32_t GetRemovedFrameForward() const { return m_removedFrameForward; }
     uint32_t GetRemovedFrameBackward() const { return m_removedFrameBackward; }
     uint32_t GetFrameRateNumerator() const { return m_frameRateNumerator; }
@@ -27,5 +25,4 @@ private:
     mutable uint32_t m_removedFrameBackward = 0;
     mutable uint32_t m_frameRateNumerator = 0;
     mutable uint32_t m_frameRateDenominator = 0;
-    CTqovixPathTarget m_target;
 };
