@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <new>
+#include <stdexcept>
 
 #include "atom/CTqovixAtomVisitor.h"
 #include "file/CTqovixFile.h"

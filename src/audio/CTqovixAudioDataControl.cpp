@@ -1,0 +1,251 @@
+#include "audio/CTqovixAudioDataControl.h"
+
+#include <cstring>
+#include <new>
+#include <stdexcept>
+
+#include "file/CTqovixFile.h"
+
+namespace {
+
+void SwapWords(uint8_t* bytes, size_t size)
+{
+    for (size_t i = 0; i + 1 < size; i += 2) {
+        std::swap(bytes[i], bytes[i + 1]);
+    }
+}
+
+// Grows a scratch buffer without value-initialising what is overwritten anyway.
+eTqovixErrorCode Reserve(std::vector<uint8_t>& buffer, size_t size)
+{
+    try {
+        if (buffer.size() < size) {
+            buffer.resize(size);
+        }
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    } catch (const std::length_error&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    return eTqovixSuccess;
+}
+
+}  // namespace
+
+CTqovixAudioDataControl::~CTqovixAudioDataControl() = default;
+
+eTqovixErrorCode CTqovixAudioDataControl::Initialize(CTqovixFile& file, const std::vector<TqovixChunkInformation>& chunks,
+                                                     bool bigEndian)
+{
+    if (chunks.empty()) {
+        return eTqovixErrorInternal;
+    }
+    m_chunks.resize(chunks.size());
+    for (size_t i = 0; i < chunks.size(); ++i) {
+        m_chunks[i] = std::make_shared<CTqovixAudioChunk>();
+        const eTqovixErrorCode result = m_chunks[i]->Initialize(file, chunks[i]);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+    }
+    m_decodedPool = std::make_shared<CTqovixAudioChunk>();
+    const eTqovixErrorCode result = m_decodedPool->Initialize(file, TqovixChunkInformation{});
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    m_bBigEndian = bigEndian;
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::Close()
+{
+    for (const auto& chunk : m_chunks) {
+        chunk->Close();
+    }
+    m_chunks.clear();
+    if (m_decodedPool) {
+        m_decodedPool->Close();
+        m_decodedPool.reset();
+    }
+    CloseDecoderAAC();
+    CloseEncoderAAC();
+    m_inputChunkIndex = 0;
+    m_outputChunkIndex = 0;
+    m_bBigEndian = true;
+    std::vector<uint8_t>().swap(m_scratch);
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::DecodeChunk(const CTqovixAudioChunk& chunk, const uint8_t* bytes,
+                                                      unsigned int size)
+{
+    std::vector<uint8_t> collected;
+    uint8_t block[kDecodedPacketBytes];
+    unsigned int offset = 0;
+    for (int k = 0; offset < size; ++k) {
+        const uint32_t packetSize = chunk.GetSampleSize(k);
+        // Sizes that do not add up to the chunk must not read past it or stall.
+        if (packetSize == 0 || packetSize > size - offset) {
+            return eTqovixErrorInternal;
+        }
+        unsigned int pcmSize = 0;
+        unsigned int used = 0;
+        const eTqovixErrorCode result = DecodeAAC2PCM(block, &pcmSize, &used, bytes + offset, packetSize);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        if (used == 0 || used > size - offset || pcmSize > kDecodedPacketBytes) {
+            return eTqovixErrorInternal;
+        }
+        try {
+            collected.insert(collected.end(), block, block + pcmSize);
+        } catch (const std::bad_alloc&) {
+            return eTqovixErrorOutOfMemory;
+        }
+        offset += used;
+    }
+    if (collected.empty()) {
+        return eTqovixSuccess;
+    }
+    return TqovixFailed(m_decodedPool->PushDecodedData(collected.data(), collected.size())) ? eTqovixErrorInternal
+                                                                                          : eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::FillPool(unsigned long requested)
+{
+    while (m_decodedPool->GetDecodedDataSize() < requested && m_inputChunkIndex < m_chunks.size()) {
+        CTqovixAudioChunk& chunk = *m_chunks[m_inputChunkIndex];
+        const auto size = static_cast<unsigned int>(chunk.GetInputDataSize());
+        if (size == 0) {
+            ++m_inputChunkIndex;
+            continue;
+        }
+        eTqovixErrorCode result = Reserve(m_scratch, size);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        unsigned int got = 0;
+        result = chunk.PopInputData(m_scratch.data(), &got, size);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        if (got == 0) {
+            return eTqovixErrorInternal;  // the file ends before this chunk
+        }
+        if (IsAACCodec()) {
+            result = DecodeChunk(chunk, m_scratch.data(), got);
+        } else {
+            if (m_bBigEndian) {
+                SwapWords(m_scratch.data(), got);
+            }
+            result = TqovixFailed(m_decodedPool->PushDecodedData(m_scratch.data(), got)) ? eTqovixErrorInternal
+                                                                                      : eTqovixSuccess;
+        }
+        if (TqovixFailed(result)) {
+            return result;
+        }
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::PopAudioData(void* buffer, unsigned long* size, unsigned long requested)
+{
+    if (buffer == nullptr || size == nullptr || requested == 0 || !m_decodedPool) {
+        return eTqovixErrorInternal;
+    }
+    const bool aac = IsAACCodec();
+    if (aac) {
+        std::memset(buffer, 0, requested);
+    }
+    eTqovixErrorCode result = FillPool(requested);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    result = m_decodedPool->PopDecodedData(buffer, size, requested);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    // AAC never ends by itself: past the track the caller gets silence.
+    if (aac && *size < requested) {
+        *size = requested;
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::PopFinishedAudioChunk(std::shared_ptr<CTqovixAudioChunk>& chunk)
+{
+    if (m_outputChunkIndex >= m_chunks.size()) {
+        return eTqovixErrorInternal;
+    }
+    chunk = m_chunks[m_outputChunkIndex];
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::PushAudioData(const void* data, unsigned long size)
+{
+    if (data == nullptr || size == 0 || m_chunks.empty()) {
+        return eTqovixErrorInternal;
+    }
+    if (IsAACCodec()) {
+        // Encoded packets reach the writer inside this call; it may announce the end.
+        const eTqovixErrorCode result = EncodePCM2AAC(const_cast<void*>(data), static_cast<unsigned int>(size));
+        if (TqovixFailed(result) || m_outputChunkIndex < m_chunks.size()) {
+            return result;
+        }
+        const eTqovixErrorCode flushed = EncodeDone();
+        return TqovixFailed(flushed) ? eTqovixErrorInternal : flushed;
+    }
+    if (m_inputChunkIndex >= m_chunks.size()) {
+        return eTqovixErrorInternal;
+    }
+    m_outputChunkIndex = m_inputChunkIndex;
+    return m_chunks[m_inputChunkIndex]->PushOutputData(data, size);
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::SetOutputChunkIndex(unsigned long index)
+{
+    m_outputChunkIndex = static_cast<uint32_t>(index);
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::SetAACInformation(
+    const CTqovixMovControl* movControl, const void* audioSpecificConfig, unsigned int audioSpecificConfigSize,
+    const TqovixInterfaceConvert::TqovixAudioInformation& information, unsigned int bitRate)
+{
+    if (audioSpecificConfig == nullptr || audioSpecificConfigSize == 0) {
+        return eTqovixErrorInternal;
+    }
+    const eTqovixErrorCode result = OpenDecoderAAC(audioSpecificConfig, audioSpecificConfigSize);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    const eTqovixErrorCode encoder = OpenEncoderAAC(movControl, information, bitRate);
+    return TqovixFailed(encoder) ? encoder : eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::OpenDecoderAAC(const void*, unsigned int) { return eTqovixSuccess; }
+
+eTqovixErrorCode CTqovixAudioDataControl::OpenEncoderAAC(const CTqovixMovControl*,
+                                                         const TqovixInterfaceConvert::TqovixAudioInformation&,
+                                                         unsigned int)
+{
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::DecodeAAC2PCM(void*, unsigned int*, unsigned int*, const void*, unsigned int)
+{
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::EncodePCM2AAC(void*, unsigned int) { return eTqovixSuccess; }
+
+eTqovixErrorCode CTqovixAudioDataControl::EncodeDone() { return eTqovixSuccess; }
+
+uint64_t CTqovixAudioDataControl::GetHeldByteCount() const
+{
+    uint64_t total = m_scratch.capacity();
+    for (const auto& chunk : m_chunks) {
+        total += chunk->GetHeldByteCount();
+    }
+    return total + (m_decodedPool ? m_decodedPool->GetHeldByteCount() : 0);
+}
