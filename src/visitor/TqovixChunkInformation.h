@@ -11,6 +11,8 @@ struct TqovixChunkInformation {
     std::vector<uint32_t> sampleSizes;  // empty for tracks with one common sample size
     uint32_t chunkNumber = 0;           // 1-based, as the sample-to-chunk table counts
     uint32_t sampleCount = 0;
+
+    bool operator==(const TqovixChunkInformation&) const = default;
 };
 
 // One sample-to-chunk run, without its sample description index.

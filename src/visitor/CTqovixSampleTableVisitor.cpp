@@ -1,0 +1,210 @@
+#include "visitor/CTqovixSampleTableVisitor.h"
+
+#include "atom/CTqovixLeafAtom.h"
+#include "atom/TqovixEndian.h"
+#include "visitor/TqovixTrackPath.h"
+
+using namespace TqovixTrackPath;
+
+namespace {
+
+template <typename T>
+T& At(std::vector<T>& table, uint64_t index)
+{
+    if (table.size() <= index) {
+        table.resize(index + 1);
+    }
+    return table[index];
+}
+
+}  // namespace
+
+CTqovixSampleTableVisitor::CTqovixSampleTableVisitor(const char (&handlerSubtype)[5], bool emptyPathIsError)
+    : m_handlerSubtype(handlerSubtype), m_bEmptyPathIsError(emptyPathIsError)
+{
+}
+
+bool CTqovixSampleTableVisitor::IsNecessary(const TqovixAtomPath& path) const
+{
+    static const TqovixAtomPath handler = TqovixMakeAtomPath("moovtrakmdiahdlr");
+    const bool isHandler = !path.empty() && path.back() == kHdlr;
+    return IsWanted(path, isHandler ? handler : SampleTablePath(), {kStsc, kStsz, kStco, kCo64, kHdlr});
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::Analyze(const TqovixAtomPath& path, const CTqovixContainerAtom&) const
+{
+    return IsNecessary(path) ? eTqovixVisitContinue : eTqovixVisitSkip;
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::Update(const TqovixAtomPath& path, CTqovixContainerAtom&) const
+{
+    return IsNecessary(path) ? eTqovixVisitContinue : eTqovixVisitSkip;
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::Analyze(const TqovixAtomPath& path, const CTqovixLeafAtom& atom) const
+{
+    if (!IsNecessary(path)) {
+        return eTqovixVisitSkip;
+    }
+    if (path.empty() && m_bEmptyPathIsError) {
+        return eTqovixErrorInternal;
+    }
+    if (atom.GetType() == kHdlr) {
+        const eTqovixErrorCode answer = HandlerAnswer(atom, m_handlerSubtype);
+        m_bTrack = answer == eTqovixVisitContinue;
+        return answer;
+    }
+    const uint64_t size = atom.GetDataSize();
+    const uint8_t* payload = size == 0 ? nullptr : atom.GetData();
+    if (!m_bTrack || payload == nullptr) {
+        return eTqovixVisitSkip;
+    }
+    const eTqovixErrorCode result = ReadTable(atom.GetType(), payload, size);
+    if (result != eTqovixSuccess) {
+        return result;
+    }
+    if (++m_analyzedTableCount < 3) {
+        return eTqovixVisitSkip;
+    }
+    m_analyzedTableCount = 0;
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::ReadTable(eTqovixAtomType type, const uint8_t* payload, uint64_t size) const
+{
+    // Entries follow from the payload size; the count field is not trusted.
+    const uint64_t entriesBytes = size >= 8 ? size - 8 : 0;
+    if (type == kCo64 || type == kStco) {
+        const uint64_t width = type == kCo64 ? 8 : 4;
+        const uint64_t entries = entriesBytes / width;
+        if (entries > kMaxTableEntries) {
+            return eTqovixErrorInvalidMovie;
+        }
+        for (uint64_t j = 0; j < entries; ++j) {
+            const uint8_t* entry = payload + 8 + width * j;
+            At(m_chunkTable, j).offset = width == 8 ? TqovixReadBE64(entry) : TqovixReadBE32(entry);
+        }
+        m_offsetEntries = entries;
+    } else if (type == kStsc) {
+        const uint64_t entries = entriesBytes / 12;
+        if (entries > kMaxTableEntries) {
+            return eTqovixErrorInvalidMovie;
+        }
+        for (uint64_t j = 0; j < entries; ++j) {
+            const uint8_t* entry = payload + 8 + 12 * j;
+            At(m_sampleToChunkTable, j) = {TqovixReadBE32(entry), TqovixReadBE32(entry + 4)};
+        }
+        m_runEntries = entries;
+    } else if (type == kStsz) {
+        if (size < 8) {
+            return eTqovixErrorInvalidMovie;
+        }
+        const uint32_t commonSize = TqovixReadBE32(payload + 4);
+        if (commonSize != 0) {
+            m_constantSampleSize = commonSize;
+            return eTqovixSuccess;
+        }
+        const uint64_t entries = size >= 12 ? (size - 12) / 4 : 0;
+        if (entries > kMaxTableEntries) {
+            return eTqovixErrorInvalidMovie;
+        }
+        for (uint64_t j = 0; j < entries; ++j) {
+            At(m_sampleSizeTable, j) = TqovixReadBE32(payload + 12 + 4 * j);
+        }
+        m_sizeEntries = entries;
+    } else {
+        return eTqovixErrorInternal;
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::BuildChunkList(std::vector<TqovixChunkInformation>& out,
+                                                          uint32_t bytesPerSample) const
+{
+    const uint64_t chunkCount = m_offsetEntries;
+    uint64_t position = 0;
+    uint64_t sample = 0;
+    bool consistent = chunkCount > 0 && m_runEntries > 0;
+    for (uint64_t r = 0; consistent && r < m_runEntries; ++r) {
+        const uint64_t first = m_sampleToChunkTable[r].firstChunk;
+        const uint64_t next = r + 1 < m_runEntries ? m_sampleToChunkTable[r + 1].firstChunk : chunkCount + 1;
+        const uint32_t samplesPerChunk = m_sampleToChunkTable[r].samplesPerChunk;
+        // Runs start at chunk 1, rise strictly and name only chunks the offset table has.
+        if (first != position + 1 || next <= first || next > chunkCount + 1) {
+            consistent = false;
+            break;
+        }
+        for (uint64_t k = first; k < next; ++k, ++position) {
+            TqovixChunkInformation& record = m_chunkTable[position];
+            uint64_t bytes = 0;
+            if (m_constantSampleSize == 0) {
+                if (samplesPerChunk > m_sizeEntries - sample) {
+                    consistent = false;  // the size table runs out
+                    break;
+                }
+                record.sampleSizes.assign(m_sampleSizeTable.begin() + static_cast<std::ptrdiff_t>(sample),
+                                          m_sampleSizeTable.begin() + static_cast<std::ptrdiff_t>(sample + samplesPerChunk));
+                for (uint32_t size : record.sampleSizes) {
+                    bytes += size;
+                }
+                sample += samplesPerChunk;
+            } else {
+                bytes = static_cast<uint64_t>(samplesPerChunk) * bytesPerSample * m_constantSampleSize;
+            }
+            if (bytes > UINT32_MAX) {
+                consistent = false;
+                break;
+            }
+            record.size = static_cast<uint32_t>(bytes);
+            record.chunkNumber = static_cast<uint32_t>(k);
+            record.sampleCount = samplesPerChunk;
+        }
+    }
+    // Every chunk belongs to a run, and a size table holds no sample nobody uses.
+    if (position != chunkCount || (m_constantSampleSize == 0 && sample != m_sizeEntries)) {
+        consistent = false;
+    }
+    out.assign(m_chunkTable.begin(), m_chunkTable.begin() + static_cast<std::ptrdiff_t>(std::min<uint64_t>(chunkCount, m_chunkTable.size())));
+    return consistent ? eTqovixSuccess : eTqovixErrorInvalidMovie;
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::BeginUpdate(const TqovixAtomPath& path, CTqovixLeafAtom& atom,
+                                                       std::vector<uint8_t>& payload) const
+{
+    if (!IsNecessary(path)) {
+        return eTqovixVisitSkip;
+    }
+    if (path.empty() && m_bEmptyPathIsError) {
+        return eTqovixErrorInternal;
+    }
+    if (atom.GetType() == kHdlr) {
+        const eTqovixErrorCode answer = HandlerAnswer(atom, m_handlerSubtype);
+        m_bTrack = answer == eTqovixVisitContinue;
+        return answer;
+    }
+    if (!m_bTrack) {
+        return eTqovixVisitSkip;
+    }
+    const uint8_t* data = atom.GetDataSize() == 0 ? nullptr : atom.GetData();
+    if (data == nullptr) {
+        return eTqovixErrorOutOfMemory;
+    }
+    payload.assign(data, data + atom.GetDataSize());
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::WriteOffsets(std::vector<uint8_t>& payload, bool wide, uint64_t count) const
+{
+    for (uint64_t j = 0; j < count; ++j) {
+        const uint64_t offset = m_chunkTable[j].offset;
+        if (wide) {
+            TqovixWriteBE64(payload.data() + 8 + 8 * j, offset);
+        } else {
+            if (offset > UINT32_MAX) {
+                return eTqovixErrorInternal;  // only a "co64" table can say where this chunk lies
+            }
+            TqovixWriteBE32(payload.data() + 8 + 4 * j, static_cast<uint32_t>(offset));
+        }
+    }
+    return eTqovixSuccess;
+}
