@@ -1,0 +1,166 @@
+// Processing speed of libOVIX on its worst case: 48 kHz stereo with the whole track inside AF
+// drive intervals. First the suppressor alone, then a whole session through the exported
+// functions with in-memory callbacks. Prints frames per second and the multiple of real time.
+#include "NoiseSuppressor.h"
+#include "ovix/Ovix.h"
+
+#include <algorithm>
+#include <chrono>
+#include <cmath>
+#include <cstdio>
+#include <cstring>
+#include <random>
+#include <thread>
+#include <vector>
+
+namespace {
+
+constexpr uint64_t kRate = 48000;
+constexpr unsigned kChannels = 2;
+constexpr uint64_t kSeconds = 600;
+constexpr uint64_t kFrames = kRate * kSeconds;
+constexpr int kRounds = 3;
+
+using Clock = std::chrono::steady_clock;
+
+// Ten seconds of speech-level noise, replayed in a loop.
+std::vector<int16_t> Source()
+{
+    std::mt19937 random(7);
+    std::normal_distribution<double> noise(0.0, 3000.0);
+    std::vector<int16_t> source(kRate * 10 * kChannels);
+    for (int16_t& sample : source) {
+        sample = static_cast<int16_t>(std::clamp(noise(random), -32768.0, 32767.0));
+    }
+    return source;
+}
+
+void Report(const char* what, double seconds)
+{
+    const double framesPerSecond = static_cast<double>(kFrames) / seconds;
+    std::printf("%-34s %8.1f Mframes/s  %7.0fx real time\n", what, framesPerSecond / 1e6,
+                framesPerSecond / static_cast<double>(kRate));
+}
+
+double TimeSuppressor(const std::vector<int16_t>& source)
+{
+    ovix::NoiseSuppressor suppressor(kRate, kChannels);
+    suppressor.SetSpans({{0, kFrames, 1.0f}});
+    std::vector<int16_t> block(ovix::NoiseSuppressor::kBlockFrames * kChannels);
+    const uint64_t sourceFrames = source.size() / kChannels;
+    const auto start = Clock::now();
+    for (uint64_t done = 0; done < kFrames; done += ovix::NoiseSuppressor::kBlockFrames) {
+        const uint64_t at = done % sourceFrames;
+        std::memcpy(block.data(), source.data() + at * kChannels, block.size() * sizeof(int16_t));
+        suppressor.Process(block.data(), done, ovix::NoiseSuppressor::kBlockFrames);
+    }
+    return std::chrono::duration<double>(Clock::now() - start).count();
+}
+
+// The session's side of the system: AF information with one interval over everything,
+// no audio level, audio served from memory, output dropped.
+struct Feed {
+    std::vector<uint8_t> af;
+    const std::vector<int16_t>* source = nullptr;
+    uint64_t position = 0;  // frames
+};
+Feed g_feed;
+
+std::vector<uint8_t> AfBlock()
+{
+    std::vector<uint8_t> block(8 + 16 + 20, 0);
+    auto put = [&](size_t at, uint64_t value, int bytes) {
+        for (int i = 0; i < bytes; ++i) {
+            block[at + i] = static_cast<uint8_t>(value >> (8 * (bytes - 1 - i)));
+        }
+    };
+    put(0, block.size(), 4);
+    std::memcpy(block.data() + 4, "OP01AFR1", 8);
+    put(12, 1, 2);
+    put(16, kRate, 4);
+    put(20, 1, 4);
+    put(24, 0, 8);
+    put(32, kFrames, 8);
+    put(40, 1000, 2);
+    return block;
+}
+
+unsigned long InputAf(void* buffer, unsigned long* delivered, unsigned long size, unsigned long)
+{
+    if (buffer == nullptr) {
+        *delivered = g_feed.af.size();
+        return 0;
+    }
+    *delivered = std::min<unsigned long>(size, g_feed.af.size());
+    std::memcpy(buffer, g_feed.af.data(), *delivered);
+    return 0;
+}
+
+unsigned long InputLevel(void*, unsigned long* delivered, unsigned long, unsigned long)
+{
+    *delivered = 0;
+    return ovix::kNoAudioLevel;
+}
+
+unsigned long InputAudio(void* buffer, unsigned long* delivered, unsigned long size, unsigned long)
+{
+    const uint64_t sourceFrames = g_feed.source->size() / kChannels;
+    const uint64_t frames = std::min<uint64_t>(size / (kChannels * 2), sourceFrames - g_feed.position % sourceFrames);
+    std::memcpy(buffer, g_feed.source->data() + (g_feed.position % sourceFrames) * kChannels, frames * kChannels * 2);
+    g_feed.position += frames;
+    *delivered = frames * kChannels * 2;
+    return 0;
+}
+
+unsigned long OutputAudio(void*, unsigned long) { return 0; }
+void NotifyProgress(unsigned long, unsigned long) {}
+
+double TimeSession(const std::vector<int16_t>& source)
+{
+    g_feed = {AfBlock(), &source, 0};
+    TqovixLibraryInitialize();
+    TqovixSetCallbackInputAFInformation(InputAf);
+    TqovixSetCallbackInputAudioLevelInformation(InputLevel);
+    TqovixSetCallbackInputAudio(InputAudio);
+    TqovixSetCallbackOutputAudio(OutputAudio);
+    TqovixSetCallbackNotifyProgress(NotifyProgress);
+    const TqovixAudioInformation audio{sizeof(TqovixAudioInformation), kRate / 1000, kChannels, 16, kFrames, 0, 0};
+    const TqovixTrimInformation trim{sizeof(TqovixTrimInformation), 30000, 1001, 0, 0};
+    const auto start = Clock::now();
+    double seconds = -1.0;
+    if (TqovixOpenSession(audio, trim) == ovix::kSuccess) {
+        while (TqovixIsSessionFinished() == 0) {
+            std::this_thread::sleep_for(std::chrono::microseconds(200));
+        }
+        seconds = std::chrono::duration<double>(Clock::now() - start).count();
+        if (TqovixIsSessionFinished() != ovix::kSessionFinished) {
+            seconds = -1.0;
+        }
+        TqovixCloseSession(0);
+    }
+    TqovixLibraryClose();
+    return seconds;
+}
+
+}  // namespace
+
+int main()
+{
+    const std::vector<int16_t> source = Source();
+    std::printf("%llu s of 48 kHz stereo, every frame inside an AF interval, best of %d\n",
+                static_cast<unsigned long long>(kSeconds), kRounds);
+    double suppressor = 1e30;
+    double session = 1e30;
+    for (int round = 0; round < kRounds; ++round) {
+        suppressor = std::min(suppressor, TimeSuppressor(source));
+        const double seconds = TimeSession(source);
+        if (seconds < 0.0) {
+            std::fprintf(stderr, "the session did not finish\n");
+            return 1;
+        }
+        session = std::min(session, seconds);
+    }
+    Report("suppressor alone", suppressor);
+    Report("session through the interface", session);
+    return 0;
+}

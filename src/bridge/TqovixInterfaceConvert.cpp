@@ -1,0 +1,205 @@
+#include "bridge/TqovixInterfaceConvert.h"
+
+namespace TqovixInterfaceConvert {
+
+InputFunc g_pfnInputAFInformationFunc = nullptr;
+InputFunc g_pfnInputAudioLevelInformationFunc = nullptr;
+InputFunc g_pfnInputAudioFunc = nullptr;
+OutputFunc g_pfnOutputAudioFunc = nullptr;
+NotifyFunc g_pfnNotifyProgressFunc = nullptr;
+
+namespace {
+
+// Library code to internal code for the results that carry a state or a verdict; the rest
+// are ordinary result codes.
+eTqovixErrorCode ConvertVerdict(unsigned long code)
+{
+    switch (code) {
+    case ovix::kVerdictNoAfInformation: return eTqovixVerdict7;
+    case ovix::kVerdictNotAfBlock: return eTqovixVerdict8;
+    case ovix::kVerdictMalformed: return eTqovixVerdict9;
+    case ovix::kVerdictAlreadyProcessed: return eTqovixVerdict20;
+    default: return ConvertToLocalError(code);
+    }
+}
+
+unsigned long CallInput(InputFunc callback, void* buffer, unsigned long* delivered, unsigned long size,
+                        unsigned long skip)
+{
+    if (callback == nullptr) {
+        return ovix::kFailure;
+    }
+    return ConvertToLibraryError(callback(buffer, delivered, size, skip));
+}
+
+}  // namespace
+
+eTqovixErrorCode TqovixLibraryInitialize()
+{
+    return ConvertToLocalError(::TqovixLibraryInitialize());
+}
+
+void TqovixLibraryClose()
+{
+    ::TqovixLibraryClose();
+}
+
+eTqovixErrorCode TqovixIsEnable(void* block, unsigned long size)
+{
+    const unsigned long code = ::TqovixIsEnable(block, size);
+    return code == ovix::kSuccess ? eTqovixEnable : ConvertVerdict(code);
+}
+
+eTqovixErrorCode TqovixOpenSession(const TqovixAudioInformation& audio, const TqovixTrimInformation& trim)
+{
+    return ConvertToLocalError(::TqovixOpenSession(MakeLibraryRecord(audio), MakeLibraryRecord(trim)));
+}
+
+eTqovixErrorCode TqovixIsSessionFinished()
+{
+    switch (const unsigned long code = ::TqovixIsSessionFinished()) {
+    case 0: return eTqovixRunning;
+    case ovix::kSessionFinished: return eTqovixFinished;
+    default: return ConvertVerdict(code);
+    }
+}
+
+eTqovixErrorCode TqovixGetProcessedAFInfo(void* buffer, unsigned long size, unsigned long* count)
+{
+    switch (const unsigned long code = ::TqovixGetProcessedAFInfo(buffer, size, count)) {
+    case 0: return eTqovixRunning;
+    case ovix::kLastPiece: return eTqovixFinished;
+    default: return ConvertToLocalError(code);
+    }
+}
+
+void TqovixAbortSession()
+{
+    ::TqovixAbortSession();
+}
+
+void TqovixCloseSession(eTqovixErrorCode code)
+{
+    ::TqovixCloseSession(ConvertToLibraryError(code));
+}
+
+void TqovixSetCallbackInputAFInformation(InputFunc callback)
+{
+    g_pfnInputAFInformationFunc = callback;
+    ::TqovixSetCallbackInputAFInformation(InputAFInformationFunc);
+}
+
+void TqovixSetCallbackInputAudioLevelInformation(InputFunc callback)
+{
+    g_pfnInputAudioLevelInformationFunc = callback;
+    ::TqovixSetCallbackInputAudioLevelInformation(InputAudioLevelInformationFunc);
+}
+
+void TqovixSetCallbackInputAudio(InputFunc callback)
+{
+    g_pfnInputAudioFunc = callback;
+    ::TqovixSetCallbackInputAudio(InputAudioFunc);
+}
+
+void TqovixSetCallbackOutputAudio(OutputFunc callback)
+{
+    g_pfnOutputAudioFunc = callback;
+    ::TqovixSetCallbackOutputAudio(OutputAudioFunc);
+}
+
+void TqovixSetCallbackNotifyProgress(NotifyFunc callback)
+{
+    g_pfnNotifyProgressFunc = callback;
+    ::TqovixSetCallbackNotifyProgress(NotifyProgressFunc);
+}
+
+unsigned long InputAFInformationFunc(void* buffer, unsigned long* delivered, unsigned long size, unsigned long skip)
+{
+    return CallInput(g_pfnInputAFInformationFunc, buffer, delivered, size, skip);
+}
+
+unsigned long InputAudioLevelInformationFunc(void* buffer, unsigned long* delivered, unsigned long size,
+                                             unsigned long skip)
+{
+    return CallInput(g_pfnInputAudioLevelInformationFunc, buffer, delivered, size, skip);
+}
+
+unsigned long InputAudioFunc(void* buffer, unsigned long* delivered, unsigned long size, unsigned long skip)
+{
+    return CallInput(g_pfnInputAudioFunc, buffer, delivered, size, skip);
+}
+
+unsigned long OutputAudioFunc(void* data, unsigned long size)
+{
+    if (g_pfnOutputAudioFunc == nullptr) {
+        return ovix::kFailure;
+    }
+    return ConvertToLibraryError(g_pfnOutputAudioFunc(data, size));
+}
+
+void NotifyProgressFunc(unsigned long first, unsigned long second)
+{
+    if (g_pfnNotifyProgressFunc != nullptr) {
+        g_pfnNotifyProgressFunc(first, second);
+    }
+}
+
+::TqovixAudioInformation MakeLibraryRecord(const TqovixAudioInformation& audio)
+{
+    ::TqovixAudioInformation record{};
+    record.size = sizeof record;
+    record.sampleRate = audio.sampleRate;
+    record.channels = audio.channels;
+    record.bitsPerSample = audio.bitsPerSample;
+    record.sampleCount = audio.sampleCount;
+    record.startOffset = audio.startOffset;
+    return record;
+}
+
+::TqovixTrimInformation MakeLibraryRecord(const TqovixTrimInformation& trim)
+{
+    ::TqovixTrimInformation record{};
+    record.size = sizeof record;
+    record.frameRateNumerator = trim.frameRateNumerator;
+    record.frameRateDenominator = trim.frameRateDenominator;
+    record.removedFrameForward = trim.removedFrameForward;
+    record.removedFrameBackward = trim.removedFrameBackward;
+    return record;
+}
+
+unsigned long ConvertToLibraryError(eTqovixErrorCode code)
+{
+    switch (code) {
+    case eTqovixSuccess:
+    case eTqovixFinished: return 0;
+    case eTqovixNoAudioLevel: return 30;
+    case eTqovixErrorOutOfMemory: return 100;
+    case eTqovixErrorSourceNotFound: return 110;
+    case eTqovixErrorDestinationNotFound: return 111;
+    case eTqovixErrorSourceAccessDenied: return 120;
+    case eTqovixErrorDestinationAccessDenied: return 121;
+    case eTqovixErrorDiskFull: return 130;
+    case eTqovixErrorFileTooLarge: return 131;
+    case eTqovixErrorAborted: return 200;
+    default: return 190;
+    }
+}
+
+eTqovixErrorCode ConvertToLocalError(unsigned long code)
+{
+    switch (code) {
+    case 0: return eTqovixSuccess;
+    case 30: return eTqovixNoAudioLevel;
+    case 100: return eTqovixErrorOutOfMemory;
+    case 110: return eTqovixErrorSourceNotFound;
+    case 111: return eTqovixErrorDestinationNotFound;
+    case 120: return eTqovixErrorSourceAccessDenied;
+    case 121: return eTqovixErrorDestinationAccessDenied;
+    case 130: return eTqovixErrorDiskFull;
+    case 131: return eTqovixErrorFileTooLarge;
+    case 200: return eTqovixErrorAborted;
+    default: return eTqovixErrorGeneral;
+    }
+}
+
+}  // namespace TqovixInterfaceConvert
