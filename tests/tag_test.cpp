@@ -89,7 +89,11 @@ class TagTreeTest : public ::testing::Test {
 protected:
     void Load(const Bytes& movie)
     {
-        const std::string path = m_dir.File("movie.mov");
+        m_tree.Close();
+        if (m_file.IsOpened()) {
+            m_file.Close();
+        }
+        const std::string path = m_dir.File("movie" + std::to_string(m_loads++) + ".mov");
         ASSERT_TRUE(testsupport::WriteFile(path, movie));
         ASSERT_EQ(m_file.Open(path.c_str(), 1), eTqovixSuccess);
         ASSERT_EQ(m_tree.Initialize(m_file), eTqovixSuccess);
@@ -109,6 +113,7 @@ protected:
     testsupport::TempDir m_dir;
     CTqovixFile m_file;
     CTqovixAtomControl m_tree;
+    int m_loads = 0;
 };
 
 TEST(TagCursorTest, WalksTagsAndReadsValuesOfTheirSize)
@@ -313,6 +318,30 @@ TEST_F(TagTreeTest, MakerBlocksCopyOutWithHeaderAndGoBackAsPayload)
     CTqovixAudioLevelInformationVisitor emptyLevel;
     emptyLevel.SetAudioLevelInformation(nullptr, 0);
     EXPECT_EQ(m_tree.Update(emptyLevel), eTqovixErrorInternal);
+}
+
+TEST_F(TagTreeTest, EmptyAndZeroSizedAfInformation)
+{
+    // An atom claiming size 0 cannot be parsed at all; an empty one gives a bare header.
+    CTqovixFile file;
+    CTqovixAtomControl tree;
+    const std::string path = m_dir.File("zero.mov");
+    Bytes zero = Atom("OP01", {});
+    zero[3] = 0;
+    ASSERT_TRUE(testsupport::WriteFile(path, MovieWith(kRate, {zero, Atom("OP02", {})})));
+    ASSERT_EQ(file.Open(path.c_str(), 1), eTqovixSuccess);
+    EXPECT_EQ(tree.Initialize(file), eTqovixErrorInvalidMovie);
+
+    // Alone, an empty atom leaves "TCDB" too small to be a container: nothing is found.
+    Load(MovieWith(kRate, {Atom("OP01", {})}));
+    CTqovixAFInformationVisitor hidden;
+    EXPECT_EQ(m_tree.Analyze(hidden), eTqovixErrorInvalidMovie);
+
+    Load(MovieWith(kRate, {Atom("OP01", {}), Atom("OP02", {})}));
+    CTqovixAFInformationVisitor af;
+    ASSERT_EQ(m_tree.Analyze(af), eTqovixSuccess);
+    ASSERT_EQ(af.GetAFInformationSize(), 8u);
+    EXPECT_EQ(Bytes(af.GetAFInformation(), af.GetAFInformation() + 8), (Bytes{0, 0, 0, 8, 'O', 'P', '0', '1'}));
 }
 
 TEST_F(TagTreeTest, MakerBlocksElsewhereAreNotFound)

@@ -294,7 +294,24 @@ TEST_F(TrackTest, ChunkListsOfCameraMoviesMatchTheirLayout)
         std::vector<TqovixChunkInformation> videoChunks;
         ASSERT_EQ(video.GetOffset(videoChunks), eTqovixSuccess);
         EXPECT_EQ(videoChunks, ExpectedChunks(layout.videoChunks, spec.video.perSampleSizes));
+
+        // The last chunk ends exactly where the file would have to, or one byte beyond.
+        uint64_t end = 0;
+        for (const auto& chunk : soundChunks) {
+            end = std::max<uint64_t>(end, chunk.offset + chunk.size);
+        }
+        for (const auto& chunk : videoChunks) {
+            end = std::max<uint64_t>(end, chunk.offset + chunk.size);
+        }
+        EXPECT_EQ(TqovixCheckChunksInFile(soundChunks, end), eTqovixSuccess);
+        EXPECT_EQ(TqovixCheckChunksInFile(videoChunks, end), eTqovixSuccess);
+        EXPECT_EQ(std::max(TqovixCheckChunksInFile(soundChunks, end - 1), TqovixCheckChunksInFile(videoChunks, end - 1)),
+                  eTqovixErrorInvalidMovie);
     }
+    std::vector<TqovixChunkInformation> wrapping(1);
+    wrapping[0].offset = ~0ULL - 2;
+    wrapping[0].size = 8;
+    EXPECT_EQ(TqovixCheckChunksInFile(wrapping, ~0ULL), eTqovixErrorInvalidMovie) << "no wrap-around";
 }
 
 struct TableCase {

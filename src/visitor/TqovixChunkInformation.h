@@ -4,6 +4,8 @@
 #include <cstdint>
 #include <vector>
 
+#include "bridge/TqovixErrorCode.h"
+
 // One chunk of a track: where it lies, how many bytes and samples it holds.
 struct TqovixChunkInformation {
     uint64_t offset = 0;
@@ -20,3 +22,15 @@ struct TqovixSampleInfomation {
     uint32_t firstChunk = 0;
     uint32_t samplesPerChunk = 0;
 };
+
+// 4359 when a chunk lies past the end of a file of `fileSize` bytes: tables
+// that point outside the movie describe a damaged or foreign file.
+inline eTqovixErrorCode TqovixCheckChunksInFile(const std::vector<TqovixChunkInformation>& chunks, uint64_t fileSize)
+{
+    for (const TqovixChunkInformation& chunk : chunks) {
+        if (chunk.offset > fileSize || chunk.size > fileSize - chunk.offset) {
+            return eTqovixErrorInvalidMovie;
+        }
+    }
+    return eTqovixSuccess;
+}
