@@ -273,9 +273,9 @@ TEST_F(AtomFileTest, CameraMoviesWriteBackByteIdentical)
     reordered.ftypAfterMoov = true;
     reordered.majorBrand = "mp42";
     reordered.soundTrackFirst = true;
-    for (const moviekit::MovieSpec& spec : {plain, wide, reordered}) {
+    for (const moviekit::MovieSpec& recipe : {plain, wide, reordered}) {
         std::string error;
-        const Bytes movie = moviekit::BuildMovie(spec, nullptr, &error);
+        const Bytes movie = moviekit::BuildMovie(recipe, nullptr, &error);
         ASSERT_FALSE(movie.empty()) << error;
         CTqovixFile source;
         CTqovixAtomControl tree;

@@ -146,12 +146,12 @@ TEST_F(AudioFileTest, ChunkReadsWhatTheFileHoldsAndRemembersTheRest)
 TEST_F(AudioFileTest, PcmRequestsOfAnySizeDeliverTheTrackInOrder)
 {
     for (const moviekit::SoundCodec codec : {moviekit::SoundCodec::Twos, moviekit::SoundCodec::Sowt}) {
-        moviekit::MovieSpec spec;
-        spec.video.frameCount = 45;
-        spec.sound.samplesPerChunk = 700;
+        moviekit::MovieSpec recipe;
+        recipe.video.frameCount = 45;
+        recipe.sound.samplesPerChunk = 700;
         moviekit::MovieLayout layout;
-        spec.sound.codec = codec;
-        const Bytes movie = moviekit::BuildMovie(spec, &layout);
+        recipe.sound.codec = codec;
+        const Bytes movie = moviekit::BuildMovie(recipe, &layout);
         CTqovixFile file;
         const std::string path = m_dir.File("pcm.mov");
         ASSERT_TRUE(testsupport::WriteFile(path, movie));
@@ -312,11 +312,11 @@ TEST_F(AudioFileTest, AacPacketsDecodeInOrderAndSilenceFollowsTheTrack)
 
 TEST_F(AudioFileTest, AacTrackOfACameraMovieIsDecodedPacketByPacketInTableOrder)
 {
-    moviekit::MovieSpec spec;
-    spec.sound.codec = moviekit::SoundCodec::Aac;
-    spec.sound.samplesPerChunk = 7;
+    moviekit::MovieSpec recipe;
+    recipe.sound.codec = moviekit::SoundCodec::Aac;
+    recipe.sound.samplesPerChunk = 7;
     moviekit::MovieLayout layout;
-    const Bytes movie = moviekit::BuildMovie(spec, &layout);
+    const Bytes movie = moviekit::BuildMovie(recipe, &layout);
     Open(movie);
     for (const unsigned long request : {1UL, 333UL, 4096UL}) {
         FakeAacControl control;

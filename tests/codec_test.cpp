@@ -232,13 +232,13 @@ Pcm DecodeAll(const Packets& packets, unsigned int delay)
 
 std::string WriteAacMovie(const testsupport::TempDir& dir, const Packets& packets, uint32_t mediaTime)
 {
-    moviekit::MovieSpec spec;
-    spec.sound.codec = moviekit::SoundCodec::Aac;
-    spec.sound.mediaTime = mediaTime;
-    spec.sound.aacPackets = packets;
+    moviekit::MovieSpec recipe;
+    recipe.sound.codec = moviekit::SoundCodec::Aac;
+    recipe.sound.mediaTime = mediaTime;
+    recipe.sound.aacPackets = packets;
     const std::string path = dir.File("movie-" + std::to_string(mediaTime) + ".mov");
     std::string error;
-    EXPECT_TRUE(moviekit::WriteMovie(path, spec, nullptr, &error)) << error;
+    EXPECT_TRUE(moviekit::WriteMovie(path, recipe, nullptr, &error)) << error;
     return path;
 }
 
@@ -867,10 +867,10 @@ void PatchAtoms(moviekit::Bytes& bytes, const char* type, ptrdiff_t offset, uint
 
 TEST(AudioFileTest, MalformedMoviesAreRefused)
 {
-    moviekit::MovieSpec spec;
-    spec.sound.codec = moviekit::SoundCodec::Aac;
+    moviekit::MovieSpec recipe;
+    recipe.sound.codec = moviekit::SoundCodec::Aac;
     moviekit::MovieLayout layout;
-    const moviekit::Bytes movie = moviekit::BuildMovie(spec, &layout);
+    const moviekit::Bytes movie = moviekit::BuildMovie(recipe, &layout);
     ASSERT_FALSE(movie.empty());
     struct Case {
         const char* name;

@@ -151,10 +151,10 @@ std::vector<std::pair<uint32_t, uint32_t>> StscRuns(const Bytes& stsc)
     return runs;
 }
 
-Bytes BuildOk(const MovieSpec& spec, MovieLayout* layout = nullptr)
+Bytes BuildOk(const MovieSpec& recipe, MovieLayout* layout = nullptr)
 {
     std::string error;
-    Bytes file = moviekit::BuildMovie(spec, layout, &error);
+    Bytes file = moviekit::BuildMovie(recipe, layout, &error);
     EXPECT_FALSE(file.empty()) << error;
     return file;
 }
@@ -215,17 +215,17 @@ TEST(AacConfigTest, AudioSpecificConfig)
 
 TEST(AacConfigTest, EsdsDescriptorChain)
 {
-    moviekit::EsdsSpec spec;
+    moviekit::EsdsSpec recipe;
     const Bytes expected = {0, 0, 0, 0,                                 // version, flags
                             0x03, 25, 0x00, 0x01, 0x00,                 // ES_Descriptor, ES_ID 1, flags
                             0x04, 17, 0x40, 0x15, 0x00, 0x18, 0x00,     // DecoderConfig, buffer 6144
                             0x00, 0x03, 0xE8, 0x00, 0x00, 0x01, 0xF4, 0x00,  // max 256000, avg 128000
                             0x05, 2, 0x11, 0x90,                        // DecoderSpecificInfo
                             0x06, 1, 0x02};                             // SLConfig
-    EXPECT_EQ(moviekit::MakeEsdsPayload(spec, {0x11, 0x90}, 256000, 128000), expected);
+    EXPECT_EQ(moviekit::MakeEsdsPayload(recipe, {0x11, 0x90}, 256000, 128000), expected);
 
-    spec.longSizes = true;
-    const Bytes longForm = moviekit::MakeEsdsPayload(spec, {0x11, 0x90}, 256000, 128000);
+    recipe.longSizes = true;
+    const Bytes longForm = moviekit::MakeEsdsPayload(recipe, {0x11, 0x90}, 256000, 128000);
     ASSERT_EQ(longForm.size(), 43U);
     EXPECT_EQ(Slice(longForm, 4, 5), (Bytes{0x03, 0x80, 0x80, 0x80, 34}));
     EXPECT_EQ(Slice(longForm, 4 + 8, 5), (Bytes{0x04, 0x80, 0x80, 0x80, 20}));
@@ -353,10 +353,10 @@ TEST(MovieStructureTest, TopLevelOrderOptions)
     };
     for (const Row& row : rows) {
         SCOPED_TRACE(row.name);
-        MovieSpec spec;
-        row.apply(spec);
+        MovieSpec recipe;
+        row.apply(recipe);
         MovieLayout layout;
-        const Bytes file = BuildOk(spec, &layout);
+        const Bytes file = BuildOk(recipe, &layout);
         std::vector<std::string> order;
         std::vector<AtomView> mdats;
         for (const AtomView& atom : TopLevel(file)) {
@@ -386,7 +386,7 @@ TEST(MovieStructureTest, TopLevelOrderOptions)
             payloads += mdats[i].PayloadSize();
         }
         EXPECT_EQ(payloads, chunkBytes);
-        EXPECT_EQ(mdats[0].header, spec.largeMdatHeader ? 16U : 8U);
+        EXPECT_EQ(mdats[0].header, recipe.largeMdatHeader ? 16U : 8U);
         EXPECT_EQ(U32(StblAtom(file, "soun", "stco"), 8), layout.soundChunks[0].offset);
     }
 }
@@ -394,13 +394,13 @@ TEST(MovieStructureTest, TopLevelOrderOptions)
 TEST(MovieStructureTest, PcmBytesAreStoredInTheTrackByteOrder)
 {
     for (SoundCodec codec : {SoundCodec::Twos, SoundCodec::Sowt}) {
-        MovieSpec spec;
-        spec.sound.codec = codec;
-        spec.sound.channels = 1;
-        spec.sound.pcm = {0x1234, -2, 0x7F00, 5, 6};
-        spec.sound.chunkSampleCounts = {2, 3};
+        MovieSpec recipe;
+        recipe.sound.codec = codec;
+        recipe.sound.channels = 1;
+        recipe.sound.pcm = {0x1234, -2, 0x7F00, 5, 6};
+        recipe.sound.chunkSampleCounts = {2, 3};
         MovieLayout layout;
-        const Bytes file = BuildOk(spec, &layout);
+        const Bytes file = BuildOk(recipe, &layout);
         const Bytes expected = codec == SoundCodec::Twos ? Bytes{0x12, 0x34, 0xFF, 0xFE, 0x7F, 0, 0, 5, 0, 6}
                                                          : Bytes{0x34, 0x12, 0xFE, 0xFF, 0, 0x7F, 5, 0, 6, 0};
         EXPECT_EQ(layout.soundBytes, expected);
@@ -439,37 +439,37 @@ TEST(MovieStructureTest, GeneratedMediaIsDeterministicAndDistinctPerFrame)
 
 TEST(MovieStructureTest, SampleToChunkRuns)
 {
-    MovieSpec spec;
-    spec.sound.sampleCount = 1000;
-    spec.sound.samplesPerChunk = 300;  // 300, 300, 300, 100
-    spec.video.frameCount = 31;        // 15, 15, 1
+    MovieSpec recipe;
+    recipe.sound.sampleCount = 1000;
+    recipe.sound.samplesPerChunk = 300;  // 300, 300, 300, 100
+    recipe.video.frameCount = 31;        // 15, 15, 1
     MovieLayout layout;
-    Bytes file = BuildOk(spec, &layout);
+    Bytes file = BuildOk(recipe, &layout);
     using Runs = std::vector<std::pair<uint32_t, uint32_t>>;
     EXPECT_EQ(StscRuns(StblAtom(file, "soun", "stsc")), (Runs{{1, 300}, {4, 100}}));
     EXPECT_EQ(StscRuns(StblAtom(file, "vide", "stsc")), (Runs{{1, 15}, {3, 1}}));
     EXPECT_EQ(U32(StblAtom(file, "soun", "stco"), 4), 4U);
 
-    spec.sound.chunkSampleCounts = {100, 100, 50, 50, 70, 630};
-    file = BuildOk(spec, &layout);
+    recipe.sound.chunkSampleCounts = {100, 100, 50, 50, 70, 630};
+    file = BuildOk(recipe, &layout);
     EXPECT_EQ(StscRuns(StblAtom(file, "soun", "stsc")), (Runs{{1, 100}, {3, 50}, {5, 70}, {6, 630}}));
     EXPECT_EQ(layout.soundChunks[5].firstSample, 370U);
 
-    spec.sound.chunkSampleCounts = {100, 100};
+    recipe.sound.chunkSampleCounts = {100, 100};
     std::string error;
-    EXPECT_TRUE(moviekit::BuildMovie(spec, nullptr, &error).empty());
+    EXPECT_TRUE(moviekit::BuildMovie(recipe, nullptr, &error).empty());
     EXPECT_NE(error.find("add up"), std::string::npos) << error;
 }
 
 TEST(MovieStructureTest, ChunksInterleaveInTimeOrder)
 {
     for (bool soundFirst : {false, true}) {
-        MovieSpec spec;
-        spec.soundFirstInPeriod = soundFirst;
-        spec.video.frameCount = 90;  // six periods of 15 frames (0.5005 s)
-        spec.sound.samplesPerChunk = 9600;  // 0.2 s
+        MovieSpec recipe;
+        recipe.soundFirstInPeriod = soundFirst;
+        recipe.video.frameCount = 90;  // six periods of 15 frames (0.5005 s)
+        recipe.sound.samplesPerChunk = 9600;  // 0.2 s
         MovieLayout layout;
-        BuildOk(spec, &layout);
+        BuildOk(recipe, &layout);
         struct Placed {
             uint64_t offset;
             double start;
@@ -502,15 +502,15 @@ TEST(MovieStructureTest, ChunksInterleaveInTimeOrder)
 
 TEST(MovieStructureTest, EditListAndMakerAtomOptions)
 {
-    MovieSpec spec;
-    spec.sound.mediaTime = 2112;
-    spec.soundTrackFirst = true;
-    spec.dataHandlerInMinf = false;
-    spec.maker.audioLevel = false;
-    spec.maker.afPayload = Text("foreign camera AF");
-    spec.maker.tags = std::vector<moviekit::Tag>{moviekit::MakeAsciiTag(1, 3, "x")};
-    spec.maker.extraTcdtChildren = {moviekit::Atom("OP02", {1, 2})};
-    Bytes file = BuildOk(spec);
+    MovieSpec recipe;
+    recipe.sound.mediaTime = 2112;
+    recipe.soundTrackFirst = true;
+    recipe.dataHandlerInMinf = false;
+    recipe.maker.audioLevel = false;
+    recipe.maker.afPayload = Text("foreign camera AF");
+    recipe.maker.tags = std::vector<moviekit::Tag>{moviekit::MakeAsciiTag(1, 3, "x")};
+    recipe.maker.extraTcdtChildren = {moviekit::Atom("OP02", {1, 2})};
+    Bytes file = BuildOk(recipe);
     EXPECT_EQ(TrackKinds(file), (std::vector<std::string>{"mhlr/soun", "mhlr/vide"}));
     EXPECT_EQ(U32(TrackAtom(file, "soun", {"edts", "elst"}), 12), 2112U);
     EXPECT_FALSE(Path(file, Moov(file), {"trak", "mdia", "minf", "hdlr"}));
@@ -519,22 +519,22 @@ TEST(MovieStructureTest, EditListAndMakerAtomOptions)
     EXPECT_EQ(MakerAtom(file, {"udta", "TCDT", "OP02"}), (Bytes{1, 2}));
     EXPECT_EQ(MakerAtom(file, {"udta", "TCDT", "TCTG"}), (Bytes{0, 1, 0, 3, 0, 2, 0, 2, 'x', 0}));
 
-    spec = MovieSpec{};
-    spec.sound.elst = false;
-    spec.video.edit = false;
-    spec.maker.afInformation = false;
-    spec.maker.audioLevel = false;
-    spec.maker.tagAtom = false;
-    file = BuildOk(spec);
+    recipe = MovieSpec{};
+    recipe.sound.elst = false;
+    recipe.video.edit = false;
+    recipe.maker.afInformation = false;
+    recipe.maker.audioLevel = false;
+    recipe.maker.tagAtom = false;
+    file = BuildOk(recipe);
     const std::optional<AtomView> edts = TrackPath(file, "soun", {"edts"});
     ASSERT_TRUE(edts);
     EXPECT_EQ(edts->size, 8U);  // an edit container without its list
     EXPECT_FALSE(TrackPath(file, "vide", {"edts"}));
     EXPECT_EQ(MakerAtom(file, {"udta"}), Bytes{});
 
-    spec.sound.edts = false;
-    spec.maker.userData = false;
-    file = BuildOk(spec);
+    recipe.sound.edts = false;
+    recipe.maker.userData = false;
+    file = BuildOk(recipe);
     EXPECT_FALSE(TrackPath(file, "soun", {"edts"}));
     EXPECT_TRUE(TrackPath(file, "soun", {"tkhd"}));
     for (const AtomView& atom : Children(file, Moov(file).PayloadOffset(), Moov(file).offset + Moov(file).size)) {
@@ -559,24 +559,24 @@ TEST(MovieStructureTest, InvalidDescriptionsAreRefused)
         {"movie time scale 0", [](MovieSpec& s) { s.movieTimeScale = 0; }},
     };
     for (const Row& row : rows) {
-        MovieSpec spec;
-        row.apply(spec);
+        MovieSpec recipe;
+        row.apply(recipe);
         std::string error;
         MovieLayout layout;
-        EXPECT_TRUE(moviekit::BuildMovie(spec, &layout, &error).empty()) << row.name;
+        EXPECT_TRUE(moviekit::BuildMovie(recipe, &layout, &error).empty()) << row.name;
         EXPECT_FALSE(error.empty()) << row.name;
     }
 }
 
 TEST(MovieStructureTest, AacTrackCarriesPacketTableAndDecoderConfig)
 {
-    MovieSpec spec;
-    spec.sound.codec = SoundCodec::Aac;
-    spec.sound.esds.averageBitRate = 96000;
-    spec.sound.aacPackets = {Bytes(10, 1), Bytes(20, 2), Bytes(30, 3)};
-    spec.sound.samplesPerChunk = 2;
+    MovieSpec recipe;
+    recipe.sound.codec = SoundCodec::Aac;
+    recipe.sound.esds.averageBitRate = 96000;
+    recipe.sound.aacPackets = {Bytes(10, 1), Bytes(20, 2), Bytes(30, 3)};
+    recipe.sound.samplesPerChunk = 2;
     MovieLayout layout;
-    const Bytes file = BuildOk(spec, &layout);
+    const Bytes file = BuildOk(recipe, &layout);
     const Bytes stsz = StblAtom(file, "soun", "stsz");
     EXPECT_EQ(Slice(stsz, 4, 8 + 12), (Bytes{0, 0, 0, 0, 0, 0, 0, 3, 0, 0, 0, 10, 0, 0, 0, 20, 0, 0, 0, 30}));
     EXPECT_EQ(Slice(StblAtom(file, "soun", "stts"), 8, 8), (Bytes{0, 0, 0, 3, 0, 0, 4, 0}));
@@ -588,8 +588,8 @@ TEST(MovieStructureTest, AacTrackCarriesPacketTableAndDecoderConfig)
     EXPECT_EQ(Type(stsd, 16 + 28 + 4), "esds");
     const Bytes esds = Slice(stsd, 16 + 28 + 8, U32(stsd, 16 + 28) - 8);
     // The largest packet, 30 bytes per 1024 frames at 48 kHz, sets the peak rate.
-    spec.sound.esds.maxBitRate = 11250;
-    EXPECT_EQ(esds, moviekit::MakeEsdsPayload(spec.sound.esds, {0x11, 0x90}, 11250, 96000));
+    recipe.sound.esds.maxBitRate = 11250;
+    EXPECT_EQ(esds, moviekit::MakeEsdsPayload(recipe.sound.esds, {0x11, 0x90}, 11250, 96000));
 }
 
 // ---------------------------------------------------------------------------------------
@@ -631,22 +631,22 @@ TEST_P(FfprobeTest, ReadsTracksAndPacketsAsLaidOut)
 {
     ASSERT_TRUE(testsupport::HaveCommand("ffprobe")) << "ffprobe is required";
     const ProbeCase& c = GetParam();
-    MovieSpec spec;
-    spec.sound.codec = c.codec;
-    spec.sound.channels = c.channels;
-    spec.sound.sampleRate = c.rate;
-    spec.sound.descriptionVersion = c.descriptionVersion;
-    spec.sound.samplesPerChunk = c.codec == SoundCodec::Aac ? 7 : 5000;  // short last chunks
-    spec.video.frameCount = 45;
-    spec.co64 = c.co64;
-    spec.largeMdatHeader = c.largeMdatHeader;
-    spec.soundTrackFirst = c.soundTrackFirst;
-    spec.moovBeforeMdat = c.moovBeforeMdat;
+    MovieSpec recipe;
+    recipe.sound.codec = c.codec;
+    recipe.sound.channels = c.channels;
+    recipe.sound.sampleRate = c.rate;
+    recipe.sound.descriptionVersion = c.descriptionVersion;
+    recipe.sound.samplesPerChunk = c.codec == SoundCodec::Aac ? 7 : 5000;  // short last chunks
+    recipe.video.frameCount = 45;
+    recipe.co64 = c.co64;
+    recipe.largeMdatHeader = c.largeMdatHeader;
+    recipe.soundTrackFirst = c.soundTrackFirst;
+    recipe.moovBeforeMdat = c.moovBeforeMdat;
     testsupport::TempDir dir;
     const std::string path = dir.File("movie.mov");
     MovieLayout layout;
     std::string error;
-    ASSERT_TRUE(moviekit::WriteMovie(path, spec, &layout, &error)) << error;
+    ASSERT_TRUE(moviekit::WriteMovie(path, recipe, &layout, &error)) << error;
     ASSERT_EQ(layout.co64, c.co64);
 
     // Edit lists are ignored so that every stored packet is listed; -count_frames decodes them all.

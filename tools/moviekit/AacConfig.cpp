@@ -99,41 +99,41 @@ Bytes MakeAudioSpecificConfig(uint32_t sampleRate, uint16_t channels, uint8_t ob
     return bits.Finish();
 }
 
-Bytes MakeEsdsPayload(const EsdsSpec& spec, const Bytes& audioSpecificConfig, uint32_t maxBitRate,
+Bytes MakeEsdsPayload(const EsdsSpec& recipe, const Bytes& audioSpecificConfig, uint32_t maxBitRate,
                       uint32_t averageBitRate)
 {
-    if (spec.rawPayload) {
-        return *spec.rawPayload;
+    if (recipe.rawPayload) {
+        return *recipe.rawPayload;
     }
     Bytes config;
-    PutU8(config, spec.objectType);
-    PutU8(config, spec.streamType);
-    PutU24(config, spec.bufferSize);
+    PutU8(config, recipe.objectType);
+    PutU8(config, recipe.streamType);
+    PutU24(config, recipe.bufferSize);
     PutU32(config, maxBitRate);
     PutU32(config, averageBitRate);
-    PutBytes(config, Descriptor(0x05, audioSpecificConfig, spec.longSizes));
-    if (spec.profileLevelAfterConfig) {
-        PutBytes(config, Descriptor(0x14, Bytes{0x01}, spec.longSizes));
+    PutBytes(config, Descriptor(0x05, audioSpecificConfig, recipe.longSizes));
+    if (recipe.profileLevelAfterConfig) {
+        PutBytes(config, Descriptor(0x14, Bytes{0x01}, recipe.longSizes));
     }
 
     Bytes es;
     PutU16(es, 1);  // ES_ID
-    PutU8(es, spec.esFlags);
-    if (spec.esFlags & 0x80) {
+    PutU8(es, recipe.esFlags);
+    if (recipe.esFlags & 0x80) {
         PutU16(es, 0);
     }
-    if (spec.esFlags & 0x40) {
+    if (recipe.esFlags & 0x40) {
         PutU8(es, 0);  // empty URL
     }
-    if (spec.esFlags & 0x20) {
+    if (recipe.esFlags & 0x20) {
         PutU16(es, 0);
     }
-    PutBytes(es, Descriptor(0x04, config, spec.longSizes));
-    PutBytes(es, Descriptor(0x06, Bytes{0x02}, spec.longSizes));  // SLConfig: predefined MP4
+    PutBytes(es, Descriptor(0x04, config, recipe.longSizes));
+    PutBytes(es, Descriptor(0x06, Bytes{0x02}, recipe.longSizes));  // SLConfig: predefined MP4
 
     Bytes payload;
     PutU32(payload, 0);  // version and flags
-    PutBytes(payload, Descriptor(0x03, es, spec.longSizes));
+    PutBytes(payload, Descriptor(0x03, es, recipe.longSizes));
     return payload;
 }
 

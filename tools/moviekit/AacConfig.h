@@ -28,7 +28,7 @@ struct EsdsSpec {
 };
 
 // The "esds" payload (version and flags included) with the bit rates already resolved.
-Bytes MakeEsdsPayload(const EsdsSpec& spec, const Bytes& audioSpecificConfig, uint32_t maxBitRate,
+Bytes MakeEsdsPayload(const EsdsSpec& recipe, const Bytes& audioSpecificConfig, uint32_t maxBitRate,
                       uint32_t averageBitRate);
 
 // A raw_data_block that decodes to silence: one SCE (mono) or CPE (stereo) with no spectral

@@ -10,7 +10,7 @@ namespace moviekit {
 
 class MediaSource {
 public:
-    MediaSource(const MovieSpec& spec, const MoviePlan& plan) : m_spec(spec), m_plan(plan) {}
+    MediaSource(const MovieSpec& recipe, const MoviePlan& plan) : m_spec(recipe), m_plan(plan) {}
 
     // Replaces `out` with the frame's bytes.
     void VideoFrame(uint64_t index, Bytes& out) const;

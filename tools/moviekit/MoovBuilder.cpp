@@ -114,13 +114,13 @@ Bytes Dinf()
     return Container("dinf", {Atom("dref", dref)});
 }
 
-Bytes VideoTrack(const MovieSpec& spec, const MoviePlan& plan, bool co64)
+Bytes VideoTrack(const MovieSpec& recipe, const MoviePlan& plan, bool co64)
 {
-    const VideoSpec& video = spec.video;
+    const VideoSpec& video = recipe.video;
     const uint64_t mediaDuration = uint64_t{video.frameCount} * video.frameDuration;
-    const uint32_t movieDuration = Rescale(mediaDuration, video.timeScale, spec.movieTimeScale);
+    const uint32_t movieDuration = Rescale(mediaDuration, video.timeScale, recipe.movieTimeScale);
     std::vector<Bytes> minf = {Atom("vmhd", Bytes{0, 0, 0, 1, 0, 0x40, 0x80, 0, 0x80, 0, 0x80, 0})};
-    if (spec.dataHandlerInMinf) {
+    if (recipe.dataHandlerInMinf) {
         minf.push_back(Hdlr("dhlr", "alis", "Data Handler"));
     }
     minf.push_back(Dinf());
@@ -137,13 +137,13 @@ Bytes VideoTrack(const MovieSpec& spec, const MoviePlan& plan, bool co64)
     return Container("trak", trak);
 }
 
-Bytes SoundTrack(const MovieSpec& spec, const MoviePlan& plan, bool co64)
+Bytes SoundTrack(const MovieSpec& recipe, const MoviePlan& plan, bool co64)
 {
-    const SoundSpec& sound = spec.sound;
+    const SoundSpec& sound = recipe.sound;
     const uint32_t rate = sound.sampleRate;
-    const uint32_t movieDuration = Rescale(plan.soundFrames, rate, spec.movieTimeScale);
+    const uint32_t movieDuration = Rescale(plan.soundFrames, rate, recipe.movieTimeScale);
     std::vector<Bytes> minf = {Atom("smhd", Bytes(8, 0))};
-    if (spec.dataHandlerInMinf) {
+    if (recipe.dataHandlerInMinf) {
         minf.push_back(Hdlr("dhlr", "alis", "Data Handler"));
     }
     minf.push_back(Dinf());
@@ -155,7 +155,7 @@ Bytes SoundTrack(const MovieSpec& spec, const MoviePlan& plan, bool co64)
     std::vector<Bytes> trak = {Tkhd(kSoundTrackId, movieDuration, true, 0, 0)};
     if (sound.edts) {
         const uint64_t played = plan.soundFrames > plan.soundMediaTime ? plan.soundFrames - plan.soundMediaTime : 0;
-        trak.push_back(Edts(Rescale(played, rate, spec.movieTimeScale), plan.soundMediaTime, sound.elst));
+        trak.push_back(Edts(Rescale(played, rate, recipe.movieTimeScale), plan.soundMediaTime, sound.elst));
     }
     trak.push_back(Container("mdia", {Mdhd(rate, Clamp32(plan.soundFrames)), Hdlr("mhlr", "soun", "Sound Handler"),
                                       Container("minf", minf)}));
@@ -190,24 +190,24 @@ Bytes UserData(const MakerSpec& maker, const MoviePlan& plan)
 
 }  // namespace
 
-Bytes BuildMoov(const MovieSpec& spec, const MoviePlan& plan, bool co64)
+Bytes BuildMoov(const MovieSpec& recipe, const MoviePlan& plan, bool co64)
 {
     uint32_t duration = 0;
     std::vector<Bytes> tracks;
-    if (spec.video.present) {
-        tracks.push_back(VideoTrack(spec, plan, co64));
-        duration = Rescale(uint64_t{spec.video.frameCount} * spec.video.frameDuration, spec.video.timeScale,
-                           spec.movieTimeScale);
+    if (recipe.video.present) {
+        tracks.push_back(VideoTrack(recipe, plan, co64));
+        duration = Rescale(uint64_t{recipe.video.frameCount} * recipe.video.frameDuration, recipe.video.timeScale,
+                           recipe.movieTimeScale);
     }
-    if (spec.sound.present) {
-        Bytes sound = SoundTrack(spec, plan, co64);
-        tracks.insert(spec.soundTrackFirst ? tracks.begin() : tracks.end(), std::move(sound));
-        duration = std::max(duration, Rescale(plan.soundFrames, spec.sound.sampleRate, spec.movieTimeScale));
+    if (recipe.sound.present) {
+        Bytes sound = SoundTrack(recipe, plan, co64);
+        tracks.insert(recipe.soundTrackFirst ? tracks.begin() : tracks.end(), std::move(sound));
+        duration = std::max(duration, Rescale(plan.soundFrames, recipe.sound.sampleRate, recipe.movieTimeScale));
     }
-    std::vector<Bytes> children = {Mvhd(spec.movieTimeScale, duration)};
+    std::vector<Bytes> children = {Mvhd(recipe.movieTimeScale, duration)};
     children.insert(children.end(), tracks.begin(), tracks.end());
-    if (spec.maker.userData) {
-        children.push_back(UserData(spec.maker, plan));
+    if (recipe.maker.userData) {
+        children.push_back(UserData(recipe.maker, plan));
     }
     return Container("moov", children);
 }

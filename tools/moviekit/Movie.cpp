@@ -44,7 +44,7 @@ private:
 
 }  // namespace
 
-bool WriteMovie(const std::string& path, const MovieSpec& spec, MovieLayout* layout, std::string* error)
+bool WriteMovie(const std::string& path, const MovieSpec& recipe, MovieLayout* layout, std::string* error)
 {
     FileSink sink(path);
     if (!sink.IsOpen()) {
@@ -53,7 +53,7 @@ bool WriteMovie(const std::string& path, const MovieSpec& spec, MovieLayout* lay
         }
         return false;
     }
-    const bool written = WriteMovieTo(sink, spec, layout, error);
+    const bool written = WriteMovieTo(sink, recipe, layout, error);
     if (!sink.Close() && written) {
         if (error != nullptr) {
             *error = "cannot write " + path;
@@ -63,10 +63,10 @@ bool WriteMovie(const std::string& path, const MovieSpec& spec, MovieLayout* lay
     return written;
 }
 
-Bytes BuildMovie(const MovieSpec& spec, MovieLayout* layout, std::string* error)
+Bytes BuildMovie(const MovieSpec& recipe, MovieLayout* layout, std::string* error)
 {
     VectorSink sink;
-    if (!WriteMovieTo(sink, spec, layout, error)) {
+    if (!WriteMovieTo(sink, recipe, layout, error)) {
         return {};
     }
     return sink.Take();

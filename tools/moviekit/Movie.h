@@ -118,8 +118,8 @@ struct MovieLayout {
     uint32_t videoFrameSize = 0;
 };
 
-bool WriteMovie(const std::string& path, const MovieSpec& spec, MovieLayout* layout, std::string* error);
+bool WriteMovie(const std::string& path, const MovieSpec& recipe, MovieLayout* layout, std::string* error);
 // Same bytes as WriteMovie; empty on an invalid description (the reason in `error`).
-Bytes BuildMovie(const MovieSpec& spec, MovieLayout* layout = nullptr, std::string* error = nullptr);
+Bytes BuildMovie(const MovieSpec& recipe, MovieLayout* layout = nullptr, std::string* error = nullptr);
 
 }  // namespace moviekit

@@ -32,15 +32,15 @@ std::vector<uint32_t> SplitIntoChunks(uint64_t total, uint32_t perChunk)
 
 namespace {
 
-void ResolveMaker(const MovieSpec& spec, MoviePlan& plan)
+void ResolveMaker(const MovieSpec& recipe, MoviePlan& plan)
 {
-    const MakerSpec& maker = spec.maker;
+    const MakerSpec& maker = recipe.maker;
     if (maker.afPayload) {
         plan.afPayload = *maker.afPayload;
     } else {
         const uint64_t n = plan.soundFrames;
         const std::vector<AfInterval> defaults = {{n / 4, n / 4 + n / 10, 800}, {n / 2, n / 2 + n / 8, 500}};
-        plan.afPayload = MakeAfInformation(spec.sound.sampleRate, maker.afIntervals.value_or(defaults),
+        plan.afPayload = MakeAfInformation(recipe.sound.sampleRate, maker.afIntervals.value_or(defaults),
                                            maker.afProcessed);
     }
     plan.audioLevelPayload = maker.audioLevelPayload.value_or(MakeAudioLevel(maker.levelDb100));
@@ -49,10 +49,10 @@ void ResolveMaker(const MovieSpec& spec, MoviePlan& plan)
     } else if (maker.tags) {
         plan.tagPayload = SerializeTags(*maker.tags);
     } else {
-        const bool video = spec.video.present;
+        const bool video = recipe.video.present;
         std::vector<Tag> tags = {MakeAsciiTag(0, kSoftwareNameTag, maker.softwareName)};
         for (Tag& tag : MakeTrimTags(maker.removedFrameForward, maker.removedFrameBackward,
-                                     video ? spec.video.timeScale : 30, video ? spec.video.frameDuration : 1)) {
+                                     video ? recipe.video.timeScale : 30, video ? recipe.video.frameDuration : 1)) {
             tags.push_back(std::move(tag));
         }
         plan.tagPayload = SerializeTags(tags);
@@ -91,7 +91,7 @@ bool PlanVideo(const VideoSpec& video, MoviePlan& plan, std::string* error)
 }
 
 // Sound chunks go with the video chunk period in which they start.
-void Interleave(const MovieSpec& spec, MoviePlan& plan)
+void Interleave(const MovieSpec& recipe, MoviePlan& plan)
 {
     std::vector<ChunkSlot> order;
     const size_t videoCount = plan.videoChunks.size();
@@ -99,9 +99,9 @@ void Interleave(const MovieSpec& spec, MoviePlan& plan)
     for (uint32_t s = 0; s < plan.soundChunks.size(); ++s) {
         size_t period = 0;
         if (videoCount > 0) {
-            const VideoSpec& video = spec.video;
+            const VideoSpec& video = recipe.video;
             const uint64_t startFrame = plan.soundChunks[s].firstSample * (plan.aac ? kAacFramesPerPacket : 1);
-            const Wide periodLength = Wide{video.framesPerChunk} * video.frameDuration * spec.sound.sampleRate;
+            const Wide periodLength = Wide{video.framesPerChunk} * video.frameDuration * recipe.sound.sampleRate;
             const Wide index = Wide{startFrame} * video.timeScale / periodLength;
             period = static_cast<size_t>(std::min<Wide>(index, videoCount - 1));
         }
@@ -109,17 +109,17 @@ void Interleave(const MovieSpec& spec, MoviePlan& plan)
     }
     for (size_t period = 0; period < soundByPeriod.size(); ++period) {
         const bool haveVideo = period < videoCount;
-        if (haveVideo && !spec.soundFirstInPeriod) {
+        if (haveVideo && !recipe.soundFirstInPeriod) {
             order.push_back({false, static_cast<uint32_t>(period)});
         }
         for (uint32_t s : soundByPeriod[period]) {
             order.push_back({true, s});
         }
-        if (haveVideo && spec.soundFirstInPeriod) {
+        if (haveVideo && recipe.soundFirstInPeriod) {
             order.push_back({false, static_cast<uint32_t>(period)});
         }
     }
-    const size_t groups = std::max<uint32_t>(spec.mdatCount, 1);
+    const size_t groups = std::max<uint32_t>(recipe.mdatCount, 1);
     plan.mdats.assign(groups, {});
     for (size_t g = 0; g < groups; ++g) {
         const size_t begin = g * order.size() / groups;
@@ -131,17 +131,17 @@ void Interleave(const MovieSpec& spec, MoviePlan& plan)
 
 }  // namespace
 
-bool PlanMovie(const MovieSpec& spec, MoviePlan* plan, std::string* error)
+bool PlanMovie(const MovieSpec& recipe, MoviePlan* plan, std::string* error)
 {
     *plan = MoviePlan{};
-    if (!PlanVideo(spec.video, *plan, error)) {
+    if (!PlanVideo(recipe.video, *plan, error)) {
         return false;
     }
-    if (spec.sound.present && !PlanSound(spec, *plan, error)) {
+    if (recipe.sound.present && !PlanSound(recipe, *plan, error)) {
         return false;
     }
-    ResolveMaker(spec, *plan);
-    Interleave(spec, *plan);
+    ResolveMaker(recipe, *plan);
+    Interleave(recipe, *plan);
     return true;
 }
 

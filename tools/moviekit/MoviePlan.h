@@ -37,7 +37,7 @@ struct MoviePlan {
     std::vector<std::vector<ChunkSlot>> mdats;  // the chunks of each "mdat" in file order
 };
 
-bool PlanMovie(const MovieSpec& spec, MoviePlan* plan, std::string* error);
+bool PlanMovie(const MovieSpec& recipe, MoviePlan* plan, std::string* error);
 std::vector<uint64_t> MdatPayloadSizes(const MoviePlan& plan);
 void AssignOffsets(MoviePlan& plan, const std::vector<uint64_t>& mdatPayloadOffsets);
 

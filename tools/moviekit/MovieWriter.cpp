@@ -17,31 +17,31 @@ struct TopLevel {
     uint32_t mdat = 0;
 };
 
-std::vector<TopLevel> TopLevelOrder(const MovieSpec& spec, size_t mdatCount)
+std::vector<TopLevel> TopLevelOrder(const MovieSpec& recipe, size_t mdatCount)
 {
     std::vector<TopLevel> order;
-    if (!spec.ftypAfterMoov) {
+    if (!recipe.ftypAfterMoov) {
         order.push_back({Part::Ftyp});
     }
-    if (spec.freeSize != 0) {
+    if (recipe.freeSize != 0) {
         order.push_back({Part::Free});
     }
     auto moov = [&] {
         order.push_back({Part::Moov});
-        if (spec.ftypAfterMoov) {
+        if (recipe.ftypAfterMoov) {
             order.push_back({Part::Ftyp});
         }
     };
-    if (spec.moovBeforeMdat) {
+    if (recipe.moovBeforeMdat) {
         moov();
     }
-    if (spec.wide) {
+    if (recipe.wide) {
         order.push_back({Part::Wide});
     }
     for (uint32_t g = 0; g < mdatCount; ++g) {
         order.push_back({Part::Mdat, g});
     }
-    if (!spec.moovBeforeMdat) {
+    if (!recipe.moovBeforeMdat) {
         moov();
     }
     return order;
@@ -63,7 +63,7 @@ Bytes MdatHeader(uint64_t payloadSize, bool large)
 
 class MovieWriter {
 public:
-    MovieWriter(const MovieSpec& spec, Sink& sink) : m_spec(spec), m_sink(sink) {}
+    MovieWriter(const MovieSpec& recipe, Sink& sink) : m_spec(recipe), m_sink(sink) {}
 
     bool Write(MovieLayout* layout, std::string* error);
 
@@ -215,9 +215,9 @@ bool MovieWriter::Write(MovieLayout* layout, std::string* error)
 
 }  // namespace
 
-bool WriteMovieTo(Sink& sink, const MovieSpec& spec, MovieLayout* layout, std::string* error)
+bool WriteMovieTo(Sink& sink, const MovieSpec& recipe, MovieLayout* layout, std::string* error)
 {
-    MovieWriter writer(spec, sink);
+    MovieWriter writer(recipe, sink);
     return writer.Write(layout, error);
 }
 

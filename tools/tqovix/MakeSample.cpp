@@ -49,15 +49,15 @@ int MakeSampleCommand(const Arguments& arguments)
         return 2;
     }
 
-    moviekit::MovieSpec spec;
-    spec.video.width = 320;
-    spec.video.height = 180;
-    spec.video.frameCount = static_cast<uint32_t>(seconds * 30000 / 1001);
-    spec.sound.codec = littleEndian ? moviekit::SoundCodec::Sowt : moviekit::SoundCodec::Twos;
-    spec.keepSoundBytes = false;
+    moviekit::MovieSpec recipe;
+    recipe.video.width = 320;
+    recipe.video.height = 180;
+    recipe.video.frameCount = static_cast<uint32_t>(seconds * 30000 / 1001);
+    recipe.sound.codec = littleEndian ? moviekit::SoundCodec::Sowt : moviekit::SoundCodec::Twos;
+    recipe.keepSoundBytes = false;
     moviekit::MovieLayout layout;
     std::string error;
-    if (!moviekit::WriteMovie(destination, spec, &layout, &error)) {
+    if (!moviekit::WriteMovie(destination, recipe, &layout, &error)) {
         std::fprintf(stderr, "tqovix: %s: %s\n", destination.c_str(), error.c_str());
         return 1;
     }
