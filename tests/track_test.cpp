@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <functional>
+#include <map>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -8,6 +9,7 @@
 #include "ByteWriter.h"
 #include "Movie.h"
 #include "atom/CTqovixAtomControl.h"
+#include "atom/TqovixEndian.h"
 #include "file/CTqovixFile.h"
 #include "support/TestSupport.h"
 #include "visitor/CTqovixAudioDataVisitor.h"
@@ -45,12 +47,90 @@ Bytes Handler(const char* subtype)
     return Atom("hdlr", payload);
 }
 
-// A movie whose only track holds the given handler subtype and sample tables.
-Bytes TrackMovie(const char* subtype, const std::vector<Bytes>& tables, const std::vector<Bytes>& beforeMedia = {})
+Bytes U64s(std::initializer_list<uint64_t> values)
+{
+    Bytes out;
+    for (uint64_t value : values) {
+        moviekit::PutU64(out, value);
+    }
+    return out;
+}
+
+Bytes Track(const char* subtype, const std::vector<Bytes>& tables, const std::vector<Bytes>& beforeMedia = {})
 {
     std::vector<Bytes> track = beforeMedia;
     track.push_back(Container("mdia", {Handler(subtype), Container("minf", {Container("stbl", tables)})}));
-    return moviekit::Concat({Atom("ftyp", Bytes{'q', 't', ' ', ' '}), Container("moov", {Container("trak", track)})});
+    return Container("trak", track);
+}
+
+Bytes MovieOf(const std::vector<Bytes>& tracks)
+{
+    return moviekit::Concat({Atom("ftyp", Bytes{'q', 't', ' ', ' '}), Container("moov", tracks)});
+}
+
+// A movie whose only track holds the given handler subtype and sample tables.
+Bytes TrackMovie(const char* subtype, const std::vector<Bytes>& tables, const std::vector<Bytes>& beforeMedia = {})
+{
+    return MovieOf({Track(subtype, tables, beforeMedia)});
+}
+
+Bytes PcmDescription(const char* format, uint32_t rate)
+{
+    Bytes payload = U32s({0, 1, 36});
+    moviekit::PutString(payload, format);
+    moviekit::PutBytes(payload, Bytes(8, 0));
+    moviekit::PutBytes(payload, U32s({0, 0, 0x00020010, 0, rate << 16}));
+    return Atom("stsd", payload);
+}
+
+// Payload range of one atom inside a file's bytes.
+struct Span {
+    size_t begin = 0;
+    size_t end = 0;
+};
+
+std::vector<std::pair<std::string, Span>> Children(const Bytes& file, Span parent)
+{
+    std::vector<std::pair<std::string, Span>> out;
+    size_t at = parent.begin;
+    while (at + 8 <= parent.end) {
+        const size_t size = TqovixReadBE32(file.data() + at);
+        if (size < 8 || size > parent.end - at) {
+            break;
+        }
+        out.emplace_back(std::string(file.begin() + at + 4, file.begin() + at + 8), Span{at + 8, at + size});
+        at += size;
+    }
+    return out;
+}
+
+Span Child(const Bytes& file, Span parent, const std::string& type)
+{
+    for (const auto& [childType, span] : Children(file, parent)) {
+        if (childType == type) {
+            return span;
+        }
+    }
+    return {};
+}
+
+// The sample-table atoms, header included, of the track whose handler names `subtype`.
+std::map<std::string, Bytes> TrackTables(const Bytes& file, const std::string& subtype)
+{
+    std::map<std::string, Bytes> tables;
+    for (const auto& [type, trak] : Children(file, Child(file, {0, file.size()}, "moov"))) {
+        const Span mdia = Child(file, trak, "mdia");
+        const Span handler = Child(file, mdia, "hdlr");
+        if (type != "trak" || handler.end - handler.begin < 12 ||
+            std::string(file.begin() + handler.begin + 8, file.begin() + handler.begin + 12) != subtype) {
+            continue;
+        }
+        for (const auto& [tableType, table] : Children(file, Child(file, Child(file, mdia, "minf"), "stbl"))) {
+            tables[tableType] = Bytes(file.begin() + table.begin - 8, file.begin() + table.end);
+        }
+        break;
+    }
+    return tables;
 }
 
 Bytes Table(const char* type, uint32_t declaredCount, const Bytes& entries)
@@ -126,14 +206,14 @@ TEST_F(TrackTest, SoundFormatOfCameraMovies)
         {moviekit::SoundCodec::Aac, 44100, 1, 44, false, 1024},
     };
     for (const Case& c : cases) {
-        moviekit::MovieSpec spec;
-        spec.sound.codec = c.codec;
-        spec.sound.sampleRate = c.rate;
-        spec.sound.channels = c.channels;
-        spec.sound.mediaTime = 2112;
-        spec.soundTrackFirst = c.rate == 44100;
+        moviekit::MovieSpec recipe;
+        recipe.sound.codec = c.codec;
+        recipe.sound.sampleRate = c.rate;
+        recipe.sound.channels = c.channels;
+        recipe.sound.mediaTime = 2112;
+        recipe.soundTrackFirst = c.rate == 44100;
         moviekit::MovieLayout layout;
-        ASSERT_EQ(Load(moviekit::BuildMovie(spec, &layout)), eTqovixSuccess);
+        ASSERT_EQ(Load(moviekit::BuildMovie(recipe, &layout)), eTqovixSuccess);
         CTqovixAudioInformationVisitor visitor;
         ASSERT_EQ(m_tree.Analyze(visitor), eTqovixSuccess);
         EXPECT_EQ(visitor.GetRate(), c.rateKHz);
@@ -168,10 +248,10 @@ class SoundFormatTest : public TrackTest, public ::testing::WithParamInterface<F
 
 TEST_P(SoundFormatTest, AcceptsOrRefusesTheDescription)
 {
-    moviekit::MovieSpec spec;
-    spec.sound.codec = moviekit::SoundCodec::Aac;
-    GetParam().change(spec);
-    ASSERT_EQ(Load(moviekit::BuildMovie(spec)), eTqovixSuccess);
+    moviekit::MovieSpec recipe;
+    recipe.sound.codec = moviekit::SoundCodec::Aac;
+    GetParam().change(recipe);
+    ASSERT_EQ(Load(moviekit::BuildMovie(recipe)), eTqovixSuccess);
     CTqovixAudioInformationVisitor visitor;
     EXPECT_EQ(m_tree.Analyze(visitor), GetParam().expected);
     if (GetParam().expected == eTqovixSuccess) {
@@ -219,18 +299,36 @@ const FormatCase kFormatCases[] = {
 INSTANTIATE_TEST_SUITE_P(Descriptions, SoundFormatTest, ::testing::ValuesIn(kFormatCases),
                          [](const ::testing::TestParamInfo<FormatCase>& info) { return std::string(info.param.name); });
 
-TEST_F(TrackTest, TimeToSampleEntriesAddUpAndOverflowIsRefused)
+TEST_F(TrackTest, SampleTotalAndMediaTimeComeFromWholeEntriesOnly)
 {
-    Bytes pcm = U32s({0, 1, 36});
-    moviekit::PutString(pcm, "twos");
-    moviekit::PutBytes(pcm, Bytes(8, 0));
-    moviekit::PutBytes(pcm, U32s({0, 0, 0x00020010, 0, 0xBB800000}));
-    const Bytes stsd = Atom("stsd", pcm);
-    ASSERT_EQ(Load(TrackMovie("soun", {stsd, Table("stts", 3, U32s({100, 1, 200, 1, 3000, 1}))})), eTqovixSuccess);
+    const Bytes stsd = PcmDescription("twos", 48000);
+    // Many runs, then a count cut off from its duration, which is not a run.
+    Bytes runs;
+    uint32_t total = 0;
+    for (uint32_t i = 1; i <= 5000; ++i) {
+        moviekit::PutBytes(runs, U32s({i, 1}));
+        total += i;
+    }
+    moviekit::PutU32(runs, 777);
+    ASSERT_EQ(Load(TrackMovie("soun", {stsd, Table("stts", 5000, runs)})), eTqovixSuccess);
     CTqovixAudioInformationVisitor visitor;
-    EXPECT_EQ(m_tree.Analyze(visitor), eTqovixSuccess);
-    EXPECT_EQ(visitor.GetCount(), 3300u);
+    EXPECT_EQ(m_tree.Analyze(visitor), eTqovixSuccess) << "without edits the second table finishes the walk";
+    EXPECT_EQ(visitor.GetCount(), total);
     EXPECT_EQ(visitor.GetRate(), 48u);
+    EXPECT_EQ(visitor.GetMediaTime(), 0u);
+
+    const Bytes stts = Table("stts", 1, U32s({10, 1}));
+    const Bytes wholeEdit = Container("edts", {Atom("elst", U32s({0, 1, 900, 2112, 0x10000}))});
+    ASSERT_EQ(Load(TrackMovie("soun", {stsd, stts}, {wholeEdit})), eTqovixSuccess);
+    CTqovixAudioInformationVisitor edited;
+    EXPECT_EQ(m_tree.Analyze(edited), eTqovixSuccess);
+    EXPECT_EQ(edited.GetMediaTime(), 2112u);
+    EXPECT_EQ(edited.GetCount(), 10u);
+
+    const Bytes cutEdit = Container("edts", {Atom("elst", U32s({0, 1, 900, 2112}))});
+    ASSERT_EQ(Load(TrackMovie("soun", {stsd, stts}, {cutEdit})), eTqovixSuccess);
+    CTqovixAudioInformationVisitor cut;
+    EXPECT_EQ(m_tree.Analyze(cut), eTqovixErrorInvalidMovie) << "an edit entry without its rate is not whole";
 
     ASSERT_EQ(Load(TrackMovie("soun", {stsd, Table("stts", 2, U32s({0xFFFFFFF0, 1, 0x20, 1}))})), eTqovixSuccess);
     CTqovixAudioInformationVisitor overflowing;
@@ -278,10 +376,10 @@ TEST_F(TrackTest, ChunkListsOfCameraMoviesMatchTheirLayout)
     aac.sound.codec = moviekit::SoundCodec::Aac;
     aac.sound.chunkSampleCounts = {5, 5, 3, 7};
     aac.video.framesPerChunk = 4;
-    for (const moviekit::MovieSpec& spec : {pcm, wide, aac}) {
+    for (const moviekit::MovieSpec& recipe : {pcm, wide, aac}) {
         moviekit::MovieLayout layout;
-        ASSERT_EQ(Load(moviekit::BuildMovie(spec, &layout)), eTqovixSuccess);
-        const bool isAac = spec.sound.codec == moviekit::SoundCodec::Aac;
+        ASSERT_EQ(Load(moviekit::BuildMovie(recipe, &layout)), eTqovixSuccess);
+        const bool isAac = recipe.sound.codec == moviekit::SoundCodec::Aac;
 
         CTqovixAudioDataVisitor sound;
         ASSERT_EQ(m_tree.Analyze(sound), eTqovixSuccess);
@@ -293,7 +391,7 @@ TEST_F(TrackTest, ChunkListsOfCameraMoviesMatchTheirLayout)
         ASSERT_EQ(m_tree.Analyze(video), eTqovixSuccess);
         std::vector<TqovixChunkInformation> videoChunks;
         ASSERT_EQ(video.GetOffset(videoChunks), eTqovixSuccess);
-        EXPECT_EQ(videoChunks, ExpectedChunks(layout.videoChunks, spec.video.perSampleSizes));
+        EXPECT_EQ(videoChunks, ExpectedChunks(layout.videoChunks, recipe.video.perSampleSizes));
 
         // The last chunk ends exactly where the file would have to, or one byte beyond.
         uint64_t end = 0;
@@ -319,6 +417,7 @@ struct TableCase {
     std::vector<Bytes> tables;
     eTqovixErrorCode expected;
     std::vector<uint32_t> sampleCounts;  // per chunk, when accepted
+    unsigned int bytesPerFrame = 4;
 };
 
 void PrintTo(const TableCase& c, std::ostream* os) { *os << c.name; }
@@ -331,13 +430,14 @@ TEST_P(SampleTableTest, BuildsChunksOrRefusesContradictions)
     CTqovixAudioDataVisitor visitor;
     const eTqovixErrorCode walk = m_tree.Analyze(visitor);
     std::vector<TqovixChunkInformation> chunks;
-    const eTqovixErrorCode built = walk == eTqovixSuccess ? visitor.GetAudioChunkInformation(chunks, 4) : walk;
+    const unsigned int frame = GetParam().bytesPerFrame;
+    const eTqovixErrorCode built = walk == eTqovixSuccess ? visitor.GetAudioChunkInformation(chunks, frame) : walk;
     EXPECT_EQ(built, GetParam().expected);
     if (GetParam().expected == eTqovixSuccess) {
         std::vector<uint32_t> counts;
         for (const auto& chunk : chunks) {
             counts.push_back(chunk.sampleCount);
-            EXPECT_EQ(chunk.size, chunk.sampleCount * 4);
+            EXPECT_EQ(chunk.size, chunk.sampleCount * frame);
         }
         EXPECT_EQ(counts, GetParam().sampleCounts);
     }
@@ -366,92 +466,248 @@ const TableCase kTableCases[] = {
     {"ChunkBeyondFourGiB", {Table("stsc", 1, U32s({1, 0x40000000, 1})), Sizes(1, {}), Table("stco", 1, U32s({8}))},
      eTqovixErrorInvalidMovie, {}},
     {"MissingTable", {Table("stsc", 1, U32s({1, 3, 1})), kSixOffsets}, eTqovixErrorInvalidMovie, {}},
+    {"SizeCountFieldIgnored",
+     {Table("stsc", 1, U32s({1, 2, 1})), Table("stsz", 0, U32s({0xFFFFFFFF, 4, 4})), Table("co64", 9, U64s({8}))},
+     eTqovixSuccess, {2}},
+    {"FirstChunkNotOne", {Table("stsc", 1, U32s({2, 3, 1})), Sizes(1, {}), kSixOffsets}, eTqovixErrorInvalidMovie, {}},
+    {"RunRepeatsItsFirstChunk", {Table("stsc", 2, U32s({1, 3, 1, 1, 2, 1})), Sizes(1, {}), kSixOffsets},
+     eTqovixErrorInvalidMovie, {}},
+    {"SizesPastFourGiB", {Table("stsc", 1, U32s({1, 2, 1})), Sizes(0, {0xFFFFFFFF, 1}), Table("stco", 1, U32s({8}))},
+     eTqovixErrorInvalidMovie, {}},
+    // 2^31 samples of 2^31 bytes, 8 each: a product past 64 bits must not wrap to a small chunk.
+    {"ProductPastSixtyFourBits", {Table("stsc", 1, U32s({1, 0x80000000, 1})), Sizes(8, {}), Table("stco", 1, U32s({8}))},
+     eTqovixErrorInvalidMovie, {}, 0x80000000},
 };
 
 INSTANTIATE_TEST_SUITE_P(Tables, SampleTableTest, ::testing::ValuesIn(kTableCases),
                          [](const ::testing::TestParamInfo<TableCase>& info) { return std::string(info.param.name); });
 
-TEST_F(TrackTest, UpdatedTablesWriteBackAndReadAsSet)
+// Chunks of stsc {1, 3}, {5, 2} over six offsets; with `sizes`, each takes the next sizes in order.
+std::vector<TqovixChunkInformation> TwoRunChunks(const std::vector<uint64_t>& offsets, const std::vector<uint32_t>& sizes,
+                                                 uint32_t bytesPerSample)
 {
-    moviekit::MovieSpec spec;
-    spec.sound.codec = moviekit::SoundCodec::Aac;
-    spec.co64 = true;
-    spec.video.perSampleSizes = true;
-    moviekit::MovieLayout layout;
-    ASSERT_EQ(Load(moviekit::BuildMovie(spec, &layout)), eTqovixSuccess);
-    TqovixAtomList atoms;
-    m_tree.GetAtoms(atoms);
-    const Bytes before = WriteTree();
-
-    std::vector<TqovixChunkInformation> sound = ExpectedChunks(layout.soundChunks, true);
-    for (auto& chunk : sound) {
-        chunk.offset += 5ULL << 32;  // beyond what 32 bits can say
-        for (auto& size : chunk.sampleSizes) {
-            size += 3;
+    std::vector<TqovixChunkInformation> chunks;
+    size_t sample = 0;
+    for (uint32_t k = 1; k <= 6; ++k) {
+        TqovixChunkInformation chunk;
+        chunk.offset = offsets[k - 1];
+        chunk.chunkNumber = k;
+        chunk.sampleCount = k <= 4 ? 3 : 2;
+        chunk.size = chunk.sampleCount * bytesPerSample;
+        if (!sizes.empty()) {
+            chunk.sampleSizes.assign(sizes.begin() + static_cast<long>(sample),
+                                     sizes.begin() + static_cast<long>(sample + chunk.sampleCount));
+            chunk.size = 0;
+            for (uint32_t size : chunk.sampleSizes) {
+                chunk.size += size;
+            }
         }
+        sample += chunk.sampleCount;
+        chunks.push_back(chunk);
     }
-    CTqovixAudioDataVisitor soundWriter;
-    soundWriter.SetAudioChunkInformation(sound);
-    ASSERT_EQ(m_tree.Update(soundWriter), eTqovixSuccess);
-    std::vector<TqovixChunkInformation> video = ExpectedChunks(layout.videoChunks, false);
-    for (auto& chunk : video) {
-        chunk.offset = chunk.offset * 3 + 1;
-    }
-    CTqovixMovieDataVisitor videoWriter;
-    videoWriter.SetOffset(video);
-    ASSERT_EQ(m_tree.Update(videoWriter), eTqovixSuccess);
+    return chunks;
+}
 
-    const Bytes after = WriteTree();
-    ASSERT_EQ(after.size(), before.size()) << "tables keep their kind and length";
-    ASSERT_EQ(Load(after), eTqovixSuccess);
-    CTqovixAudioDataVisitor soundReader;
-    ASSERT_EQ(m_tree.Analyze(soundReader), eTqovixSuccess);
-    std::vector<TqovixChunkInformation> soundRead;
-    soundReader.GetAudioChunkInformation(soundRead, 4);
-    for (size_t i = 0; i < sound.size(); ++i) {
-        sound[i].size = 0;
-        for (uint32_t size : sound[i].sampleSizes) {
-            sound[i].size += size;
-        }
+TEST_F(TrackTest, EachTrackReadsOnlyItsOwnRunsSizesAndOffsets)
+{
+    const Bytes runs = Table("stsc", 2, U32s({1, 3, 1, 5, 2, 1}));
+    std::vector<uint32_t> sizes;
+    for (uint32_t i = 0; i < 16; ++i) {
+        sizes.push_back(100 + i);
     }
-    EXPECT_EQ(soundRead, sound);
-    CTqovixMovieDataVisitor videoReader;
-    ASSERT_EQ(m_tree.Analyze(videoReader), eTqovixSuccess);
-    std::vector<TqovixChunkInformation> videoRead;
-    videoReader.GetOffset(videoRead);
-    ASSERT_EQ(videoRead.size(), video.size());
-    for (size_t i = 0; i < video.size(); ++i) {
-        EXPECT_EQ(videoRead[i].offset, video[i].offset);
-        EXPECT_EQ(videoRead[i].sampleSizes, layout.videoChunks[i].sampleSizes) << "video sizes stay as they were";
+    const Bytes perSample = Sizes(0, sizes);
+    const Bytes common = Sizes(7, {});
+    const std::vector<uint64_t> soundOffsets = {1ULL << 33, (1ULL << 33) + 9, 5ULL << 32, 7, 8, 0xFFFFFFFFFFFFULL};
+    const Bytes soundTable = Table("co64", 6, U64s({1ULL << 33, (1ULL << 33) + 9, 5ULL << 32, 7, 8, 0xFFFFFFFFFFFFULL}));
+    const std::vector<uint64_t> videoOffsets = {10, 20, 30, 40, 50, 0xFFFFFFF0};
+    const Bytes videoTable = Table("stco", 6, U32s({10, 20, 30, 40, 50, 0xFFFFFFF0}));
+
+    struct Layout {
+        const char* name;
+        Bytes movie;
+        bool soundPerSample;
+    };
+    const Layout layouts[] = {
+        {"sound first, sound sizes listed",
+         MovieOf({Track("soun", {runs, perSample, soundTable}), Track("vide", {runs, common, videoTable})}), true},
+        {"video first, video sizes listed",
+         MovieOf({Track("vide", {runs, perSample, videoTable}), Track("soun", {runs, common, soundTable})}), false},
+    };
+    for (const Layout& layout : layouts) {
+        SCOPED_TRACE(layout.name);
+        ASSERT_EQ(Load(layout.movie), eTqovixSuccess);
+        CTqovixAudioDataVisitor sound;
+        ASSERT_EQ(m_tree.Analyze(sound), eTqovixSuccess);
+        std::vector<TqovixChunkInformation> soundChunks;
+        EXPECT_EQ(sound.GetAudioChunkInformation(soundChunks, 4), eTqovixSuccess);
+        // A common size counts frames for sound (7 × 4 bytes) but bytes for video.
+        EXPECT_EQ(soundChunks, TwoRunChunks(soundOffsets, layout.soundPerSample ? sizes : std::vector<uint32_t>{}, 28));
+        if (layout.soundPerSample && soundChunks.size() == 6) {
+            EXPECT_EQ(soundChunks[1].sampleSizes, (std::vector<uint32_t>{103, 104, 105}));
+            EXPECT_EQ(soundChunks[5].sampleSizes, (std::vector<uint32_t>{114, 115}));
+        }
+
+        CTqovixMovieDataVisitor video;
+        ASSERT_EQ(m_tree.Analyze(video), eTqovixSuccess);
+        std::vector<TqovixChunkInformation> videoChunks;
+        EXPECT_EQ(video.GetOffset(videoChunks), eTqovixSuccess);
+        EXPECT_EQ(videoChunks, TwoRunChunks(videoOffsets, layout.soundPerSample ? std::vector<uint32_t>{} : sizes, 7));
     }
 }
 
-TEST_F(TrackTest, UpdatesThatCannotBeWrittenLeaveTheTablesAlone)
+TEST_F(TrackTest, UpdateWalksRewriteOnlyTheirTablesAndReadBackAsSet)
 {
-    moviekit::MovieSpec spec;  // PCM with "stco" tables
+    struct Case {
+        const char* name;
+        moviekit::SoundCodec codec;
+        bool co64;
+        uint64_t shift;
+    };
+    const Case cases[] = {{"aac with co64", moviekit::SoundCodec::Aac, true, 5ULL << 32},
+                          {"pcm with stco", moviekit::SoundCodec::Twos, false, 1000}};
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        moviekit::MovieSpec spec;
+        spec.sound.codec = c.codec;
+        spec.co64 = c.co64;
+        spec.video.perSampleSizes = true;
+        moviekit::MovieLayout layout;
+        ASSERT_EQ(Load(moviekit::BuildMovie(spec, &layout)), eTqovixSuccess);
+        const bool aac = c.codec == moviekit::SoundCodec::Aac;
+        const std::string offsets = c.co64 ? "co64" : "stco";
+        const Bytes before = WriteTree();
+
+        std::vector<TqovixChunkInformation> sound = ExpectedChunks(layout.soundChunks, aac);
+        for (auto& chunk : sound) {
+            chunk.offset += c.shift;
+            for (auto& size : chunk.sampleSizes) {
+                size += 3;
+                chunk.size += 3;
+            }
+        }
+        CTqovixAudioDataVisitor soundWriter;
+        soundWriter.SetAudioChunkInformation(sound);
+        ASSERT_EQ(m_tree.Update(soundWriter), eTqovixSuccess);
+        const Bytes afterSound = WriteTree();
+        auto soundBefore = TrackTables(before, "soun");
+        auto soundAfter = TrackTables(afterSound, "soun");
+        EXPECT_EQ(TrackTables(afterSound, "vide"), TrackTables(before, "vide")) << "the video track is not touched";
+        EXPECT_EQ(soundAfter["stsc"], soundBefore["stsc"]);
+        EXPECT_NE(soundAfter[offsets], soundBefore[offsets]);
+        if (aac) {
+            ASSERT_EQ(soundAfter["stsz"].size(), soundBefore["stsz"].size());
+            EXPECT_TRUE(std::equal(soundBefore["stsz"].begin(), soundBefore["stsz"].begin() + 20, soundAfter["stsz"].begin()))
+                << "header, common size and count stay";
+        } else {
+            EXPECT_EQ(soundAfter["stsz"], soundBefore["stsz"]) << "a common sample size is left as it is";
+        }
+
+        std::vector<TqovixChunkInformation> video = ExpectedChunks(layout.videoChunks, false);
+        for (auto& chunk : video) {
+            chunk.offset = chunk.offset * 3 + 1;
+        }
+        CTqovixMovieDataVisitor videoWriter;
+        videoWriter.SetOffset(video);
+        ASSERT_EQ(m_tree.Update(videoWriter), eTqovixSuccess);
+        const Bytes after = WriteTree();
+        auto videoBefore = TrackTables(before, "vide");
+        auto videoAfter = TrackTables(after, "vide");
+        EXPECT_EQ(TrackTables(after, "soun"), soundAfter) << "the sound track is not touched";
+        EXPECT_EQ(videoAfter["stsc"], videoBefore["stsc"]);
+        EXPECT_EQ(videoAfter["stsz"], videoBefore["stsz"]);
+        EXPECT_NE(videoAfter[offsets], videoBefore[offsets]);
+        ASSERT_EQ(after.size(), before.size()) << "tables keep their kind and length";
+
+        ASSERT_EQ(Load(after), eTqovixSuccess);
+        CTqovixAudioDataVisitor soundReader;
+        ASSERT_EQ(m_tree.Analyze(soundReader), eTqovixSuccess);
+        std::vector<TqovixChunkInformation> soundRead;
+        EXPECT_EQ(soundReader.GetAudioChunkInformation(soundRead, 4), eTqovixSuccess);
+        EXPECT_EQ(soundRead, sound);
+        CTqovixMovieDataVisitor videoReader;
+        ASSERT_EQ(m_tree.Analyze(videoReader), eTqovixSuccess);
+        std::vector<TqovixChunkInformation> videoRead;
+        EXPECT_EQ(videoReader.GetOffset(videoRead), eTqovixSuccess);
+        ASSERT_EQ(videoRead.size(), video.size());
+        for (size_t i = 0; i < video.size(); ++i) {
+            EXPECT_EQ(videoRead[i].offset, video[i].offset);
+            EXPECT_EQ(videoRead[i].sampleSizes, layout.videoChunks[i].sampleSizes);
+        }
+    }
+}
+
+eTqovixErrorCode UpdateSound(const CTqovixAtomControl& tree, const std::vector<TqovixChunkInformation>& chunks)
+{
+    CTqovixAudioDataVisitor visitor;
+    visitor.SetAudioChunkInformation(chunks);
+    return tree.Update(visitor);
+}
+
+eTqovixErrorCode UpdateVideo(const CTqovixAtomControl& tree, const std::vector<TqovixChunkInformation>& chunks)
+{
+    CTqovixMovieDataVisitor visitor;
+    visitor.SetOffset(chunks);
+    return tree.Update(visitor);
+}
+
+TEST_F(TrackTest, UpdatesThatCannotBeWrittenReplaceNoPayload)
+{
+    using Chunks = std::vector<TqovixChunkInformation>;
+    struct Refused {
+        const char* name;
+        moviekit::SoundCodec codec;
+        bool video;
+        std::function<void(Chunks&)> change;
+    };
+    const Refused cases[] = {
+        {"sound offset past an stco", moviekit::SoundCodec::Twos, false, [](Chunks& c) { c.back().offset = 1ULL << 32; }},
+        {"fewer sound records", moviekit::SoundCodec::Twos, false, [](Chunks& c) { c.pop_back(); }},
+        {"more sound records", moviekit::SoundCodec::Twos, false, [](Chunks& c) { c.push_back(c.back()); }},
+        {"no sound records", moviekit::SoundCodec::Twos, false, [](Chunks& c) { c.clear(); }},
+        {"fewer sample sizes", moviekit::SoundCodec::Aac, false, [](Chunks& c) { c.back().sampleSizes.pop_back(); }},
+        {"more sample sizes", moviekit::SoundCodec::Aac, false, [](Chunks& c) { c.front().sampleSizes.push_back(9); }},
+        {"video offset past an stco", moviekit::SoundCodec::Twos, true, [](Chunks& c) { c.back().offset = 1ULL << 32; }},
+        {"fewer video records", moviekit::SoundCodec::Twos, true, [](Chunks& c) { c.pop_back(); }},
+        {"no video records", moviekit::SoundCodec::Twos, true, [](Chunks& c) { c.clear(); }},
+    };
+    for (const Refused& c : cases) {
+        SCOPED_TRACE(c.name);
+        moviekit::MovieSpec spec;
+        spec.sound.codec = c.codec;
+        moviekit::MovieLayout layout;
+        const Bytes movie = moviekit::BuildMovie(spec, &layout);
+        ASSERT_EQ(Load(movie), eTqovixSuccess);
+        Chunks chunks = c.video ? ExpectedChunks(layout.videoChunks, false)
+                                : ExpectedChunks(layout.soundChunks, c.codec == moviekit::SoundCodec::Aac);
+        c.change(chunks);
+        EXPECT_EQ(c.video ? UpdateVideo(m_tree, chunks) : UpdateSound(m_tree, chunks), eTqovixErrorInternal);
+        EXPECT_EQ(WriteTree(), movie);
+    }
+
+    // More video records than entries are ignored.
     moviekit::MovieLayout layout;
-    const Bytes movie = moviekit::BuildMovie(spec, &layout);
-    ASSERT_EQ(Load(movie), eTqovixSuccess);
+    ASSERT_EQ(Load(moviekit::BuildMovie(moviekit::MovieSpec{}, &layout)), eTqovixSuccess);
+    Chunks extra = ExpectedChunks(layout.videoChunks, false);
+    extra.push_back(extra.back());
+    EXPECT_EQ(UpdateVideo(m_tree, extra), eTqovixSuccess);
 
-    std::vector<TqovixChunkInformation> far = ExpectedChunks(layout.soundChunks, false);
-    far.back().offset = 1ULL << 32;
-    CTqovixAudioDataVisitor tooFar;
-    tooFar.SetAudioChunkInformation(far);
-    EXPECT_EQ(m_tree.Update(tooFar), eTqovixErrorInternal) << "an stco cannot say 4 GiB";
+    // An empty offset table cannot be rewritten, and no list at all must not
+    // write the visitor's blank record over a one-chunk table.
+    const Chunks one(1);
+    for (const char* subtype : {"soun", "vide"}) {
+        SCOPED_TRACE(subtype);
+        const bool sound = subtype[0] == 's';
+        const Bytes empty = TrackMovie(subtype, {Table("stsc", 1, U32s({1, 1, 1})), Sizes(1, {}), Atom("stco", {})});
+        ASSERT_EQ(Load(empty), eTqovixSuccess);
+        EXPECT_EQ(sound ? UpdateSound(m_tree, one) : UpdateVideo(m_tree, one), eTqovixErrorOutOfMemory);
+        EXPECT_EQ(WriteTree(), empty);
 
-    std::vector<TqovixChunkInformation> fewer = ExpectedChunks(layout.soundChunks, false);
-    fewer.pop_back();
-    CTqovixAudioDataVisitor missing;
-    missing.SetAudioChunkInformation(fewer);
-    EXPECT_EQ(m_tree.Update(missing), eTqovixErrorInternal);
-
-    CTqovixMovieDataVisitor shortVideo;
-    std::vector<TqovixChunkInformation> oneVideo(1);
-    oneVideo[0].offset = 77;
-    shortVideo.SetOffset(oneVideo);
-    EXPECT_EQ(m_tree.Update(shortVideo), eTqovixErrorInternal);
-
-    EXPECT_EQ(WriteTree(), movie) << "failed updates replace no payload";
+        const Bytes oneChunk =
+            TrackMovie(subtype, {Table("stsc", 1, U32s({1, 1, 1})), Sizes(1, {}), Table("stco", 1, U32s({4096}))});
+        ASSERT_EQ(Load(oneChunk), eTqovixSuccess);
+        EXPECT_EQ(sound ? UpdateSound(m_tree, {}) : UpdateVideo(m_tree, {}), eTqovixErrorInternal);
+        EXPECT_EQ(WriteTree(), oneChunk);
+    }
 }
 
 TEST_F(TrackTest, RewrittenOffsetsAreWhereAnIndependentReaderFindsThePackets)
@@ -460,11 +716,11 @@ TEST_F(TrackTest, RewrittenOffsetsAreWhereAnIndependentReaderFindsThePackets)
         FAIL() << "ffprobe is needed as the independent reader";
     }
     for (const moviekit::SoundCodec codec : {moviekit::SoundCodec::Twos, moviekit::SoundCodec::Aac}) {
-        moviekit::MovieSpec spec;
-        spec.sound.codec = codec;
-        spec.wide = false;
+        moviekit::MovieSpec recipe;
+        recipe.sound.codec = codec;
+        recipe.wide = false;
         moviekit::MovieLayout layout;
-        ASSERT_EQ(Load(moviekit::BuildMovie(spec, &layout)), eTqovixSuccess);
+        ASSERT_EQ(Load(moviekit::BuildMovie(recipe, &layout)), eTqovixSuccess);
 
         // Move the media data 1000 bytes down by putting a "free" atom in front of it.
         const Bytes padding = Atom("free", Bytes(992, 0));

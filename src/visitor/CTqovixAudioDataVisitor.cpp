@@ -13,17 +13,7 @@ eTqovixErrorCode CTqovixAudioDataVisitor::IsSoundMediaTrack(const CTqovixLeafAto
 
 void CTqovixAudioDataVisitor::SetAudioChunkInformation(const std::vector<TqovixChunkInformation>& chunks)
 {
-    if (chunks.empty()) {
-        return;
-    }
-    m_chunkTable.resize(chunks.size());
-    for (size_t j = 0; j < chunks.size(); ++j) {
-        m_chunkTable[j].offset = chunks[j].offset;
-        m_chunkTable[j].size = chunks[j].size;
-        if (m_constantSampleSize == 0) {
-            m_chunkTable[j].sampleSizes = chunks[j].sampleSizes;
-        }
-    }
+    LoadRecords(chunks, true);
 }
 
 eTqovixErrorCode CTqovixAudioDataVisitor::Update(const TqovixAtomPath& path, CTqovixLeafAtom& atom) const
@@ -34,47 +24,47 @@ eTqovixErrorCode CTqovixAudioDataVisitor::Update(const TqovixAtomPath& path, CTq
         return begun;
     }
     const eTqovixAtomType type = atom.GetType();
-    const uint64_t size = payload.size();
     if (type == kStsc) {
         return eTqovixVisitContinue;
     }
     if (type == kCo64 || type == kStco) {
         // The destination keeps the source's chunk structure: one record per entry.
-        const uint64_t width = type == kCo64 ? 8 : 4;
-        if (size < 8 || (size - 8) / width != m_chunkTable.size()) {
-            return eTqovixErrorInternal;
-        }
-        const eTqovixErrorCode written = WriteOffsets(payload, type == kCo64, m_chunkTable.size());
+        const eTqovixErrorCode written = RewriteOffsets(payload, type, true);
         if (written != eTqovixSuccess) {
             return written;
         }
     } else if (type == kStsz) {
-        if (size < 8) {
+        if (payload.size() < 8) {
             return eTqovixErrorInternal;
         }
         if (TqovixReadBE32(payload.data() + 4) == 0) {
-            uint64_t total = 0;
-            for (const TqovixChunkInformation& chunk : m_chunkTable) {
-                total += chunk.sampleSizes.size();
-            }
-            if (size < 12 || (size - 12) / 4 != total) {
-                return eTqovixErrorInternal;
-            }
-            uint8_t* entry = payload.data() + 12;
-            for (const TqovixChunkInformation& chunk : m_chunkTable) {
-                for (uint32_t sampleSize : chunk.sampleSizes) {
-                    TqovixWriteBE32(entry, sampleSize);
-                    entry += 4;
-                }
+            const eTqovixErrorCode written = RewriteSampleSizes(payload);
+            if (written != eTqovixSuccess) {
+                return written;
             }
         }
     } else {
         return eTqovixErrorInternal;
     }
-    atom.SetData(payload.data(), payload.size());
-    if (++m_analyzedTableCount < 2) {
-        return eTqovixVisitContinue;
+    return FinishUpdate(atom, payload, 2, eTqovixVisitContinue);
+}
+
+eTqovixErrorCode CTqovixAudioDataVisitor::RewriteSampleSizes(std::vector<uint8_t>& payload) const
+{
+    uint64_t total = 0;
+    for (uint64_t j = 0; j < m_recordCount; ++j) {
+        total += m_chunkTable[j].sampleSizes.size();
     }
-    m_analyzedTableCount = 0;
+    // Every entry is replaced, and by exactly as many sizes as the table holds.
+    if (payload.size() < 12 || (payload.size() - 12) / 4 != total) {
+        return eTqovixErrorInternal;
+    }
+    uint8_t* entry = payload.data() + 12;
+    for (uint64_t j = 0; j < m_recordCount; ++j) {
+        for (uint32_t sampleSize : m_chunkTable[j].sampleSizes) {
+            TqovixWriteBE32(entry, sampleSize);
+            entry += 4;
+        }
+    }
     return eTqovixSuccess;
 }

@@ -18,4 +18,7 @@ public:
         return BuildChunkList(out, bytesPerFrame);
     }
     void SetAudioChunkInformation(const std::vector<TqovixChunkInformation>& chunks);
+
+private:
+    eTqovixErrorCode RewriteSampleSizes(std::vector<uint8_t>& payload) const;
 };

@@ -119,8 +119,8 @@ eTqovixErrorCode CTqovixAudioInformationVisitor::Analyze(const TqovixAtomPath& p
         return AnalyzeTimeToSample(payload, size);
     }
     if (type == kElst) {
-        if (size < 16) {
-            return eTqovixErrorInvalidMovie;  // no first entry to take the media time from
+        if (size < 20) {
+            return eTqovixErrorInvalidMovie;  // no whole first entry to take the media time from
         }
         m_mediaTime = TqovixReadBE32(payload + 12);
         m_bNeedMediaTime = false;
@@ -164,8 +164,9 @@ eTqovixErrorCode CTqovixAudioInformationVisitor::AnalyzeSampleDescription(const 
 
 eTqovixErrorCode CTqovixAudioInformationVisitor::AnalyzeTimeToSample(const uint8_t* payload, uint64_t size) const
 {
+    // Whole entries only: a count cut off from its duration is not a sample run.
     uint64_t total = m_sampleTotal;
-    for (uint64_t offset = 8; offset + 4 <= size; offset += 8) {
+    for (uint64_t offset = 8; offset + 8 <= size; offset += 8) {
         total += TqovixReadBE32(payload + offset);
     }
     if (total > UINT32_MAX) {

@@ -12,13 +12,7 @@ eTqovixErrorCode CTqovixMovieDataVisitor::IsVideoMediaTrack(const CTqovixLeafAto
 
 void CTqovixMovieDataVisitor::SetOffset(const std::vector<TqovixChunkInformation>& chunks)
 {
-    if (chunks.empty()) {
-        return;
-    }
-    m_chunkTable.resize(chunks.size());
-    for (size_t j = 0; j < chunks.size(); ++j) {
-        m_chunkTable[j].offset = chunks[j].offset;
-    }
+    LoadRecords(chunks, false);
 }
 
 eTqovixErrorCode CTqovixMovieDataVisitor::Update(const TqovixAtomPath& path, CTqovixLeafAtom& atom) const
@@ -30,21 +24,11 @@ eTqovixErrorCode CTqovixMovieDataVisitor::Update(const TqovixAtomPath& path, CTq
     }
     const eTqovixAtomType type = atom.GetType();
     if (type == kCo64 || type == kStco) {
-        const uint64_t width = type == kCo64 ? 8 : 4;
-        const uint64_t entries = payload.size() >= 8 ? (payload.size() - 8) / width : 0;
         // Extra records are ignored; entries without a record leave the table as it was.
-        if (entries > m_chunkTable.size()) {
-            return eTqovixErrorInternal;
-        }
-        const eTqovixErrorCode written = WriteOffsets(payload, type == kCo64, entries);
+        const eTqovixErrorCode written = RewriteOffsets(payload, type, false);
         if (written != eTqovixSuccess) {
             return written;
         }
     }
-    atom.SetData(payload.data(), payload.size());
-    if (++m_analyzedTableCount < 3) {
-        return eTqovixVisitSkip;
-    }
-    m_analyzedTableCount = 0;
-    return eTqovixSuccess;
+    return FinishUpdate(atom, payload, 3, eTqovixVisitSkip);
 }

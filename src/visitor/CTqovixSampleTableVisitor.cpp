@@ -1,5 +1,7 @@
 #include "visitor/CTqovixSampleTableVisitor.h"
 
+#include <algorithm>
+
 #include "atom/CTqovixLeafAtom.h"
 #include "atom/TqovixEndian.h"
 #include "visitor/TqovixTrackPath.h"
@@ -8,13 +10,13 @@ using namespace TqovixTrackPath;
 
 namespace {
 
+// Entry j lands at position j; tables only grow while reading.
 template <typename T>
-T& At(std::vector<T>& table, uint64_t index)
+void Reserve(std::vector<T>& table, uint64_t entries)
 {
-    if (table.size() <= index) {
-        table.resize(index + 1);
+    if (table.size() < entries) {
+        table.resize(entries);
     }
-    return table[index];
 }
 
 }  // namespace
@@ -31,14 +33,11 @@ bool CTqovixSampleTableVisitor::IsNecessary(const TqovixAtomPath& path) const
     return IsWanted(path, isHandler ? handler : SampleTablePath(), {kStsc, kStsz, kStco, kCo64, kHdlr});
 }
 
-eTqovixErrorCode CTqovixSampleTableVisitor::Analyze(const TqovixAtomPath& path, const CTqovixContainerAtom&) const
+eTqovixErrorCode CTqovixSampleTableVisitor::AnswerHandler(const CTqovixLeafAtom& handler) const
 {
-    return IsNecessary(path) ? eTqovixVisitContinue : eTqovixVisitSkip;
-}
-
-eTqovixErrorCode CTqovixSampleTableVisitor::Update(const TqovixAtomPath& path, CTqovixContainerAtom&) const
-{
-    return IsNecessary(path) ? eTqovixVisitContinue : eTqovixVisitSkip;
+    const eTqovixErrorCode answer = HandlerAnswer(handler, m_handlerSubtype);
+    m_bTrack = answer == eTqovixVisitContinue;
+    return answer;
 }
 
 eTqovixErrorCode CTqovixSampleTableVisitor::Analyze(const TqovixAtomPath& path, const CTqovixLeafAtom& atom) const
@@ -50,9 +49,7 @@ eTqovixErrorCode CTqovixSampleTableVisitor::Analyze(const TqovixAtomPath& path, 
         return eTqovixErrorInternal;
     }
     if (atom.GetType() == kHdlr) {
-        const eTqovixErrorCode answer = HandlerAnswer(atom, m_handlerSubtype);
-        m_bTrack = answer == eTqovixVisitContinue;
-        return answer;
+        return AnswerHandler(atom);
     }
     const uint64_t size = atom.GetDataSize();
     const uint8_t* payload = size == 0 ? nullptr : atom.GetData();
@@ -80,19 +77,21 @@ eTqovixErrorCode CTqovixSampleTableVisitor::ReadTable(eTqovixAtomType type, cons
         if (entries > kMaxTableEntries) {
             return eTqovixErrorInvalidMovie;
         }
+        Reserve(m_chunkTable, entries);
         for (uint64_t j = 0; j < entries; ++j) {
             const uint8_t* entry = payload + 8 + width * j;
-            At(m_chunkTable, j).offset = width == 8 ? TqovixReadBE64(entry) : TqovixReadBE32(entry);
+            m_chunkTable[j].offset = width == 8 ? TqovixReadBE64(entry) : TqovixReadBE32(entry);
         }
-        m_offsetEntries = entries;
+        m_recordCount = entries;
     } else if (type == kStsc) {
         const uint64_t entries = entriesBytes / 12;
         if (entries > kMaxTableEntries) {
             return eTqovixErrorInvalidMovie;
         }
+        Reserve(m_sampleToChunkTable, entries);
         for (uint64_t j = 0; j < entries; ++j) {
             const uint8_t* entry = payload + 8 + 12 * j;
-            At(m_sampleToChunkTable, j) = {TqovixReadBE32(entry), TqovixReadBE32(entry + 4)};
+            m_sampleToChunkTable[j] = {TqovixReadBE32(entry), TqovixReadBE32(entry + 4)};
         }
         m_runEntries = entries;
     } else if (type == kStsz) {
@@ -108,8 +107,9 @@ eTqovixErrorCode CTqovixSampleTableVisitor::ReadTable(eTqovixAtomType type, cons
         if (entries > kMaxTableEntries) {
             return eTqovixErrorInvalidMovie;
         }
+        Reserve(m_sampleSizeTable, entries);
         for (uint64_t j = 0; j < entries; ++j) {
-            At(m_sampleSizeTable, j) = TqovixReadBE32(payload + 12 + 4 * j);
+            m_sampleSizeTable[j] = TqovixReadBE32(payload + 12 + 4 * j);
         }
         m_sizeEntries = entries;
     } else {
@@ -121,7 +121,7 @@ eTqovixErrorCode CTqovixSampleTableVisitor::ReadTable(eTqovixAtomType type, cons
 eTqovixErrorCode CTqovixSampleTableVisitor::BuildChunkList(std::vector<TqovixChunkInformation>& out,
                                                           uint32_t bytesPerSample) const
 {
-    const uint64_t chunkCount = m_offsetEntries;
+    const uint64_t chunkCount = m_recordCount;
     uint64_t position = 0;
     uint64_t sample = 0;
     bool consistent = chunkCount > 0 && m_runEntries > 0;
@@ -142,14 +142,18 @@ eTqovixErrorCode CTqovixSampleTableVisitor::BuildChunkList(std::vector<TqovixChu
                     consistent = false;  // the size table runs out
                     break;
                 }
-                record.sampleSizes.assign(m_sampleSizeTable.begin() + static_cast<std::ptrdiff_t>(sample),
-                                          m_sampleSizeTable.begin() + static_cast<std::ptrdiff_t>(sample + samplesPerChunk));
+                const auto begin = m_sampleSizeTable.begin() + static_cast<std::ptrdiff_t>(sample);
+                record.sampleSizes.assign(begin, begin + samplesPerChunk);
                 for (uint32_t size : record.sampleSizes) {
                     bytes += size;
                 }
                 sample += samplesPerChunk;
             } else {
-                bytes = static_cast<uint64_t>(samplesPerChunk) * bytesPerSample * m_constantSampleSize;
+                // Two steps, each product of 32-bit factors, so nothing wraps in 64 bits.
+                bytes = uint64_t{samplesPerChunk} * bytesPerSample;
+                if (bytes <= UINT32_MAX) {
+                    bytes *= m_constantSampleSize;
+                }
             }
             if (bytes > UINT32_MAX) {
                 consistent = false;
@@ -164,8 +168,26 @@ eTqovixErrorCode CTqovixSampleTableVisitor::BuildChunkList(std::vector<TqovixChu
     if (position != chunkCount || (m_constantSampleSize == 0 && sample != m_sizeEntries)) {
         consistent = false;
     }
-    out.assign(m_chunkTable.begin(), m_chunkTable.begin() + static_cast<std::ptrdiff_t>(std::min<uint64_t>(chunkCount, m_chunkTable.size())));
+    out.assign(m_chunkTable.begin(), m_chunkTable.begin() + static_cast<std::ptrdiff_t>(chunkCount));
     return consistent ? eTqovixSuccess : eTqovixErrorInvalidMovie;
+}
+
+void CTqovixSampleTableVisitor::LoadRecords(const std::vector<TqovixChunkInformation>& chunks, bool withSizes)
+{
+    if (chunks.empty()) {
+        return;
+    }
+    m_chunkTable.resize(chunks.size());
+    for (size_t j = 0; j < chunks.size(); ++j) {
+        m_chunkTable[j].offset = chunks[j].offset;
+        if (withSizes) {
+            m_chunkTable[j].size = chunks[j].size;
+            if (m_constantSampleSize == 0) {
+                m_chunkTable[j].sampleSizes = chunks[j].sampleSizes;
+            }
+        }
+    }
+    m_recordCount = chunks.size();
 }
 
 eTqovixErrorCode CTqovixSampleTableVisitor::BeginUpdate(const TqovixAtomPath& path, CTqovixLeafAtom& atom,
@@ -178,9 +200,7 @@ eTqovixErrorCode CTqovixSampleTableVisitor::BeginUpdate(const TqovixAtomPath& pa
         return eTqovixErrorInternal;
     }
     if (atom.GetType() == kHdlr) {
-        const eTqovixErrorCode answer = HandlerAnswer(atom, m_handlerSubtype);
-        m_bTrack = answer == eTqovixVisitContinue;
-        return answer;
+        return AnswerHandler(atom);
     }
     if (!m_bTrack) {
         return eTqovixVisitSkip;
@@ -193,18 +213,35 @@ eTqovixErrorCode CTqovixSampleTableVisitor::BeginUpdate(const TqovixAtomPath& pa
     return eTqovixSuccess;
 }
 
-eTqovixErrorCode CTqovixSampleTableVisitor::WriteOffsets(std::vector<uint8_t>& payload, bool wide, uint64_t count) const
+eTqovixErrorCode CTqovixSampleTableVisitor::RewriteOffsets(std::vector<uint8_t>& payload, eTqovixAtomType type,
+                                                          bool exactCount) const
 {
-    for (uint64_t j = 0; j < count; ++j) {
+    const bool wide = type == kCo64;
+    const uint64_t width = wide ? 8 : 4;
+    const uint64_t entries = payload.size() >= 8 ? (payload.size() - 8) / width : 0;
+    if (entries > m_recordCount || (exactCount && entries != m_recordCount)) {
+        return eTqovixErrorInternal;
+    }
+    for (uint64_t j = 0; j < entries; ++j) {
         const uint64_t offset = m_chunkTable[j].offset;
         if (wide) {
             TqovixWriteBE64(payload.data() + 8 + 8 * j, offset);
+        } else if (offset > UINT32_MAX) {
+            return eTqovixErrorInternal;  // only a "co64" table can say where this chunk lies
         } else {
-            if (offset > UINT32_MAX) {
-                return eTqovixErrorInternal;  // only a "co64" table can say where this chunk lies
-            }
             TqovixWriteBE32(payload.data() + 8 + 4 * j, static_cast<uint32_t>(offset));
         }
     }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::FinishUpdate(CTqovixLeafAtom& atom, const std::vector<uint8_t>& payload,
+                                                        uint32_t tablesPerTrack, eTqovixErrorCode unfinished) const
+{
+    atom.SetData(payload.data(), payload.size());
+    if (++m_analyzedTableCount < tablesPerTrack) {
+        return unfinished;
+    }
+    m_analyzedTableCount = 0;
     return eTqovixSuccess;
 }
