@@ -495,12 +495,12 @@ TEST_F(TrackTest, UpdateWalksRewriteOnlyTheirTablesAndReadBackAsSet)
                           {"pcm with stco", moviekit::SoundCodec::Twos, false, 1000}};
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
-        moviekit::MovieSpec spec;
-        spec.sound.codec = c.codec;
-        spec.co64 = c.co64;
-        spec.video.perSampleSizes = true;
+        moviekit::MovieSpec recipe;
+        recipe.sound.codec = c.codec;
+        recipe.co64 = c.co64;
+        recipe.video.perSampleSizes = true;
         moviekit::MovieLayout layout;
-        ASSERT_EQ(Load(moviekit::BuildMovie(spec, &layout)), eTqovixSuccess);
+        ASSERT_EQ(Load(moviekit::BuildMovie(recipe, &layout)), eTqovixSuccess);
         const bool aac = c.codec == moviekit::SoundCodec::Aac;
         const std::string offsets = c.co64 ? "co64" : "stco";
         const Bytes before = WriteTree();
@@ -600,10 +600,10 @@ TEST_F(TrackTest, UpdatesThatCannotBeWrittenReplaceNoPayload)
     };
     for (const Refused& c : cases) {
         SCOPED_TRACE(c.name);
-        moviekit::MovieSpec spec;
-        spec.sound.codec = c.codec;
+        moviekit::MovieSpec recipe;
+        recipe.sound.codec = c.codec;
         moviekit::MovieLayout layout;
-        const Bytes movie = moviekit::BuildMovie(spec, &layout);
+        const Bytes movie = moviekit::BuildMovie(recipe, &layout);
         ASSERT_EQ(Load(movie), eTqovixSuccess);
         Chunks chunks = c.video ? ExpectedChunks(layout.videoChunks, false)
                                 : ExpectedChunks(layout.soundChunks, c.codec == moviekit::SoundCodec::Aac);
