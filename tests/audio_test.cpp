@@ -9,27 +9,13 @@
 #include "audio/CTqovixAudioChunk.h"
 #include "audio/CTqovixAudioDataControl.h"
 #include "file/CTqovixFile.h"
+#include "support/ChunkTables.h"
 #include "support/TestSupport.h"
 
 using moviekit::Bytes;
 
 namespace {
 
-std::vector<TqovixChunkInformation> ChunkTable(const std::vector<moviekit::ChunkLayout>& chunks)
-{
-    std::vector<TqovixChunkInformation> table;
-    uint32_t number = 1;
-    for (const moviekit::ChunkLayout& chunk : chunks) {
-        TqovixChunkInformation info;
-        info.offset = chunk.offset;
-        info.size = static_cast<uint32_t>(chunk.size);
-        info.sampleSizes = chunk.sampleSizes;
-        info.chunkNumber = number++;
-        info.sampleCount = chunk.sampleCount;
-        table.push_back(info);
-    }
-    return table;
-}
 
 Bytes SwappedWords(Bytes bytes)
 {
@@ -161,7 +147,7 @@ TEST_F(AudioFileTest, PcmRequestsOfAnySizeDeliverTheTrackInOrder)
 
         for (const unsigned long request : {1UL, 4095UL, 4096UL, 2801UL, static_cast<unsigned long>(expected.size() + 9)}) {
             CTqovixAudioDataControl control;
-            ASSERT_EQ(control.Initialize(file, ChunkTable(layout.soundChunks), bigEndian), eTqovixSuccess);
+            ASSERT_EQ(control.Initialize(file, testsupport::ChunkTableOf(layout.soundChunks, true), bigEndian), eTqovixSuccess);
             Bytes delivered;
             ASSERT_EQ(Drain(control, request, delivered), eTqovixSuccess) << request;
             EXPECT_EQ(delivered, expected) << "request of " << request;
@@ -321,7 +307,7 @@ TEST_F(AudioFileTest, AacTrackOfACameraMovieIsDecodedPacketByPacketInTableOrder)
     for (const unsigned long request : {1UL, 333UL, 4096UL}) {
         FakeAacControl control;
         control.echo = true;
-        ASSERT_EQ(control.Initialize(m_file, ChunkTable(layout.soundChunks), false), eTqovixSuccess);
+        ASSERT_EQ(control.Initialize(m_file, testsupport::ChunkTableOf(layout.soundChunks, true), false), eTqovixSuccess);
         Bytes delivered;
         Bytes buffer(request);
         while (delivered.size() < layout.soundBytes.size() + 5000) {

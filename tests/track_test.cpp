@@ -11,6 +11,7 @@
 #include "atom/CTqovixAtomControl.h"
 #include "atom/TqovixEndian.h"
 #include "file/CTqovixFile.h"
+#include "support/ChunkTables.h"
 #include "support/TestSupport.h"
 #include "visitor/CTqovixAudioDataVisitor.h"
 #include "visitor/CTqovixAudioInformationVisitor.h"
@@ -345,23 +346,6 @@ TEST_F(TrackTest, SampleTotalAndMediaTimeComeFromWholeEntriesOnly)
     EXPECT_EQ(m_tree.Analyze(noSound), eTqovixErrorInvalidMovie);
 }
 
-std::vector<TqovixChunkInformation> ExpectedChunks(const std::vector<moviekit::ChunkLayout>& chunks, bool withSizes)
-{
-    std::vector<TqovixChunkInformation> table;
-    uint32_t number = 1;
-    for (const moviekit::ChunkLayout& chunk : chunks) {
-        TqovixChunkInformation info;
-        info.offset = chunk.offset;
-        info.size = static_cast<uint32_t>(chunk.size);
-        if (withSizes) {
-            info.sampleSizes = chunk.sampleSizes;
-        }
-        info.chunkNumber = number++;
-        info.sampleCount = chunk.sampleCount;
-        table.push_back(info);
-    }
-    return table;
-}
 
 TEST_F(TrackTest, ChunkListsOfCameraMoviesMatchTheirLayout)
 {
@@ -385,13 +369,13 @@ TEST_F(TrackTest, ChunkListsOfCameraMoviesMatchTheirLayout)
         ASSERT_EQ(m_tree.Analyze(sound), eTqovixSuccess);
         std::vector<TqovixChunkInformation> soundChunks;
         ASSERT_EQ(sound.GetAudioChunkInformation(soundChunks, 4), eTqovixSuccess);
-        EXPECT_EQ(soundChunks, ExpectedChunks(layout.soundChunks, isAac));
+        EXPECT_EQ(soundChunks, testsupport::ChunkTableOf(layout.soundChunks, isAac));
 
         CTqovixMovieDataVisitor video;
         ASSERT_EQ(m_tree.Analyze(video), eTqovixSuccess);
         std::vector<TqovixChunkInformation> videoChunks;
         ASSERT_EQ(video.GetOffset(videoChunks), eTqovixSuccess);
-        EXPECT_EQ(videoChunks, ExpectedChunks(layout.videoChunks, recipe.video.perSampleSizes));
+        EXPECT_EQ(videoChunks, testsupport::ChunkTableOf(layout.videoChunks, recipe.video.perSampleSizes));
 
         // The last chunk ends exactly where the file would have to, or one byte beyond.
         uint64_t end = 0;
@@ -505,7 +489,7 @@ TEST_F(TrackTest, UpdateWalksRewriteOnlyTheirTablesAndReadBackAsSet)
         const std::string offsets = c.co64 ? "co64" : "stco";
         const Bytes before = WriteTree();
 
-        std::vector<TqovixChunkInformation> sound = ExpectedChunks(layout.soundChunks, aac);
+        std::vector<TqovixChunkInformation> sound = testsupport::ChunkTableOf(layout.soundChunks, aac);
         for (auto& chunk : sound) {
             chunk.offset += c.shift;
             for (auto& size : chunk.sampleSizes) {
@@ -530,7 +514,7 @@ TEST_F(TrackTest, UpdateWalksRewriteOnlyTheirTablesAndReadBackAsSet)
             EXPECT_EQ(soundAfter["stsz"], soundBefore["stsz"]) << "a common sample size is left as it is";
         }
 
-        std::vector<TqovixChunkInformation> video = ExpectedChunks(layout.videoChunks, false);
+        std::vector<TqovixChunkInformation> video = testsupport::ChunkTableOf(layout.videoChunks, false);
         for (auto& chunk : video) {
             chunk.offset = chunk.offset * 3 + 1;
         }
@@ -605,8 +589,8 @@ TEST_F(TrackTest, UpdatesThatCannotBeWrittenReplaceNoPayload)
         moviekit::MovieLayout layout;
         const Bytes movie = moviekit::BuildMovie(recipe, &layout);
         ASSERT_EQ(Load(movie), eTqovixSuccess);
-        Chunks chunks = c.video ? ExpectedChunks(layout.videoChunks, false)
-                                : ExpectedChunks(layout.soundChunks, c.codec == moviekit::SoundCodec::Aac);
+        Chunks chunks = c.video ? testsupport::ChunkTableOf(layout.videoChunks, false)
+                                : testsupport::ChunkTableOf(layout.soundChunks, c.codec == moviekit::SoundCodec::Aac);
         c.change(chunks);
         EXPECT_EQ(c.video ? UpdateVideo(m_tree, chunks) : UpdateSound(m_tree, chunks), eTqovixErrorInternal);
         EXPECT_EQ(WriteTree(), movie);
@@ -615,7 +599,7 @@ TEST_F(TrackTest, UpdatesThatCannotBeWrittenReplaceNoPayload)
     // More video records than entries are ignored.
     moviekit::MovieLayout layout;
     ASSERT_EQ(Load(moviekit::BuildMovie(moviekit::MovieSpec{}, &layout)), eTqovixSuccess);
-    Chunks extra = ExpectedChunks(layout.videoChunks, false);
+    Chunks extra = testsupport::ChunkTableOf(layout.videoChunks, false);
     extra.push_back(extra.back());
     EXPECT_EQ(UpdateVideo(m_tree, extra), eTqovixSuccess);
 
@@ -652,11 +636,11 @@ TEST_F(TrackTest, RewrittenOffsetsAreWhereAnIndependentReaderFindsThePackets)
 
         // Move the media data 1000 bytes down by putting a "free" atom in front of it.
         const Bytes padding = Atom("free", Bytes(992, 0));
-        std::vector<TqovixChunkInformation> sound = ExpectedChunks(layout.soundChunks, codec == moviekit::SoundCodec::Aac);
+        std::vector<TqovixChunkInformation> sound = testsupport::ChunkTableOf(layout.soundChunks, codec == moviekit::SoundCodec::Aac);
         for (auto& chunk : sound) {
             chunk.offset += padding.size();
         }
-        std::vector<TqovixChunkInformation> video = ExpectedChunks(layout.videoChunks, false);
+        std::vector<TqovixChunkInformation> video = testsupport::ChunkTableOf(layout.videoChunks, false);
         for (auto& chunk : video) {
             chunk.offset += padding.size();
         }
