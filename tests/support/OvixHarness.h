@@ -1,6 +1,6 @@
 // Plays the system's side of the processing library for its tests: callbacks over in-memory
-// AF information, audio level and PCM, a record of everything the library asked and pushed,
-// and scripted faults (failing callbacks, aborts, a callback held at a gate).
+// AF information, audio level and PCM, a record of what the library asked and pushed, and
+// scripted faults (a failing callback, an abort inside one, a callback held at a gate).
 #pragma once
 
 #include <ovix/Ovix.h>
@@ -8,14 +8,12 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <cstdint>
-#include <cstring>
-#include <limits>
-#include <mutex>
 #include <optional>
+#include <ostream>
 #include <string>
 #include <thread>
+#include <utility>
 #include <vector>
 
 namespace ovixtest {
@@ -29,13 +27,10 @@ template <typename Predicate>
 bool WaitFor(Predicate done)
 {
     const auto deadline = std::chrono::steady_clock::now() + kPatience;
-    while (!done()) {
-        if (std::chrono::steady_clock::now() > deadline) {
-            return false;
-        }
+    while (!done() && std::chrono::steady_clock::now() < deadline) {
         std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
-    return true;
+    return done();
 }
 
 // Holds one callback until the test opens it; both sides wait a bounded time.
@@ -43,205 +38,146 @@ class Gate {
 public:
     void Arrive()
     {
-        std::unique_lock lock(m_mutex);
         m_arrived = true;
-        m_changed.notify_all();
-        m_changed.wait_for(lock, kPatience, [this] { return m_open; });
+        WaitFor([this] { return m_open.load(); });
     }
-    bool WaitArrived()
-    {
-        std::unique_lock lock(m_mutex);
-        return m_changed.wait_for(lock, kPatience, [this] { return m_arrived; });
-    }
-    void Open()
-    {
-        std::lock_guard lock(m_mutex);
-        m_open = true;
-        m_changed.notify_all();
-    }
+    bool WaitArrived() { return WaitFor([this] { return m_arrived.load(); }); }
+    void Open() { m_open = true; }
 
 private:
-    std::mutex m_mutex;
-    std::condition_variable m_changed;
-    bool m_arrived = false;
-    bool m_open = false;
+    std::atomic<bool> m_arrived{false};
+    std::atomic<bool> m_open{false};
 };
 
-// Event letters: 'a' AF size query, 'A' AF read, 'l' level size query, 'L' level read,
-// 'I' audio pull, 'O' audio push, 'N' progress notification.
+// The n-th (0-based) call of one callback, by event letter: 'a' AF size query, 'A' AF read,
+// 'l' level size query, 'L' level read, 'I' audio pull, 'O' audio push, 'N' notification.
+using Trigger = std::pair<char, int>;
+
 struct Script {
-    Bytes afBlock;
-    std::optional<Bytes> levelBlock;
-    std::vector<int16_t> pcm;  // interleaved
+    Bytes afBlock = {};
+    Bytes levelBlock = {};  // empty: the recording has no audio level
+    std::vector<int16_t> pcm = {};  // interleaved
     unsigned channels = 2;
     bool zerosAfterEnd = false;  // decoded AAC: the track is followed by zeros forever
-    unsigned long infoPieceLimit = std::numeric_limits<unsigned long>::max();
-    unsigned long audioFrameLimit = std::numeric_limits<unsigned long>::max();
-    std::optional<unsigned long> afSizeOverride;
+    size_t infoPieceLimit = SIZE_MAX;
+    size_t audioFrameLimit = SIZE_MAX / 64;
+    std::optional<unsigned long> afSize = {};  // announced instead of the true size
     bool overDeliver = false;  // the audio reader claims one byte more than asked
-    char failOn = 0;  // the callback of this event letter fails ...
-    int failOrdinal = 0;  // ... at its n-th call (0-based)
-    char abortOn = 0;  // TqovixAbortSession inside this callback ...
-    int abortOrdinal = 0;
-    char holdOn = 0;  // held at the gate inside this callback ...
-    int holdOrdinal = 0;
+    Trigger failAt = {}, abortAt = {}, holdAt = {};
     Gate* gate = nullptr;
-    int closeInNotification = -1;  // closes from inside the n-th notification ...
-    bool closeLibrary = false;  // ... the library rather than the session
 };
 
 struct Note {
-    unsigned long done = 0;
-    unsigned long total = 0;
+    unsigned long done = 0, total = 0;
     unsigned long state = 0;  // TqovixIsSessionFinished inside the notification
+    bool operator==(const Note&) const = default;
+    friend void PrintTo(const Note& n, std::ostream* out) { *out << n.done << '/' << n.total << " state " << n.state; }
 };
 
 class Harness {
 public:
-    explicit Harness(Script script) : m_script(std::move(script)) { Current() = this; }
-    ~Harness() { Current() = nullptr; }
-    Harness(const Harness&) = delete;
-    Harness& operator=(const Harness&) = delete;
+    explicit Harness(Script script) : m_script(std::move(script)) { s_current = this; }
+    ~Harness() { s_current = nullptr; }
 
     static void Register()
     {
-        TqovixSetCallbackInputAFInformation(&Harness::InputAf);
-        TqovixSetCallbackInputAudioLevelInformation(&Harness::InputLevel);
+        TqovixSetCallbackInputAFInformation([](void* to, unsigned long* got, unsigned long n, unsigned long) {
+            return s_current.load()->ReadInfo('a', to, got, n);
+        });
+        TqovixSetCallbackInputAudioLevelInformation([](void* to, unsigned long* got, unsigned long n, unsigned long) {
+            return s_current.load()->ReadInfo('l', to, got, n);
+        });
         TqovixSetCallbackInputAudio(&Harness::InputAudio);
         TqovixSetCallbackOutputAudio(&Harness::OutputAudio);
         TqovixSetCallbackNotifyProgress(&Harness::Notify);
     }
 
-    // Read only after the session is closed (its worker joined) unless noted.
+    // Read only after the session is closed (its worker joined) or while it is held at the gate.
     std::string events;
-    std::vector<unsigned long> audioRequests;
     std::vector<int16_t> pushed;
     std::vector<Note> notes;
     Bytes processedAtEnd;  // read inside the notification that first reports the end
-    std::atomic<int> outputs{0};  // safe to poll while running
-    std::atomic<int> notifications{0};
-    // What the close inside a notification returned; stored last, after which the harness
-    // is no longer touched by the worker.
-    std::atomic<long> closedInside{-1};
 
 private:
-    static std::atomic<Harness*>& Current()
-    {
-        static std::atomic<Harness*> current{nullptr};
-        return current;
-    }
+    static inline std::atomic<Harness*> s_current{nullptr};
 
-    // Counts the event and plays the scripted fault; false when this call is to fail.
+    // Records the event and plays the scripted fault; false when this call is to fail.
     bool Enter(char event)
     {
-        const int ordinal = static_cast<int>(std::count(events.begin(), events.end(), event));
+        const Trigger now{event, static_cast<int>(std::ranges::count(events, event))};
         events.push_back(event);
-        if (m_script.abortOn == event && m_script.abortOrdinal == ordinal) {
+        if (now == m_script.abortAt) {
             TqovixAbortSession();
         }
-        if (m_script.holdOn == event && m_script.holdOrdinal == ordinal && m_script.gate != nullptr) {
+        if (now == m_script.holdAt && m_script.gate != nullptr) {
             m_script.gate->Arrive();
         }
-        return !(m_script.failOn == event && m_script.failOrdinal == ordinal);
+        return now != m_script.failAt;
     }
 
-    // The system's sequential reader: a null buffer asks for the size; the end delivers 0
-    // and rewinds.
-    unsigned long ReadInfo(const Bytes& block, size_t& position, void* buffer, unsigned long* delivered,
-                           unsigned long size, unsigned long skip)
+    // The system's sequential reader: a null buffer asks for the size; the end delivers 0 and
+    // rewinds.
+    unsigned long ReadInfo(char event, void* buffer, unsigned long* delivered, unsigned long size)
     {
+        const bool af = event == 'a';
+        const Bytes& block = af ? m_script.afBlock : m_script.levelBlock;
+        size_t& position = af ? m_afPosition : m_levelPosition;
+        if (!Enter(buffer != nullptr ? (af ? 'A' : 'L') : event)) {
+            return ovix::kFailure;
+        }
         if (buffer == nullptr) {
-            *delivered = m_script.afSizeOverride && &block == &m_script.afBlock ? *m_script.afSizeOverride
-                                                                              : block.size();
-            return 0;
+            *delivered = af ? m_script.afSize.value_or(block.size()) : block.size();
+            return !af && block.empty() ? ovix::kNoAudioLevel : ovix::kSuccess;
         }
-        position = std::min(block.size(), position + skip);
-        const size_t piece = std::min({block.size() - position, size_t{size}, size_t{m_script.infoPieceLimit}});
-        if (piece > 0) {
-            std::memcpy(buffer, block.data() + position, piece);
-        }
-        position = piece == 0 ? 0 : position + piece;
-        *delivered = piece;
-        return 0;
-    }
-
-    static unsigned long InputAf(void* buffer, unsigned long* delivered, unsigned long size, unsigned long skip)
-    {
-        Harness& h = *Current();
-        if (!h.Enter(buffer == nullptr ? 'a' : 'A')) {
-            return ovix::kFailure;
-        }
-        return h.ReadInfo(h.m_script.afBlock, h.m_afPosition, buffer, delivered, size, skip);
-    }
-
-    static unsigned long InputLevel(void* buffer, unsigned long* delivered, unsigned long size, unsigned long skip)
-    {
-        Harness& h = *Current();
-        if (!h.Enter(buffer == nullptr ? 'l' : 'L')) {
-            return ovix::kFailure;
-        }
-        if (!h.m_script.levelBlock) {
-            *delivered = 0;
-            return ovix::kNoAudioLevel;
-        }
-        return h.ReadInfo(*h.m_script.levelBlock, h.m_levelPosition, buffer, delivered, size, skip);
+        *delivered = std::min({block.size() - position, size_t{size}, m_script.infoPieceLimit});
+        std::copy_n(block.begin() + position, *delivered, static_cast<uint8_t*>(buffer));
+        position = *delivered == 0 ? 0 : position + *delivered;
+        return ovix::kSuccess;
     }
 
     static unsigned long InputAudio(void* buffer, unsigned long* delivered, unsigned long size, unsigned long)
     {
-        Harness& h = *Current();
-        h.audioRequests.push_back(size);
+        Harness& h = *s_current;
+        const Script& s = h.m_script;
         if (!h.Enter('I')) {
             return ovix::kFailure;
         }
-        const size_t frameBytes = h.m_script.channels * sizeof(int16_t);
-        const size_t left = (h.m_script.pcm.size() - h.m_samplePosition) * sizeof(int16_t);
-        size_t piece = std::min<size_t>(size, left);
-        piece = std::min<size_t>(piece, h.m_script.audioFrameLimit * frameBytes);
-        if (piece > 0) {
-            std::memcpy(buffer, h.m_script.pcm.data() + h.m_samplePosition, piece);
-        }
+        const size_t left = (s.pcm.size() - h.m_samplePosition) * sizeof(int16_t);
+        size_t piece = std::min({size_t{size}, left, s.audioFrameLimit * s.channels * sizeof(int16_t)});
+        uint8_t* out = static_cast<uint8_t*>(buffer);
+        std::copy_n(reinterpret_cast<const uint8_t*>(s.pcm.data() + h.m_samplePosition), piece, out);
         h.m_samplePosition += piece / sizeof(int16_t);
-        if (h.m_script.zerosAfterEnd && piece == left && piece < size) {
-            std::memset(static_cast<uint8_t*>(buffer) + piece, 0, size - piece);
-            piece = size;
+        if (s.zerosAfterEnd && piece == left && piece < size) {
+            piece = std::fill_n(out + piece, size - piece, 0) - out;
         }
-        *delivered = piece + (h.m_script.overDeliver ? 1 : 0);
-        return 0;
+        *delivered = piece + (s.overDeliver ? 1 : 0);
+        return ovix::kSuccess;
     }
 
     static unsigned long OutputAudio(void* data, unsigned long size)
     {
-        Harness& h = *Current();
+        Harness& h = *s_current;
         const int16_t* samples = static_cast<const int16_t*>(data);
         h.pushed.insert(h.pushed.end(), samples, samples + size / sizeof(int16_t));
-        const bool ok = h.Enter('O');
-        h.outputs.fetch_add(1);
-        return ok ? 0 : ovix::kFailure;
+        return h.Enter('O') ? ovix::kSuccess : ovix::kFailure;
     }
 
     static void Notify(unsigned long done, unsigned long total)
     {
-        Harness& h = *Current();
+        Harness& h = *s_current;
         h.Enter('N');
         const unsigned long state = TqovixIsSessionFinished();
         if (state != 0 && h.processedAtEnd.empty()) {
-            uint8_t piece[1024];
+            uint8_t piece[7];  // smaller than any block, so that it comes in pieces
             unsigned long count = 0;
             unsigned long result = 0;
             do {
                 result = TqovixGetProcessedAFInfo(piece, sizeof piece, &count);
-                if (result <= ovix::kLastPiece) {
-                    h.processedAtEnd.insert(h.processedAtEnd.end(), piece, piece + count);
-                }
-            } while (result == 0);
+                count = result <= ovix::kLastPiece ? count : 0;
+                h.processedAtEnd.insert(h.processedAtEnd.end(), piece, piece + count);
+            } while (result == ovix::kSuccess && h.processedAtEnd.size() < 4096);
         }
         h.notes.push_back({done, total, state});
-        const int ordinal = h.notifications.fetch_add(1);
-        if (ordinal == h.m_script.closeInNotification) {
-            const unsigned long result = h.m_script.closeLibrary ? TqovixLibraryClose() : TqovixCloseSession(0);
-            h.closedInside.store(static_cast<long>(result));
-        }
     }
 
     Script m_script;
