@@ -10,7 +10,6 @@
 #include "atom/CTqovixAtomVisitor.h"
 #include "atom/CTqovixContainerAtom.h"
 #include "atom/CTqovixLeafAtom.h"
-#include "atom/TqovixEndian.h"
 #include "file/CTqovixFile.h"
 #include "support/TestSupport.h"
 
@@ -124,30 +123,6 @@ private:
         return answer(text, isLeaf);
     }
 };
-
-TEST(AtomTypeTest, TypesReadAsFileOrderBytesAndOnlyNineAreContainers)
-{
-    EXPECT_EQ(TqovixAtom::kMoov, 0x766F6F6Du);
-    EXPECT_EQ(TqovixAtom::kTrak, 0x6B617274u);
-    EXPECT_EQ(TqovixAtom::kEdts, 0x73746465u);
-    EXPECT_EQ(TqovixAtom::kMdat, 0x7461646Du);
-    EXPECT_EQ(TqovixMakeAtomPath("moovudtaTCDTTCDB"),
-              (TqovixAtomPath{TqovixAtom::kMoov, TqovixAtom::kUdta, TqovixAtom::kTCDT, TqovixAtom::kTCDB}));
-
-    for (const char* type : {"moov", "trak", "mdia", "minf", "stbl", "edts", "udta", "TCDT", "TCDB"}) {
-        EXPECT_TRUE(IsContainerAtom(TqovixMakeAtomPath(type)[0])) << type;
-    }
-    for (const char* type : {"mdat", "ftyp", "stsd", "TCTG", "OP01", "meta", "dinf", "tcdt", "MOOV"}) {
-        EXPECT_FALSE(IsContainerAtom(TqovixMakeAtomPath(type)[0])) << type;
-    }
-
-    uint32_t value = 0x11223344;
-    EndianSwap32(value);
-    EXPECT_EQ(value, 0x44332211u);
-    uint64_t wide = 0x0102030405060708ULL;
-    EndianSwap64(wide);
-    EXPECT_EQ(wide, 0x0807060504030201ULL);
-}
 
 TEST(AtomSizeTest, HeaderFormFollowsTheThirtyTwoBitLimit)
 {
@@ -494,19 +469,6 @@ TEST_F(AtomFileTest, VisitorAnswersSteerAndStopTheWalk)
     RecordingVisitor visitor;
     EXPECT_EQ(empty.Analyze(visitor), eTqovixErrorGeneral);
     EXPECT_EQ(empty.Update(visitor), eTqovixErrorGeneral);
-}
-
-TEST(PathTargetTest, ContainersOnTheWayLeadInAndOnlyTheTargetLeafCounts)
-{
-    const CTqovixPathTarget target(TqovixMakeAtomPath("moovudtaTCDTTCTG"));
-    EXPECT_TRUE(target.IsNecessary({}, false));
-    EXPECT_TRUE(target.IsNecessary(TqovixMakeAtomPath("moovudta"), false));
-    EXPECT_EQ(target.ContainerAnswer(TqovixMakeAtomPath("moovudtaTCDT")), eTqovixVisitContinue);
-    EXPECT_EQ(target.ContainerAnswer(TqovixMakeAtomPath("moovtrak")), eTqovixVisitSkip);
-    EXPECT_EQ(target.ContainerAnswer(TqovixMakeAtomPath("moovudtaTCDTTCTG")), eTqovixVisitSkip);
-    EXPECT_FALSE(target.IsNecessary(TqovixMakeAtomPath("moovudtaTCDT"), true));
-    EXPECT_TRUE(target.IsNecessary(TqovixMakeAtomPath("moovudtaTCDTTCTG"), true));
-    EXPECT_FALSE(target.IsNecessary(TqovixMakeAtomPath("moovudtaTCDTTCTGfree"), true));
 }
 
 }  // namespace
