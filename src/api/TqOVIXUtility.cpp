@@ -1,0 +1,101 @@
+// The exported functions: each forwards to the one engine and turns its internal
+// result into the exported code.
+#include "api/TqOVIXUtility.h"
+
+#include <new>
+
+#include "engine/CTqovixMainFrame.h"
+
+namespace {
+
+int ConvertToUtilityError(eTqovixErrorCode code)
+{
+    switch (code) {
+    case eTqovixSuccess:
+    case eTqovixRunning:
+    case eTqovixEnable: return 0;
+    case eTqovixFinished: return 1;
+    case eTqovixVerdict7: return 7;
+    case eTqovixVerdict8: return 8;
+    case eTqovixVerdict9: return 9;
+    case eTqovixVerdict20: return 20;
+    case eTqovixErrorOutOfMemory: return 100;
+    case eTqovixErrorSourceNotFound: return 110;
+    case eTqovixErrorDestinationNotFound: return 111;
+    case eTqovixErrorSourceAccessDenied: return 120;
+    case eTqovixErrorDestinationAccessDenied: return 121;
+    case eTqovixErrorDiskFull: return 130;
+    case eTqovixErrorFileTooLarge: return 131;
+    case eTqovixErrorInvalidMovie: return 8;
+    case eTqovixErrorAborted: return 200;
+    default: return 190;
+    }
+}
+
+}  // namespace
+
+extern "C" {
+
+int TqInitializeOVIX(void)
+{
+    if (g_pMainFrame != nullptr) {
+        return 190;
+    }
+    auto* engine = new (std::nothrow) CTqovixMainFrame;
+    if (engine == nullptr) {
+        return 100;
+    }
+    const eTqovixErrorCode result = engine->Initialize();
+    if (result != eTqovixSuccess) {
+        delete engine;
+        return ConvertToUtilityError(result);
+    }
+    g_pMainFrame = engine;
+    return 0;
+}
+
+void TqCloseOVIX(void)
+{
+    CTqovixMainFrame* engine = g_pMainFrame;
+    if (engine == nullptr) {
+        return;
+    }
+    // Close waits until the library's thread has left the engine; only then is it freed.
+    engine->Close();
+    g_pMainFrame = nullptr;
+    delete engine;
+}
+
+int TqGetPropertyOVIX(const char* path)
+{
+    return g_pMainFrame ? ConvertToUtilityError(g_pMainFrame->GetProperty(path)) : 190;
+}
+
+int TqSetCallBackNotifyProgressOVIX(int (*callback)(int, int))
+{
+    return g_pMainFrame ? ConvertToUtilityError(g_pMainFrame->SetCallback(callback)) : 190;
+}
+
+int TqExecuteOVIX(const char* sourcePath, const char* destinationPath)
+{
+    return g_pMainFrame ? ConvertToUtilityError(g_pMainFrame->Execute(sourcePath, destinationPath, 0)) : 190;
+}
+
+int TqIsFinishedOVIX(void)
+{
+    return g_pMainFrame ? ConvertToUtilityError(g_pMainFrame->GetProcessingState()) : 190;
+}
+
+void TqAbortOVIX(void)
+{
+    if (g_pMainFrame != nullptr) {
+        g_pMainFrame->Abort();
+    }
+}
+
+int TqGetProgressOVIX(int* first, int* second)
+{
+    return g_pMainFrame ? ConvertToUtilityError(g_pMainFrame->GetProgress(first, second)) : 190;
+}
+
+}  // extern "C"

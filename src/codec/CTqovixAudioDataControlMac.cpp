@@ -1,0 +1,146 @@
+#include "codec/CTqovixAudioDataControlMac.h"
+
+#include <new>
+
+#include "bridge/TqovixInterfaceConvert.h"
+#include "codec/AACDecoder.h"
+#include "codec/AACEncoder.h"
+#include "movie/CTqovixMovControl.h"
+
+namespace {
+
+constexpr unsigned int kStreamBufferSize = 4096;
+constexpr uint32_t kPcmFlags = 12;  // signed integer, packed, host order
+
+}  // namespace
+
+CTqovixAudioDataControlMac::~CTqovixAudioDataControlMac()
+{
+    // The base destructor cannot reach our overrides any more.
+    CloseDecoderAAC();
+    CloseEncoderAAC();
+}
+
+eTqovixErrorCode CTqovixAudioDataControlMac::SetAACInformation(
+    const CTqovixMovControl* movControl, const void* audioSpecificConfig, unsigned int audioSpecificConfigSize,
+    const TqovixInterfaceConvert::TqovixAudioInformation& information, unsigned int bitRate)
+{
+    try {
+        if (!m_pAACFormat) {
+            m_pAACFormat = std::make_unique<ACFormat>();
+        }
+        if (!m_pPCMFormat) {
+            m_pPCMFormat = std::make_unique<ACFormat>();
+        }
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    const double rate = static_cast<double>(information.sampleRate);
+    const auto channels = static_cast<uint32_t>(information.channels);
+    const auto bits = static_cast<uint32_t>(information.bitsPerSample);
+    *m_pAACFormat = ACFormat{rate, ACFormatAAC, 0, 0, 1024, 0, channels, 0};
+    const uint32_t frameBytes = (bits / 8) * channels;
+    *m_pPCMFormat = ACFormat{rate, ACFormatLinearPCM, kPcmFlags, frameBytes, 1, frameBytes, channels, bits};
+    // Natural for a second call on one opened movie: the previous codecs go first.
+    CloseDecoderAAC();
+    CloseEncoderAAC();
+    return CTqovixAudioDataControl::SetAACInformation(movControl, audioSpecificConfig, audioSpecificConfigSize,
+                                                      information, bitRate);
+}
+
+eTqovixErrorCode CTqovixAudioDataControlMac::OpenDecoderAAC(const void* audioSpecificConfig,
+                                                            unsigned int audioSpecificConfigSize)
+{
+    if (audioSpecificConfig == nullptr || audioSpecificConfigSize == 0 || !m_pAACFormat || !m_pPCMFormat) {
+        return eTqovixErrorInternal;
+    }
+    try {
+        m_pDecoder = std::make_unique<AACDecoder>();
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    ConvertOVIXResult(m_pDecoder->Initialize(*m_pAACFormat, *m_pPCMFormat));
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControlMac::OpenEncoderAAC(
+    const CTqovixMovControl* movControl, const TqovixInterfaceConvert::TqovixAudioInformation&, unsigned int bitRate)
+{
+    if (!m_pAACFormat || !m_pPCMFormat) {
+        return eTqovixErrorInternal;
+    }
+    try {
+        m_pEncoder = std::make_unique<AACEncoder>();
+        m_pBinding = std::make_unique<EncodeCallbackBinding>();
+        m_pStreamBuffer = std::make_unique<unsigned char[]>(kStreamBufferSize);
+        m_pEncoderStream = std::make_unique<ACEncoderStream>();
+    } catch (const std::bad_alloc&) {
+        CloseEncoderAAC();
+        return eTqovixErrorOutOfMemory;
+    }
+    m_pBinding->object = const_cast<CTqovixMovControl*>(movControl);
+    m_pBinding->function = &CTqovixMovControl::EncodeCallback;
+    m_pEncoderStream->requestProc = EncoderRequestProc;
+    m_pEncoderStream->resultProc = EncoderResultProc;
+    m_pEncoderStream->buffer = m_pStreamBuffer.get();
+    m_pEncoderStream->bufferSize = kStreamBufferSize;
+    m_pEncoderStream->userData = m_pBinding.get();
+    ConvertOVIXResult(m_pEncoder->Initialize(*m_pPCMFormat, *m_pAACFormat, bitRate, m_pEncoderStream.get()));
+    return eTqovixSuccess;
+}
+
+void CTqovixAudioDataControlMac::CloseDecoderAAC() { m_pDecoder.reset(); }
+
+void CTqovixAudioDataControlMac::CloseEncoderAAC()
+{
+    // The encoder refers to the stream, so it goes first.
+    m_pEncoder.reset();
+    m_pEncoderStream.reset();
+    m_pBinding.reset();
+    m_pStreamBuffer.reset();
+}
+
+eTqovixErrorCode CTqovixAudioDataControlMac::DecodeAAC2PCM(void* pcm, unsigned int* pcmSize, unsigned int* usedSize,
+                                                           const void* packet, unsigned int packetSize)
+{
+    if (pcm == nullptr || pcmSize == nullptr || usedSize == nullptr || packet == nullptr || packetSize == 0 ||
+        !m_pDecoder) {
+        return eTqovixErrorInternal;
+    }
+    return ConvertOVIXResult(m_pDecoder->Decode(pcm, pcmSize, usedSize, packet, packetSize));
+}
+
+eTqovixErrorCode CTqovixAudioDataControlMac::EncodePCM2AAC(void* pcm, unsigned int pcmSize)
+{
+    if (pcm == nullptr || pcmSize == 0 || !m_pEncoder) {
+        return eTqovixErrorInternal;
+    }
+    return ConvertOVIXResult(m_pEncoder->Encode(pcm, pcmSize));
+}
+
+eTqovixErrorCode CTqovixAudioDataControlMac::EncodeDone()
+{
+    if (!m_pEncoder) {
+        return eTqovixErrorInternal;
+    }
+    return ConvertOVIXResult(m_pEncoder->EncodeDone());
+}
+
+unsigned char* EncoderRequestProc(void* stream, unsigned int size)
+{
+    const auto* encoderStream = static_cast<const ACEncoderStream*>(stream);
+    if (encoderStream == nullptr || size == 0 || encoderStream->bufferSize <= size) {
+        return nullptr;
+    }
+    return encoderStream->buffer;
+}
+
+eTqovixErrorCode EncoderResultProc(void* stream, unsigned char* data, unsigned int size)
+{
+    const auto* encoderStream = static_cast<const ACEncoderStream*>(stream);
+    const auto* binding = encoderStream ? static_cast<const EncodeCallbackBinding*>(encoderStream->userData) : nullptr;
+    if (binding != nullptr && binding->function != nullptr) {
+        binding->function(binding->object, data, static_cast<int>(size));
+    }
+    return eTqovixSuccess;
+}

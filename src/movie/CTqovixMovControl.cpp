@@ -1,0 +1,293 @@
+#include "movie/CTqovixMovControl.h"
+
+#include <algorithm>
+#include <cstring>
+#include <new>
+
+#include "file/CTqovixUtil.h"
+#include "visitor/CTqovixAudioDataVisitor.h"
+#include "visitor/CTqovixAudioInformationVisitor.h"
+#include "visitor/CTqovixMakerBlockVisitor.h"
+#include "visitor/CTqovixMovieDataVisitor.h"
+#include "visitor/CTqovixTrimInformationVisitor.h"
+
+namespace {
+
+constexpr int kOpenRead = 1;
+constexpr int kOpenWrite = 2;
+
+eTqovixErrorCode CopyBlock(std::vector<uint8_t>& target, const uint8_t* data, uint64_t size)
+{
+    try {
+        target.assign(data, data + size);
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    return eTqovixSuccess;
+}
+
+// The sequential reader the processing library pulls the maker blocks through: a null
+// buffer asks for the size, a position past the end rewinds.
+eTqovixErrorCode ReadSequentially(const std::vector<uint8_t>& block, uint64_t& position, void* buffer,
+                                  unsigned long* delivered, unsigned long size, unsigned long skip)
+{
+    if (buffer == nullptr) {
+        if (delivered != nullptr) {
+            *delivered = block.size();
+        }
+        return eTqovixSuccess;
+    }
+    if (size == 0) {
+        return eTqovixErrorInternal;
+    }
+    position = skip > block.size() - position ? block.size() : position + skip;
+    if (position == block.size()) {
+        if (delivered != nullptr) {
+            *delivered = 0;
+        }
+        position = 0;
+        return eTqovixSuccess;
+    }
+    const uint64_t count = std::min<uint64_t>(block.size() - position, size);
+    CTqovixUtil::_memcpy(buffer, size, block.data() + position, count);
+    position += count;
+    if (delivered != nullptr) {
+        *delivered = count;
+    }
+    return eTqovixSuccess;
+}
+
+}  // namespace
+
+eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const char* destinationPath)
+{
+    if (sourcePath == nullptr || sourcePath[0] == '\0') {
+        return eTqovixErrorSourceNotFound;
+    }
+    eTqovixErrorCode result = m_sourceFile.Open(sourcePath, kOpenRead);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    if (destinationPath != nullptr) {
+        result = InitializeDestination(sourcePath, destinationPath);
+        if (TqovixFailed(result)) {
+            m_sourceFile.Close();
+            return result;
+        }
+    }
+    if (TqovixFailed(m_atomControl.Initialize(m_sourceFile))) {
+        Close();
+        return eTqovixErrorInvalidMovie;
+    }
+
+    CTqovixAFInformationVisitor af;
+    result = m_atomControl.Analyze(af);
+    if (TqovixFailed(result) || (result >= eTqovixEnable && result <= eTqovixVerdict20)) {
+        Close();
+        return result;
+    }
+    if (af.GetAFInformationSize() == 0) {
+        Close();
+        return eTqovixErrorInvalidMovie;
+    }
+    result = CopyBlock(m_afInformation, af.GetAFInformation(), af.GetAFInformationSize());
+    if (TqovixFailed(result)) {
+        Close();
+        return result;
+    }
+
+    CTqovixAudioLevelInformationVisitor level;
+    result = m_atomControl.Analyze(level);
+    if (TqovixFailed(result) && result != eTqovixErrorInvalidMovie) {
+        Close();
+        return result;
+    }
+    if (!TqovixFailed(result) && level.GetAudioLevelInformationSize() != 0) {
+        result = CopyBlock(m_audioLevelInformation, level.GetAudioLevelInformation(),
+                           level.GetAudioLevelInformationSize());
+        if (TqovixFailed(result)) {
+            Close();
+            return result;
+        }
+    }
+    if (destinationPath == nullptr) {
+        return eTqovixSuccess;
+    }
+    result = AnalyzeTracks();
+    if (TqovixFailed(result)) {
+        Close();
+    }
+    return result;
+}
+
+eTqovixErrorCode CTqovixMovControl::InitializeDestination(const char* sourcePath, const char* destinationPath)
+{
+    long long sourceSize = 0;
+    eTqovixErrorCode result = m_sourceFile.GetFileSize(&sourceSize);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    // Two spellings of the source: opening the destination would truncate it.
+    if (CTqovixUtil::IsSameFile(sourcePath, destinationPath)) {
+        return eTqovixErrorGeneral;
+    }
+    result = m_destinationFile.ComfirmWritable(sourceSize, destinationPath);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    return m_destinationFile.Open(destinationPath, kOpenWrite);
+}
+
+eTqovixErrorCode CTqovixMovControl::AnalyzeTracks()
+{
+    CTqovixAudioInformationVisitor information;
+    eTqovixErrorCode result = m_atomControl.Analyze(information);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    if (information.GetAudioSpecificConfigSize() != 0) {
+        m_bPCM = false;
+    }
+    long long fileSize = 0;
+    result = m_sourceFile.GetFileSize(&fileSize);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+
+    CTqovixAudioDataVisitor audio;
+    result = m_atomControl.Analyze(audio);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    const uint32_t frameBytes = (uint32_t{information.GetSize()} * information.GetChannel()) >> 3;
+    result = audio.GetAudioChunkInformation(m_audioChunks, frameBytes);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    CTqovixMovieDataVisitor video;
+    result = m_atomControl.Analyze(video);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    result = video.GetOffset(m_movieDataChunks);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    // Tables that point outside the file describe a damaged movie; refuse it before any work.
+    const auto size = static_cast<uint64_t>(fileSize);
+    if (m_audioChunks.empty() || TqovixFailed(TqovixCheckChunksInFile(m_audioChunks, size)) ||
+        TqovixFailed(TqovixCheckChunksInFile(m_movieDataChunks, size))) {
+        return eTqovixErrorInvalidMovie;
+    }
+    result = m_audioDataControl.Initialize(m_sourceFile, m_audioChunks, information.IsBigEndianFormat());
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    m_bBigEndian = information.IsBigEndianFormat();
+    return eTqovixSuccess;
+}
+
+void CTqovixMovControl::Close()
+{
+    m_outputAudioChunkIndex = 0;
+    m_outputMovieDataChunkIndex = 0;
+    m_samplesInOutputChunk = 0;
+    m_bytesInOutputChunk = 0;
+    m_mediaDataSize = 0;
+    m_mediaDataSizePosition = 0;
+    m_encodeResult = eTqovixSuccess;
+    m_bBigEndian = true;
+    m_outputMovieDataChunks.clear();
+    m_outputAudioChunks.clear();
+    m_movieDataChunks.clear();
+    m_audioChunks.clear();
+    m_afInformationPosition = 0;
+    m_audioLevelInformationPosition = 0;
+    m_afInformation.clear();
+    m_audioLevelInformation.clear();
+    m_bHeaderPending = true;
+    m_bPCM = true;
+    m_pMainFrame = nullptr;
+    m_bLargeMediaDataHeader = false;
+    m_bFinishPending = false;
+    m_bDestinationComplete = false;
+    m_carriedByte = -1;
+    std::vector<uint8_t>().swap(m_copyBuffer);
+    if (m_audioDataControl.IsInitialized() || m_audioDataControl.IsAACCodec()) {
+        m_audioDataControl.Close();
+    }
+    if (m_atomControl.IsInitialized()) {
+        m_atomControl.Close();
+    }
+    if (m_destinationFile.IsOpened()) {
+        m_destinationFile.Close();
+    }
+    if (m_sourceFile.IsOpened()) {
+        m_sourceFile.Close();
+    }
+}
+
+eTqovixErrorCode CTqovixMovControl::GetAFInformation(void* buffer, unsigned long* delivered, unsigned long size,
+                                                     unsigned long skip) const
+{
+    return ReadSequentially(m_afInformation, m_afInformationPosition, buffer, delivered, size, skip);
+}
+
+eTqovixErrorCode CTqovixMovControl::GetAudioLevelInformation(void* buffer, unsigned long* delivered,
+                                                             unsigned long size, unsigned long skip) const
+{
+    const eTqovixErrorCode result =
+        ReadSequentially(m_audioLevelInformation, m_audioLevelInformationPosition, buffer, delivered, size, skip);
+    if (m_audioLevelInformation.empty() && !TqovixFailed(result)) {
+        return eTqovixNoAudioLevel;
+    }
+    return result;
+}
+
+eTqovixErrorCode CTqovixMovControl::GetAudioData(void* buffer, unsigned long* delivered, unsigned long size,
+                                                 unsigned long) const
+{
+    return m_audioDataControl.PopAudioData(buffer, delivered, size);
+}
+
+eTqovixErrorCode CTqovixMovControl::GetAudioInformation(TqovixInterfaceConvert::TqovixAudioInformation& record)
+{
+    CTqovixAudioInformationVisitor information;
+    const eTqovixErrorCode result = m_atomControl.Analyze(information);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    record.sampleRate = information.GetRate();
+    record.channels = information.GetChannel();
+    record.bitsPerSample = information.GetSize();
+    record.sampleCount = information.GetCount();
+    record.startOffset = information.GetMediaTime() - information.GetPriming();
+    if (information.GetAudioSpecificConfigSize() == 0) {
+        return eTqovixSuccess;
+    }
+    m_bPCM = false;
+    record.sampleRate *= 1000;
+    const eTqovixErrorCode opened = m_audioDataControl.SetAACInformation(
+        this, information.GetAudioSpecificConfigData(), information.GetAudioSpecificConfigSize(), record,
+        information.GetAverageBitRate());
+    if (TqovixFailed(opened)) {
+        return opened;
+    }
+    record.sampleRate /= 1000;
+    record.sampleCount *= 1024;
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::GetTrimInformation(TqovixInterfaceConvert::TqovixTrimInformation& record) const
+{
+    CTqovixTrimInformationVisitor trim;
+    const eTqovixErrorCode result = m_atomControl.Analyze(trim);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    record.frameRateNumerator = trim.GetFrameRateNumerator();
+    record.frameRateDenominator = trim.GetFrameRateDenominator();
+    record.removedFrameForward = trim.GetRemovedFrameForward();
+    record.removedFrameBackward = trim.GetRemovedFrameBackward();
+    return eTqovixSuccess;
+}

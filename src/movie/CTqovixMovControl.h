@@ -1,0 +1,97 @@
+// One job's movie files: opens and analyses the source, serves the processing
+// library's input callbacks from it, and writes the destination movie.
+#pragma once
+
+#include <cstdint>
+#include <vector>
+
+#include "atom/CTqovixAtomControl.h"
+#include "bridge/TqovixInterfaceConvert.h"
+#include "codec/CTqovixAudioDataControlMac.h"
+#include "file/CTqovixFile.h"
+#include "visitor/TqovixChunkInformation.h"
+
+class CTqovixMainFrame;
+
+class CTqovixMovControl {
+public:
+    CTqovixMovControl() = default;
+    CTqovixMovControl(const CTqovixMovControl&) = delete;
+    CTqovixMovControl& operator=(const CTqovixMovControl&) = delete;
+
+    // Without a destination only the source and its AF and audio level information are opened.
+    eTqovixErrorCode Initialize(const char* sourcePath, const char* destinationPath);
+    void Close();
+
+    eTqovixErrorCode GetAFInformation(void* buffer, unsigned long* delivered, unsigned long size,
+                                      unsigned long skip) const;
+    // 154 instead of 0 when the movie has no audio level information.
+    eTqovixErrorCode GetAudioLevelInformation(void* buffer, unsigned long* delivered, unsigned long size,
+                                              unsigned long skip) const;
+    eTqovixErrorCode GetAudioData(void* buffer, unsigned long* delivered, unsigned long size, unsigned long skip) const;
+    // Opens the AAC codecs when the track needs them.
+    eTqovixErrorCode GetAudioInformation(TqovixInterfaceConvert::TqovixAudioInformation& information);
+    eTqovixErrorCode GetTrimInformation(TqovixInterfaceConvert::TqovixTrimInformation& information) const;
+    bool IsPCMCodec() const { return m_bPCM; }
+    bool IsAACCodec() const { return !m_bPCM; }
+    void GetMainFrame(CTqovixMainFrame* mainFrame) { m_pMainFrame = mainFrame; }
+
+    // Writing the destination.
+    eTqovixErrorCode SetMovieMetaData(const void* data, unsigned long size);
+    eTqovixErrorCode WriteMetaData(const void* data, unsigned long size);
+    eTqovixErrorCode WriteMovieMetaData();
+    static void EncodeCallback(void* user, unsigned char* packet, int size);
+    eTqovixErrorCode SetMovieDataInformation(const void* afInformation, unsigned long size);
+    // Every sound and video chunk is in the destination (the moov may still be missing).
+    bool IsMediaDataComplete() const;
+    // The finishing step has written the moov and the media data size.
+    bool IsDestinationComplete() const { return m_bDestinationComplete; }
+    // True once after EncodeCallback has written the last packet. The job is finished
+    // only after the encoder has returned, so that no codec is closed under its own feet.
+    bool TakeFinishPending();
+    // AAC: makes the encoder give up what it holds when the library has ended early.
+    eTqovixErrorCode FlushEncoder();
+
+private:
+    eTqovixErrorCode InitializeDestination(const char* sourcePath, const char* destinationPath);
+    eTqovixErrorCode AnalyzeTracks();
+    eTqovixErrorCode WriteLeadingAtoms();
+    eTqovixErrorCode WritePcm(const uint8_t* data, unsigned long size, bool swap);
+    eTqovixErrorCode WriteAacPacket(const uint8_t* packet, unsigned long size);
+    eTqovixErrorCode CopyPrecedingVideo();
+    eTqovixErrorCode CopyRemainingVideo();
+    eTqovixErrorCode CopySourceSoundTail();
+    eTqovixErrorCode WriteMediaDataSize();
+    eTqovixErrorCode WriteSwapped(const uint8_t* data, unsigned long size);
+
+    CTqovixFile m_sourceFile;
+    CTqovixFile m_destinationFile;
+    CTqovixAtomControl m_atomControl;
+    mutable CTqovixAudioDataControlMac m_audioDataControl;  // served from the const audio reader
+    CTqovixMainFrame* m_pMainFrame = nullptr;
+    bool m_bHeaderPending = true;
+    bool m_bPCM = true;
+    std::vector<uint8_t> m_afInformation;
+    mutable uint64_t m_afInformationPosition = 0;
+    std::vector<uint8_t> m_audioLevelInformation;
+    mutable uint64_t m_audioLevelInformationPosition = 0;
+    std::vector<TqovixChunkInformation> m_audioChunks;
+    std::vector<TqovixChunkInformation> m_movieDataChunks;
+    std::vector<TqovixChunkInformation> m_outputAudioChunks;
+    std::vector<TqovixChunkInformation> m_outputMovieDataChunks;
+    bool m_bBigEndian = true;
+    uint64_t m_outputAudioChunkIndex = 0;
+    uint64_t m_outputMovieDataChunkIndex = 0;
+    uint32_t m_samplesInOutputChunk = 0;
+    uint32_t m_bytesInOutputChunk = 0;
+    uint64_t m_mediaDataSize = 0;
+    int64_t m_mediaDataSizePosition = 0;
+    eTqovixErrorCode m_encodeResult = eTqovixSuccess;
+
+    // Our additions to the writer's state.
+    bool m_bLargeMediaDataHeader = false;  // the mdat header written has a 64-bit size field
+    bool m_bFinishPending = false;
+    bool m_bDestinationComplete = false;
+    int m_carriedByte = -1;  // big-endian PCM: the odd byte of a piece waits for its pair
+    std::vector<uint8_t> m_copyBuffer;  // reused for video chunks and swapped PCM
+};

@@ -1,0 +1,531 @@
+// The writing half of the movie controller: leading atoms, one new mdat holding the
+// new sound chunks and the copied video chunks in source order, then the updated moov.
+#include <algorithm>
+#include <cstring>
+#include <new>
+
+#include "atom/CTqovixAtom.h"
+#include "atom/TqovixEndian.h"
+#include "engine/CTqovixMainFrame.h"
+#include "movie/CTqovixMovControl.h"
+#include "visitor/CTqovixAudioDataVisitor.h"
+#include "visitor/CTqovixMakerBlockVisitor.h"
+#include "visitor/CTqovixMovieDataVisitor.h"
+#include "visitor/CTqovixTCTGAtomVisitor.h"
+
+namespace {
+
+// Video chunks and swapped PCM move through one reused buffer of at most this size,
+// so memory stays flat whatever the chunk sizes.
+constexpr uint64_t kCopyPiece = 1 << 20;
+constexpr uint64_t kMax32 = CTqovixAtom::kMaxCompactAtomSize;
+// Room for an AAC track re-encoded larger than its source when choosing the mdat header.
+constexpr uint64_t kAacGrowthMargin = 1 << 20;
+
+void SwapPairs(uint8_t* bytes, uint64_t size)
+{
+    for (uint64_t k = 0; k + 1 < size; k += 2) {
+        std::swap(bytes[k], bytes[k + 1]);
+    }
+}
+
+}  // namespace
+
+eTqovixErrorCode CTqovixMovControl::SetMovieMetaData(const void* data, unsigned long size)
+{
+    if (m_bHeaderPending) {
+        m_bHeaderPending = false;
+        const eTqovixErrorCode result = WriteLeadingAtoms();
+        if (TqovixFailed(result)) {
+            return result;
+        }
+    }
+    if (!m_bPCM) {
+        if (TqovixFailed(m_encodeResult)) {
+            return m_encodeResult;
+        }
+        const eTqovixErrorCode result = m_audioDataControl.PushAudioData(data, size);
+        if (TqovixFailed(result) || TqovixFailed(m_encodeResult)) {
+            return TqovixFailed(result) ? result : m_encodeResult;
+        }
+        if (TakeFinishPending() && m_pMainFrame != nullptr) {
+            // Last call on this object: finishing may close the controller.
+            return m_pMainFrame->SetAFInformation();
+        }
+        return result;
+    }
+    if (size != 0 && data == nullptr) {
+        return eTqovixErrorInternal;
+    }
+    const auto* bytes = static_cast<const uint8_t*>(data);
+    if (m_bBigEndian && size != 0) {
+        // Only whole 2-byte samples can be swapped: an odd byte waits for its partner.
+        if (m_carriedByte >= 0) {
+            const uint8_t pair[2] = {static_cast<uint8_t>(m_carriedByte), bytes[0]};
+            m_carriedByte = -1;
+            const eTqovixErrorCode result = WritePcm(pair, 2, true);
+            if (TqovixFailed(result)) {
+                return result;
+            }
+            ++bytes;
+            --size;
+        }
+        if (size % 2 != 0) {
+            m_carriedByte = bytes[size - 1];
+            --size;
+        }
+    }
+    return WritePcm(bytes, size, m_bBigEndian);
+}
+
+eTqovixErrorCode CTqovixMovControl::WriteLeadingAtoms()
+{
+    TqovixAtomList atoms;
+    eTqovixErrorCode result = m_atomControl.GetAtoms(atoms);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    bool largeSource = false;
+    for (const auto& atom : atoms) {
+        const eTqovixAtomType type = atom->GetType();
+        if (type == TqovixAtom::kMdat) {
+            largeSource = largeSource || atom->GetSize() > kMax32;
+        } else if (type != TqovixAtom::kMoov) {
+            result = atom->Write(m_destinationFile);
+            if (TqovixFailed(result)) {
+                return result;
+            }
+        }
+    }
+    // One mdat for all media, whatever the source had; its size form is chosen now from
+    // what will go in, because the header cannot grow once media follows it.
+    uint64_t projected = kAacGrowthMargin;
+    for (const auto& chunk : m_movieDataChunks) {
+        projected += chunk.size;
+    }
+    for (const auto& chunk : m_audioChunks) {
+        projected += m_bPCM ? chunk.size : 2 * uint64_t{chunk.size};
+    }
+    m_bLargeMediaDataHeader = largeSource || projected + 16 > kMax32;
+
+    uint8_t header[16] = {};
+    unsigned int headerSize = 8;
+    unsigned int sizeField = 0;
+    if (m_bLargeMediaDataHeader) {
+        TqovixWriteBE32(header, 1);
+        std::memcpy(header + 4, "mdat", 4);
+        headerSize = 16;
+        sizeField = 8;
+    } else {
+        std::memcpy(header + 4, "mdat", 4);
+    }
+    long long position = 0;
+    result = m_destinationFile.GetPosition(&position);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    m_mediaDataSizePosition = position + sizeField;
+    result = m_destinationFile.Write(header, headerSize);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    try {
+        if (m_bPCM) {
+            m_outputAudioChunks = m_audioChunks;
+        }
+        m_outputMovieDataChunks = m_movieDataChunks;
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    result = m_atomControl.Update(CTqovixTCTGAtomVisitor());
+    return TqovixFailed(result) ? result : eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::WriteMetaData(const void* data, unsigned long size)
+{
+    if (m_bPCM) {
+        return WritePcm(static_cast<const uint8_t*>(data), size, m_bBigEndian);
+    }
+    return WriteAacPacket(static_cast<const uint8_t*>(data), size);
+}
+
+eTqovixErrorCode CTqovixMovControl::WriteAacPacket(const uint8_t* packet, unsigned long size)
+{
+    const uint64_t count = m_audioChunks.size();
+    if (m_outputAudioChunkIndex >= count) {
+        return eTqovixFinished;
+    }
+    if (packet == nullptr || size == 0 || size > kMax32) {
+        return eTqovixErrorInternal;
+    }
+    eTqovixErrorCode result = CopyPrecedingVideo();
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    const uint64_t a = m_outputAudioChunkIndex;
+    try {
+        if (a >= m_outputAudioChunks.size()) {
+            m_outputAudioChunks.resize(a + 1);
+        }
+        TqovixChunkInformation& output = m_outputAudioChunks[a];
+        if (m_samplesInOutputChunk == 0) {
+            long long position = 0;
+            result = m_destinationFile.GetPosition(&position);
+            if (TqovixFailed(result)) {
+                return result;
+            }
+            output.size = 0;
+            output.offset = static_cast<uint64_t>(position);
+            output.sampleSizes.clear();
+        }
+        if (uint64_t{output.size} + size > kMax32) {
+            return eTqovixErrorInternal;
+        }
+        output.sampleSizes.resize(m_samplesInOutputChunk + 1);
+        output.sampleSizes.back() = static_cast<uint32_t>(size);
+        result = m_destinationFile.Write(packet, static_cast<unsigned int>(size));
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        output.size += static_cast<uint32_t>(size);
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    m_mediaDataSize += size;
+    ++m_samplesInOutputChunk;
+    const TqovixChunkInformation& source = m_audioChunks[a];
+    if (m_samplesInOutputChunk >= source.sampleCount) {
+        m_outputAudioChunks[a].chunkNumber = source.chunkNumber;
+        m_outputAudioChunks[a].sampleCount = source.sampleCount;
+        m_samplesInOutputChunk = 0;
+        m_outputAudioChunkIndex = a + 1;
+        m_audioDataControl.SetOutputChunkIndex(m_outputAudioChunkIndex);
+    }
+    // Within two packets of the end the encoder may flush; a chunk of fewer than two
+    // packets must not wrap the count around.
+    const uint32_t lastCount = m_audioChunks.back().sampleCount;
+    if (m_outputAudioChunkIndex == count - 1 && m_samplesInOutputChunk >= (lastCount >= 2 ? lastCount - 2 : 0)) {
+        m_audioDataControl.SetOutputChunkIndex(count);
+    }
+    if (m_outputAudioChunkIndex >= count) {
+        result = CopyRemainingVideo();
+        return TqovixFailed(result) ? result : eTqovixSuccess;
+    }
+    return eTqovixRunning;
+}
+
+eTqovixErrorCode CTqovixMovControl::WritePcm(const uint8_t* data, unsigned long size, bool swap)
+{
+    const uint64_t count = m_audioChunks.size();
+    if (m_outputAudioChunkIndex >= count) {
+        return eTqovixFinished;
+    }
+    unsigned long consumed = 0;
+    while (size != 0 && m_outputAudioChunkIndex < count) {
+        eTqovixErrorCode result = CopyPrecedingVideo();
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        TqovixChunkInformation& output = m_outputAudioChunks[m_outputAudioChunkIndex];
+        if (m_bytesInOutputChunk == 0) {
+            long long position = 0;
+            result = m_destinationFile.GetPosition(&position);
+            if (TqovixFailed(result)) {
+                return result;
+            }
+            output.offset = static_cast<uint64_t>(position);
+        }
+        const uint32_t need = m_audioChunks[m_outputAudioChunkIndex].size - m_bytesInOutputChunk;
+        const auto n = static_cast<uint32_t>(std::min<uint64_t>(size - consumed, need));
+        result = swap ? WriteSwapped(data + consumed, n) : m_destinationFile.Write(data + consumed, n);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        m_bytesInOutputChunk += n;
+        m_mediaDataSize += n;
+        consumed += n;
+        if (n == need) {
+            ++m_outputAudioChunkIndex;
+            m_bytesInOutputChunk = 0;
+        }
+        if (consumed >= size) {
+            break;
+        }
+    }
+    if (m_outputAudioChunkIndex >= count) {
+        return CopyRemainingVideo();
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::WriteSwapped(const uint8_t* data, unsigned long size)
+{
+    try {
+        m_copyBuffer.resize(std::min<uint64_t>(std::max<uint64_t>(size, 2), kCopyPiece));
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    for (unsigned long done = 0; done < size;) {
+        const auto piece = static_cast<unsigned int>(std::min<uint64_t>(size - done, m_copyBuffer.size()));
+        std::memcpy(m_copyBuffer.data(), data + done, piece);
+        SwapPairs(m_copyBuffer.data(), piece);
+        const eTqovixErrorCode result = m_destinationFile.Write(m_copyBuffer.data(), piece);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        done += piece;
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::CopyPrecedingVideo()
+{
+    const uint64_t soundOffset = m_audioChunks[m_outputAudioChunkIndex].offset;
+    while (m_outputMovieDataChunkIndex < m_movieDataChunks.size() &&
+           m_movieDataChunks[m_outputMovieDataChunkIndex].offset < soundOffset) {
+        const eTqovixErrorCode result = WriteMovieMetaData();
+        if (TqovixFailed(result)) {
+            return result;
+        }
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::CopyRemainingVideo()
+{
+    while (m_outputMovieDataChunkIndex < m_movieDataChunks.size()) {
+        const eTqovixErrorCode result = WriteMovieMetaData();
+        if (TqovixFailed(result)) {
+            return result;
+        }
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::WriteMovieMetaData()
+{
+    const uint64_t v = m_outputMovieDataChunkIndex;
+    if (v >= m_movieDataChunks.size()) {
+        return eTqovixErrorInternal;
+    }
+    const TqovixChunkInformation& chunk = m_movieDataChunks[v];
+    long long position = 0;
+    eTqovixErrorCode result = m_destinationFile.GetPosition(&position);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    result = m_sourceFile.Seek(static_cast<long long>(chunk.offset), CTqovixFile::eTqovixSeekBegin);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    try {
+        m_copyBuffer.resize(std::min<uint64_t>(std::max<uint64_t>(chunk.size, 1), kCopyPiece));
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    for (uint32_t done = 0; done < chunk.size;) {
+        const auto piece = static_cast<unsigned int>(std::min<uint64_t>(chunk.size - done, m_copyBuffer.size()));
+        unsigned int got = 0;
+        result = m_sourceFile.Read(m_copyBuffer.data(), &got, piece);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        // The tables were checked against the file size: a short read means the source changed.
+        if (got != piece) {
+            return eTqovixErrorInternal;
+        }
+        result = m_destinationFile.Write(m_copyBuffer.data(), got);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        done += got;
+    }
+    m_outputMovieDataChunks[v].offset = static_cast<uint64_t>(position);
+    m_mediaDataSize += chunk.size;
+    m_outputMovieDataChunkIndex = v + 1;
+    return eTqovixSuccess;
+}
+
+void CTqovixMovControl::EncodeCallback(void* user, unsigned char* packet, int size)
+{
+    auto* self = static_cast<CTqovixMovControl*>(user);
+    if (self == nullptr || packet == nullptr || size <= 0) {
+        return;
+    }
+    if (size >= 7 && packet[0] == 0xFF && packet[1] >= 0xF0) {
+        packet += 7;
+        size -= 7;
+    }
+    if (size == 0) {
+        return;
+    }
+    self->m_encodeResult = self->WriteMetaData(packet, static_cast<unsigned long>(size));
+    if (self->m_encodeResult == eTqovixSuccess) {
+        self->m_bFinishPending = true;
+    }
+}
+
+bool CTqovixMovControl::TakeFinishPending()
+{
+    const bool pending = m_bFinishPending;
+    m_bFinishPending = false;
+    return pending;
+}
+
+eTqovixErrorCode CTqovixMovControl::FlushEncoder()
+{
+    if (m_bPCM || m_bHeaderPending || IsMediaDataComplete() || TqovixFailed(m_encodeResult)) {
+        return m_encodeResult;
+    }
+    m_audioDataControl.SetOutputChunkIndex(m_audioChunks.size());
+    const eTqovixErrorCode result = m_audioDataControl.EncodeDone();
+    return TqovixFailed(result) ? result : m_encodeResult;
+}
+
+bool CTqovixMovControl::IsMediaDataComplete() const
+{
+    return !m_bHeaderPending && m_outputAudioChunkIndex >= m_audioChunks.size() &&
+           m_outputMovieDataChunkIndex >= m_movieDataChunks.size();
+}
+
+eTqovixErrorCode CTqovixMovControl::CopySourceSoundTail()
+{
+    // The library ended before the track did: the rest of the sound goes out unprocessed
+    // rather than leaving chunks whose offsets point nowhere.
+    std::vector<uint8_t> piece;
+    try {
+        piece.resize(kCopyPiece);
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    m_carriedByte = -1;
+    while (m_outputAudioChunkIndex < m_audioChunks.size()) {
+        const TqovixChunkInformation& chunk = m_audioChunks[m_outputAudioChunkIndex];
+        const uint32_t left = chunk.size - m_bytesInOutputChunk;
+        const auto wanted = static_cast<unsigned int>(std::min<uint64_t>(left, piece.size()));
+        eTqovixErrorCode result = m_sourceFile.Seek(static_cast<long long>(chunk.offset + m_bytesInOutputChunk),
+                                                    CTqovixFile::eTqovixSeekBegin);
+        unsigned int got = 0;
+        if (!TqovixFailed(result)) {
+            result = m_sourceFile.Read(piece.data(), &got, wanted);
+        }
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        if (got != wanted) {
+            return eTqovixErrorInternal;
+        }
+        if (wanted == 0) {
+            // An empty chunk still needs its offset recorded by the writer.
+            result = CopyPrecedingVideo();
+            if (TqovixFailed(result)) {
+                return result;
+            }
+            long long position = 0;
+            result = m_destinationFile.GetPosition(&position);
+            if (TqovixFailed(result)) {
+                return result;
+            }
+            m_outputAudioChunks[m_outputAudioChunkIndex].offset = static_cast<uint64_t>(position);
+            ++m_outputAudioChunkIndex;
+            continue;
+        }
+        result = WritePcm(piece.data(), got, false);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+    }
+    return CopyRemainingVideo();
+}
+
+eTqovixErrorCode CTqovixMovControl::SetMovieDataInformation(const void* afInformation, unsigned long size)
+{
+    if (m_bHeaderPending) {
+        return eTqovixErrorInternal;
+    }
+    eTqovixErrorCode result = eTqovixSuccess;
+    if (!IsMediaDataComplete()) {
+        if (!m_bPCM) {
+            return eTqovixErrorInternal;
+        }
+        result = CopySourceSoundTail();
+        if (TqovixFailed(result)) {
+            return result;
+        }
+    }
+    CTqovixAudioDataVisitor audio;
+    audio.SetAudioChunkInformation(m_outputAudioChunks);
+    result = m_atomControl.Update(audio);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    CTqovixAFInformationVisitor af;
+    af.SetAFInformation(afInformation, size);
+    result = m_atomControl.Update(af);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    if (!m_audioLevelInformation.empty()) {
+        CTqovixAudioLevelInformationVisitor level;
+        level.SetAudioLevelInformation(m_audioLevelInformation.data(), m_audioLevelInformation.size());
+        result = m_atomControl.Update(level);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+    }
+    CTqovixMovieDataVisitor video;
+    video.SetOffset(m_outputMovieDataChunks);
+    result = m_atomControl.Update(video);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    TqovixAtomList atoms;
+    result = m_atomControl.GetAtoms(atoms);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    for (const auto& atom : atoms) {
+        if (atom->GetType() == TqovixAtom::kMoov) {
+            result = atom->Write(m_destinationFile);
+            if (TqovixFailed(result)) {
+                return result;
+            }
+        }
+    }
+    result = WriteMediaDataSize();
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    // Buffered bytes that a full disk refuses only show up here.
+    result = m_destinationFile.Flush();
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    m_bDestinationComplete = true;
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::WriteMediaDataSize()
+{
+    uint8_t field[8];
+    unsigned int fieldSize = 4;
+    if (m_bLargeMediaDataHeader) {
+        TqovixWriteBE64(field, m_mediaDataSize + 16);
+        fieldSize = 8;
+    } else if (m_mediaDataSize + 8 > kMax32) {
+        // An 8-byte header was written; a size that does not fit it would make a broken file.
+        return eTqovixErrorInternal;
+    } else {
+        TqovixWriteBE32(field, static_cast<uint32_t>(m_mediaDataSize + 8));
+    }
+    m_mediaDataSize += fieldSize == 8 ? 16 : 8;
+    eTqovixErrorCode result = m_destinationFile.Seek(m_mediaDataSizePosition, CTqovixFile::eTqovixSeekBegin);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    result = m_destinationFile.Write(field, fieldSize);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    return m_destinationFile.Seek(0, CTqovixFile::eTqovixSeekEnd);
+}

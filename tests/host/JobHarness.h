@@ -1,0 +1,54 @@
+// What the host-side suites share: an initialised library per test, movies written by
+// moviekit into a scratch directory, jobs run to their end with a bounded wait, and
+// ffprobe/ffmpeg as the independent readers of what a job wrote.
+#pragma once
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include "Movie.h"
+#include "api/TqOVIXUtility.h"
+#include "support/TestSupport.h"
+
+namespace jobtest {
+
+inline constexpr auto kJobPatience = std::chrono::seconds(120);
+
+// Polls TqIsFinishedOVIX until it stops answering 0; -1 when the patience runs out.
+int WaitForJob(std::chrono::steady_clock::duration patience = kJobPatience);
+
+struct FileStamp {
+    std::vector<uint8_t> bytes;
+    int64_t modifiedNs = 0;
+    bool operator==(const FileStamp&) const = default;
+};
+FileStamp StampFile(const std::string& path);
+bool Exists(const std::string& path);
+
+// One line per packet of the stream: "size,hash" from ffmpeg's framemd5 of a stream copy.
+std::vector<std::string> PacketHashes(const std::string& path, const std::string& stream);
+// ffprobe's verdict: empty when it reads every packet without complaint, else its messages.
+std::string ProbeErrors(const std::string& path);
+// Packets of one stream as ffprobe counts them.
+uint64_t PacketCount(const std::string& path, const std::string& stream);
+// Decodes the first sound stream to interleaved s16; false when ffmpeg reports an error.
+bool DecodeSound(const std::string& path, std::vector<int16_t>& samples);
+
+class HostTest : public ::testing::Test {
+protected:
+    void SetUp() override;
+    void TearDown() override;
+
+    std::string Write(const moviekit::MovieSpec& recipe, const std::string& name,
+                      moviekit::MovieLayout* layout = nullptr);
+    // Starts a job and waits for its end; the exported final state.
+    int Run(const std::string& source, const std::string& destination);
+
+    testsupport::TempDir m_dir;
+};
+
+}  // namespace jobtest
