@@ -6,6 +6,10 @@
 
 #include "engine/CTqovixMainFrame.h"
 
+// Defined here, not beside the engine, so that a program holding the internals for other
+// work (the command-line tool's inspector) and this library share one engine pointer.
+__attribute__((visibility("default"))) CTqovixMainFrame* g_pMainFrame = nullptr;
+
 namespace {
 
 int ConvertToUtilityError(eTqovixErrorCode code)

@@ -9,8 +9,6 @@
 
 namespace ovixbridge = TqovixInterfaceConvert;
 
-__attribute__((visibility("default"))) CTqovixMainFrame* g_pMainFrame = nullptr;
-
 namespace {
 
 constexpr unsigned long kAFInformationPiece = 1024;

@@ -74,4 +74,5 @@ private:
     std::vector<pthread_t> m_closeThreads;
 };
 
+// Defined by the exported interface; the callbacks reach the engine only through it.
 extern CTqovixMainFrame* g_pMainFrame;
