@@ -69,7 +69,7 @@ eTqovixErrorCode CTqovixLeafAtom::LoadData() const
             return result;
         }
         if (readSize < piece) {
-            break;  // the file shrank under us; the tail stays zero
+            return eTqovixErrorInvalidMovie;  // the file shrank under us
         }
         done += piece;
     }
@@ -80,7 +80,12 @@ eTqovixErrorCode CTqovixLeafAtom::LoadData() const
 
 const uint8_t* CTqovixLeafAtom::GetData() const
 {
-    if (TqovixFailed(LoadData()) || m_data.empty()) {
+    const eTqovixErrorCode result = LoadData();
+    if (TqovixFailed(result)) {
+        m_loadFailure = result;
+        return nullptr;
+    }
+    if (m_data.empty()) {
         return nullptr;
     }
     return m_data.data();
@@ -103,14 +108,18 @@ eTqovixErrorCode CTqovixLeafAtom::Analyze(CTqovixAtomVisitor& visitor, const Tqo
 {
     TqovixAtomPath leafPath = path;
     leafPath.push_back(m_type);
-    return visitor.Analyze(leafPath, *this);
+    m_loadFailure = eTqovixSuccess;
+    const eTqovixErrorCode result = visitor.Analyze(leafPath, *this);
+    return TqovixFailed(m_loadFailure) ? m_loadFailure : result;
 }
 
 eTqovixErrorCode CTqovixLeafAtom::Update(const CTqovixAtomVisitor& visitor, const TqovixAtomPath& path)
 {
     TqovixAtomPath leafPath = path;
     leafPath.push_back(m_type);
-    return visitor.Update(leafPath, *this);
+    m_loadFailure = eTqovixSuccess;
+    const eTqovixErrorCode result = visitor.Update(leafPath, *this);
+    return TqovixFailed(m_loadFailure) ? m_loadFailure : result;
 }
 
 eTqovixErrorCode CTqovixLeafAtom::Write(CTqovixFile& file) const

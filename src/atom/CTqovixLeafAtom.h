@@ -32,6 +32,9 @@ private:
     eTqovixAtomType m_type;
     mutable std::vector<uint8_t> m_data;
     mutable CTqovixFile* m_pFile;
+    // A payload that could not be read while a visitor looked at it: the walk reports this
+    // rather than what the visitor made of the missing bytes.
+    mutable eTqovixErrorCode m_loadFailure = eTqovixSuccess;
     long long m_offset;
     uint64_t m_size;
     bool m_bLargeHeader;

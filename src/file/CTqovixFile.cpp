@@ -64,6 +64,13 @@ const char* FileSystemTypeName(uint32_t magic)
 }
 
 std::atomic<TqovixVolumeQuery> g_volumeQuery{&CTqovixFile::QueryVolume};
+std::atomic<TqovixFaultHook> g_faultHook{nullptr};
+
+int InjectedFault(eTqovixFileOperation operation)
+{
+    const TqovixFaultHook hook = g_faultHook.load(std::memory_order_relaxed);
+    return hook == nullptr ? 0 : hook(operation);
+}
 
 // A 4 GiB file cannot exist on FAT: its size field is 32 bits wide.
 constexpr double kMsdosLargestFile = 4294967295.0;
@@ -137,6 +144,9 @@ eTqovixErrorCode CTqovixFile::Read(void* buffer, unsigned int* readSize, unsigne
         return eTqovixErrorInternal;
     }
 
+    if (const int fault = InjectedFault(eTqovixFileOperation::Read)) {
+        return ConvertErrnoToLocalError(fault, m_bReadOnly);
+    }
     // Single-byte items, so a partial read reports its exact count.
     const size_t count = std::fread(buffer, 1, size, m_stream);
     const int error = errno;
@@ -157,6 +167,9 @@ eTqovixErrorCode CTqovixFile::Write(const void* buffer, unsigned int size)
         return eTqovixErrorInternal;
     }
 
+    if (const int fault = InjectedFault(eTqovixFileOperation::Write)) {
+        return ConvertErrnoToLocalError(fault, m_bReadOnly);
+    }
     if (std::fwrite(buffer, size, 1, m_stream) == 1) {
         return eTqovixSuccess;
     }
@@ -176,6 +189,9 @@ eTqovixErrorCode CTqovixFile::Flush()
     if (m_stream == nullptr) {
         return eTqovixErrorInternal;
     }
+    if (const int fault = InjectedFault(eTqovixFileOperation::Flush)) {
+        return ConvertErrnoToLocalError(fault, m_bReadOnly);
+    }
     if (std::fflush(m_stream) != 0) {
         const int error = errno;
         std::clearerr(m_stream);
@@ -189,6 +205,9 @@ eTqovixErrorCode CTqovixFile::GetPosition(long long* position) const
     if (m_stream == nullptr || position == nullptr) {
         return eTqovixErrorInternal;
     }
+    if (const int fault = InjectedFault(eTqovixFileOperation::Position)) {
+        return ConvertErrnoToLocalError(fault, m_bReadOnly);
+    }
     const off_t current = ftello(m_stream);
     if (current < 0) {
         return ConvertErrnoToLocalError(errno, m_bReadOnly);
@@ -201,6 +220,9 @@ eTqovixErrorCode CTqovixFile::Seek(long long offset, eTqovixSeek origin)
 {
     if (m_stream == nullptr) {
         return eTqovixErrorInternal;
+    }
+    if (const int fault = InjectedFault(eTqovixFileOperation::Seek)) {
+        return ConvertErrnoToLocalError(fault, m_bReadOnly);
     }
     if (fseeko(m_stream, static_cast<off_t>(offset), origin) != 0) {
         return ConvertErrnoToLocalError(errno, m_bReadOnly);
@@ -241,11 +263,16 @@ eTqovixErrorCode CTqovixFile::SetFileSize(long long size)
         std::clearerr(m_stream);
         return ConvertErrnoToLocalError(error, m_bReadOnly);
     }
+    if (const int fault = InjectedFault(eTqovixFileOperation::Truncate)) {
+        return ConvertErrnoToLocalError(fault, m_bReadOnly);
+    }
     if (ftruncate(fileno(m_stream), static_cast<off_t>(size)) != 0) {
         return ConvertErrnoToLocalError(errno, m_bReadOnly);
     }
     return eTqovixSuccess;
 }
+
+TqovixFaultHook CTqovixFile::SetFaultHook(TqovixFaultHook hook) { return g_faultHook.exchange(hook); }
 
 eTqovixErrorCode CTqovixFile::ComfirmWritable(long long size, const char* path)
 {

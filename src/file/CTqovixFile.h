@@ -18,6 +18,13 @@ struct TqovixVolumeInformation {
 // Fills the record for the volume holding `directory`; returns false with errno set on failure.
 using TqovixVolumeQuery = bool (*)(const char* directory, TqovixVolumeInformation* information);
 
+// The operations a fault seam can fail.
+enum class eTqovixFileOperation { Read, Write, Seek, Position, Truncate, Flush };
+
+// Answers an errno to fail the operation with, or 0 to let it run. Tests use it to fail
+// the Nth call of a whole job and check that nothing is lost or left behind.
+using TqovixFaultHook = int (*)(eTqovixFileOperation operation);
+
 class CTqovixFile {
 public:
     enum eTqovixSeek { eTqovixSeekBegin = SEEK_SET, eTqovixSeekCurrent = SEEK_CUR, eTqovixSeekEnd = SEEK_END };
@@ -50,6 +57,8 @@ public:
     static TqovixVolumeQuery SetVolumeQuery(TqovixVolumeQuery query);
     // The real query (statfs); what a null SetVolumeQuery restores.
     static bool QueryVolume(const char* directory, TqovixVolumeInformation* information);
+    // Installs a fault seam (null removes it); returns the previous one.
+    static TqovixFaultHook SetFaultHook(TqovixFaultHook hook);
 
 private:
     bool m_bOpened = false;

@@ -356,7 +356,8 @@ void CTqovixMovControl::EncodeCallback(void* user, unsigned char* packet, int si
         packet += 7;
         size -= 7;
     }
-    if (size == 0) {
+    // A failed packet must stay failed: later packets of the same push would hide it.
+    if (size == 0 || TqovixFailed(self->m_encodeResult)) {
         return;
     }
     self->m_encodeResult = self->WriteMetaData(packet, static_cast<unsigned long>(size));
