@@ -1,19 +1,63 @@
 // tqovix make-sample: a camera-style movie to try the tools on.
+#include <algorithm>
+#include <cmath>
 #include <cstdio>
 #include <cstdlib>
+#include <numbers>
 #include <string>
+#include <vector>
 
 #include "Commands.h"
 #include "Movie.h"
+#include "MoviePlan.h"
+#include "Pattern.h"
 
 namespace {
 
 constexpr const char* kUsage =
-    "usage: tqovix make-sample DST [--seconds N] [--little-endian]\n"
-    "  writes a 30 fps camera-style movie with 48 kHz stereo PCM sound, AF information,\n"
-    "  audio level information and trim tags\n"
+    "usage: tqovix make-sample DST [--pcm|--aac] [--seconds N] [--size-gib N] [--little-endian]\n"
+    "  writes a 30 fps camera-style movie with 48 kHz stereo sound, AF information, audio\n"
+    "  level information and trim tags\n"
+    "  --pcm             16-bit PCM sound: a tone, with noise bursts while the AF motor runs\n"
+    "                    (the default; movies over 20 minutes get the tone alone)\n"
+    "  --aac             an AAC sound track (silent packets)\n"
     "  --seconds N       length of the movie (default 10)\n"
-    "  --little-endian   store the sound as \"sowt\" instead of \"twos\"\n";
+    "  --size-gib N      pad the video frames so that the file reaches about N GiB\n"
+    "  --little-endian   store PCM sound as \"sowt\" instead of \"twos\"\n";
+
+constexpr uint32_t kSampleRate = 48000;
+constexpr uint16_t kChannels = 2;
+// Explicit samples are held in memory: 20 minutes of stereo are 230 MB.
+constexpr unsigned long kMaxExplicitSoundSeconds = 20 * 60;
+// Video frames are generated in memory one at a time; keep each one modest.
+constexpr uint64_t kMaxFrameBytes = 64ULL << 20;
+
+// A steady tone, and inside each AF interval bursts of noise as a lens motor makes
+// (30 ms on, 70 ms off), as loud as the interval's strength says.
+std::vector<int16_t> ToneWithMotorNoise(uint64_t frames, const std::vector<moviekit::AfInterval>& intervals)
+{
+    std::vector<int16_t> samples(frames * kChannels);
+    for (uint64_t f = 0; f < frames; ++f) {
+        const double phase = 2 * std::numbers::pi * static_cast<double>(f % kSampleRate) / kSampleRate;
+        samples[f * kChannels] = static_cast<int16_t>(std::lround(6000 * std::sin(1000 * phase)));
+        samples[f * kChannels + 1] = static_cast<int16_t>(std::lround(6000 * std::sin(1500 * phase)));
+    }
+    const uint64_t period = kSampleRate / 10;
+    const uint64_t burst = kSampleRate * 3 / 100;
+    for (const moviekit::AfInterval& interval : intervals) {
+        for (uint64_t f = interval.startFrame; f < interval.endFrame && f < frames; ++f) {
+            if ((f - interval.startFrame) % period >= burst) {
+                continue;
+            }
+            for (uint64_t c = 0; c < kChannels; ++c) {
+                const auto noise = static_cast<int64_t>(moviekit::SplitMix64(f * kChannels + c) % 8001) - 4000;
+                const int64_t mixed = samples[f * kChannels + c] + noise * interval.strength / 1000;
+                samples[f * kChannels + c] = static_cast<int16_t>(std::clamp<int64_t>(mixed, -32768, 32767));
+            }
+        }
+    }
+    return samples;
+}
 
 }  // namespace
 
@@ -21,6 +65,8 @@ int MakeSampleCommand(const Arguments& arguments)
 {
     std::string destination;
     unsigned long seconds = 10;
+    double sizeGib = 0;
+    bool aac = false;
     bool littleEndian = false;
     for (size_t i = 0; i < arguments.size(); ++i) {
         const std::string& argument = arguments[i];
@@ -35,17 +81,26 @@ int MakeSampleCommand(const Arguments& arguments)
                 std::fprintf(stderr, "tqovix: --seconds takes a whole number from 1 to 86400\n");
                 return 2;
             }
+        } else if (argument == "--size-gib" && i + 1 < arguments.size()) {
+            char* end = nullptr;
+            sizeGib = std::strtod(arguments[++i].c_str(), &end);
+            if (*end != '\0' || !(sizeGib > 0 && sizeGib <= 1024)) {
+                std::fprintf(stderr, "tqovix: --size-gib takes a number above 0 and up to 1024\n");
+                return 2;
+            }
+        } else if (argument == "--aac" || argument == "--pcm") {
+            aac = argument == "--aac";
         } else if (argument == "--little-endian") {
             littleEndian = true;
-        } else if (destination.empty() && !argument.starts_with("--")) {
+        } else if (destination.empty() && !argument.starts_with("-")) {
             destination = argument;
         } else {
             std::fputs(kUsage, stderr);
             return 2;
         }
     }
-    if (destination.empty()) {
-        std::fputs(kUsage, stderr);
+    if (destination.empty() || (aac && littleEndian)) {
+        std::fputs(aac ? "tqovix: --little-endian is for PCM sound\n" : kUsage, stderr);
         return 2;
     }
 
@@ -53,16 +108,39 @@ int MakeSampleCommand(const Arguments& arguments)
     recipe.video.width = 320;
     recipe.video.height = 180;
     recipe.video.frameCount = static_cast<uint32_t>(seconds * 30000 / 1001);
-    recipe.sound.codec = littleEndian ? moviekit::SoundCodec::Sowt : moviekit::SoundCodec::Twos;
+    recipe.sound.sampleRate = kSampleRate;
+    recipe.sound.channels = kChannels;
+    recipe.sound.codec = aac ? moviekit::SoundCodec::Aac
+                             : (littleEndian ? moviekit::SoundCodec::Sowt : moviekit::SoundCodec::Twos);
     recipe.keepSoundBytes = false;
+    const uint64_t frames = moviekit::FramesForVideo(recipe.video, recipe.video.frameCount, kSampleRate);
+    const uint64_t n = aac ? moviekit::DivCeil(frames, 1024) * 1024 : frames;
+    const std::vector<moviekit::AfInterval> intervals = {{n / 4, n / 4 + n / 10, 800}, {n / 2, n / 2 + n / 8, 500}};
+    recipe.maker.afIntervals = intervals;
+    if (!aac && seconds <= kMaxExplicitSoundSeconds) {
+        recipe.sound.pcm = ToneWithMotorNoise(frames, intervals);
+    }
+    if (sizeGib > 0) {
+        // Sound and the atoms besides the frames are small beside the video: the frames take the rest.
+        const auto target = static_cast<uint64_t>(sizeGib * (1ULL << 30));
+        const uint64_t sound = aac ? frames / 4 : frames * kChannels * 2;
+        const uint64_t natural = uint64_t{recipe.video.width} * recipe.video.height * 3;
+        const uint64_t frameBytes = target > sound ? (target - sound) / recipe.video.frameCount : 0;
+        if (frameBytes > kMaxFrameBytes) {
+            std::fprintf(stderr, "tqovix: %.1f GiB needs video frames over 64 MiB; give more --seconds\n", sizeGib);
+            return 2;
+        }
+        recipe.video.frameSize = static_cast<uint32_t>(std::max(natural, frameBytes));
+    }
     moviekit::MovieLayout layout;
     std::string error;
     if (!moviekit::WriteMovie(destination, recipe, &layout, &error)) {
         std::fprintf(stderr, "tqovix: %s: %s\n", destination.c_str(), error.c_str());
+        std::remove(destination.c_str());
         return 1;
     }
-    std::printf("%s: %llu bytes, %zu video chunks, %zu sound chunks\n", destination.c_str(),
+    std::printf("%s: %llu bytes, %zu video chunks, %zu sound chunks (%s)\n", destination.c_str(),
                 static_cast<unsigned long long>(layout.fileSize), layout.videoChunks.size(),
-                layout.soundChunks.size());
+                layout.soundChunks.size(), aac ? "AAC" : littleEndian ? "PCM sowt" : "PCM twos");
     return 0;
 }

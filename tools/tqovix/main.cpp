@@ -10,10 +10,15 @@ constexpr const char* kUsage =
     "usage: tqovix COMMAND [ARGS]\n"
     "\n"
     "commands:\n"
-    "  inspect FILE            print the atom tree of a movie with offsets and sizes\n"
-    "  make-sample DST [opts]  write a camera-style movie (see tqovix make-sample --help)\n"
+    "  check FILE...              tell whether each movie can be processed, or why not\n"
+    "  process SRC DST [opts]     remove the AF noise of SRC's sound, writing DST\n"
+    "  batch -o OUTDIR FILE...    process many movies, several at a time\n"
+    "  inspect FILE [--json]      atom tree, tracks, trim tags and maker data of a movie\n"
+    "  make-sample DST [opts]     write a camera-style movie to try the others on\n"
     "\n"
-    "  --version               print the version\n";
+    "  tqovix COMMAND --help      the options of a command\n"
+    "\n"
+    "  --version                  print the version\n";
 
 }  // namespace
 
@@ -33,6 +38,15 @@ int main(int argc, char** argv)
     }
     if (std::strcmp(argv[1], "make-sample") == 0) {
         return MakeSampleCommand(arguments);
+    }
+    if (std::strcmp(argv[1], "check") == 0) {
+        return CheckCommand(arguments);
+    }
+    if (std::strcmp(argv[1], "process") == 0) {
+        return ProcessCommand(arguments);
+    }
+    if (std::strcmp(argv[1], "batch") == 0) {
+        return BatchCommand(arguments);
     }
     std::fprintf(stderr, "tqovix: unknown command '%s'\n%s", argv[1], kUsage);
     return 2;

@@ -1,0 +1,125 @@
+#include "FuzzTargets.h"
+
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <string>
+#include <thread>
+
+#include "atom/CTqovixAtomControl.h"
+#include "engine/CTqovixMainFrame.h"
+#include "file/CTqovixFile.h"
+#include "visitor/CTqovixAudioDataVisitor.h"
+#include "visitor/CTqovixAudioInformationVisitor.h"
+#include "visitor/CTqovixMakerBlockVisitor.h"
+#include "visitor/CTqovixMovieDataVisitor.h"
+#include "visitor/CTqovixTrimInformationVisitor.h"
+
+namespace fuzztarget {
+
+namespace {
+
+// The input as a file in a private directory, removed with the object.
+class InputFile {
+public:
+    InputFile(const uint8_t* data, size_t size)
+    {
+        char pattern[] = "/tmp/tqovix-fuzz-XXXXXX";
+        if (mkdtemp(pattern) != nullptr) {
+            m_directory = pattern;
+        }
+        m_path = m_directory + "/input.mov";
+        if (FILE* file = std::fopen(m_path.c_str(), "wb")) {
+            if (size != 0) {
+                std::fwrite(data, 1, size, file);
+            }
+            std::fclose(file);
+        }
+    }
+    ~InputFile()
+    {
+        unlink(m_path.c_str());
+        unlink(Output().c_str());
+        rmdir(m_directory.c_str());
+    }
+    const std::string& Path() const { return m_path; }
+    std::string Output() const { return m_directory + "/output.mov"; }
+
+private:
+    std::string m_directory;
+    std::string m_path;
+};
+
+}  // namespace
+
+int AtomTree(const uint8_t* data, size_t size)
+{
+    InputFile input(data, size);
+    CTqovixFile file;
+    if (TqovixFailed(file.Open(input.Path().c_str(), 1))) {
+        return 0;
+    }
+    CTqovixAtomControl tree;
+    if (TqovixFailed(tree.Initialize(file))) {
+        return 0;
+    }
+    CTqovixAudioInformationVisitor information;
+    if (!TqovixFailed(tree.Analyze(information))) {
+        CTqovixAudioDataVisitor audio;
+        std::vector<TqovixChunkInformation> chunks;
+        if (!TqovixFailed(tree.Analyze(audio))) {
+            const uint32_t frameBytes = (uint32_t{information.GetSize()} * information.GetChannel()) >> 3;
+            audio.GetAudioChunkInformation(chunks, frameBytes);
+        }
+    }
+    CTqovixMovieDataVisitor video;
+    std::vector<TqovixChunkInformation> videoChunks;
+    if (!TqovixFailed(tree.Analyze(video))) {
+        video.GetOffset(videoChunks);
+    }
+    CTqovixTrimInformationVisitor trim;
+    tree.Analyze(trim);
+    CTqovixAFInformationVisitor af;
+    tree.Analyze(af);
+    CTqovixAudioLevelInformationVisitor level;
+    tree.Analyze(level);
+    return 0;
+}
+
+int Property(const uint8_t* data, size_t size)
+{
+    InputFile input(data, size);
+    CTqovixMainFrame engine;
+    g_pMainFrame = &engine;
+    if (!TqovixFailed(engine.Initialize())) {
+        engine.GetProperty(input.Path().c_str());
+    }
+    engine.Close();
+    g_pMainFrame = nullptr;
+    return 0;
+}
+
+int Job(const uint8_t* data, size_t size)
+{
+    InputFile input(data, size);
+    CTqovixMainFrame engine;
+    g_pMainFrame = &engine;
+    if (!TqovixFailed(engine.Initialize()) &&
+        !TqovixFailed(engine.Execute(input.Path().c_str(), input.Output().c_str(), 0))) {
+        // A job that does not end in time is a hang worth reporting.
+        const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+        while (engine.GetProcessingState() == eTqovixRunning) {
+            if (std::chrono::steady_clock::now() > deadline) {
+                std::abort();
+            }
+            std::this_thread::sleep_for(std::chrono::microseconds(100));
+        }
+    }
+    engine.Close();
+    g_pMainFrame = nullptr;
+    return 0;
+}
+
+}  // namespace fuzztarget

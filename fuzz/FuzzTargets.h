@@ -1,0 +1,18 @@
+// The fuzzed entry points, shared by the libFuzzer programs and the replay of kept inputs.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+
+namespace fuzztarget {
+
+// The atom tree parser with its acceptance rules, then every reading walk over what it built
+// (sound format with its decoder configuration, sample tables, video chunks, trim tags through
+// the tag cursor, AF and audio level blocks).
+int AtomTree(const uint8_t* data, size_t size);
+// The property query over a movie made of the input.
+int Property(const uint8_t* data, size_t size);
+// A whole job over a movie made of the input, through the real processing library.
+int Job(const uint8_t* data, size_t size);
+
+}  // namespace fuzztarget

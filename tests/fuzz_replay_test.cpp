@@ -1,0 +1,69 @@
+// The fuzzed entry points over every kept input in fuzz/regressions and over deterministic
+// mutations of moviekit movies, so each compiler's sanitizers see them on every run.
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <random>
+
+#include "FuzzTargets.h"
+#include "Movie.h"
+#include "support/TestSupport.h"
+
+namespace {
+
+using Target = int (*)(const uint8_t*, size_t);
+
+TEST(FuzzReplayTest, KeptInputsRunCleanly)
+{
+    const std::filesystem::path root = TQOVIX_FUZZ_REGRESSIONS;
+    size_t inputs = 0;
+    for (const auto& [name, target] : {std::pair<const char*, Target>{"atomtree", fuzztarget::AtomTree},
+                                       {"property", fuzztarget::Property},
+                                       {"job", fuzztarget::Job}}) {
+        const std::filesystem::path directory = root / name;
+        if (!std::filesystem::is_directory(directory)) {
+            continue;
+        }
+        for (const auto& entry : std::filesystem::directory_iterator(directory)) {
+            SCOPED_TRACE(entry.path().string());
+            const std::vector<uint8_t> bytes = testsupport::ReadFile(entry.path().string());
+            EXPECT_EQ(target(bytes.data(), bytes.size()), 0);
+            ++inputs;
+        }
+    }
+    RecordProperty("inputs", static_cast<int>(inputs));
+}
+
+// Truncations and byte changes of a real movie: every one must end in a result, not a crash.
+TEST(FuzzReplayTest, MutatedMoviesRunCleanly)
+{
+    moviekit::MovieSpec pcm;
+    pcm.video.frameCount = 6;
+    pcm.video.framesPerChunk = 3;
+    pcm.sound.sampleCount = 2400;
+    moviekit::MovieSpec aac = pcm;
+    aac.sound.codec = moviekit::SoundCodec::Aac;
+    aac.sound.sampleCount = 4;
+    std::mt19937 random(7);
+    for (const moviekit::MovieSpec& recipe : {pcm, aac}) {
+        const std::vector<uint8_t> movie = moviekit::BuildMovie(recipe);
+        ASSERT_FALSE(movie.empty());
+        for (int k = 0; k < 120; ++k) {
+            std::vector<uint8_t> bytes = movie;
+            if (k % 4 == 0) {
+                bytes.resize(random() % bytes.size());
+            } else {
+                for (int flips = 1 + k % 3; flips > 0; --flips) {
+                    bytes[random() % bytes.size()] = static_cast<uint8_t>(random());
+                }
+            }
+            EXPECT_EQ(fuzztarget::AtomTree(bytes.data(), bytes.size()), 0);
+            EXPECT_EQ(fuzztarget::Property(bytes.data(), bytes.size()), 0);
+            if (k % 6 == 0) {
+                EXPECT_EQ(fuzztarget::Job(bytes.data(), bytes.size()), 0);
+            }
+        }
+    }
+}
+
+}  // namespace

@@ -1,0 +1,255 @@
+// tqovix process: one job through the exported interface, with a progress display and
+// Ctrl-C turned into an orderly abort (the library then deletes the destination).
+#include <algorithm>
+#include <chrono>
+#include <csignal>
+#include <cstdint>
+#include <cstdio>
+#include <string>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+#include <thread>
+#include <unistd.h>
+
+#include "Commands.h"
+#include "api/TqOVIXUtility.h"
+
+namespace {
+
+constexpr const char* kUsage =
+    "usage: tqovix process SRC DST [--force] [--quiet] [--json]\n"
+    "  removes the AF noise from the sound of SRC and writes the result to DST\n"
+    "  --force   overwrite an existing DST\n"
+    "  --quiet   no progress and no \"done\" line\n"
+    "  --json    print one JSON object with the outcome instead of text\n"
+    "  Ctrl-C aborts the job; DST is then removed. Exit status: 0 done, 1 failed,\n"
+    "  2 usage error or DST exists, 130 aborted\n";
+
+constexpr auto kPollInterval = std::chrono::milliseconds(50);
+// How long an abort may take before the library is closed under the job.
+constexpr double kAbortGraceSeconds = 30;
+
+volatile std::sig_atomic_t g_signal = 0;
+
+void OnSignal(int number) { g_signal = number; }
+
+double SecondsSince(std::chrono::steady_clock::time_point start)
+{
+    return std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
+}
+
+std::string Clock(double seconds)
+{
+    const long total = static_cast<long>(seconds + 0.5);
+    char text[32];
+    if (total >= 3600) {
+        std::snprintf(text, sizeof text, "%ld:%02ld:%02ld", total / 3600, total / 60 % 60, total % 60);
+    } else {
+        std::snprintf(text, sizeof text, "%ld:%02ld", total / 60, total % 60);
+    }
+    return text;
+}
+
+// Progress on stderr: a bar redrawn in place on a terminal, a plain line at most once a
+// second otherwise.
+class ProgressView {
+public:
+    ProgressView(bool quiet, double sourceBytes)
+        : m_quiet(quiet), m_terminal(isatty(STDERR_FILENO) == 1), m_sourceBytes(sourceBytes)
+    {
+    }
+
+    void Show(double fraction, double elapsed)
+    {
+        if (m_quiet) {
+            return;
+        }
+        const int percent = static_cast<int>(fraction * 100);
+        if (m_terminal) {
+            DrawBar(fraction, percent, elapsed);
+        } else if (percent != m_lastPercent && (elapsed - m_lastLine >= 1 || percent == 100)) {
+            std::fprintf(stderr, "progress %d%%\n", percent);
+            m_lastPercent = percent;
+            m_lastLine = elapsed;
+        }
+    }
+
+    // Ends the bar's line so that what follows starts on a fresh one.
+    void Close()
+    {
+        if (m_drawn) {
+            std::fputc('\n', stderr);
+            m_drawn = false;
+        }
+    }
+
+private:
+    void DrawBar(double fraction, int percent, double elapsed)
+    {
+        winsize size{};
+        const int columns = ioctl(STDERR_FILENO, TIOCGWINSZ, &size) == 0 && size.ws_col > 0 ? size.ws_col : 80;
+        char rate[32] = "";
+        char left[32] = "--:-- left";
+        if (elapsed > 0.2 && fraction > 0) {
+            std::snprintf(rate, sizeof rate, "%.1f MB/s", m_sourceBytes * fraction / elapsed / 1e6);
+            if (fraction < 1) {
+                std::snprintf(left, sizeof left, "%s left", Clock(elapsed * (1 - fraction) / fraction).c_str());
+            } else {
+                std::snprintf(left, sizeof left, "%s total", Clock(elapsed).c_str());
+            }
+        }
+        char tail[96];
+        std::snprintf(tail, sizeof tail, " %3d%%  %s  %s", percent, rate, left);
+        const int width = std::max(10, std::min(50, columns - static_cast<int>(std::string(tail).size()) - 3));
+        const int filled = static_cast<int>(fraction * width);
+        std::string bar = "\r[" + std::string(filled, '#') + std::string(width - filled, '.') + "]" + tail;
+        std::fputs(bar.c_str(), stderr);
+        std::fputs("\033[K", stderr);
+        std::fflush(stderr);
+        m_drawn = true;
+    }
+
+    bool m_quiet;
+    bool m_terminal;
+    double m_sourceBytes;
+    bool m_drawn = false;
+    int m_lastPercent = -1;
+    double m_lastLine = -1;
+};
+
+struct Options {
+    std::string source;
+    std::string destination;
+    bool force = false;
+    bool quiet = false;
+    bool json = false;
+};
+
+// 0 when the arguments are complete, otherwise the exit status (0 too for --help, via `done`).
+int Parse(const Arguments& arguments, Options& options, bool& done)
+{
+    Arguments paths;
+    for (const std::string& argument : arguments) {
+        if (argument == "--help") {
+            std::fputs(kUsage, stdout);
+            done = true;
+            return 0;
+        }
+        if (argument == "--force") {
+            options.force = true;
+        } else if (argument == "--quiet") {
+            options.quiet = true;
+        } else if (argument == "--json") {
+            options.json = true;
+        } else if (argument.size() > 1 && argument[0] == '-') {
+            std::fprintf(stderr, "tqovix process: unknown option '%s'\n%s", argument.c_str(), kUsage);
+            return 2;
+        } else {
+            paths.push_back(argument);
+        }
+    }
+    if (paths.size() != 2) {
+        std::fputs(kUsage, stderr);
+        return 2;
+    }
+    options.source = paths[0];
+    options.destination = paths[1];
+    return 0;
+}
+
+void Report(const Options& options, const char* result, const std::string& message, double seconds)
+{
+    std::printf("{\"source\":%s,\"destination\":%s,\"result\":%s,\"message\":%s,\"seconds\":%.3f}\n",
+                JsonString(options.source).c_str(), JsonString(options.destination).c_str(), result,
+                JsonString(message).c_str(), seconds);
+}
+
+}  // namespace
+
+int ProcessCommand(const Arguments& arguments)
+{
+    Options options;
+    bool done = false;
+    if (const int status = Parse(arguments, options, done); status != 0 || done) {
+        return status;
+    }
+    struct stat info{};
+    if (!options.force && lstat(options.destination.c_str(), &info) == 0) {
+        const std::string message = "destination exists (use --force to overwrite it)";
+        if (options.json) {
+            Report(options, "null", message, 0);
+        } else {
+            std::fprintf(stderr, "tqovix: %s: %s\n", options.destination.c_str(), message.c_str());
+        }
+        return 2;
+    }
+    const double sourceBytes = stat(options.source.c_str(), &info) == 0 ? static_cast<double>(info.st_size) : 0;
+
+    struct sigaction action{};
+    action.sa_handler = OnSignal;
+    sigemptyset(&action.sa_mask);
+    sigaction(SIGINT, &action, nullptr);
+    sigaction(SIGTERM, &action, nullptr);
+
+    const auto start = std::chrono::steady_clock::now();
+    ProgressView view(options.quiet || options.json, sourceBytes);
+    int code = TqInitializeOVIX();
+    if (code == 0) {
+        code = TqExecuteOVIX(options.source.c_str(), options.destination.c_str());
+    }
+    const bool started = code == 0;
+    double abortedAt = -1;
+    while (code == 0) {
+        const int state = TqIsFinishedOVIX();
+        if (state != 0) {
+            code = state == 1 ? 0 : state;
+            break;
+        }
+        const double elapsed = SecondsSince(start);
+        if (g_signal != 0 && abortedAt < 0) {
+            TqAbortOVIX();  // the job ends at the library's next call into us
+            abortedAt = elapsed;
+        }
+        if (abortedAt >= 0 && elapsed - abortedAt > kAbortGraceSeconds) {
+            code = 200;  // closing the library below stops the job and removes DST
+            break;
+        }
+        int first = 0;
+        int second = 0;
+        TqGetProgressOVIX(&first, &second);
+        // Frame counts travel as unsigned 32-bit values in ints.
+        const double total = static_cast<uint32_t>(second);
+        const double fraction = total > 0 ? std::min(1.0, static_cast<uint32_t>(first) / total) : 0;
+        view.Show(fraction, elapsed);
+        std::this_thread::sleep_for(kPollInterval);
+    }
+    const double seconds = SecondsSince(start);
+    if (code == 0) {
+        view.Show(1.0, seconds);  // the library resets its progress once the job has finished
+    }
+    view.Close();
+    TqCloseOVIX();
+    // The library keeps what a job wrote when the processing library itself refused the
+    // sound (a verdict, not an error); a user asked for a finished movie or none.
+    if (started && code != 0) {
+        unlink(options.destination.c_str());
+    }
+
+    const std::string message = code == 0 ? "done" : DescribeResult(code);
+    if (options.json) {
+        Report(options, std::to_string(code).c_str(), message, seconds);
+    } else if (code == 0) {
+        if (!options.quiet) {
+            std::printf("%s: done\n", options.destination.c_str());
+        }
+    } else {
+        const bool aboutDestination = code == 111 || code == 121 || code == 130 || code == 131;
+        std::fprintf(stderr, "tqovix: %s: %s\n", (aboutDestination ? options.destination : options.source).c_str(),
+                     message.c_str());
+    }
+    std::fflush(stdout);
+    if (code == 200 && g_signal != 0) {
+        return 128 + g_signal;
+    }
+    return code == 0 ? 0 : 1;
+}
