@@ -179,6 +179,15 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeTracks()
         TqovixFailed(TqovixCheckChunksInFile(m_movieDataChunks, size))) {
         return eTqovixErrorInvalidMovie;
     }
+    // A track that claims more sound than its chunks hold would have the library pull
+    // silence for as long as the claim says: refuse it.
+    uint64_t chunkSamples = 0;
+    for (const TqovixChunkInformation& chunk : m_audioChunks) {
+        chunkSamples += chunk.sampleCount;
+    }
+    if (information.GetCount() > chunkSamples) {
+        return eTqovixErrorInvalidMovie;
+    }
     result = m_audioDataControl.Initialize(m_sourceFile, m_audioChunks, information.IsBigEndianFormat());
     if (TqovixFailed(result)) {
         return result;
