@@ -1,36 +1,523 @@
 // Whole jobs through the exported API on moviekit movies, judged by ffprobe and ffmpeg.
 #include "host/JobHarness.h"
 
+#include <signal.h>
+#include <sys/mount.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/statvfs.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cerrno>
+#include <cmath>
+#include <cstring>
+#include <filesystem>
+#include <numbers>
+
 namespace {
 
 using jobtest::HostTest;
+using moviekit::AfInterval;
+using moviekit::SoundCodec;
 
-class JobTest : public HostTest {};
+constexpr int kDone = 1;
+constexpr int kAborted = 200;
+constexpr int kAlreadyProcessed = 20;
+constexpr char kSoftwareName[] = "VELDA OVIX Utility";
+constexpr uint64_t k4GiB = uint64_t{1} << 32;
+// Frames around an AF interval that may differ: the edit list's shift, the ramps, AAC frames.
+constexpr uint64_t kMargin = 4096;
+// Inside the default movie's sound (48 048 PCM frames, 47 AAC packets).
+const std::vector<AfInterval> kIntervals = {{8000, 18000, 1000}, {28000, 40000, 500}};
 
-TEST_F(JobTest, PcmSmoke)
+std::vector<uint8_t> MoovBytes(const std::string& path)
 {
-    moviekit::MovieSpec recipe;
-    const std::string source = Write(recipe, "src.mov");
-    const std::string destination = m_dir.File("dst.mov");
-    EXPECT_EQ(Run(source, destination), 1);
-    EXPECT_EQ(jobtest::ProbeErrors(destination), "");
-    EXPECT_EQ(jobtest::PacketHashes(source, "v:0"), jobtest::PacketHashes(destination, "v:0"));
-    EXPECT_EQ(TqGetPropertyOVIX(destination.c_str()), 20);
+    for (const jobtest::TopAtom& atom : jobtest::TopLevelAtoms(path)) {
+        if (atom.type == "moov") {
+            return jobtest::ReadRange(path, atom.offset, atom.size);
+        }
+    }
+    return {};
 }
 
-}  // namespace
+bool NearInterval(uint64_t frame, const std::vector<AfInterval>& intervals)
+{
+    for (const AfInterval& span : intervals) {
+        if (frame + kMargin >= span.startFrame && frame < span.endFrame + kMargin) {
+            return true;
+        }
+    }
+    return false;
+}
 
-namespace {
-TEST_F(JobTest, AacSmoke)
+class JobTest : public HostTest {
+protected:
+    // What every completed job leaves, whatever the layout; returns the destination's mdat.
+    // `video`: the source's video packets, unless its PacketHashes are wanted.
+    jobtest::TopAtom ExpectCompleteDestination(const std::string& source, const std::string& destination,
+                                               uint32_t videoFrames, std::vector<std::string> video = {})
+    {
+        EXPECT_EQ(jobtest::ProbeErrors(destination), "");
+        if (video.empty()) {
+            video = jobtest::PacketHashes(source, "v:0");
+        }
+        EXPECT_EQ(video.size(), videoFrames);
+        EXPECT_EQ(jobtest::PacketHashes(destination, "v:0"), video);
+        EXPECT_EQ(TqGetPropertyOVIX(destination.c_str()), kAlreadyProcessed);
+        EXPECT_TRUE(jobtest::Contains(MoovBytes(destination), kSoftwareName));
+        EXPECT_FALSE(jobtest::Contains(MoovBytes(source), kSoftwareName));
+        // One media-data atom, and the movie atom last, ending with the file.
+        const std::vector<jobtest::TopAtom> atoms = jobtest::TopLevelAtoms(destination);
+        jobtest::TopAtom mdat;
+        int mdats = 0;
+        for (const jobtest::TopAtom& atom : atoms) {
+            if (atom.type == "mdat") {
+                mdat = atom;
+                ++mdats;
+            }
+        }
+        EXPECT_EQ(mdats, 1);
+        EXPECT_TRUE(!atoms.empty() && atoms.back().type == "moov" &&
+                    atoms.back().offset + atoms.back().size == std::filesystem::file_size(destination));
+        return mdat;
+    }
+
+    // PCM leaves untouched outside the AF intervals and changed inside them.
+    void ExpectPcmProcessedOnlyInside(const std::string& source, const std::string& destination,
+                                      const std::vector<AfInterval>& intervals, uint32_t channels)
+    {
+        std::vector<int16_t> before;
+        std::vector<int16_t> after;
+        ASSERT_TRUE(jobtest::DecodeSound(source, before));
+        ASSERT_TRUE(jobtest::DecodeSound(destination, after));
+        ASSERT_FALSE(before.empty());
+        ASSERT_EQ(after.size(), before.size());
+        uint64_t changedOutside = 0;
+        std::vector<uint64_t> inside(intervals.size());
+        std::vector<uint64_t> changedInside(intervals.size());
+        for (uint64_t f = 0; f < before.size() / channels; ++f) {
+            const auto from = static_cast<std::ptrdiff_t>(f * channels);
+            const bool changed =
+                !std::equal(before.begin() + from, before.begin() + from + channels, after.begin() + from);
+            for (size_t i = 0; i < intervals.size(); ++i) {
+                if (f >= intervals[i].startFrame + kMargin && f + kMargin < intervals[i].endFrame) {
+                    ++inside[i];
+                    changedInside[i] += changed ? 1 : 0;
+                }
+            }
+            if (!NearInterval(f, intervals)) {
+                changedOutside += changed ? 1 : 0;
+            }
+        }
+        EXPECT_EQ(changedOutside, 0u);
+        for (size_t i = 0; i < intervals.size(); ++i) {
+            EXPECT_GT(inside[i], 0u);
+            EXPECT_GT(changedInside[i] * 2, inside[i]) << "AF interval " << i << " left as it was";
+        }
+    }
+};
+
+// ---- Successful jobs over the layouts cameras and tools produce ----
+
+struct Layout {
+    const char* name;
+    SoundCodec codec;
+    void (*shape)(moviekit::MovieSpec&);
+};
+
+class JobMatrix : public JobTest, public ::testing::WithParamInterface<Layout> {};
+
+TEST_P(JobMatrix, WritesACompleteMovie)
 {
     moviekit::MovieSpec recipe;
-    recipe.sound.codec = moviekit::SoundCodec::Aac;
+    recipe.sound.codec = GetParam().codec;
+    recipe.maker.afIntervals = kIntervals;
+    GetParam().shape(recipe);
+    moviekit::MovieLayout layout;
+    const std::string source = Write(recipe, "src.mov", &layout);
+    const std::string destination = m_dir.File("dst.mov");
+    ASSERT_EQ(TqGetPropertyOVIX(source.c_str()), 0);
+    const jobtest::FileStamp before = jobtest::StampFile(source);
+
+    ASSERT_EQ(Run(source, destination), kDone);
+    const jobtest::TopAtom mdat = ExpectCompleteDestination(source, destination, recipe.video.frameCount);
+    EXPECT_EQ(mdat.headerSize, 8u);  // far below 4 GiB, whatever header the source had
+    if (recipe.sound.codec == SoundCodec::Aac) {
+        EXPECT_EQ(jobtest::PacketCount(source, "a:0"), layout.soundSampleCount);
+        EXPECT_EQ(jobtest::PacketCount(destination, "a:0"), layout.soundSampleCount);
+        std::vector<int16_t> sourceSound;
+        std::vector<int16_t> destinationSound;
+        EXPECT_TRUE(jobtest::DecodeSound(source, sourceSound));
+        EXPECT_TRUE(jobtest::DecodeSound(destination, destinationSound));
+        EXPECT_EQ(destinationSound.size(), sourceSound.size());
+    } else {
+        ExpectPcmProcessedOnlyInside(source, destination, kIntervals, recipe.sound.channels);
+    }
+    EXPECT_TRUE(jobtest::StampFile(source) == before) << "the source changed";
+}
+
+const Layout kLayouts[] = {
+    {"Twos", SoundCodec::Twos, [](moviekit::MovieSpec&) {}},
+    {"Sowt", SoundCodec::Sowt, [](moviekit::MovieSpec&) {}},
+    {"Aac", SoundCodec::Aac, [](moviekit::MovieSpec&) {}},
+    {"TwosSoundFirst", SoundCodec::Twos,
+     [](moviekit::MovieSpec& r) { r.soundFirstInPeriod = r.soundTrackFirst = true; }},
+    {"AacSoundFirst", SoundCodec::Aac, [](moviekit::MovieSpec& r) { r.soundFirstInPeriod = r.soundTrackFirst = true; }},
+    {"SowtSmallChunks", SoundCodec::Sowt, [](moviekit::MovieSpec& r) { r.sound.samplesPerChunk = 1000; }},
+    {"TwosUnevenChunks", SoundCodec::Twos,
+     [](moviekit::MovieSpec& r) { r.sound.chunkSampleCounts = {1, 7001, 20000, 3, 21043}; }},
+    {"AacSmallChunks", SoundCodec::Aac, [](moviekit::MovieSpec& r) { r.sound.samplesPerChunk = 3; }},
+    {"AacUnevenChunksLastOfOne", SoundCodec::Aac,
+     [](moviekit::MovieSpec& r) { r.sound.chunkSampleCounts = {1, 20, 25, 1}; }},
+    {"TwosCo64", SoundCodec::Twos, [](moviekit::MovieSpec& r) { r.co64 = true; }},
+    {"AacCo64MoovFirst", SoundCodec::Aac, [](moviekit::MovieSpec& r) { r.co64 = r.moovBeforeMdat = true; }},
+    {"SowtMoovFirst", SoundCodec::Sowt, [](moviekit::MovieSpec& r) { r.moovBeforeMdat = true; }},
+    {"TwosThreeMdats", SoundCodec::Twos, [](moviekit::MovieSpec& r) { r.mdatCount = 3; }},
+    {"AacTwoMdatsSoundFirst", SoundCodec::Aac,
+     [](moviekit::MovieSpec& r) {
+         r.mdatCount = 2;
+         r.soundFirstInPeriod = true;
+     }},
+    {"SowtMdatSize64", SoundCodec::Sowt, [](moviekit::MovieSpec& r) { r.largeMdatHeader = true; }},
+    {"AacMdatSize64ThreeMdats", SoundCodec::Aac,
+     [](moviekit::MovieSpec& r) {
+         r.largeMdatHeader = true;
+         r.mdatCount = 3;
+     }},
+};
+
+INSTANTIATE_TEST_SUITE_P(Layouts, JobMatrix, ::testing::ValuesIn(kLayouts),
+                         [](const auto& info) { return std::string(info.param.name); });
+
+// ---- What the library does to the sound ----
+
+// AF information the library accepts but does not read as intervals: the sound is not touched.
+TEST_F(JobTest, ForeignAfPayloadLeavesPcmUntouched)
+{
+    for (SoundCodec codec : {SoundCodec::Twos, SoundCodec::Sowt}) {
+        moviekit::MovieSpec recipe;
+        recipe.sound.codec = codec;
+        recipe.maker.afPayload = moviekit::Bytes{'X', 'A', 'F', '9', 0, 1, 0, 0, 0, 0, 0xBB, 0x80, 0, 0, 0, 2};
+        const std::string name = codec == SoundCodec::Twos ? "twos" : "sowt";
+        const std::string source = Write(recipe, name + ".mov");
+        const std::string destination = m_dir.File(name + "-out.mov");
+        ASSERT_EQ(Run(source, destination), kDone) << name;
+        EXPECT_EQ(jobtest::ProbeErrors(destination), "") << name;
+        EXPECT_EQ(TqGetPropertyOVIX(destination.c_str()), TqGetPropertyOVIX(source.c_str())) << name;
+        std::vector<int16_t> before;
+        std::vector<int16_t> after;
+        ASSERT_TRUE(jobtest::DecodeSound(source, before));
+        ASSERT_TRUE(jobtest::DecodeSound(destination, after));
+        EXPECT_FALSE(before.empty());
+        EXPECT_TRUE(after == before) << name << ": the sound changed";
+    }
+}
+
+// Voice-like: low tones that carry most of the energy, a little presence, slow envelopes.
+std::vector<int16_t> VoiceLike(uint64_t frames, uint32_t rate)
+{
+    std::vector<int16_t> pcm(frames * 2);
+    const double w = 2.0 * std::numbers::pi / rate;
+    for (uint64_t f = 0; f < frames; ++f) {
+        const double t = static_cast<double>(f);
+        const double syllable = 0.6 + 0.4 * std::sin(w * 3.3 * t);
+        const double breath = 0.5 + 0.5 * std::sin(w * 1.7 * t + 0.8);
+        const double voice = 5000 * std::sin(w * 220 * t) + 2500 * std::sin(w * 330 * t + 0.3);
+        const double presence = 900 * std::sin(w * 1870 * t) + 500 * std::sin(w * 3150 * t + 1.1);
+        pcm[2 * f] = static_cast<int16_t>(std::lround(syllable * voice + breath * presence));
+        pcm[2 * f + 1] = static_cast<int16_t>(std::lround(0.8 * breath * voice + syllable * presence));
+    }
+    return pcm;
+}
+
+std::vector<double> Mono(const std::vector<int16_t>& stereo)
+{
+    std::vector<double> mono(stereo.size() / 2);
+    for (size_t f = 0; f < mono.size(); ++f) {
+        mono[f] = stereo[2 * f] + stereo[2 * f + 1];
+    }
+    return mono;
+}
+
+// Normalised correlation of a[f] with b[f + lag] over the frames in [from, to) that `use` takes.
+template <typename Use>
+double Correlation(const std::vector<double>& a, const std::vector<double>& b, int64_t lag, int64_t from,
+                   int64_t to, Use use)
+{
+    double ab = 0;
+    double aa = 0;
+    double bb = 0;
+    for (int64_t f = std::max<int64_t>({from, 0, -lag}); f < to && f + lag < static_cast<int64_t>(b.size()); ++f) {
+        if (use(f)) {
+            ab += a[f] * b[f + lag];
+            aa += a[f] * a[f];
+            bb += b[f + lag] * b[f + lag];
+        }
+    }
+    return aa > 0 && bb > 0 ? ab / std::sqrt(aa * bb) : 0.0;
+}
+
+TEST_F(JobTest, AacSoundKeptOutsideAfIntervals)
+{
+    constexpr uint32_t kRate = 48000;
+    constexpr int64_t kEncoderLeadIn = 2048;
+    std::vector<moviekit::Bytes> packets;
+    ASSERT_TRUE(jobtest::EncodeAacPackets(VoiceLike(3 * kRate, kRate), kRate, 2, 192000, packets));
+    moviekit::MovieSpec recipe;
+    recipe.sound.codec = SoundCodec::Aac;
+    recipe.sound.aacPackets = packets;
+    recipe.video.frameCount = 90;
+    const AfInterval interval{48000, 96000, 1000};
+    recipe.maker.afIntervals = std::vector<AfInterval>{interval};
     const std::string source = Write(recipe, "src.mov");
     const std::string destination = m_dir.File("dst.mov");
-    EXPECT_EQ(Run(source, destination), 1);
+    ASSERT_EQ(Run(source, destination), kDone);
     EXPECT_EQ(jobtest::ProbeErrors(destination), "");
-    EXPECT_EQ(jobtest::PacketHashes(source, "v:0"), jobtest::PacketHashes(destination, "v:0"));
-    EXPECT_EQ(jobtest::PacketCount(source, "a:0"), jobtest::PacketCount(destination, "a:0"));
-    EXPECT_EQ(TqGetPropertyOVIX(destination.c_str()), 20);
+    EXPECT_EQ(jobtest::PacketCount(destination, "a:0"), packets.size());
+
+    std::vector<int16_t> sourceSound;
+    std::vector<int16_t> destinationSound;
+    ASSERT_TRUE(jobtest::DecodeSound(source, sourceSound));
+    ASSERT_TRUE(jobtest::DecodeSound(destination, destinationSound));
+    const std::vector<double> a = Mono(sourceSound);
+    const std::vector<double> b = Mono(destinationSound);
+    ASSERT_GT(a.size(), 2 * kRate);
+    // The re-encoding may delay the sound: take the lag that best matches a stretch before the interval.
+    auto all = [](int64_t) { return true; };
+    int64_t lag = 0;
+    double best = -2;
+    for (int64_t candidate = -4096; candidate <= 4096; ++candidate) {
+        const double c = Correlation(a, b, candidate, 8192, 8192 + 16384, all);
+        if (c > best) {
+            best = c;
+            lag = candidate;
+        }
+    }
+    EXPECT_LT(std::abs(lag), 1024) << "the sound moved against the video by more than a packet";
+    // The encoder gives up its first block of processed sound, so the first 1024 frames go quiet.
+    auto outside = [&](int64_t f) { return !NearInterval(static_cast<uint64_t>(f), {interval}); };
+    const auto end = static_cast<int64_t>(a.size());
+    EXPECT_GT(Correlation(a, b, lag, kEncoderLeadIn, end, outside), 0.99) << "lag " << lag;
+    // Inside, the low voice band is shelved down: most of the energy goes.
+    double before = 0;
+    double after = 0;
+    for (auto f = static_cast<int64_t>(interval.startFrame + kMargin); f + kMargin < interval.endFrame; ++f) {
+        before += a[f] * a[f];
+        after += b[f + lag] * b[f + lag];
+    }
+    EXPECT_LT(after, 0.5 * before) << "lag " << lag;
 }
+
+// ---- Jobs that end early: aborts and host answers ----
+
+std::atomic<int> g_calls{0};
+std::atomic<int> g_lastBlockCalls{0};  // notifications that report every frame done
+std::atomic<int> g_callsWhenActed{-1};
+std::atomic<int> g_actAt{0};           // act at this notification
+std::atomic<int> g_actAtLastBlock{0};  // or at this one of those reporting every frame done
+std::atomic<int> g_answer{0};          // what to answer when acting; 0: TqAbortOVIX instead
+
+int Notify(int first, int second)
+{
+    const int call = ++g_calls;
+    const int last = first == second ? ++g_lastBlockCalls : 0;
+    const bool act = call == g_actAt || (last != 0 && last == g_actAtLastBlock);
+    if (!act) {
+        return 0;
+    }
+    g_callsWhenActed = call;
+    if (g_answer == 0) {
+        TqAbortOVIX();
+    }
+    return g_answer;
+}
+
+struct Ending {
+    const char* name;
+    SoundCodec codec;
+    bool abortAtStart;  // TqAbortOVIX as soon as TqExecuteOVIX returns, on a 20 s movie
+    int actAt;
+    int actAtLastBlock;
+    int answer;
+    int expected;
+};
+
+class JobEnding : public JobTest, public ::testing::WithParamInterface<Ending> {};
+
+TEST_P(JobEnding, EndsAsTheHostAsked)
+{
+    const Ending& row = GetParam();
+    g_calls = 0;
+    g_lastBlockCalls = 0;
+    g_callsWhenActed = -1;
+    g_actAt = row.actAt;
+    g_actAtLastBlock = row.actAtLastBlock;
+    g_answer = row.answer;
+    moviekit::MovieSpec recipe;
+    recipe.sound.codec = row.codec;
+    if (row.abortAtStart) {
+        recipe.video.frameCount = 600;
+    }
+    const std::string source = Write(recipe, "src.mov");
+    const std::string destination = m_dir.File("dst.mov");
+    const jobtest::FileStamp before = jobtest::StampFile(source);
+    ASSERT_EQ(TqSetCallBackNotifyProgressOVIX(Notify), 0);
+
+    ASSERT_EQ(TqExecuteOVIX(source.c_str(), destination.c_str()), 0);
+    if (row.abortAtStart) {
+        TqAbortOVIX();
+    }
+    ASSERT_EQ(jobtest::WaitForJob(), row.expected);
+    if (!row.abortAtStart) {
+        EXPECT_NE(g_callsWhenActed.load(), -1) << "the callback never acted";
+        if (row.actAt != 0) {
+            EXPECT_EQ(g_callsWhenActed.load(), row.actAt);
+        }
+        // The request is acted on at the very next callback: the host hears nothing more.
+        EXPECT_EQ(g_calls.load(), g_callsWhenActed.load());
+    }
+    if (row.expected == kDone) {
+        ExpectCompleteDestination(source, destination, recipe.video.frameCount);
+        TqAbortOVIX();  // too late as well
+        EXPECT_EQ(TqIsFinishedOVIX(), kDone);
+        EXPECT_TRUE(jobtest::Exists(destination));
+    } else {
+        EXPECT_FALSE(jobtest::Exists(destination));
+    }
+    EXPECT_TRUE(jobtest::StampFile(source) == before) << "the source changed";
+    // The engine is ready for the next job.
+    ASSERT_EQ(TqSetCallBackNotifyProgressOVIX(nullptr), 0);
+    EXPECT_EQ(Run(source, m_dir.File("again.mov")), kDone);
+}
+
+const Ending kEndings[] = {
+    {"PcmAbortBeforeFirstAudio", SoundCodec::Twos, true, 0, 0, 0, kAborted},
+    {"AacAbortBeforeFirstAudio", SoundCodec::Aac, true, 0, 0, 0, kAborted},
+    {"PcmAbortMidway", SoundCodec::Sowt, false, 3, 0, 0, kAborted},
+    {"AacAbortMidway", SoundCodec::Aac, false, 3, 0, 0, kAborted},
+    // The last block is out, but the job ends only when the library reports its end.
+    {"PcmAbortAfterLastBlock", SoundCodec::Twos, false, 0, 1, 0, kAborted},
+    {"AacAbortAfterLastBlock", SoundCodec::Aac, false, 0, 1, 0, kAborted},
+    // Requested from the notification that reports the end: the job is already complete.
+    {"PcmAbortAfterCompletion", SoundCodec::Twos, false, 0, 2, 0, kDone},
+    {"AacAbortAfterCompletion", SoundCodec::Aac, false, 0, 2, 0, kDone},
+    {"PcmHostAnswers200", SoundCodec::Twos, false, 1, 0, 200, 200},
+    {"PcmHostAnswers120", SoundCodec::Sowt, false, 2, 0, 120, 120},
+    {"AacHostAnswers120", SoundCodec::Aac, false, 4, 0, 120, 120},
+};
+
+INSTANTIATE_TEST_SUITE_P(Endings, JobEnding, ::testing::ValuesIn(kEndings),
+                         [](const auto& info) { return std::string(info.param.name); });
+
+// ---- A destination volume that fills up ----
+
+// The file size limit of a child process stands in for a full volume.
+TEST_F(JobTest, DestinationPastFileSizeLimitFails)
+{
+    const std::string source = Write(moviekit::MovieSpec{}, "src.mov");
+    const std::string destination = m_dir.File("dst.mov");
+    ASSERT_GT(std::filesystem::file_size(source), 4u * 64 * 1024);
+    const pid_t child = fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        signal(SIGXFSZ, SIG_IGN);
+        const rlimit limit{64 * 1024, 64 * 1024};
+        if (setrlimit(RLIMIT_FSIZE, &limit) != 0) {
+            _exit(251);
+        }
+        if (TqExecuteOVIX(source.c_str(), destination.c_str()) != 0) {
+            _exit(250);
+        }
+        const int state = jobtest::WaitForJob();
+        TqCloseOVIX();  // joins the library's threads before the child goes
+        _exit(state < 0 ? 252 : state);
+    }
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFEXITED(status)) << "child ended by signal " << WTERMSIG(status);
+    // A write refused as too large (EFBIG) is a general failure.
+    EXPECT_EQ(WEXITSTATUS(status), 190);
+    EXPECT_FALSE(jobtest::Exists(destination));
+}
+
+// A small tmpfs with room for 95 % of the source: the start's free-space test passes, writing fails.
+TEST_F(JobTest, DestinationVolumeFillsUp)
+{
+    const std::string source = Write(moviekit::MovieSpec{}, "src.mov");
+    const std::string volume = m_dir.File("volume");
+    ASSERT_TRUE(std::filesystem::create_directory(volume));
+    const uint64_t room = std::filesystem::file_size(source) * 95 / 100 / 4096 * 4096;
+    if (mount("tmpfs", volume.c_str(), "tmpfs", 0, ("size=" + std::to_string(room)).c_str()) != 0) {
+        GTEST_SKIP() << "cannot mount a tmpfs here: " << std::strerror(errno);
+    }
+    struct Unmount {
+        std::string path;
+        ~Unmount() { umount2(path.c_str(), MNT_DETACH); }
+    } unmount{volume};
+    const std::string destination = volume + "/dst.mov";
+    ASSERT_EQ(TqExecuteOVIX(source.c_str(), destination.c_str()), 0);
+    EXPECT_EQ(jobtest::WaitForJob(), 130);
+    EXPECT_FALSE(jobtest::Exists(destination));
+}
+
+// ---- Past 4 GiB ----
+
+// 88 video frames of 48 MiB, left as holes in the source; the destination is written in full.
+TEST_F(JobTest, LargeMovieGetsA64BitMdat)
+{
+    struct statvfs volume {};
+    ASSERT_EQ(statvfs(m_dir.Path().c_str(), &volume), 0);
+    const uint64_t available = uint64_t{volume.f_bavail} * volume.f_frsize;
+    if (available < (uint64_t{10} << 30)) {
+        GTEST_SKIP() << "needs 10 GiB free in " << m_dir.Path() << ", has " << (available >> 20) << " MiB";
+    }
+    moviekit::MovieSpec recipe;
+    recipe.video.width = 4096;
+    recipe.video.height = 4096;
+    recipe.video.frameCount = 88;
+    recipe.video.framesPerChunk = 8;
+    recipe.keepSoundBytes = false;
+    recipe.maker.afIntervals = kIntervals;
+    moviekit::MovieLayout layout;
+    const std::string source = m_dir.File("src.mov");
+    std::string error;
+    ASSERT_TRUE(jobtest::WriteSparseMovie(source, recipe, 16 << 20, &layout, &error)) << error;
+    ASSERT_TRUE(layout.co64);
+    ASSERT_GT(layout.mdatPayloadSizes.at(0), k4GiB);
+    ASSERT_GT(layout.soundChunks.back().offset, k4GiB);
+    ASSERT_EQ(jobtest::TopLevelAtoms(source).back().type, "moov");
+    struct stat sourceBefore {};
+    ASSERT_EQ(stat(source.c_str(), &sourceBefore), 0);
+
+    const std::string destination = m_dir.File("dst.mov");
+    ASSERT_EQ(Run(source, destination), kDone);
+    // Every source frame is the same hole: hashing one stands for hashing them all.
+    const std::vector<std::string> frame = jobtest::FirstPacketHashes(source, "v:0", 1);
+    ASSERT_EQ(frame.size(), 1u);
+    ASSERT_EQ(std::stoull(frame[0]), layout.videoFrameSize) << frame[0];
+    const std::vector<std::string> video(recipe.video.frameCount, frame[0]);
+    const jobtest::TopAtom mdat = ExpectCompleteDestination(source, destination, recipe.video.frameCount, video);
+    const std::vector<uint8_t> header = jobtest::ReadRange(destination, mdat.offset, 16);
+    ASSERT_EQ(header.size(), 16u);
+    EXPECT_EQ(std::vector<uint8_t>(header.begin(), header.begin() + 8),
+              (std::vector<uint8_t>{0, 0, 0, 1, 'm', 'd', 'a', 't'}));
+    uint64_t size = 0;
+    for (size_t k = 8; k < 16; ++k) {
+        size = size << 8 | header[k];
+    }
+    EXPECT_EQ(size, 16 + layout.mdatPayloadSizes[0]);
+    const std::vector<uint8_t> moov = MoovBytes(destination);
+    EXPECT_TRUE(jobtest::Contains(moov, "co64"));
+    EXPECT_FALSE(jobtest::Contains(moov, "stco"));
+    ExpectPcmProcessedOnlyInside(source, destination, kIntervals, recipe.sound.channels);
+    struct stat sourceAfter {};
+    ASSERT_EQ(stat(source.c_str(), &sourceAfter), 0);
+    EXPECT_EQ(sourceAfter.st_size, sourceBefore.st_size);
+    EXPECT_EQ(sourceAfter.st_mtim.tv_sec, sourceBefore.st_mtim.tv_sec);
+    EXPECT_EQ(sourceAfter.st_mtim.tv_nsec, sourceBefore.st_mtim.tv_nsec);
+}
+
 }  // namespace

@@ -1,9 +1,15 @@
 #include "host/JobHarness.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
+#include <algorithm>
 #include <sstream>
 #include <thread>
+#include <utility>
+
+#include "MovieWriter.h"
 
 namespace jobtest {
 
@@ -42,11 +48,13 @@ bool Exists(const std::string& path)
     return stat(path.c_str(), &info) == 0;
 }
 
-std::vector<std::string> PacketHashes(const std::string& path, const std::string& stream)
+namespace {
+
+std::vector<std::string> HashPackets(const std::string& path, const std::string& stream, const std::string& limit)
 {
     std::string output;
     const std::string command = "ffmpeg -v error -nostdin -i " + ShellQuote(path) + " -map 0:" + stream +
-                                " -c copy -f framemd5 - 2>&1";
+                                " -c copy" + limit + " -f framemd5 - 2>&1";
     std::vector<std::string> lines;
     if (RunCommand(command, &output) != 0) {
         lines.push_back("ffmpeg failed: " + output);
@@ -62,6 +70,18 @@ std::vector<std::string> PacketHashes(const std::string& path, const std::string
         lines.push_back(line.substr(cut + 1));
     }
     return lines;
+}
+
+}  // namespace
+
+std::vector<std::string> PacketHashes(const std::string& path, const std::string& stream)
+{
+    return HashPackets(path, stream, "");
+}
+
+std::vector<std::string> FirstPacketHashes(const std::string& path, const std::string& stream, uint64_t count)
+{
+    return HashPackets(path, stream, " -frames " + std::to_string(count));
 }
 
 std::string ProbeErrors(const std::string& path)
@@ -102,6 +122,178 @@ bool DecodeSound(const std::string& path, std::vector<int16_t>& samples)
         samples[k] = static_cast<int16_t>(bytes[2 * k] | (bytes[2 * k + 1] << 8));
     }
     return true;
+}
+
+std::vector<uint8_t> ReadRange(const std::string& path, uint64_t offset, uint64_t size)
+{
+    std::vector<uint8_t> bytes;
+    const int fd = open(path.c_str(), O_RDONLY);
+    if (fd < 0) {
+        return bytes;
+    }
+    bytes.resize(size);
+    uint64_t got = 0;
+    while (got < size) {
+        const ssize_t n = pread(fd, bytes.data() + got, size - got, static_cast<off_t>(offset + got));
+        if (n <= 0) {
+            break;
+        }
+        got += static_cast<uint64_t>(n);
+    }
+    close(fd);
+    bytes.resize(got);
+    return bytes;
+}
+
+std::vector<TopAtom> TopLevelAtoms(const std::string& path)
+{
+    std::vector<TopAtom> atoms;
+    struct stat info {};
+    if (stat(path.c_str(), &info) != 0) {
+        return atoms;
+    }
+    const auto fileSize = static_cast<uint64_t>(info.st_size);
+    auto be = [](const std::vector<uint8_t>& b, size_t at, size_t width) {
+        uint64_t value = 0;
+        for (size_t k = 0; k < width; ++k) {
+            value = value << 8 | b[at + k];
+        }
+        return value;
+    };
+    for (uint64_t offset = 0; offset + 8 <= fileSize;) {
+        const std::vector<uint8_t> header = ReadRange(path, offset, 16);
+        if (header.size() < 8) {
+            break;
+        }
+        TopAtom atom;
+        atom.type.assign(header.begin() + 4, header.begin() + 8);
+        atom.offset = offset;
+        atom.headerSize = 8;
+        atom.size = be(header, 0, 4);
+        if (atom.size == 1) {
+            if (header.size() < 16) {
+                break;
+            }
+            atom.headerSize = 16;
+            atom.size = be(header, 8, 8);
+        } else if (atom.size == 0) {
+            atom.size = fileSize - offset;
+        }
+        if (atom.size < atom.headerSize || atom.size > fileSize - offset) {
+            break;
+        }
+        atoms.push_back(atom);
+        offset += atom.size;
+    }
+    return atoms;
+}
+
+bool Contains(const std::vector<uint8_t>& bytes, const std::string& text)
+{
+    return std::search(bytes.begin(), bytes.end(), text.begin(), text.end()) != bytes.end();
+}
+
+namespace {
+
+class SparseFileSink : public moviekit::Sink {
+public:
+    SparseFileSink(const std::string& path, uint64_t holeBytes)
+        : m_fd(open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644)), m_holeBytes(holeBytes)
+    {
+    }
+    ~SparseFileSink() override
+    {
+        if (m_fd >= 0) {
+            close(m_fd);
+        }
+    }
+    bool IsOpen() const { return m_fd >= 0; }
+    bool Finish()
+    {
+        // A trailing hole only counts once the file is that long.
+        return ftruncate(m_fd, static_cast<off_t>(Written())) == 0 && close(std::exchange(m_fd, -1)) == 0;
+    }
+
+private:
+    bool Store(const uint8_t* data, size_t size) override
+    {
+        if (size >= m_holeBytes) {
+            return lseek(m_fd, static_cast<off_t>(size), SEEK_CUR) >= 0;
+        }
+        for (size_t done = 0; done < size;) {
+            const ssize_t n = write(m_fd, data + done, size - done);
+            if (n <= 0) {
+                return false;
+            }
+            done += static_cast<size_t>(n);
+        }
+        return true;
+    }
+
+    int m_fd;
+    uint64_t m_holeBytes;
+};
+
+}  // namespace
+
+bool WriteSparseMovie(const std::string& path, const moviekit::MovieSpec& recipe, uint64_t holeBytes,
+                      moviekit::MovieLayout* layout, std::string* error)
+{
+    SparseFileSink sink(path, holeBytes);
+    if (!sink.IsOpen()) {
+        *error = "cannot create " + path;
+        return false;
+    }
+    if (!moviekit::WriteMovieTo(sink, recipe, layout, error)) {
+        return false;
+    }
+    if (!sink.Finish()) {
+        *error = "cannot finish " + path;
+        return false;
+    }
+    return true;
+}
+
+bool EncodeAacPackets(const std::vector<int16_t>& pcm, uint32_t sampleRate, uint16_t channels, uint32_t bitRate,
+                      std::vector<std::vector<uint8_t>>& packets)
+{
+    testsupport::TempDir scratch;
+    const std::string raw = scratch.File("in.raw");
+    const std::string adts = scratch.File("out.aac");
+    std::vector<uint8_t> bytes(pcm.size() * 2);
+    for (size_t k = 0; k < pcm.size(); ++k) {
+        const auto bits = static_cast<uint16_t>(pcm[k]);
+        bytes[2 * k] = static_cast<uint8_t>(bits);
+        bytes[2 * k + 1] = static_cast<uint8_t>(bits >> 8);
+    }
+    if (!testsupport::WriteFile(raw, bytes)) {
+        return false;
+    }
+    std::string output;
+    const std::string command = "ffmpeg -v error -nostdin -f s16le -ar " + std::to_string(sampleRate) + " -ac " +
+                                std::to_string(channels) + " -i " + ShellQuote(raw) + " -c:a aac -b:a " +
+                                std::to_string(bitRate) + " -f adts " + ShellQuote(adts) + " 2>&1";
+    if (RunCommand(command, &output) != 0 || !output.empty()) {
+        return false;
+    }
+    const std::vector<uint8_t> stream = testsupport::ReadFile(adts);
+    packets.clear();
+    for (size_t at = 0; at + 7 <= stream.size();) {
+        const uint8_t* h = stream.data() + at;
+        // Sync word, one raw data block per frame, header of 7 bytes or 9 with its CRC.
+        if (h[0] != 0xFF || (h[1] & 0xF0) != 0xF0 || (h[6] & 0x03) != 0) {
+            return false;
+        }
+        const size_t header = (h[1] & 0x01) != 0 ? 7 : 9;
+        const size_t length = (size_t{h[3] & 0x03u} << 11) | (size_t{h[4]} << 3) | (h[5] >> 5);
+        if (length <= header || at + length > stream.size()) {
+            return false;
+        }
+        packets.emplace_back(stream.begin() + static_cast<std::ptrdiff_t>(at + header),
+                             stream.begin() + static_cast<std::ptrdiff_t>(at + length));
+        at += length;
+    }
+    return !packets.empty();
 }
 
 void HostTest::SetUp()

@@ -31,12 +31,34 @@ bool Exists(const std::string& path);
 
 // One line per packet of the stream: "size,hash" from ffmpeg's framemd5 of a stream copy.
 std::vector<std::string> PacketHashes(const std::string& path, const std::string& stream);
+// The same for the stream's first `count` packets only.
+std::vector<std::string> FirstPacketHashes(const std::string& path, const std::string& stream, uint64_t count);
 // ffprobe's verdict: empty when it reads every packet without complaint, else its messages.
 std::string ProbeErrors(const std::string& path);
 // Packets of one stream as ffprobe counts them.
 uint64_t PacketCount(const std::string& path, const std::string& stream);
 // Decodes the first sound stream to interleaved s16; false when ffmpeg reports an error.
 bool DecodeSound(const std::string& path, std::vector<int16_t>& samples);
+
+// A top-level atom as its header declares it (size 0 runs to the end of the file).
+struct TopAtom {
+    std::string type;
+    uint64_t offset = 0;
+    uint64_t headerSize = 0;
+    uint64_t size = 0;
+};
+// The file's top-level atoms in order; the walk stops at a header that does not fit the file.
+std::vector<TopAtom> TopLevelAtoms(const std::string& path);
+// Up to `size` bytes from `offset` on, without reading the rest of the file.
+std::vector<uint8_t> ReadRange(const std::string& path, uint64_t offset, uint64_t size);
+bool Contains(const std::vector<uint8_t>& bytes, const std::string& text);
+// Writes the movie as moviekit lays it out, but every single write of at least `holeBytes`
+// (video frames, when they are that large) becomes a hole that reads as zeros.
+bool WriteSparseMovie(const std::string& path, const moviekit::MovieSpec& recipe, uint64_t holeBytes,
+                      moviekit::MovieLayout* layout, std::string* error);
+// Raw AAC-LC packets (ADTS headers removed) that ffmpeg's encoder makes of interleaved s16.
+bool EncodeAacPackets(const std::vector<int16_t>& pcm, uint32_t sampleRate, uint16_t channels, uint32_t bitRate,
+                      std::vector<std::vector<uint8_t>>& packets);
 
 class HostTest : public ::testing::Test {
 protected:
