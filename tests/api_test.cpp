@@ -172,24 +172,6 @@ TEST_F(ApiTest, SecondInitializeLeavesTheEngineInPlace)
     EXPECT_TRUE(Exists(destination));
 }
 
-TEST_F(ApiTest, CloseDuringJobRemovesTheDestination)
-{
-    const std::string source = WriteLong("long.mov");
-    const std::string destination = m_dir.File("dst.mov");
-    const FileStamp before = StampFile(source);
-    ASSERT_EQ(TqExecuteOVIX(source.c_str(), destination.c_str()), 0);
-    TqCloseOVIX();
-    EXPECT_FALSE(Exists(destination));
-    EXPECT_EQ(StampFile(source), before);
-    EXPECT_EQ(TqIsFinishedOVIX(), 190);
-
-    ASSERT_EQ(TqInitializeOVIX(), 0);
-    EXPECT_EQ(TqIsFinishedOVIX(), 1);
-    const std::string shortSource = Write(moviekit::MovieSpec{}, "src.mov");
-    EXPECT_EQ(Run(shortSource, destination), 1);
-    EXPECT_TRUE(Exists(destination));
-}
-
 TEST_F(ApiTest, RepeatedCyclesReleaseThreadsAndDescriptors)
 {
     const std::string source = WriteLong("long.mov");
@@ -216,18 +198,6 @@ TEST_F(ApiTest, RepeatedCyclesReleaseThreadsAndDescriptors)
     }
     EXPECT_EQ(CountEntries("/proc/self/task"), threads);
     EXPECT_EQ(CountEntries("/proc/self/fd"), descriptors);
-}
-
-TEST_F(ApiTest, AbortDuringJobEndsWith200)
-{
-    const std::string source = WriteLong("long.mov");
-    const std::string destination = m_dir.File("dst.mov");
-    const FileStamp before = StampFile(source);
-    ASSERT_EQ(TqExecuteOVIX(source.c_str(), destination.c_str()), 0);
-    TqAbortOVIX();
-    EXPECT_EQ(WaitForJob(), 200);
-    EXPECT_FALSE(Exists(destination));
-    EXPECT_EQ(StampFile(source), before);
 }
 
 // ---- Refused job starts ----
@@ -319,37 +289,17 @@ TEST_F(ApiTest, CallbackCannotBeSetWhileJobRuns)
     EXPECT_TRUE(Exists(destination));
 }
 
-struct CallbackCase {
-    const char* name;
-    int answer;
-    int expected;
-};
-
-class CallbackTest : public ApiTest, public ::testing::WithParamInterface<CallbackCase> {};
-
-TEST_P(CallbackTest, AnswerDecidesTheJob)
+// Answers other than 0 are judged with whole jobs (job suite) and the scripted library
+// (engine suite); here the host sees the progress of a job it lets run.
+TEST_F(ApiTest, CallbackSeesRisingProgress)
 {
     moviekit::MovieLayout layout;
     const std::string source = Write(moviekit::MovieSpec{}, "src.mov", &layout);
-    const std::string destination = m_dir.File("dst.mov");
-    ResetCallback(GetParam().answer);
     ASSERT_EQ(TqSetCallBackNotifyProgressOVIX(HostCallback), 0);
-    EXPECT_EQ(Run(source, destination), GetParam().expected);
-    int first = -1;
-    int second = -1;
-    EXPECT_EQ(TqGetProgressOVIX(&first, &second), 0);
+    EXPECT_EQ(Run(source, m_dir.File("dst.mov")), 1);
     TqCloseOVIX();  // returns once the library's thread has left every callback
     const std::vector<std::pair<int, int>> seen = CallbackSeen();
-
-    if (GetParam().answer != 0) {
-        EXPECT_FALSE(Exists(destination));
-        EXPECT_EQ(seen.size(), 1u);
-        return;
-    }
-    EXPECT_TRUE(Exists(destination));
     const int total = static_cast<int>(layout.soundSampleCount);
-    EXPECT_EQ(first, total);
-    EXPECT_EQ(second, total);
     ASSERT_GE(seen.size(), 2u);
     for (size_t k = 0; k < seen.size(); ++k) {
         EXPECT_EQ(seen[k].second, total) << "call " << k;
@@ -357,14 +307,8 @@ TEST_P(CallbackTest, AnswerDecidesTheJob)
             EXPECT_GE(seen[k].first, seen[k - 1].first) << "call " << k;
         }
     }
-    EXPECT_LT(seen.front().first, seen.back().first);
     EXPECT_EQ(seen.back().first, total);
 }
-
-INSTANTIATE_TEST_SUITE_P(Answers, CallbackTest,
-                         ::testing::Values(CallbackCase{"Continue", 0, 1}, CallbackCase{"FileTooLarge", 131, 131},
-                                           CallbackCase{"Aborted", 200, 200}, CallbackCase{"Unknown", 5, 190}),
-                         [](const auto& info) { return std::string(info.param.name); });
 
 // ---- Property query ----
 

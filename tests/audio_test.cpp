@@ -296,34 +296,6 @@ TEST_F(AudioFileTest, AacPacketsDecodeInOrderAndSilenceFollowsTheTrack)
     EXPECT_TRUE(std::all_of(buffer.begin(), buffer.end(), [](uint8_t b) { return b == 0; }));
 }
 
-TEST_F(AudioFileTest, AacTrackOfACameraMovieIsDecodedPacketByPacketInTableOrder)
-{
-    moviekit::MovieSpec recipe;
-    recipe.sound.codec = moviekit::SoundCodec::Aac;
-    recipe.sound.samplesPerChunk = 7;
-    moviekit::MovieLayout layout;
-    const Bytes movie = moviekit::BuildMovie(recipe, &layout);
-    Open(movie);
-    for (const unsigned long request : {1UL, 333UL, 4096UL}) {
-        FakeAacControl control;
-        control.echo = true;
-        ASSERT_EQ(control.Initialize(m_file, testsupport::ChunkTableOf(layout.soundChunks, true), false), eTqovixSuccess);
-        Bytes delivered;
-        Bytes buffer(request);
-        while (delivered.size() < layout.soundBytes.size() + 5000) {
-            unsigned long size = 0;
-            ASSERT_EQ(control.PopAudioData(buffer.data(), &size, request), eTqovixSuccess);
-            ASSERT_EQ(size, request);
-            delivered.insert(delivered.end(), buffer.begin(), buffer.end());
-        }
-        EXPECT_EQ(Bytes(delivered.begin(), delivered.begin() + static_cast<std::ptrdiff_t>(layout.soundBytes.size())),
-                  layout.soundBytes);
-        EXPECT_TRUE(std::all_of(delivered.begin() + static_cast<std::ptrdiff_t>(layout.soundBytes.size()),
-                                delivered.end(), [](uint8_t b) { return b == 0; }));
-        EXPECT_EQ(control.decodeCalls, static_cast<int>(layout.soundSampleCount));
-    }
-}
-
 TEST_F(AudioFileTest, AacChunksWhoseSizesDoNotAddUpAreRefused)
 {
     Open(Bytes(64, 9));

@@ -206,29 +206,6 @@ Packets SilentPackets(size_t count)
     return packets;
 }
 
-TEST(AacRoundTripTest, ToneComesBackCleanWithOnePacketPerBlock)
-{
-    // The delay is measured on a lone burst: a steady tone would match at every period.
-    Pcm tone(94 * kBlockSamples, 0);
-    AddTone(tone, 4096, 6144);
-    AddTone(tone, 16384, 94 * 1024);
-    const Packets packets = EncodeBlocks(tone);
-    ASSERT_EQ(packets.size(), 94U);
-    EXPECT_TRUE(std::none_of(packets.begin(), packets.end(), [](const Packet& p) { return p.empty(); }));
-
-    const Pcm decoded = DecodeAll(packets, 0);
-    ASSERT_EQ(decoded.size(), tone.size());
-    const long delay = BestLag(tone, decoded, 3072, 4096, 4096);
-    ASSERT_GE(delay, 0);
-    double power = 0;
-    double noise = 0;
-    for (size_t i = 20000 * kChannels; i < 85536 * kChannels; ++i) {
-        power += std::pow(tone[i], 2);
-        noise += std::pow(tone[i] - decoded[i + static_cast<size_t>(delay) * kChannels], 2);
-    }
-    EXPECT_GT(10 * std::log10(power / std::max(noise, 1.0)), 30.0) << "delay " << delay;
-}
-
 TEST(AacRoundTripTest, ClickKeepsItsPositionThroughDecodeEncodeDecode)
 {
     // The source as the platform encoder would have made it: primed by 2112 frames.
