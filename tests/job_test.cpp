@@ -15,6 +15,7 @@
 #include <cmath>
 #include <cstring>
 #include <filesystem>
+#include <fstream>
 #include <numbers>
 
 namespace {
@@ -214,6 +215,31 @@ TEST_F(JobTest, ForeignAfPayloadLeavesPcmUntouched)
         EXPECT_FALSE(before.empty());
         EXPECT_TRUE(after == before) << name << ": the sound changed";
     }
+}
+
+bool CodecLibraryMapped()
+{
+    std::ifstream maps("/proc/self/maps");
+    std::string line;
+    while (std::getline(maps, line)) {
+        if (line.find("libavcodec.so") != std::string::npos) {
+            return true;
+        }
+    }
+    return false;
+}
+
+// A host that only ever handles PCM never pays for mapping the AAC codecs.
+TEST_F(JobTest, CodecLibrariesLoadOnlyForAac)
+{
+    moviekit::MovieSpec pcm;
+    pcm.video.frameCount = 30;
+    ASSERT_EQ(Run(Write(pcm, "pcm.mov"), m_dir.File("pcm-out.mov")), kDone);
+    EXPECT_FALSE(CodecLibraryMapped());
+    moviekit::MovieSpec aac = pcm;
+    aac.sound.codec = SoundCodec::Aac;
+    ASSERT_EQ(Run(Write(aac, "aac.mov"), m_dir.File("aac-out.mov")), kDone);
+    EXPECT_TRUE(CodecLibraryMapped());
 }
 
 // Voice-like: low tones that carry most of the energy, a little presence, slow envelopes.

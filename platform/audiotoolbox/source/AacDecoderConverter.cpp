@@ -23,8 +23,8 @@ OSStatus AacDecoderConverter::Create(const AudioStreamBasicDescription& aac, con
                                      int aacRate, std::unique_ptr<AacDecoderConverter>* converter)
 {
     auto created = std::make_unique<AacDecoderConverter>(aac, pcm, aacRate);
-    created->m_frame.reset(av_frame_alloc());
-    created->m_packet.reset(av_packet_alloc());
+    created->m_frame.reset(Libav().av_frame_alloc());
+    created->m_packet.reset(Libav().av_packet_alloc());
     if (created->m_frame == nullptr || created->m_packet == nullptr) {
         return kAudio_MemFullError;
     }
@@ -37,23 +37,23 @@ OSStatus AacDecoderConverter::Create(const AudioStreamBasicDescription& aac, con
 
 OSStatus AacDecoderConverter::Open(const std::vector<uint8_t>& config)
 {
-    const AVCodec* codec = avcodec_find_decoder(AV_CODEC_ID_AAC);
+    const AVCodec* codec = Libav().avcodec_find_decoder(AV_CODEC_ID_AAC);
     if (codec == nullptr || config.empty()) {
         return kAudioConverterErr_FormatNotSupported;
     }
-    CodecContextPtr context(avcodec_alloc_context3(codec));
+    CodecContextPtr context(Libav().avcodec_alloc_context3(codec));
     if (context == nullptr) {
         return kAudio_MemFullError;
     }
-    context->extradata = static_cast<uint8_t*>(av_mallocz(config.size() + AV_INPUT_BUFFER_PADDING_SIZE));
+    context->extradata = static_cast<uint8_t*>(Libav().av_mallocz(config.size() + AV_INPUT_BUFFER_PADDING_SIZE));
     if (context->extradata == nullptr) {
         return kAudio_MemFullError;
     }
     std::memcpy(context->extradata, config.data(), config.size());
     context->extradata_size = static_cast<int>(config.size());
     context->sample_rate = m_aacRate;
-    av_channel_layout_default(&context->ch_layout, static_cast<int>(m_output.mChannelsPerFrame));
-    if (avcodec_open2(context.get(), codec, nullptr) < 0) {
+    Libav().av_channel_layout_default(&context->ch_layout, static_cast<int>(m_output.mChannelsPerFrame));
+    if (Libav().avcodec_open2(context.get(), codec, nullptr) < 0) {
         return kAudioConverterErr_FormatNotSupported;
     }
     // A configuration that disagrees with the descriptions would change the PCM's shape.
@@ -63,12 +63,12 @@ OSStatus AacDecoderConverter::Open(const std::vector<uint8_t>& config)
     }
 
     SwrContext* resampler = nullptr;
-    if (swr_alloc_set_opts2(&resampler, &context->ch_layout, AV_SAMPLE_FMT_S16, m_aacRate, &context->ch_layout,
+    if (Libav().swr_alloc_set_opts2(&resampler, &context->ch_layout, AV_SAMPLE_FMT_S16, m_aacRate, &context->ch_layout,
                             AV_SAMPLE_FMT_FLTP, m_aacRate, 0, nullptr) < 0) {
         return kAudio_MemFullError;
     }
     ResamplerPtr ownedResampler(resampler);
-    if (swr_init(ownedResampler.get()) < 0) {
+    if (Libav().swr_init(ownedResampler.get()) < 0) {
         return kAudioConverterErr_FormatNotSupported;
     }
 
@@ -195,16 +195,16 @@ OSStatus AacDecoderConverter::DecodePacket(const uint8_t* data, UInt32 size)
     if (size == 0 || size > kAacMaxPacketBytesPerChannel * m_output.mChannelsPerFrame) {
         return kAudioConverterErr_InvalidInputSize;
     }
-    av_packet_unref(m_packet.get());
-    if (av_new_packet(m_packet.get(), static_cast<int>(size)) < 0) {
+    Libav().av_packet_unref(m_packet.get());
+    if (Libav().av_new_packet(m_packet.get(), static_cast<int>(size)) < 0) {
         return kAudio_MemFullError;
     }
     std::memcpy(m_packet->data, data, size);
-    if (avcodec_send_packet(m_context.get(), m_packet.get()) < 0) {
+    if (Libav().avcodec_send_packet(m_context.get(), m_packet.get()) < 0) {
         return kAudioConverterErr_UnspecifiedError;
     }
     for (;;) {
-        const int received = avcodec_receive_frame(m_context.get(), m_frame.get());
+        const int received = Libav().avcodec_receive_frame(m_context.get(), m_frame.get());
         if (received == AVERROR(EAGAIN)) {
             return noErr;
         }
@@ -212,7 +212,7 @@ OSStatus AacDecoderConverter::DecodePacket(const uint8_t* data, UInt32 size)
             return kAudioConverterErr_UnspecifiedError;
         }
         const OSStatus appended = AppendFrame(*m_frame);
-        av_frame_unref(m_frame.get());
+        Libav().av_frame_unref(m_frame.get());
         if (appended != noErr) {
             return appended;
         }
@@ -231,7 +231,7 @@ OSStatus AacDecoderConverter::AppendFrame(const AVFrame& frame)
     const size_t start = m_pcm.size();
     m_pcm.resize(start + static_cast<size_t>(frame.nb_samples) * m_output.mChannelsPerFrame);
     uint8_t* out = reinterpret_cast<uint8_t*>(m_pcm.data() + start);
-    const int converted = swr_convert(m_resampler.get(), &out, frame.nb_samples,
+    const int converted = Libav().swr_convert(m_resampler.get(), &out, frame.nb_samples,
                                       const_cast<const uint8_t**>(frame.extended_data), frame.nb_samples);
     if (converted != frame.nb_samples) {
         m_pcm.resize(start);

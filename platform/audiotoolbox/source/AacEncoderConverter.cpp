@@ -46,7 +46,7 @@ OSStatus AacEncoderConverter::Create(const AudioStreamBasicDescription& pcm, con
                                      int aacRate, std::unique_ptr<AacEncoderConverter>* converter)
 {
     auto created = std::make_unique<AacEncoderConverter>(pcm, aac, aacRate);
-    created->m_packet.reset(av_packet_alloc());
+    created->m_packet.reset(Libav().av_packet_alloc());
     if (created->m_packet == nullptr) {
         return kAudio_MemFullError;
     }
@@ -59,11 +59,11 @@ OSStatus AacEncoderConverter::Create(const AudioStreamBasicDescription& pcm, con
 
 OSStatus AacEncoderConverter::Open(int64_t bitRate)
 {
-    const AVCodec* codec = avcodec_find_encoder(AV_CODEC_ID_AAC);
+    const AVCodec* codec = Libav().avcodec_find_encoder(AV_CODEC_ID_AAC);
     if (codec == nullptr) {
         return kAudioConverterErr_FormatNotSupported;
     }
-    CodecContextPtr context(avcodec_alloc_context3(codec));
+    CodecContextPtr context(Libav().avcodec_alloc_context3(codec));
     if (context == nullptr) {
         return kAudio_MemFullError;
     }
@@ -72,31 +72,31 @@ OSStatus AacEncoderConverter::Open(int64_t bitRate)
     context->sample_fmt = AV_SAMPLE_FMT_FLTP;
     context->bit_rate = bitRate;
     context->time_base = AVRational{1, m_aacRate};
-    if (av_channel_layout_copy(&context->ch_layout, &layout) < 0) {
+    if (Libav().av_channel_layout_copy(&context->ch_layout, &layout) < 0) {
         return kAudio_MemFullError;
     }
-    if (avcodec_open2(context.get(), codec, nullptr) < 0 || context->frame_size != int{kAacFramesPerPacket}) {
+    if (Libav().avcodec_open2(context.get(), codec, nullptr) < 0 || context->frame_size != int{kAacFramesPerPacket}) {
         return kAudioConverterErr_FormatNotSupported;
     }
 
     SwrContext* resampler = nullptr;
-    if (swr_alloc_set_opts2(&resampler, &layout, AV_SAMPLE_FMT_FLTP, m_aacRate, &layout, AV_SAMPLE_FMT_S16,
+    if (Libav().swr_alloc_set_opts2(&resampler, &layout, AV_SAMPLE_FMT_FLTP, m_aacRate, &layout, AV_SAMPLE_FMT_S16,
                             m_aacRate, 0, nullptr) < 0) {
         return kAudio_MemFullError;
     }
     ResamplerPtr ownedResampler(resampler);
-    if (swr_init(ownedResampler.get()) < 0) {
+    if (Libav().swr_init(ownedResampler.get()) < 0) {
         return kAudioConverterErr_FormatNotSupported;
     }
 
-    FramePtr frame(av_frame_alloc());
+    FramePtr frame(Libav().av_frame_alloc());
     if (frame == nullptr) {
         return kAudio_MemFullError;
     }
     frame->format = AV_SAMPLE_FMT_FLTP;
     frame->nb_samples = int{kAacFramesPerPacket};
     frame->sample_rate = m_aacRate;
-    if (av_channel_layout_copy(&frame->ch_layout, &layout) < 0 || av_frame_get_buffer(frame.get(), 0) < 0) {
+    if (Libav().av_channel_layout_copy(&frame->ch_layout, &layout) < 0 || Libav().av_frame_get_buffer(frame.get(), 0) < 0) {
         return kAudio_MemFullError;
     }
 
@@ -248,19 +248,19 @@ OSStatus AacEncoderConverter::TakeInput(AudioConverterComplexInputDataProc proc,
 OSStatus AacEncoderConverter::EncodeHeld(size_t frames)
 {
     const size_t channels = m_input.mChannelsPerFrame;
-    if (av_frame_make_writable(m_frame.get()) < 0) {
+    if (Libav().av_frame_make_writable(m_frame.get()) < 0) {
         return kAudio_MemFullError;
     }
     m_frame->nb_samples = static_cast<int>(frames);
     const auto* in = reinterpret_cast<const uint8_t*>(m_pcm.data() + m_pcmRead);
-    if (swr_convert(m_resampler.get(), m_frame->extended_data, m_frame->nb_samples, &in, m_frame->nb_samples) !=
+    if (Libav().swr_convert(m_resampler.get(), m_frame->extended_data, m_frame->nb_samples, &in, m_frame->nb_samples) !=
         m_frame->nb_samples) {
         return kAudioConverterErr_UnspecifiedError;
     }
     m_pcmRead += frames * channels;
     m_frame->pts = m_nextPts;
     m_nextPts += m_frame->nb_samples;
-    if (avcodec_send_frame(m_context.get(), m_frame.get()) < 0) {
+    if (Libav().avcodec_send_frame(m_context.get(), m_frame.get()) < 0) {
         return kAudioConverterErr_UnspecifiedError;
     }
     return CollectPackets();
@@ -276,7 +276,7 @@ OSStatus AacEncoderConverter::Drain()
         }
     }
     m_bEnded = true;
-    if (avcodec_send_frame(m_context.get(), nullptr) < 0) {
+    if (Libav().avcodec_send_frame(m_context.get(), nullptr) < 0) {
         return kAudioConverterErr_UnspecifiedError;
     }
     return CollectPackets();
@@ -285,7 +285,7 @@ OSStatus AacEncoderConverter::Drain()
 OSStatus AacEncoderConverter::CollectPackets()
 {
     for (;;) {
-        const int received = avcodec_receive_packet(m_context.get(), m_packet.get());
+        const int received = Libav().avcodec_receive_packet(m_context.get(), m_packet.get());
         if (received == AVERROR(EAGAIN) || received == AVERROR_EOF) {
             return noErr;
         }
@@ -296,7 +296,7 @@ OSStatus AacEncoderConverter::CollectPackets()
         if (fits) {
             m_packets.emplace_back(m_packet->data, m_packet->data + m_packet->size);
         }
-        av_packet_unref(m_packet.get());
+        Libav().av_packet_unref(m_packet.get());
         if (!fits) {
             return kAudioConverterErr_UnspecifiedError;
         }

@@ -6,22 +6,13 @@
 #include "AacEncoderConverter.h"
 #include "AacStreamFormat.h"
 
+#include "LibavHandles.h"
+
 #include <cstring>
 #include <memory>
-#include <mutex>
 #include <new>
 
-extern "C" {
-#include <libavutil/log.h>
-}
-
 namespace atcompat {
-
-void QuietLibavLogging()
-{
-    static std::once_flag once;
-    std::call_once(once, [] { av_log_set_level(AV_LOG_QUIET); });
-}
 
 OSStatus CopyPropertyOut(const void* value, UInt32 valueSize, UInt32* size, void* data)
 {
@@ -61,7 +52,10 @@ OSStatus AudioConverterNew(const AudioStreamBasicDescription* inSourceFormat,
         return kAudio_ParamError;
     }
     *outAudioConverter = nullptr;
-    QuietLibavLogging();
+    if (LoadLibav() == nullptr) {
+        // The platform's answer when a codec component is not installed.
+        return kAudioConverterErr_FormatNotSupported;
+    }
     return Guarded([&]() -> OSStatus {
         const bool decoding = inSourceFormat->mFormatID == kAudioFormatMPEG4AAC &&
                               inDestinationFormat->mFormatID == kAudioFormatLinearPCM;
