@@ -2,6 +2,7 @@
 
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
@@ -9,6 +10,7 @@
 #include <thread>
 
 #include "atom/CTqovixAtomControl.h"
+#include "atom/CTqovixTCTGAtom.h"
 #include "engine/CTqovixMainFrame.h"
 #include "file/CTqovixFile.h"
 #include "visitor/CTqovixAudioDataVisitor.h"
@@ -85,6 +87,55 @@ int AtomTree(const uint8_t* data, size_t size)
     tree.Analyze(af);
     CTqovixAudioLevelInformationVisitor level;
     tree.Analyze(level);
+    return 0;
+}
+
+int TagCursor(const uint8_t* data, size_t size)
+{
+    CTqovixTCTGAtom cursor(data, size);
+    std::vector<uint8_t> rewritten;
+    size_t tags = 0;
+    while (cursor.FindNextTag()) {
+        // Every tag has an 8-byte header, so more tags than that is a cursor going round.
+        if (++tags > size / 8) {
+            std::abort();
+        }
+        TCTG::TqovixTCTGTag tag;
+        tag.group = cursor.GetTagGroup();
+        tag.number = cursor.GetTagNumber();
+        tag.type = cursor.GetTagType();
+        tag.count = cursor.GetTagCount();
+        const uint8_t* bytes = cursor.GetTag();
+        tag.data.assign(bytes + 8, bytes + cursor.GetTagSize());
+        CTqovixTCTGAtom::AppendTag(rewritten, tag);
+        std::vector<uint32_t> longs;
+        std::vector<TCTG::TqovixURational> rationals;
+        cursor.GetTagData(longs);
+        cursor.GetTagData(rationals);
+        const size_t values = cursor.GetTagDataSize() == 4 ? longs.size() : rationals.size();
+        if ((cursor.GetTagDataSize() == 4 || cursor.GetTagDataSize() == 8) && values != tag.count) {
+            std::abort();
+        }
+    }
+    if (rewritten.size() > size || !std::equal(rewritten.begin(), rewritten.end(), data)) {
+        std::abort();
+    }
+    return 0;
+}
+
+int Esds(const uint8_t* data, size_t size)
+{
+    // A copy of exactly the input's length, so reading one byte past it is caught.
+    const std::vector<char> payload(data, data + size);
+    CTqovixAudioInformationVisitor visitor;
+    if (visitor.Analyze_ESDSAtom(payload.data(), static_cast<unsigned int>(payload.size()))) {
+        const uint8_t* config = visitor.GetAudioSpecificConfigData();
+        const uint32_t configSize = visitor.GetAudioSpecificConfigSize();
+        if (configSize > size ||
+            (configSize > 0 && std::search(data, data + size, config, config + configSize) == data + size)) {
+            std::abort();
+        }
+    }
     return 0;
 }
 

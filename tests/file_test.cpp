@@ -163,7 +163,59 @@ TEST(FileReadWrite, WrittenBytesReadBackAndFailuresConvert)
     ASSERT_EQ(file.Open("/dev/full", 2), eTqovixSuccess);
     EXPECT_EQ(file.Write(content.data(), 16), eTqovixSuccess);
     EXPECT_EQ(file.Flush(), eTqovixErrorDiskFull);
-    EXPECT_EQ(file.Write(second.data(), 20000), eTqovixErrorDiskFull);
+    const std::vector<uint8_t> pastTheBuffer(1 << 20);
+    EXPECT_EQ(file.Write(pastTheBuffer.data(), 1 << 20), eTqovixErrorDiskFull);
+}
+
+// A range copied file to file lands between what was written before and after it, and both
+// streams move on; when the kernel will not copy (another volume), nothing moves at all.
+TEST(FileCopy, CopiedRangeLandsWhereTheStreamsStand)
+{
+    TempDir temp;
+    const std::vector<uint8_t> bytes = Pattern(600000, 5);
+    const std::vector<uint8_t> header = Pattern(100, 9);
+    const std::vector<uint8_t> trailer = Pattern(50, 77);
+    std::vector<std::string> sources{temp.File("source.mov")};
+    const std::string shared = "/dev/shm/tqovix-file-test-" + std::to_string(getpid());
+    if (fs::is_directory("/dev/shm")) {
+        sources.push_back(shared);
+    }
+    for (const std::string& path : sources) {
+        SCOPED_TRACE(path);
+        ASSERT_TRUE(testsupport::WriteFile(path, bytes));
+        const std::string destination = temp.File("destination.mov");
+        CTqovixFile in;
+        CTqovixFile out;
+        ASSERT_EQ(in.Open(path.c_str(), 1), eTqovixSuccess);
+        ASSERT_EQ(out.Open(destination.c_str(), 2), eTqovixSuccess);
+        ASSERT_EQ(out.Write(header.data(), 100), eTqovixSuccess);  // still in the stream's buffer
+        ASSERT_EQ(in.Seek(1000, CTqovixFile::eTqovixSeekBegin), eTqovixSuccess);
+        EXPECT_EQ(ReadSome(in, 10), std::vector<uint8_t>(bytes.begin() + 1000, bytes.begin() + 1010));
+        bool copied = false;
+        ASSERT_EQ(out.CopyFrom(in, 500000, &copied), eTqovixSuccess);
+        if (path == sources.front()) {
+            EXPECT_TRUE(copied) << "one volume: the kernel copies";
+        }
+        long long inAt = 0;
+        long long outAt = 0;
+        ASSERT_EQ(in.GetPosition(&inAt), eTqovixSuccess);
+        ASSERT_EQ(out.GetPosition(&outAt), eTqovixSuccess);
+        EXPECT_EQ(inAt, copied ? 501010 : 1010);
+        EXPECT_EQ(outAt, copied ? 500100 : 100);
+        if (!copied) {
+            const std::vector<uint8_t> piece = ReadSome(in, 500000);
+            ASSERT_EQ(out.Write(piece.data(), 500000), eTqovixSuccess);
+        }
+        EXPECT_EQ(ReadSome(in, 10), std::vector<uint8_t>(bytes.begin() + 501010, bytes.begin() + 501020));
+        ASSERT_EQ(out.Write(trailer.data(), 50), eTqovixSuccess);
+        ASSERT_EQ(out.Flush(), eTqovixSuccess);
+        out.Close();
+        std::vector<uint8_t> expected = header;
+        expected.insert(expected.end(), bytes.begin() + 1010, bytes.begin() + 501010);
+        expected.insert(expected.end(), trailer.begin(), trailer.end());
+        EXPECT_EQ(testsupport::ReadFile(destination), expected);
+    }
+    unlink(shared.c_str());
 }
 
 // Positions beyond 4 GiB on a sparse file, and resizing that lets no buffered byte outlive a

@@ -18,6 +18,8 @@ TEST(FuzzReplayTest, KeptInputsRunCleanly)
     const std::filesystem::path root = TQOVIX_FUZZ_REGRESSIONS;
     size_t inputs = 0;
     for (const auto& [name, target] : {std::pair<const char*, Target>{"atomtree", fuzztarget::AtomTree},
+                                       {"tagcursor", fuzztarget::TagCursor},
+                                       {"esds", fuzztarget::Esds},
                                        {"property", fuzztarget::Property},
                                        {"job", fuzztarget::Job}}) {
         const std::filesystem::path directory = root / name;

@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <cstdio>
+#include <memory>
 #include <string>
 
 #include "bridge/TqovixErrorCode.h"
@@ -47,6 +48,10 @@ public:
     // A buffered Write may succeed and the device refuse the bytes later: a writer
     // that must know its output reached the file calls this before Close.
     eTqovixErrorCode Flush();
+    // Copies `size` bytes from the source's position to ours, both moving on, inside the
+    // kernel: the bytes never visit our memory. *copied is false (and nothing moved) when
+    // the two files do not allow it; the caller then copies through a buffer.
+    eTqovixErrorCode CopyFrom(CTqovixFile& source, unsigned long long size, bool* copied);
 
     eTqovixErrorCode ComfirmWritable(long long size, const char* path);
     static eTqovixErrorCode Delete(const char* path);
@@ -63,5 +68,7 @@ public:
 private:
     bool m_bOpened = false;
     bool m_bReadOnly = true;
+    bool m_bKernelCopyRefused = false;  // asked once per destination, not once per chunk
     FILE* m_stream = nullptr;
+    std::unique_ptr<char[]> m_buffer;  // the stream's; outlives it
 };

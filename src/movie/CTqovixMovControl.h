@@ -40,6 +40,8 @@ public:
     eTqovixErrorCode SetMovieMetaData(const void* data, unsigned long size);
     eTqovixErrorCode WriteMetaData(const void* data, unsigned long size);
     eTqovixErrorCode WriteMovieMetaData();
+    // Source position to destination position through m_copyBuffer, for files the kernel cannot copy between.
+    eTqovixErrorCode CopyThroughBuffer(uint32_t size);
     static void EncodeCallback(void* user, unsigned char* packet, int size);
     eTqovixErrorCode SetMovieDataInformation(const void* afInformation, unsigned long size);
     // Every sound and video chunk is in the destination (the moov may still be missing).
@@ -93,5 +95,5 @@ private:
     bool m_bFinishPending = false;
     bool m_bDestinationComplete = false;
     int m_carriedByte = -1;  // big-endian PCM: the odd byte of a piece waits for its pair
-    std::vector<uint8_t> m_copyBuffer;  // reused for video chunks and swapped PCM
+    std::vector<uint8_t> m_copyBuffer;  // reused for swapped PCM and video chunks the kernel cannot copy
 };

@@ -318,15 +318,31 @@ eTqovixErrorCode CTqovixMovControl::WriteMovieMetaData()
     if (TqovixFailed(result)) {
         return result;
     }
+    bool copied = false;
+    result = m_destinationFile.CopyFrom(m_sourceFile, chunk.size, &copied);
+    if (!TqovixFailed(result) && !copied) {
+        result = CopyThroughBuffer(chunk.size);
+    }
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    m_outputMovieDataChunks[v].offset = static_cast<uint64_t>(position);
+    m_mediaDataSize += chunk.size;
+    m_outputMovieDataChunkIndex = v + 1;
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::CopyThroughBuffer(uint32_t size)
+{
     try {
-        m_copyBuffer.resize(std::min<uint64_t>(std::max<uint64_t>(chunk.size, 1), kCopyPiece));
+        m_copyBuffer.resize(std::min<uint64_t>(std::max<uint64_t>(size, 1), kCopyPiece));
     } catch (const std::bad_alloc&) {
         return eTqovixErrorOutOfMemory;
     }
-    for (uint32_t done = 0; done < chunk.size;) {
-        const auto piece = static_cast<unsigned int>(std::min<uint64_t>(chunk.size - done, m_copyBuffer.size()));
+    for (uint32_t done = 0; done < size;) {
+        const auto piece = static_cast<unsigned int>(std::min<uint64_t>(size - done, m_copyBuffer.size()));
         unsigned int got = 0;
-        result = m_sourceFile.Read(m_copyBuffer.data(), &got, piece);
+        eTqovixErrorCode result = m_sourceFile.Read(m_copyBuffer.data(), &got, piece);
         if (TqovixFailed(result)) {
             return result;
         }
@@ -340,9 +356,6 @@ eTqovixErrorCode CTqovixMovControl::WriteMovieMetaData()
         }
         done += got;
     }
-    m_outputMovieDataChunks[v].offset = static_cast<uint64_t>(position);
-    m_mediaDataSize += chunk.size;
-    m_outputMovieDataChunkIndex = v + 1;
     return eTqovixSuccess;
 }
 

@@ -25,7 +25,10 @@ constexpr const char* kUsage =
     "  Ctrl-C aborts the job; DST is then removed. Exit status: 0 done, 1 failed,\n"
     "  2 usage error or DST exists, 130 aborted\n";
 
-constexpr auto kPollInterval = std::chrono::milliseconds(50);
+// Short, so that a job of a tenth of a second is not reported up to 50 ms late; the view
+// is redrawn less often.
+constexpr auto kPollInterval = std::chrono::milliseconds(2);
+constexpr double kRedrawSeconds = 0.05;
 // How long an abort may take before the library is closed under the job.
 constexpr double kAbortGraceSeconds = 30;
 
@@ -199,6 +202,7 @@ int ProcessCommand(const Arguments& arguments)
     }
     const bool started = code == 0;
     double abortedAt = -1;
+    double drawnAt = -kRedrawSeconds;
     while (code == 0) {
         const int state = TqIsFinishedOVIX();
         if (state != 0) {
@@ -214,13 +218,16 @@ int ProcessCommand(const Arguments& arguments)
             code = 200;  // closing the library below stops the job and removes DST
             break;
         }
-        int first = 0;
-        int second = 0;
-        TqGetProgressOVIX(&first, &second);
-        // Frame counts travel as unsigned 32-bit values in ints.
-        const double total = static_cast<uint32_t>(second);
-        const double fraction = total > 0 ? std::min(1.0, static_cast<uint32_t>(first) / total) : 0;
-        view.Show(fraction, elapsed);
+        if (elapsed - drawnAt >= kRedrawSeconds) {
+            int first = 0;
+            int second = 0;
+            TqGetProgressOVIX(&first, &second);
+            // Frame counts travel as unsigned 32-bit values in ints.
+            const double total = static_cast<uint32_t>(second);
+            const double fraction = total > 0 ? std::min(1.0, static_cast<uint32_t>(first) / total) : 0;
+            view.Show(fraction, elapsed);
+            drawnAt = elapsed;
+        }
         std::this_thread::sleep_for(kPollInterval);
     }
     const double seconds = SecondsSince(start);
