@@ -18,7 +18,7 @@ int main(int argc, char** argv)
     // About 140 MB a minute: what a camera's 1280×720 stream at ~18 Mbit/s comes to.
     const unsigned long frameBytes = argc > 4 ? std::strtoul(argv[4], nullptr, 10) : 77800;
 
-    moviekit::MovieSpec recipe;
+    moviekit::MovieRecipe recipe;
     recipe.video.format = "jpeg";
     recipe.video.width = 1280;
     recipe.video.height = 720;

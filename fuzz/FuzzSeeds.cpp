@@ -33,7 +33,7 @@ int main(int argc, char** argv)
         std::filesystem::create_directories(directory / kind);
     }
     const auto small = [] {
-        moviekit::MovieSpec recipe;
+        moviekit::MovieRecipe recipe;
         recipe.video.frameCount = 6;
         recipe.video.framesPerChunk = 3;
         recipe.video.width = 8;
@@ -41,7 +41,7 @@ int main(int argc, char** argv)
         recipe.sound.sampleCount = 2400;
         return recipe;
     };
-    std::vector<std::pair<std::string, moviekit::MovieSpec>> seeds;
+    std::vector<std::pair<std::string, moviekit::MovieRecipe>> seeds;
     seeds.emplace_back("twos", small());
     seeds.emplace_back("sowt", small());
     seeds.back().second.sound.codec = moviekit::SoundCodec::Sowt;
@@ -68,8 +68,8 @@ int main(int argc, char** argv)
     bool written = WriteBytes(directory / "tag" / "trim-software-rational.bin", moviekit::SerializeTags(tags));
 
     const moviekit::Bytes config = moviekit::MakeAudioSpecificConfig(48000, 2);
-    moviekit::EsdsSpec plain;
-    moviekit::EsdsSpec everything;
+    moviekit::EsdsRecipe plain;
+    moviekit::EsdsRecipe everything;
     everything.esFlags = 0xE0;
     everything.longSizes = true;
     everything.profileLevelAfterConfig = true;

@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <functional>
 #include <string>
 #include <vector>
@@ -16,7 +17,9 @@
 using moviekit::Atom;
 using moviekit::AtomOptions;
 using moviekit::Bytes;
+using moviekit::Concat;
 using moviekit::Container;
+using Path = TqovixAtomPath;
 
 namespace {
 
@@ -29,56 +32,77 @@ Bytes Filled(size_t size, uint8_t seed)
     return bytes;
 }
 
-Bytes Ftyp(const std::string& brand)
+Bytes Ftyp(const std::string& brand, size_t padding = 0)
 {
     Bytes payload;
     moviekit::PutString(payload, brand);
     moviekit::PutU32(payload, 0);
     moviekit::PutString(payload, "qt  ");
+    moviekit::PutBytes(payload, Bytes(padding, 0));
     return Atom("ftyp", payload);
 }
 
-Bytes Track(const std::vector<Bytes>& beforeMedia, const std::vector<Bytes>& afterMedia)
-{
-    std::vector<Bytes> children = beforeMedia;
-    children.push_back(Container(
-        "mdia", {Atom("mdhd", Filled(24, 1)),
-                 Container("minf", {Container("stbl", {Atom("stsd", Filled(16, 2)), Atom("stco", Filled(12, 3))})})}));
-    children.insert(children.end(), afterMedia.begin(), afterMedia.end());
-    return Container("trak", children);
-}
-
-// ftyp, a moov with two tracks (the first with an edit list) and maker data, and media data.
+// ftyp, media data, and a moov with two tracks (the first with an edit list) and maker data.
 Bytes SampleMovie()
 {
-    return moviekit::Concat(
-        {Ftyp("qt  "), Atom("mdat", Filled(300, 9)),
-         Container("moov", {Atom("mvhd", Filled(100, 4)),
-                            Track({Atom("tkhd", Filled(84, 5)), Container("edts", {Atom("elst", Filled(20, 6))})}, {}),
-                            Track({Atom("tkhd", Filled(84, 7))}, {Atom("free", {})}),
-                            Container("udta", {Container("TCDT", {Atom("TCTG", Filled(27, 8))})})})});
+    const Bytes media = Container("mdia", {Atom("mdhd", Filled(24, 1)),
+                                           Container("minf", {Container("stbl", {Atom("stsd", Filled(16, 2)),
+                                                                                 Atom("stco", Filled(12, 3))})})});
+    return Concat({Ftyp("qt  "), Atom("mdat", Filled(300, 9)),
+                   Container("moov", {Atom("mvhd", Filled(100, 4)),
+                                      Container("trak", {Atom("tkhd", Filled(84, 5)),
+                                                         Container("edts", {Atom("elst", Filled(20, 6))}), media}),
+                                      Container("trak", {Atom("tkhd", Filled(84, 7)), media, Atom("free", {})}),
+                                      Container("udta", {Container("TCDT", {Atom("TCTG", Filled(27, 8))})})})});
+}
+
+// `depth` "moov" containers one inside the other around an empty "free".
+Bytes Nested(int depth)
+{
+    Bytes bytes;
+    for (int i = 0; i < depth; ++i) {
+        moviekit::PutU32(bytes, static_cast<uint32_t>(8 * (depth - i + 1)));
+        moviekit::PutType(bytes, "moov");
+    }
+    moviekit::PutBytes(bytes, Atom("free", {}));
+    return bytes;
 }
 
 class AtomFileTest : public ::testing::Test {
 protected:
-    // Writes the bytes to a file and opens it for reading.
-    void OpenSource(const Bytes& bytes)
+    // Every file gets a new name, so one that a tree still points into is never overwritten.
+    std::string Open(CTqovixFile& file, int mode, const Bytes& bytes = {})
     {
-        m_sourcePath = m_dir.File("source.mov");
-        ASSERT_TRUE(testsupport::WriteFile(m_sourcePath, bytes));
-        ASSERT_EQ(m_source.Open(m_sourcePath.c_str(), 1), eTqovixSuccess);
+        const std::string path = m_dir.File(std::to_string(m_files++) + ".mov");
+        file.Close();
+        EXPECT_TRUE(mode == 2 || testsupport::WriteFile(path, bytes));
+        EXPECT_EQ(file.Open(path.c_str(), mode), eTqovixSuccess);
+        return path;
     }
 
     eTqovixErrorCode Parse(const Bytes& bytes)
     {
-        OpenSource(bytes);
+        Open(m_source, 1, bytes);
         return m_control.Initialize(m_source);
     }
 
+    Bytes WriteBack()
+    {
+        TqovixAtomList atoms;
+        m_control.GetAtoms(atoms);
+        CTqovixFile out;
+        const std::string path = Open(out, 2);
+        for (const auto& atom : atoms) {
+            EXPECT_EQ(atom->Write(out), eTqovixSuccess);
+        }
+        out.Close();
+        return testsupport::ReadFile(path);
+    }
+
     testsupport::TempDir m_dir;
-    std::string m_sourcePath;
     CTqovixFile m_source;
     CTqovixAtomControl m_control;
+    int m_files = 0;
 };
 
 // Records what a walk shows it and answers from a script keyed by path text.
@@ -86,51 +110,33 @@ class RecordingVisitor : public CTqovixAtomVisitor {
 public:
     // Leads into every container and passes over every leaf unless a test says otherwise.
     static eTqovixErrorCode Default(bool isLeaf) { return isLeaf ? eTqovixVisitSkip : eTqovixVisitContinue; }
-    std::function<eTqovixErrorCode(const std::string&, bool isLeaf)> answer = [](const std::string&, bool isLeaf) {
-        return Default(isLeaf);
-    };
+    using Answer = std::function<eTqovixErrorCode(const std::string&, bool isLeaf)>;
+    explicit RecordingVisitor(Answer a = [](const std::string&, bool isLeaf) { return Default(isLeaf); }) : answer(a) {}
+    Answer answer;
     mutable std::vector<std::string> seen;
 
-    static std::string Text(const TqovixAtomPath& path)
+    size_t Count(const std::string& text) const { return std::count(seen.begin(), seen.end(), text); }
+    eTqovixErrorCode Analyze(const Path& p, const CTqovixContainerAtom&) const override { return Record(p, false); }
+    eTqovixErrorCode Update(const Path& p, CTqovixContainerAtom&) const override { return Record(p, false); }
+    eTqovixErrorCode Analyze(const Path& p, const CTqovixLeafAtom&) const override { return Record(p, true); }
+    eTqovixErrorCode Update(const Path& p, CTqovixLeafAtom&) const override { return Record(p, true); }
+    void SetNeedAnalyzeMediaTime(bool need) const override { seen.push_back(need ? "edits:yes" : "edits:no"); }
+
+private:
+    eTqovixErrorCode Record(const Path& path, bool isLeaf) const
     {
         std::string text;
         for (eTqovixAtomType type : path) {
             text += (text.empty() ? "" : "/") + TqovixAtomTypeName(type);
         }
-        return text;
-    }
-
-    eTqovixErrorCode Analyze(const TqovixAtomPath& path, const CTqovixContainerAtom&) const override
-    {
-        return Record(path, false);
-    }
-    eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixContainerAtom&) const override
-    {
-        return Record(path, false);
-    }
-    eTqovixErrorCode Analyze(const TqovixAtomPath& path, const CTqovixLeafAtom&) const override
-    {
-        return Record(path, true);
-    }
-    eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixLeafAtom&) const override { return Record(path, true); }
-    void SetNeedAnalyzeMediaTime(bool need) const override { seen.push_back(need ? "media-time:yes" : "media-time:no"); }
-
-private:
-    eTqovixErrorCode Record(const TqovixAtomPath& path, bool isLeaf) const
-    {
-        const std::string text = Text(path);
         seen.push_back(text);
         return answer(text, isLeaf);
     }
 };
 
-TEST(AtomSizeTest, HeaderFormFollowsTheThirtyTwoBitLimit)
+TEST_F(AtomFileTest, HeaderFormFollowsTheThirtyTwoBitLimitAndIsWrittenExactly)
 {
     const auto stsd = TqovixMakeAtomPath("stsd")[0];
-    CTqovixLeafAtom small(stsd, nullptr, 0, 0);
-    small.SetData(Filled(100, 0).data(), 100);
-    EXPECT_EQ(small.GetSize(), 108u);
-
     // On-disk leaves report their size without being read.
     CTqovixFile unopened;
     EXPECT_EQ(CTqovixLeafAtom(stsd, &unopened, 0, 4294967287ULL).GetSize(), 4294967295ULL);
@@ -147,14 +153,9 @@ TEST(AtomSizeTest, HeaderFormFollowsTheThirtyTwoBitLimit)
     EXPECT_EQ(emptied.GetSize(), 8u);
     EXPECT_EQ(emptied.GetData(), nullptr);
     EXPECT_FALSE(emptied.IsOnDisk());
-}
 
-TEST_F(AtomFileTest, WritesHeadersPayloadsAndTypeBytesExactly)
-{
     CTqovixFile out;
-    const std::string path = m_dir.File("out.bin");
-    ASSERT_EQ(out.Open(path.c_str(), 2), eTqovixSuccess);
-
+    const std::string path = Open(out, 2);
     CTqovixLeafAtom leaf(TqovixAtom::kTCTG, nullptr, 0, 0);
     const Bytes payload = Filled(100, 3);
     leaf.SetData(payload.data(), payload.size());
@@ -165,12 +166,10 @@ TEST_F(AtomFileTest, WritesHeadersPayloadsAndTypeBytesExactly)
     ASSERT_EQ(CTqovixContainerAtom(TqovixAtom::kTCDT, {inner}, true).Write(out), eTqovixSuccess);
     out.Close();
 
-    Bytes expected = Atom("TCTG", payload);
-    moviekit::PutBytes(expected, Container("udta", {}));
-    moviekit::PutBytes(expected, Container("TCDT", {Atom("OP01", Bytes(payload.begin(), payload.begin() + 4))},
-                                           AtomOptions{.largeHeader = true}));
+    const Bytes expected = Concat({Atom("TCTG", payload), Container("udta", {}),
+                                   Container("TCDT", {Atom("OP01", Bytes(payload.begin(), payload.begin() + 4))},
+                                             AtomOptions{.largeHeader = true})});
     EXPECT_EQ(testsupport::ReadFile(path), expected);
-    EXPECT_EQ(Bytes(expected.begin(), expected.begin() + 8), (Bytes{0, 0, 0, 108, 'T', 'C', 'T', 'G'}));
 
     CTqovixFile closed;
     EXPECT_EQ(leaf.Write(closed), eTqovixErrorInternal);
@@ -180,293 +179,182 @@ TEST_F(AtomFileTest, WritesHeadersPayloadsAndTypeBytesExactly)
 TEST_F(AtomFileTest, LeafPayloadIsReadOnceAndOnlyWithinTheFile)
 {
     const Bytes payload = Filled(40, 5);
-    OpenSource(moviekit::Concat({Bytes(8, 0xEE), payload}));
-
+    const std::string path = Open(m_source, 1, Concat({Bytes(8, 0xEE), payload}));
     CTqovixLeafAtom leaf(TqovixAtom::kOP01, &m_source, 8, payload.size());
     ASSERT_TRUE(leaf.IsOnDisk());
     const uint8_t* data = leaf.GetData();
     ASSERT_NE(data, nullptr);
     EXPECT_EQ(Bytes(data, data + payload.size()), payload);
     EXPECT_FALSE(leaf.IsOnDisk());
-
     // A second read must come from memory: the file is gone by then.
     m_source.Close();
     ASSERT_EQ(leaf.GetData(), data);
 
     // A payload claimed far beyond the file neither allocates nor reads.
-    ASSERT_EQ(m_source.Open(m_sourcePath.c_str(), 1), eTqovixSuccess);
+    ASSERT_EQ(m_source.Open(path.c_str(), 1), eTqovixSuccess);
     CTqovixLeafAtom huge(TqovixAtom::kOP01, &m_source, 8, 4ULL << 30);
     EXPECT_EQ(huge.GetData(), nullptr);
     EXPECT_EQ(huge.LoadData(), eTqovixErrorInvalidMovie);
     EXPECT_TRUE(huge.IsOnDisk());
     CTqovixFile out;
-    ASSERT_EQ(out.Open(m_dir.File("out.bin").c_str(), 2), eTqovixSuccess);
+    Open(out, 2);
     EXPECT_EQ(huge.Write(out), eTqovixErrorInvalidMovie);
     long long written = -1;
     ASSERT_EQ(out.GetFileSize(&written), eTqovixSuccess);
     EXPECT_EQ(written, 0) << "a leaf that cannot be read must not leave a header behind";
 }
 
-TEST_F(AtomFileTest, CameraMoviesWriteBackByteIdentical)
-{
-    moviekit::MovieSpec plain;
-    moviekit::MovieSpec wide = plain;
-    wide.largeMdatHeader = true;
-    wide.co64 = true;
-    wide.mdatCount = 2;
-    wide.sound.codec = moviekit::SoundCodec::Aac;
-    moviekit::MovieSpec reordered = plain;
-    reordered.ftypAfterMoov = true;
-    reordered.majorBrand = "mp42";
-    reordered.soundTrackFirst = true;
-    for (const moviekit::MovieSpec& recipe : {plain, wide, reordered}) {
-        std::string error;
-        const Bytes movie = moviekit::BuildMovie(recipe, nullptr, &error);
-        ASSERT_FALSE(movie.empty()) << error;
-        CTqovixFile source;
-        CTqovixAtomControl tree;
-        const std::string sourcePath = m_dir.File("camera.mov");
-        ASSERT_TRUE(testsupport::WriteFile(sourcePath, movie));
-        ASSERT_EQ(source.Open(sourcePath.c_str(), 1), eTqovixSuccess);
-        ASSERT_EQ(tree.Initialize(source), eTqovixSuccess);
-
-        TqovixAtomList atoms;
-        tree.GetAtoms(atoms);
-        CTqovixFile out;
-        const std::string path = m_dir.File("copy.mov");
-        ASSERT_EQ(out.Open(path.c_str(), 2), eTqovixSuccess);
-        for (const auto& atom : atoms) {
-            ASSERT_EQ(atom->Write(out), eTqovixSuccess);
-        }
-        out.Close();
-        EXPECT_EQ(testsupport::ReadFile(path), movie);
-    }
-}
-
 TEST_F(AtomFileTest, ShortUserDataBecomesALeafAndLongerOneAContainer)
 {
-    const Bytes movie = moviekit::Concat(
-        {Ftyp("mp42"), Container("moov", {Container("udta", {Atom("free", {})}),
-                                          Container("udta", {Atom("free", {0})})})});
-    ASSERT_EQ(Parse(movie), eTqovixSuccess);
+    ASSERT_EQ(Parse(Concat({Ftyp("mp42"), Container("moov", {Container("udta", {Atom("free", {})}),
+                                                             Container("udta", {Atom("free", {0})})})})),
+              eTqovixSuccess);
     TqovixAtomList atoms;
     m_control.GetAtoms(atoms);
-    const auto& moov = dynamic_cast<const CTqovixContainerAtom&>(*atoms[1]);
-    ASSERT_EQ(moov.GetChildren().size(), 2u);
-    const auto* shortUdta = dynamic_cast<const CTqovixLeafAtom*>(moov.GetChildren()[0].get());
-    ASSERT_NE(shortUdta, nullptr);
-    EXPECT_EQ(shortUdta->GetDataSize(), 8u);
-    EXPECT_NE(dynamic_cast<const CTqovixContainerAtom*>(moov.GetChildren()[1].get()), nullptr);
+    const auto& udtas = dynamic_cast<const CTqovixContainerAtom&>(*atoms[1]).GetChildren();
+    ASSERT_EQ(udtas.size(), 2u);
+    EXPECT_NE(dynamic_cast<const CTqovixLeafAtom*>(udtas[0].get()), nullptr);
+    EXPECT_EQ(udtas[0]->GetDataSize(), 8u);
+    EXPECT_NE(dynamic_cast<const CTqovixContainerAtom*>(udtas[1].get()), nullptr);
 }
 
-struct ParseCase {
-    const char* name;
-    std::function<Bytes()> bytes;
-    eTqovixErrorCode expected;
-};
-
-void PrintTo(const ParseCase& c, std::ostream* os) { *os << c.name; }
-
-
-Bytes WithSize(const char* type, uint32_t sizeField, size_t payloadBytes)
+TEST_F(AtomFileTest, RefusesBrokenFilesAndWritesAcceptedOnesBackIdentical)
 {
-    return Atom(type, Bytes(payloadBytes, 0), AtomOptions{.overrideSize = true, .sizeOverride = sizeField});
-}
-
-Bytes WithExtendedSize(const char* type, uint64_t size, size_t payloadBytes)
-{
-    return Atom(type, Bytes(payloadBytes, 0), AtomOptions{.largeHeader = true, .overrideSize = true, .sizeOverride = size});
-}
-
-// `depth` "moov" containers one inside the other around an empty "free".
-Bytes Nested(int depth)
-{
-    Bytes bytes;
-    for (int i = 0; i < depth; ++i) {
-        moviekit::PutU32(bytes, static_cast<uint32_t>(8 * (depth - i + 1)));
-        moviekit::PutType(bytes, "moov");
+    const auto qt = [](const Bytes& rest) { return Concat({Ftyp("qt  "), rest}); };
+    const auto sized = [](const char* type, uint32_t size, size_t payload) {
+        return Atom(type, Bytes(payload, 0), AtomOptions{.overrideSize = true, .sizeOverride = size});
+    };
+    const auto extended = [&](uint64_t size, size_t payload) {
+        return qt(Atom("mdat", Bytes(payload, 0),
+                       AtomOptions{.largeHeader = true, .overrideSize = true, .sizeOverride = size}));
+    };
+    const Bytes moov = Container("moov", {Atom("mvhd", Filled(20, 0))});
+    Bytes overrun = Container("moov", {Atom("mvhd", Filled(20, 0)), Atom("trak", Filled(20, 0))});
+    overrun[8 + 28 + 3] += 4;  // the last child claims 4 bytes of whatever follows "moov"
+    Bytes manyAtoms = Ftyp("qt  ");
+    for (size_t i = 0; i <= CTqovixAtomControl::kMaxAtoms; ++i) {
+        moviekit::PutBytes(manyAtoms, Atom("free", {}));
     }
-    moviekit::PutBytes(bytes, Atom("free", {}));
-    return bytes;
-}
-
-const ParseCase kParseCases[] = {
-    {"QuickTimeBrand", [] { return moviekit::Concat({Ftyp("qt  "), Container("moov", {Atom("mvhd", Filled(20, 0))}), Atom("mdat", {})}); },
-     eTqovixSuccess},
-    {"Mp42BrandAfterMoov", [] { return moviekit::Concat({Container("moov", {Atom("mvhd", Filled(20, 0))}), Ftyp("mp42")}); }, eTqovixSuccess},
-    {"OtherBrand", [] { return moviekit::Concat({Ftyp("isom"), Atom("moov", {})}); }, eTqovixErrorInvalidMovie},
-    {"NoFtyp", [] { return Container("moov", {Atom("mvhd", Filled(20, 0))}); }, eTqovixErrorInvalidMovie},
-    {"FtypPayloadOfThreeBytes", [] { return moviekit::Concat({Atom("ftyp", {'q', 't', ' '}), Atom("moov", {})}); },
-     eTqovixErrorInvalidMovie},
-    {"HugeFileTypeAtom",
-     [] {
-         Bytes ftyp = Ftyp("qt  ");
-         moviekit::PutBytes(ftyp, Bytes(2 << 20, 0));
-         ftyp[1] = static_cast<uint8_t>(ftyp.size() >> 16);
-         ftyp[2] = static_cast<uint8_t>(ftyp.size() >> 8);
-         ftyp[3] = static_cast<uint8_t>(ftyp.size());
-         return moviekit::Concat({ftyp, Container("moov", {Atom("mvhd", {})})});
-     },
-     eTqovixErrorInvalidMovie},
-    {"EmptyFile", [] { return Bytes{}; }, eTqovixErrorInvalidMovie},
-    {"TruncatedHeader", [] { return moviekit::Concat({Ftyp("qt  "), Bytes{0, 0, 0}}); }, eTqovixErrorInvalidMovie},
-    {"TruncatedExtendedHeader", [] { return moviekit::Concat({Ftyp("qt  "), Bytes{0, 0, 0, 1, 'm', 'd', 'a', 't', 0}}); },
-     eTqovixErrorInvalidMovie},
-    {"LastAtomClaimsEightMore", [] { return moviekit::Concat({Ftyp("qt  "), WithSize("mdat", 24, 8)}); },
-     eTqovixErrorInvalidMovie},
-    {"SizeZero", [] { return moviekit::Concat({Ftyp("qt  "), WithSize("mdat", 0, 8)}); }, eTqovixErrorInvalidMovie},
-    {"SizeTwo", [] { return moviekit::Concat({Ftyp("qt  "), WithSize("free", 2, 8)}); }, eTqovixErrorInvalidMovie},
-    {"SizeSeven", [] { return moviekit::Concat({Ftyp("qt  "), WithSize("free", 7, 8)}); }, eTqovixErrorInvalidMovie},
-    {"ExtendedSizeZero", [] { return moviekit::Concat({Ftyp("qt  "), WithExtendedSize("mdat", 0, 0)}); },
-     eTqovixErrorInvalidMovie},
-    {"ExtendedSizeEight", [] { return moviekit::Concat({Ftyp("qt  "), WithExtendedSize("mdat", 8, 0)}); },
-     eTqovixErrorInvalidMovie},
-    {"ExtendedSizeFifteen", [] { return moviekit::Concat({Ftyp("qt  "), WithExtendedSize("mdat", 15, 8)}); },
-     eTqovixErrorInvalidMovie},
-    {"ExtendedSizeBeyondFile", [] { return moviekit::Concat({Ftyp("qt  "), WithExtendedSize("mdat", 1ULL << 40, 16)}); },
-     eTqovixErrorInvalidMovie},
-    {"FourGiBLeafInOneKiB", [] { return moviekit::Concat({Ftyp("qt  "), WithExtendedSize("mdat", 4ULL << 30, 1000)}); },
-     eTqovixErrorInvalidMovie},
-    {"ChildRunsPastParent",
-     [] {
-         Bytes moov = Container("moov", {Atom("mvhd", Filled(20, 0)), Atom("trak", Filled(20, 0))});
-         moov[8 + 28 + 3] += 4;  // the last child claims 4 bytes of whatever follows "moov"
-         return moviekit::Concat({Ftyp("qt  "), moov, Atom("free", Filled(8, 0))});
-     },
-     eTqovixErrorInvalidMovie},
-    {"ChildSmallerThanItsHeader",
-     [] { return moviekit::Concat({Ftyp("qt  "), Container("moov", {WithSize("mvhd", 4, 20)})}); },
-     eTqovixErrorInvalidMovie},
-    {"NestingDepthInTheThousands", [] { return moviekit::Concat({Ftyp("qt  "), Nested(5000)}); },
-     eTqovixErrorInvalidMovie},
-    {"NestingDepthOfACameraMovie", [] { return moviekit::Concat({Ftyp("qt  "), Nested(12)}); }, eTqovixSuccess},
-    {"MillionsOfEmptyAtoms",
-     [] {
-         Bytes bytes = Ftyp("qt  ");
-         for (size_t i = 0; i <= CTqovixAtomControl::kMaxAtoms; ++i) {
-             moviekit::PutBytes(bytes, Atom("free", {}));
-         }
-         return bytes;
-     },
-     eTqovixErrorInvalidMovie},
-};
-
-class AtomParseTest : public AtomFileTest, public ::testing::WithParamInterface<ParseCase> {};
-
-TEST_P(AtomParseTest, AcceptsOrRefusesWithTheExpectedCode)
-{
-    EXPECT_EQ(Parse(GetParam().bytes()), GetParam().expected);
-    EXPECT_EQ(m_control.IsInitialized(), GetParam().expected == eTqovixSuccess);
-}
-
-INSTANTIATE_TEST_SUITE_P(Movies, AtomParseTest, ::testing::ValuesIn(kParseCases),
-                         [](const ::testing::TestParamInfo<ParseCase>& info) { return std::string(info.param.name); });
-
-TEST_F(AtomFileTest, FailedInitializeKeepsThePreviousTreeAndClosedFileIsRefused)
-{
+    moviekit::MovieRecipe camera, wide, reordered;
+    wide.largeMdatHeader = wide.co64 = true;
+    wide.mdatCount = 2;
+    wide.sound.codec = moviekit::SoundCodec::Aac;
+    reordered.ftypAfterMoov = reordered.soundTrackFirst = true;
+    reordered.majorBrand = "mp42";
+    const eTqovixErrorCode bad = eTqovixErrorInvalidMovie;
+    const struct {
+        const char* name;
+        Bytes bytes;
+        eTqovixErrorCode expected;
+    } cases[] = {
+        {"other brand", Concat({Ftyp("isom"), Atom("moov", {})}), bad},
+        {"qt brand", qt(Concat({moov, Atom("mdat", {})})), eTqovixSuccess},
+        {"nesting depth of a camera movie", qt(Nested(12)), eTqovixSuccess},
+        {"camera movie", moviekit::BuildMovie(camera), eTqovixSuccess},
+        {"large mdat headers, co64 and AAC", moviekit::BuildMovie(wide), eTqovixSuccess},
+        {"mp42 after moov, sound first", moviekit::BuildMovie(reordered), eTqovixSuccess},
+        {"no ftyp", moov, bad},
+        {"ftyp payload of three bytes", Concat({Atom("ftyp", {'q', 't', ' '}), Atom("moov", {})}), bad},
+        {"huge ftyp", Concat({Ftyp("qt  ", 2 << 20), Container("moov", {Atom("mvhd", {})})}), bad},
+        {"empty file", {}, bad},
+        {"truncated header", qt({0, 0, 0}), bad},
+        {"truncated extended header", qt({0, 0, 0, 1, 'm', 'd', 'a', 't', 0}), bad},
+        {"last atom claims eight more", qt(sized("mdat", 24, 8)), bad},
+        {"size zero", qt(sized("mdat", 0, 8)), bad},
+        {"size seven", qt(sized("free", 7, 8)), bad},
+        {"extended size zero", extended(0, 0), bad},
+        {"extended size fifteen", extended(15, 8), bad},
+        {"4 GiB leaf in 1 KiB", extended(4ULL << 30, 1000), bad},
+        {"child runs past its parent", Concat({Ftyp("qt  "), overrun, Atom("free", Filled(8, 0))}), bad},
+        {"child smaller than its header", qt(Container("moov", {sized("mvhd", 4, 20)})), bad},
+        {"nesting depth in the thousands", qt(Nested(5000)), bad},
+        {"more atoms than the bound", manyAtoms, bad},
+    };
     CTqovixFile closed;
     EXPECT_EQ(m_control.Initialize(closed), eTqovixErrorInternal);
-    ASSERT_EQ(Parse(SampleMovie()), eTqovixSuccess);
-
-    CTqovixFile other;
-    const std::string path = m_dir.File("bad.mov");
-    ASSERT_TRUE(testsupport::WriteFile(path, Ftyp("isom")));
-    ASSERT_EQ(other.Open(path.c_str(), 1), eTqovixSuccess);
-    EXPECT_EQ(m_control.Initialize(other), eTqovixErrorInvalidMovie);
-    TqovixAtomList atoms;
-    m_control.GetAtoms(atoms);
-    EXPECT_EQ(atoms.size(), 3u);
-    m_control.Close();
-    EXPECT_FALSE(m_control.IsInitialized());
+    TqovixAtomList before, after;
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.name);
+        m_control.GetAtoms(before);
+        EXPECT_EQ(Parse(c.bytes), c.expected);
+        m_control.GetAtoms(after);
+        // A refused file leaves the previous tree as it was.
+        EXPECT_EQ(after == before, c.expected != eTqovixSuccess);
+        if (c.expected == eTqovixSuccess) {
+            EXPECT_EQ(WriteBack(), c.bytes) << "accepted files write back byte-identical";
+        }
+    }
 }
 
-TEST_F(AtomFileTest, AnalyzeWalkVisitsMediaFirstAndTellsAboutEditLists)
+TEST_F(AtomFileTest, WalksFollowTrackRulesAndTheVisitorsAnswers)
 {
     ASSERT_EQ(Parse(SampleMovie()), eTqovixSuccess);
     RecordingVisitor visitor;
     EXPECT_EQ(m_control.Analyze(visitor), eTqovixErrorInvalidMovie) << "a walk nothing stopped found nothing";
-
-    const std::vector<std::string> expected = {
-        "ftyp", "mdat", "moov", "moov/mvhd",
-        "moov/trak", "media-time:yes", "moov/trak/mdia", "moov/trak/mdia/mdhd", "moov/trak/mdia/minf",
-        "moov/trak/mdia/minf/stbl", "moov/trak/mdia/minf/stbl/stsd", "moov/trak/mdia/minf/stbl/stco",
-        "moov/trak/tkhd", "moov/trak/edts", "moov/trak/edts/elst",
-        "moov/trak", "media-time:no", "moov/trak/mdia", "moov/trak/mdia/mdhd", "moov/trak/mdia/minf",
-        "moov/trak/mdia/minf/stbl", "moov/trak/mdia/minf/stbl/stsd", "moov/trak/mdia/minf/stbl/stco",
-        "moov/trak/tkhd", "moov/trak/free",
-        "moov/udta", "moov/udta/TCDT", "moov/udta/TCDT/TCTG"};
+    const std::string stbl = "moov/trak/mdia/minf/stbl";
+    const std::vector<std::string> media = {"moov/trak/mdia", "moov/trak/mdia/mdhd", "moov/trak/mdia/minf", stbl,
+                                            stbl + "/stsd", stbl + "/stco", "moov/trak/tkhd"};
+    std::vector<std::string> expected = {"ftyp", "mdat", "moov", "moov/mvhd", "moov/trak", "edits:yes"};
+    expected.insert(expected.end(), media.begin(), media.end());
+    expected.insert(expected.end(), {"moov/trak/edts", "moov/trak/edts/elst", "moov/trak", "edits:no"});
+    expected.insert(expected.end(), media.begin(), media.end());
+    expected.insert(expected.end(), {"moov/trak/free", "moov/udta", "moov/udta/TCDT", "moov/udta/TCDT/TCTG"});
     EXPECT_EQ(visitor.seen, expected);
-}
 
-TEST_F(AtomFileTest, UpdateWalkKeepsFileOrderWithoutTrackRules)
-{
-    ASSERT_EQ(Parse(SampleMovie()), eTqovixSuccess);
-    RecordingVisitor visitor;
-    visitor.answer = [](const std::string& path, bool leaf) {
+    // Updates keep file order, without the track rules.
+    RecordingVisitor update([](const std::string& path, bool leaf) {
         return !leaf && (path == "moov" || path.starts_with("moov/trak")) ? eTqovixVisitContinue : eTqovixVisitSkip;
-    };
-    EXPECT_EQ(m_control.Update(visitor), eTqovixVisitSkip);
-    const std::vector<std::string> firstTrack(visitor.seen.begin() + 5, visitor.seen.begin() + 13);
-    EXPECT_EQ(firstTrack, (std::vector<std::string>{
-                              "moov/trak/tkhd", "moov/trak/edts", "moov/trak/edts/elst", "moov/trak/mdia",
-                              "moov/trak/mdia/mdhd", "moov/trak/mdia/minf", "moov/trak/mdia/minf/stbl",
-                              "moov/trak/mdia/minf/stbl/stsd"}));
-    EXPECT_EQ(std::count(visitor.seen.begin(), visitor.seen.end(), "moov/udta"), 1);
-    EXPECT_EQ(std::count(visitor.seen.begin(), visitor.seen.end(), "moov/udta/TCDT"), 0);
-}
+    });
+    EXPECT_EQ(m_control.Update(update), eTqovixVisitSkip);
+    EXPECT_EQ(std::vector<std::string>(update.seen.begin() + 5, update.seen.begin() + 13),
+              (std::vector<std::string>{"moov/trak/tkhd", "moov/trak/edts", "moov/trak/edts/elst", "moov/trak/mdia",
+                                        "moov/trak/mdia/mdhd", "moov/trak/mdia/minf", "moov/trak/mdia/minf/stbl",
+                                        "moov/trak/mdia/minf/stbl/stsd"}));
+    EXPECT_EQ(update.Count("edits:yes") + update.Count("edits:no"), 0u);
+    EXPECT_EQ(update.Count("moov/udta"), 1u);
+    EXPECT_EQ(update.Count("moov/udta/TCDT"), 0u);
 
-TEST_F(AtomFileTest, VisitorAnswersSteerAndStopTheWalk)
-{
-    ASSERT_EQ(Parse(SampleMovie()), eTqovixSuccess);
-    struct Case {
-        std::function<eTqovixErrorCode(const std::string&, bool)> answer;
-        eTqovixErrorCode analyzeResult;
-        eTqovixErrorCode updateResult;
-        std::string lastSeen;
-    };
+    // What the visitor answers steers and stops the walk.
     using V = RecordingVisitor;
-    const Case cases[] = {
+    const auto atMvhd = [](eTqovixErrorCode code) {
+        return [code](const std::string& p, bool leaf) { return p.ends_with("mvhd") ? code : V::Default(leaf); };
+    };
+    const struct {
+        V::Answer answer;
+        eTqovixErrorCode analyzeResult, updateResult;
+        std::string lastSeen;
+    } cases[] = {
         // Passing over "moov" hides everything below it.
         {[](const std::string& p, bool leaf) { return p == "moov" ? eTqovixVisitSkip : V::Default(leaf); },
          eTqovixErrorInvalidMovie, eTqovixVisitSkip, "moov"},
         // A leaf that has found what it wanted ends the walk with success; 155 from a leaf goes on.
         {[](const std::string& p, bool leaf) {
-             return p.ends_with("stsd") ? eTqovixSuccess : leaf && p != "ftyp" && p != "mdat" ? eTqovixVisitContinue
-                                                                                           : V::Default(leaf);
+             return p.ends_with("stsd") ? eTqovixSuccess
+                    : leaf && p != "ftyp" && p != "mdat" ? eTqovixVisitContinue
+                                                         : V::Default(leaf);
          },
          eTqovixSuccess, eTqovixSuccess, "moov/trak/mdia/minf/stbl/stsd"},
-        {[](const std::string& p, bool leaf) { return p.ends_with("mvhd") ? eTqovixErrorInvalidMovie : V::Default(leaf); },
-         eTqovixErrorInvalidMovie, eTqovixErrorInvalidMovie, "moov/mvhd"},
+        {atMvhd(eTqovixErrorInvalidMovie), eTqovixErrorInvalidMovie, eTqovixErrorInvalidMovie, "moov/mvhd"},
         // Verdict codes pass through; other small codes read as success.
-        {[](const std::string& p, bool leaf) { return p.ends_with("mvhd") ? eTqovixVerdict9 : V::Default(leaf); },
-         eTqovixVerdict9, eTqovixVerdict9, "moov/mvhd"},
-        {[](const std::string& p, bool leaf) { return p.ends_with("mvhd") ? eTqovixNoAudioLevel : V::Default(leaf); },
-         eTqovixSuccess, eTqovixSuccess, "moov/mvhd"},
+        {atMvhd(eTqovixVerdict9), eTqovixVerdict9, eTqovixVerdict9, "moov/mvhd"},
+        {atMvhd(eTqovixNoAudioLevel), eTqovixSuccess, eTqovixSuccess, "moov/mvhd"},
         // A container's own answer other than 156 never stops the walk.
         {[](const std::string& p, bool leaf) { return leaf || p != "moov" ? eTqovixVisitSkip : eTqovixErrorInternal; },
          eTqovixErrorInvalidMovie, eTqovixVisitSkip, "moov/udta"},
     };
-    for (const Case& c : cases) {
-        RecordingVisitor analyze;
-        analyze.answer = c.answer;
+    for (const auto& c : cases) {
+        V analyze(c.answer), steered(c.answer);
         EXPECT_EQ(m_control.Analyze(analyze), c.analyzeResult);
         EXPECT_EQ(analyze.seen.back(), c.lastSeen);
-        RecordingVisitor update;
-        update.answer = c.answer;
-        EXPECT_EQ(m_control.Update(update), c.updateResult);
+        EXPECT_EQ(m_control.Update(steered), c.updateResult);
     }
 
-    RecordingVisitor skipTracks;
-    skipTracks.answer = [](const std::string& p, bool leaf) {
-        return p == "moov/trak" ? eTqovixVisitSkip : RecordingVisitor::Default(leaf);
-    };
+    V skipTracks(
+        [](const std::string& p, bool leaf) { return p == "moov/trak" ? eTqovixVisitSkip : V::Default(leaf); });
     m_control.Analyze(skipTracks);
-    EXPECT_EQ(std::count(skipTracks.seen.begin(), skipTracks.seen.end(), "media-time:yes") +
-                  std::count(skipTracks.seen.begin(), skipTracks.seen.end(), "media-time:no"),
-              0);
+    EXPECT_EQ(skipTracks.Count("edits:yes") + skipTracks.Count("edits:no"), 0u);
 
     CTqovixAtomControl empty;
-    RecordingVisitor visitor;
     EXPECT_EQ(empty.Analyze(visitor), eTqovixErrorGeneral);
     EXPECT_EQ(empty.Update(visitor), eTqovixErrorGeneral);
 }

@@ -17,28 +17,23 @@ using Audio = TC::TqovixAudioInformation;
 
 namespace {
 
-// Internal code, library code.
-using CodeRows = std::vector<std::pair<int32_t, UL>>;
-
-TEST(BridgeConversion, InternalCodesToLibraryCodes)
+TEST(BridgeConversion, CodesBothWays)
 {
-    const CodeRows rows = {{0, 0}, {2, 0}, {154, 30}, {4352, 100}, {4353, 110}, {4354, 111}, {4355, 120},
-                           {4356, 121}, {4357, 130}, {4358, 131}, {4608, 200},
-                           // everything else is a failure
-                           {1, 190}, {17, 190}, {19, 190}, {156, 190}, {4359, 190}, {4360, 190}, {4361, 190},
-                           {8192, 190}, {8198, 190}, {12288, 190}, {36864, 190}, {-1, 190}};
-    for (const auto& [internal, library] : rows) {
+    using CodeRows = std::vector<std::pair<int32_t, UL>>;  // internal, library
+    const CodeRows toLibrary = {{0, 0}, {2, 0}, {154, 30}, {4352, 100}, {4353, 110}, {4354, 111}, {4355, 120},
+                                {4356, 121}, {4357, 130}, {4358, 131}, {4608, 200},
+                                // everything else is a failure
+                                {1, 190}, {17, 190}, {19, 190}, {156, 190}, {4359, 190}, {4360, 190}, {4361, 190},
+                                {8192, 190}, {8198, 190}, {12288, 190}, {36864, 190}, {-1, 190}};
+    for (const auto& [internal, library] : toLibrary) {
         EXPECT_EQ(TC::ConvertToLibraryError(static_cast<eTqovixErrorCode>(internal)), library) << internal;
     }
-}
-
-TEST(BridgeConversion, LibraryCodesToInternalCodes)
-{
-    const CodeRows rows = {{0, 0}, {154, 30}, {4352, 100}, {4353, 110}, {4354, 111}, {4355, 120}, {4356, 121},
-                           {4357, 130}, {4358, 131}, {4608, 200},
-                           // everything else, verdicts outside their query and high bits too, is general
-                           {4361, 190}, {4361, 5}, {4361, 1}, {4361, 8}, {4361, (1ul << 32) + 30}, {4361, 1ul << 32}};
-    for (const auto& [internal, library] : rows) {
+    const CodeRows toInternal = {{0, 0}, {154, 30}, {4352, 100}, {4353, 110}, {4354, 111}, {4355, 120},
+                                 {4356, 121}, {4357, 130}, {4358, 131}, {4608, 200},
+                                 // everything else, verdicts outside their query and high bits too, is general
+                                 {4361, 190}, {4361, 5}, {4361, 1}, {4361, 8}, {4361, (1ul << 32) + 30},
+                                 {4361, 1ul << 32}};
+    for (const auto& [internal, library] : toInternal) {
         EXPECT_EQ(TC::ConvertToLocalError(library), internal) << library;
     }
 }
@@ -158,18 +153,17 @@ protected:
     SystemSide m_system;
 };
 
-TEST_F(BridgeSession, RefusalsAndNoSessionAreGeneralFailure)
+// Refusals and calls without a session are general failures; verdicts, states and processed pieces
+// are mapped to internal codes.
+TEST_F(BridgeSession, RefusalsVerdictsStatesAndProcessedPiecesAreMapped)
 {
     EXPECT_EQ(TC::TqovixLibraryInitialize(), eTqovixErrorGeneral) << "already initialised";
     EXPECT_EQ(TC::TqovixOpenSession(Audio{48, 2, 24, 100}, {}), eTqovixErrorGeneral);
     EXPECT_EQ(TC::TqovixIsSessionFinished(), eTqovixErrorGeneral);
-    uint8_t buffer[8];
+    uint8_t out[16];
     UL count = 0;
-    EXPECT_EQ(TC::TqovixGetProcessedAFInfo(buffer, sizeof buffer, &count), eTqovixErrorGeneral);
-}
+    EXPECT_EQ(TC::TqovixGetProcessedAFInfo(out, sizeof out, &count), eTqovixErrorGeneral);
 
-TEST_F(BridgeSession, VerdictsStatesAndProcessedPiecesAreMapped)
-{
     const Bytes accepted = AfBlock({{10, 20, 500}});
     // name, block, IsEnable, audio callback's answer, end of the session
     const std::vector<std::tuple<const char*, Bytes, eTqovixErrorCode, eTqovixErrorCode, eTqovixErrorCode>> rows = {
@@ -197,8 +191,7 @@ TEST_F(BridgeSession, VerdictsStatesAndProcessedPiecesAreMapped)
         // 44 bytes: two full pieces, then the last, marked processed; none after a refusal.
         Bytes read;
         for (eTqovixErrorCode piece : {eTqovixRunning, eTqovixRunning, eTqovixFinished}) {
-            uint8_t out[16];
-            UL count = 0;
+            count = 0;
             EXPECT_EQ(TC::TqovixGetProcessedAFInfo(out, sizeof out, &count), enabled ? piece : eTqovixErrorGeneral);
             read.insert(read.end(), out, out + count);
         }

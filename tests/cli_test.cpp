@@ -16,6 +16,7 @@ namespace {
 
 using testsupport::ShellQuote;
 using testsupport::TempDir;
+using Recipe = moviekit::MovieRecipe;
 
 struct Outcome {
     int status;
@@ -36,9 +37,9 @@ std::string Q(const std::string& text) { return ShellQuote(text); }
 bool Exists(const std::string& path) { return std::filesystem::exists(path); }
 
 // A small camera-style movie; `edit` changes the recipe before it is written.
-std::string Movie(const TempDir& dir, const std::string& name, void (*edit)(moviekit::MovieSpec&) = nullptr)
+std::string Movie(const TempDir& dir, const std::string& name, void (*edit)(Recipe&) = nullptr)
 {
-    moviekit::MovieSpec recipe;
+    Recipe recipe;
     recipe.video.frameCount = 60;
     if (edit != nullptr) {
         edit(recipe);
@@ -48,13 +49,13 @@ std::string Movie(const TempDir& dir, const std::string& name, void (*edit)(movi
     return dir.File(name);
 }
 
-void Processed(moviekit::MovieSpec& recipe) { recipe.maker.afProcessed = true; }
-void ForeignBrand(moviekit::MovieSpec& recipe)
+void Processed(Recipe& recipe) { recipe.maker.afProcessed = true; }
+void ForeignBrand(Recipe& recipe)
 {
     recipe.majorBrand = "isom";
     recipe.compatibleBrands = {"isom"};
 }
-void NoAfInformation(moviekit::MovieSpec& recipe) { recipe.maker.afInformation = false; }
+void NoAfInformation(Recipe& recipe) { recipe.maker.afInformation = false; }
 
 TEST(CliTest, HelpVersionAndUsageErrors)
 {
@@ -103,71 +104,58 @@ TEST(CliTest, CheckGivesEachFileItsReason)
     EXPECT_EQ(Tool("check " + Q(rows[0].path)).output, rows[0].path + ": processable\n");
 }
 
-TEST(CliTest, ProcessWritesTheDestinationAndKeepsExistingOnes)
+// Plain and JSON reports of a job done, a destination kept and a source refused.
+TEST(CliTest, ProcessReportsAndKeepsExistingDestinations)
 {
     TempDir dir;
     const std::string source = Movie(dir, "in.mov");
+    const std::string foreign = Movie(dir, "isom.mp4", ForeignBrand);
     const std::string destination = dir.File("out.mov");
-    const Outcome first = Tool("process " + Q(source) + " " + Q(destination));
-    EXPECT_EQ(first.status, 0) << first.output;
-    EXPECT_NE(first.output.find(destination + ": done"), std::string::npos) << first.output;
-    ASSERT_TRUE(Exists(destination));
-    EXPECT_EQ(Tool("check " + Q(destination)).output, destination + ": not processable: already processed\n");
-
-    const auto size = std::filesystem::file_size(destination);
     const std::string kept = dir.File("kept.mov");
     std::ofstream(kept) << "someone's file\n";
-    const Outcome again = Tool("process " + Q(source) + " " + Q(kept));
-    EXPECT_EQ(again.status, 2);
-    EXPECT_NE(again.output.find("destination exists"), std::string::npos) << again.output;
-    EXPECT_EQ(std::filesystem::file_size(kept), 15u);  // untouched
+    struct Row {
+        std::string arguments;
+        int status;
+        std::vector<std::string> fragments;
+    };
+    const Row rows[] = {
+        {"process " + Q(source) + " " + Q(destination), 0, {destination + ": done"}},
+        {"process " + Q(source) + " " + Q(kept), 2, {"destination exists"}},
+        {"process " + Q(foreign) + " " + Q(dir.File("x.mov")), 1, {"no AF information, or not a camera movie"}},
+        {"process " + Q(source) + " " + Q(dir.File("json.mov")) + " --json", 0,
+         {"{\"source\":\"" + source + "\"", "\"destination\":", "\"result\":0,", "\"message\":\"done\"",
+          "\"seconds\":"}},
+        {"process " + Q(source) + " " + Q(kept) + " --json", 2,
+         {"\"source\":", "\"destination\":", "\"result\":null", "\"message\":\"destination exists", "\"seconds\":"}},
+        {"process " + Q(foreign) + " " + Q(dir.File("x.mov")) + " --json", 1,
+         {"\"source\":", "\"destination\":", "\"result\":8,", "\"message\":\"no AF information", "\"seconds\":"}},
+        {"inspect " + Q(source) + " --json", 0,
+         {"\"atoms\":[{\"offset\":0,", "\"handler\":\"soun\",\"codec\":\"twos\"", "\"handler\":\"vide\"",
+          "\"trim\":{\"removedFrameForward\":0", "\"afInformationBytes\":", "\"processed\":false"}},
+        {"inspect " + Q(destination) + " --json", 0, {"\"processed\":true", "\"libraryAnswer\":20"}},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.arguments);
+        const Outcome outcome = Tool(row.arguments);
+        EXPECT_EQ(outcome.status, row.status) << outcome.output;
+        for (const std::string& fragment : row.fragments) {
+            EXPECT_NE(outcome.output.find(fragment), std::string::npos) << fragment << " in " << outcome.output;
+        }
+        if (row.arguments.ends_with("--json")) {  // one object on one line
+            ASSERT_FALSE(outcome.output.empty());
+            EXPECT_EQ(outcome.output.front(), '{') << outcome.output;
+            EXPECT_EQ(outcome.output.substr(outcome.output.size() - 2), "}\n") << outcome.output;
+            EXPECT_EQ(std::count(outcome.output.begin(), outcome.output.end(), '\n'), 1) << outcome.output;
+        }
+    }
+    EXPECT_EQ(std::filesystem::file_size(kept), 15u);  // untouched by both refusals
+    EXPECT_FALSE(Exists(dir.File("x.mov")));
+    EXPECT_EQ(Tool("check " + Q(destination)).output, destination + ": not processable: already processed\n");
 
     const Outcome forced = Tool("process " + Q(source) + " " + Q(kept) + " --force --quiet");
     EXPECT_EQ(forced.status, 0) << forced.output;
     EXPECT_EQ(forced.output, "");
-    EXPECT_EQ(std::filesystem::file_size(kept), size);
-
-    const Outcome failed = Tool("process " + Q(Movie(dir, "isom.mp4", ForeignBrand)) + " " + Q(dir.File("x.mov")));
-    EXPECT_EQ(failed.status, 1);
-    EXPECT_NE(failed.output.find("no AF information, or not a camera movie"), std::string::npos) << failed.output;
-    EXPECT_FALSE(Exists(dir.File("x.mov")));
-}
-
-TEST(CliTest, JsonOutputsCarryTheirKeys)
-{
-    TempDir dir;
-    const std::string source = Movie(dir, "in.mov");
-    struct Row {
-        const char* name;
-        std::string arguments;
-        std::vector<std::string> fragments;
-    };
-    const Row rows[] = {
-        {"process done", "process " + Q(source) + " " + Q(dir.File("out.mov")) + " --json",
-         {"{\"source\":\"" + source + "\"", "\"destination\":", "\"result\":0,",
-          "\"message\":\"done\"", "\"seconds\":"}},
-        {"process refused", "process " + Q(source) + " " + Q(dir.File("out.mov")) + " --json",
-         {"\"source\":", "\"destination\":", "\"result\":null", "\"message\":\"destination exists", "\"seconds\":"}},
-        {"process failed",
-         "process " + Q(Movie(dir, "isom.mp4", ForeignBrand)) + " " + Q(dir.File("x.mov")) + " --json",
-         {"\"source\":", "\"destination\":", "\"result\":8,", "\"message\":\"no AF information", "\"seconds\":"}},
-        {"inspect source", "inspect " + Q(source) + " --json",
-         {"\"atoms\":[{\"offset\":0,", "\"handler\":\"soun\",\"codec\":\"twos\"", "\"handler\":\"vide\"",
-          "\"trim\":{\"removedFrameForward\":0", "\"afInformationBytes\":", "\"processed\":false"}},
-        {"inspect result", "inspect " + Q(dir.File("out.mov")) + " --json",
-         {"\"processed\":true", "\"libraryAnswer\":20"}},
-    };
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.name);
-        const Outcome outcome = Tool(row.arguments);
-        ASSERT_FALSE(outcome.output.empty());
-        EXPECT_EQ(outcome.output.front(), '{') << outcome.output;
-        EXPECT_EQ(outcome.output.substr(outcome.output.size() - 2), "}\n") << outcome.output;
-        EXPECT_EQ(std::count(outcome.output.begin(), outcome.output.end(), '\n'), 1) << outcome.output;
-        for (const std::string& fragment : row.fragments) {
-            EXPECT_NE(outcome.output.find(fragment), std::string::npos) << fragment << " in " << outcome.output;
-        }
-    }
+    EXPECT_EQ(std::filesystem::file_size(kept), std::filesystem::file_size(destination));
 }
 
 TEST(CliTest, BatchGoesOnPastAFailingFile)
@@ -184,9 +172,8 @@ TEST(CliTest, BatchGoesOnPastAFailingFile)
     EXPECT_TRUE(Exists(dir.File("out/two.mov")));
     EXPECT_FALSE(Exists(dir.File("out/bad.mp4")));
     std::istringstream lines(outcome.output.substr(outcome.output.find("\nfile ")));
-    std::string line;
     std::vector<std::string> summary;
-    while (std::getline(lines, line)) {
+    for (std::string line; std::getline(lines, line);) {
         summary.push_back(line);
     }
     ASSERT_EQ(summary.size(), 6u) << outcome.output;  // blank, header, three rows, total
@@ -210,11 +197,27 @@ TEST(CliTest, MakeSampleWritesAacAndPaddedMovies)
     EXPECT_EQ(Tool("make-sample " + Q(dir.File("x.mov")) + " --aac --little-endian").status, 2);
 }
 
-// A tmux server of our own, its socket in the test's directory, gone with the test; the
-// pane's command ends by itself too.
+// Waits (up to `seconds`) until `ready` holds.
+template <typename Ready>
+bool WaitFor(Ready ready, int seconds)
+{
+    const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(seconds);
+    while (!ready() && std::chrono::steady_clock::now() < end) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    }
+    return ready();
+}
+
+// `command` in a 100×20 pane of a tmux server of our own, its socket in the test's directory,
+// gone with the object; the pane's command ends by itself too.
 class Terminal {
 public:
-    explicit Terminal(const TempDir& dir) : m_socket(dir.File("tmux")) {}
+    Terminal(const TempDir& dir, const std::string& command) : m_socket(dir.File("tmux")), m_status(dir.File("status"))
+    {
+        std::filesystem::remove(m_status);
+        const std::string script = command + "; echo $? > " + Q(m_status) + "; sleep 120";
+        EXPECT_EQ(Tmux("new-session -d -s cli -x 100 -y 20 " + Q(script)), 0);
+    }
     ~Terminal() { Tmux("kill-server"); }
     int Tmux(const std::string& arguments, std::string* output = nullptr) const
     {
@@ -222,82 +225,54 @@ public:
                                            (output ? "" : " >/dev/null") + " 2>&1",
                                        output);
     }
-    // Runs `command` in a 100×20 pane and writes its exit status to `statusFile`.
-    bool Start(const std::string& command, const std::string& statusFile) const
-    {
-        const std::string script = command + "; echo $? > " + Q(statusFile) + "; sleep 120";
-        return Tmux("new-session -d -s cli -x 100 -y 20 " + Q(script)) == 0;
-    }
     std::string Screen() const
     {
         std::string text;
         Tmux("capture-pane -p -t cli", &text);
         return text;
     }
+    // The command's exit status; empty while it runs.
+    std::string Status() const
+    {
+        const std::vector<uint8_t> text = testsupport::ReadFile(m_status);
+        return std::string(text.begin(), text.end());
+    }
 
 private:
     std::string m_socket;
+    std::string m_status;
 };
 
-// Waits (up to `seconds`) until `ready` holds.
-template <typename Ready>
-bool WaitFor(Ready ready, int seconds)
+// A job run to its end draws the bar to 100 %; Ctrl-C aborts a long one and removes its destination.
+TEST(CliTerminalTest, ProgressBarAndCtrlC)
 {
-    const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(seconds);
-    while (!ready()) {
-        if (std::chrono::steady_clock::now() > end) {
-            return false;
+    if (!testsupport::HaveCommand("tmux")) {
+        GTEST_SKIP() << "tmux is not installed (scripts/setup installs it)";
+    }
+    TempDir dir;
+    ASSERT_EQ(Tool("make-sample " + Q(dir.File("short.mov"))).status, 0);
+    ASSERT_EQ(Tool("make-sample " + Q(dir.File("long.mov")) + " --seconds 600", 300).status, 0);
+    for (const bool interrupt : {false, true}) {
+        SCOPED_TRACE(interrupt ? "Ctrl-C" : "to the end");
+        const std::string destination = dir.File(interrupt ? "aborted.mov" : "out.mov");
+        const Terminal terminal(dir, Q(TQOVIX_TOOL) + " process " + Q(dir.File(interrupt ? "long.mov" : "short.mov")) +
+                                         " " + Q(destination));
+        // The bar is drawn from the first poll on: the job is running.
+        ASSERT_TRUE(WaitFor([&] { return terminal.Screen().find('%') != std::string::npos; }, 60)) << terminal.Screen();
+        if (interrupt) {
+            ASSERT_EQ(terminal.Tmux("send-keys -t cli C-c"), 0);
         }
-        std::this_thread::sleep_for(std::chrono::milliseconds(50));
+        ASSERT_TRUE(WaitFor([&] { return !terminal.Status().empty(); }, 120)) << terminal.Screen();
+        const std::string screen = terminal.Screen();
+        EXPECT_EQ(terminal.Status(), interrupt ? "130\n" : "0\n") << screen;
+        EXPECT_EQ(Exists(destination), !interrupt);
+        if (interrupt) {
+            EXPECT_NE(screen.find("aborted"), std::string::npos) << screen;
+        } else {
+            EXPECT_NE(screen.find("[" + std::string(50, '#') + "] 100%"), std::string::npos) << screen;
+            EXPECT_NE(screen.find(destination + ": done"), std::string::npos) << screen;
+        }
     }
-    return true;
-}
-
-std::string ReadText(const std::string& path)
-{
-    std::ifstream in(path);
-    std::string text;
-    std::getline(in, text);
-    return text;
-}
-
-TEST(CliTerminalTest, ProgressBarReachesOneHundredPercent)
-{
-    if (!testsupport::HaveCommand("tmux")) {
-        GTEST_SKIP() << "tmux is not installed (scripts/setup installs it)";
-    }
-    TempDir dir;
-    ASSERT_EQ(Tool("make-sample " + Q(dir.File("in.mov"))).status, 0);
-    Terminal terminal(dir);
-    const std::string status = dir.File("status");
-    const std::string job = Q(TQOVIX_TOOL) + " process " + Q(dir.File("in.mov")) + " " + Q(dir.File("out.mov"));
-    ASSERT_TRUE(terminal.Start(job, status));
-    ASSERT_TRUE(WaitFor([&] { return !ReadText(status).empty(); }, 120)) << terminal.Screen();
-    const std::string screen = terminal.Screen();
-    EXPECT_EQ(ReadText(status), "0") << screen;
-    EXPECT_NE(screen.find("[##################################################] 100%"), std::string::npos) << screen;
-    EXPECT_NE(screen.find(dir.File("out.mov") + ": done"), std::string::npos) << screen;
-}
-
-TEST(CliTerminalTest, CtrlCAbortsTheJobAndRemovesTheDestination)
-{
-    if (!testsupport::HaveCommand("tmux")) {
-        GTEST_SKIP() << "tmux is not installed (scripts/setup installs it)";
-    }
-    TempDir dir;
-    ASSERT_EQ(Tool("make-sample " + Q(dir.File("in.mov")) + " --seconds 600", 300).status, 0);
-    Terminal terminal(dir);
-    const std::string status = dir.File("status");
-    const std::string job = Q(TQOVIX_TOOL) + " process " + Q(dir.File("in.mov")) + " " + Q(dir.File("out.mov"));
-    ASSERT_TRUE(terminal.Start(job, status));
-    // The bar is drawn from the first poll on: the job is running.
-    ASSERT_TRUE(WaitFor([&] { return terminal.Screen().find("%") != std::string::npos; }, 60)) << terminal.Screen();
-    ASSERT_EQ(terminal.Tmux("send-keys -t cli C-c"), 0);
-    ASSERT_TRUE(WaitFor([&] { return !ReadText(status).empty(); }, 60)) << terminal.Screen();
-    const std::string screen = terminal.Screen();
-    EXPECT_EQ(ReadText(status), "130") << screen;
-    EXPECT_NE(screen.find("aborted"), std::string::npos) << screen;
-    EXPECT_FALSE(Exists(dir.File("out.mov")));
 }
 
 }  // namespace

@@ -65,7 +65,7 @@ protected:
 TEST_P(FaultTest, EveryFailedOperationEndsTheJobCleanly)
 {
     testsupport::TempDir dir;
-    moviekit::MovieSpec recipe;
+    moviekit::MovieRecipe recipe;
     recipe.sound.codec = GetParam();
     recipe.video.frameCount = 20;
     recipe.video.framesPerChunk = 5;

@@ -39,15 +39,15 @@ TEST(FuzzReplayTest, KeptInputsRunCleanly)
 // Truncations and byte changes of a real movie: every one must end in a result, not a crash.
 TEST(FuzzReplayTest, MutatedMoviesRunCleanly)
 {
-    moviekit::MovieSpec pcm;
+    moviekit::MovieRecipe pcm;
     pcm.video.frameCount = 6;
     pcm.video.framesPerChunk = 3;
     pcm.sound.sampleCount = 2400;
-    moviekit::MovieSpec aac = pcm;
+    moviekit::MovieRecipe aac = pcm;
     aac.sound.codec = moviekit::SoundCodec::Aac;
     aac.sound.sampleCount = 4;
     std::mt19937 random(7);
-    for (const moviekit::MovieSpec& recipe : {pcm, aac}) {
+    for (const moviekit::MovieRecipe& recipe : {pcm, aac}) {
         const std::vector<uint8_t> movie = moviekit::BuildMovie(recipe);
         ASSERT_FALSE(movie.empty());
         for (int k = 0; k < 120; ++k) {

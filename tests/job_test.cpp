@@ -126,14 +126,14 @@ protected:
 struct Layout {
     const char* name;
     SoundCodec codec;
-    void (*shape)(moviekit::MovieSpec&);
+    void (*shape)(moviekit::MovieRecipe&);
 };
 
 class JobMatrix : public JobTest, public ::testing::WithParamInterface<Layout> {};
 
 TEST_P(JobMatrix, WritesACompleteMovie)
 {
-    moviekit::MovieSpec recipe;
+    moviekit::MovieRecipe recipe;
     recipe.sound.codec = GetParam().codec;
     recipe.maker.afIntervals = kIntervals;
     GetParam().shape(recipe);
@@ -161,30 +161,30 @@ TEST_P(JobMatrix, WritesACompleteMovie)
 }
 
 const Layout kLayouts[] = {
-    {"Twos", SoundCodec::Twos, [](moviekit::MovieSpec&) {}},
-    {"Sowt", SoundCodec::Sowt, [](moviekit::MovieSpec&) {}},
-    {"Aac", SoundCodec::Aac, [](moviekit::MovieSpec&) {}},
+    {"Twos", SoundCodec::Twos, [](moviekit::MovieRecipe&) {}},
+    {"Sowt", SoundCodec::Sowt, [](moviekit::MovieRecipe&) {}},
+    {"Aac", SoundCodec::Aac, [](moviekit::MovieRecipe&) {}},
     {"TwosSoundFirst", SoundCodec::Twos,
-     [](moviekit::MovieSpec& r) { r.soundFirstInPeriod = r.soundTrackFirst = true; }},
-    {"AacSoundFirst", SoundCodec::Aac, [](moviekit::MovieSpec& r) { r.soundFirstInPeriod = r.soundTrackFirst = true; }},
-    {"SowtSmallChunks", SoundCodec::Sowt, [](moviekit::MovieSpec& r) { r.sound.samplesPerChunk = 1000; }},
+     [](moviekit::MovieRecipe& r) { r.soundFirstInPeriod = r.soundTrackFirst = true; }},
+    {"AacSoundFirst", SoundCodec::Aac, [](moviekit::MovieRecipe& r) { r.soundFirstInPeriod = r.soundTrackFirst = true; }},
+    {"SowtSmallChunks", SoundCodec::Sowt, [](moviekit::MovieRecipe& r) { r.sound.samplesPerChunk = 1000; }},
     {"TwosUnevenChunks", SoundCodec::Twos,
-     [](moviekit::MovieSpec& r) { r.sound.chunkSampleCounts = {1, 7001, 20000, 3, 21043}; }},
-    {"AacSmallChunks", SoundCodec::Aac, [](moviekit::MovieSpec& r) { r.sound.samplesPerChunk = 3; }},
+     [](moviekit::MovieRecipe& r) { r.sound.chunkSampleCounts = {1, 7001, 20000, 3, 21043}; }},
+    {"AacSmallChunks", SoundCodec::Aac, [](moviekit::MovieRecipe& r) { r.sound.samplesPerChunk = 3; }},
     {"AacUnevenChunksLastOfOne", SoundCodec::Aac,
-     [](moviekit::MovieSpec& r) { r.sound.chunkSampleCounts = {1, 20, 25, 1}; }},
-    {"TwosCo64", SoundCodec::Twos, [](moviekit::MovieSpec& r) { r.co64 = true; }},
-    {"AacCo64MoovFirst", SoundCodec::Aac, [](moviekit::MovieSpec& r) { r.co64 = r.moovBeforeMdat = true; }},
-    {"SowtMoovFirst", SoundCodec::Sowt, [](moviekit::MovieSpec& r) { r.moovBeforeMdat = true; }},
-    {"TwosThreeMdats", SoundCodec::Twos, [](moviekit::MovieSpec& r) { r.mdatCount = 3; }},
+     [](moviekit::MovieRecipe& r) { r.sound.chunkSampleCounts = {1, 20, 25, 1}; }},
+    {"TwosCo64", SoundCodec::Twos, [](moviekit::MovieRecipe& r) { r.co64 = true; }},
+    {"AacCo64MoovFirst", SoundCodec::Aac, [](moviekit::MovieRecipe& r) { r.co64 = r.moovBeforeMdat = true; }},
+    {"SowtMoovFirst", SoundCodec::Sowt, [](moviekit::MovieRecipe& r) { r.moovBeforeMdat = true; }},
+    {"TwosThreeMdats", SoundCodec::Twos, [](moviekit::MovieRecipe& r) { r.mdatCount = 3; }},
     {"AacTwoMdatsSoundFirst", SoundCodec::Aac,
-     [](moviekit::MovieSpec& r) {
+     [](moviekit::MovieRecipe& r) {
          r.mdatCount = 2;
          r.soundFirstInPeriod = true;
      }},
-    {"SowtMdatSize64", SoundCodec::Sowt, [](moviekit::MovieSpec& r) { r.largeMdatHeader = true; }},
+    {"SowtMdatSize64", SoundCodec::Sowt, [](moviekit::MovieRecipe& r) { r.largeMdatHeader = true; }},
     {"AacMdatSize64ThreeMdats", SoundCodec::Aac,
-     [](moviekit::MovieSpec& r) {
+     [](moviekit::MovieRecipe& r) {
          r.largeMdatHeader = true;
          r.mdatCount = 3;
      }},
@@ -199,7 +199,7 @@ INSTANTIATE_TEST_SUITE_P(Layouts, JobMatrix, ::testing::ValuesIn(kLayouts),
 TEST_F(JobTest, ForeignAfPayloadLeavesPcmUntouched)
 {
     for (SoundCodec codec : {SoundCodec::Twos, SoundCodec::Sowt}) {
-        moviekit::MovieSpec recipe;
+        moviekit::MovieRecipe recipe;
         recipe.sound.codec = codec;
         recipe.maker.afPayload = moviekit::Bytes{'X', 'A', 'F', '9', 0, 1, 0, 0, 0, 0, 0xBB, 0x80, 0, 0, 0, 2};
         const std::string name = codec == SoundCodec::Twos ? "twos" : "sowt";
@@ -232,11 +232,11 @@ bool CodecLibraryMapped()
 // A host that only ever handles PCM never pays for mapping the AAC codecs.
 TEST_F(JobTest, CodecLibrariesLoadOnlyForAac)
 {
-    moviekit::MovieSpec pcm;
+    moviekit::MovieRecipe pcm;
     pcm.video.frameCount = 30;
     ASSERT_EQ(Run(Write(pcm, "pcm.mov"), m_dir.File("pcm-out.mov")), kDone);
     EXPECT_FALSE(CodecLibraryMapped());
-    moviekit::MovieSpec aac = pcm;
+    moviekit::MovieRecipe aac = pcm;
     aac.sound.codec = SoundCodec::Aac;
     ASSERT_EQ(Run(Write(aac, "aac.mov"), m_dir.File("aac-out.mov")), kDone);
     EXPECT_TRUE(CodecLibraryMapped());
@@ -292,7 +292,7 @@ TEST_F(JobTest, AacSoundKeptOutsideAfIntervals)
     constexpr int64_t kEncoderLeadIn = 2048;
     std::vector<moviekit::Bytes> packets;
     ASSERT_TRUE(jobtest::EncodeAacPackets(VoiceLike(3 * kRate, kRate), kRate, 2, 192000, packets));
-    moviekit::MovieSpec recipe;
+    moviekit::MovieRecipe recipe;
     recipe.sound.codec = SoundCodec::Aac;
     recipe.sound.aacPackets = packets;
     recipe.video.frameCount = 90;
@@ -382,7 +382,7 @@ TEST_P(JobEnding, EndsAsTheHostAsked)
     g_actAt = row.actAt;
     g_actAtLastBlock = row.actAtLastBlock;
     g_answer = row.answer;
-    moviekit::MovieSpec recipe;
+    moviekit::MovieRecipe recipe;
     recipe.sound.codec = row.codec;
     if (row.abortAtStart) {
         recipe.video.frameCount = 600;
@@ -443,7 +443,7 @@ INSTANTIATE_TEST_SUITE_P(Endings, JobEnding, ::testing::ValuesIn(kEndings),
 // The file size limit of a child process stands in for a full volume.
 TEST_F(JobTest, DestinationPastFileSizeLimitFails)
 {
-    const std::string source = Write(moviekit::MovieSpec{}, "src.mov");
+    const std::string source = Write(moviekit::MovieRecipe{}, "src.mov");
     const std::string destination = m_dir.File("dst.mov");
     ASSERT_GT(std::filesystem::file_size(source), 4u * 64 * 1024);
     const pid_t child = fork();
@@ -472,7 +472,7 @@ TEST_F(JobTest, DestinationPastFileSizeLimitFails)
 // A small tmpfs with room for 95 % of the source: the start's free-space test passes, writing fails.
 TEST_F(JobTest, DestinationVolumeFillsUp)
 {
-    const std::string source = Write(moviekit::MovieSpec{}, "src.mov");
+    const std::string source = Write(moviekit::MovieRecipe{}, "src.mov");
     const std::string volume = m_dir.File("volume");
     ASSERT_TRUE(std::filesystem::create_directory(volume));
     const uint64_t room = std::filesystem::file_size(source) * 95 / 100 / 4096 * 4096;
@@ -500,7 +500,7 @@ TEST_F(JobTest, LargeMovieGetsA64BitMdat)
     if (available < (uint64_t{10} << 30)) {
         GTEST_SKIP() << "needs 10 GiB free in " << m_dir.Path() << ", has " << (available >> 20) << " MiB";
     }
-    moviekit::MovieSpec recipe;
+    moviekit::MovieRecipe recipe;
     recipe.video.width = 4096;
     recipe.video.height = 4096;
     recipe.video.frameCount = 88;

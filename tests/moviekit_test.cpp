@@ -12,7 +12,7 @@ namespace {
 
 using moviekit::Bytes;
 using moviekit::MovieLayout;
-using moviekit::MovieSpec;
+using Recipe = moviekit::MovieRecipe;
 using moviekit::SoundCodec;
 using namespace std::string_literals;
 
@@ -59,7 +59,7 @@ TEST(AacConfigTest, MatchesHandWrittenBytes)
     EXPECT_EQ(moviekit::MakeAudioSpecificConfig(44100, 1), (Bytes{0x12, 0x08}));
     EXPECT_EQ(moviekit::MakeAudioSpecificConfig(50000, 2), (Bytes{0x17, 0x80, 0x61, 0xA8, 0x10}));  // escape 15
 
-    moviekit::EsdsSpec recipe;
+    moviekit::EsdsRecipe recipe;
     EXPECT_EQ(moviekit::MakeEsdsPayload(recipe, {0x11, 0x90}, 256000, 128000),
               (Bytes{0, 0, 0, 0, 0x03, 25, 0, 1, 0,                                       // ES_Descriptor, ES_ID 1
                      0x04, 17, 0x40, 0x15, 0, 0x18, 0, 0, 0x03, 0xE8, 0, 0, 0x01, 0xF4, 0,  // DecoderConfig
@@ -86,10 +86,10 @@ TEST(AacConfigTest, MatchesHandWrittenBytes)
     }
 }
 
-TEST(MovieKitTest, PcmIsStoredInTheTrackByteOrder)
+TEST(MovieKitTest, PcmInTheTrackByteOrderAndMakerAtoms)
 {
     for (SoundCodec codec : {SoundCodec::Twos, SoundCodec::Sowt}) {
-        MovieSpec recipe;
+        Recipe recipe;
         recipe.sound.codec = codec;
         recipe.sound.channels = 1;
         recipe.sound.pcm = {0x1234, -2, 0x7F00};
@@ -99,11 +99,9 @@ TEST(MovieKitTest, PcmIsStoredInTheTrackByteOrder)
         EXPECT_EQ(layout.soundBytes, codec == SoundCodec::Twos ? (Bytes{0x12, 0x34, 0xFF, 0xFE, 0x7F, 0})
                                                                : (Bytes{0x34, 0x12, 0xFE, 0xFF, 0, 0x7F}));
     }
-}
 
-TEST(MovieKitTest, DefaultMovieCarriesMakerAtoms)
-{
-    const Bytes file = moviekit::BuildMovie(MovieSpec{});
+    // The default movie carries the maker atoms.
+    const Bytes file = moviekit::BuildMovie(Recipe{});
     EXPECT_TRUE(Contains(file, Text("OP01AFR1")));
     EXPECT_TRUE(Contains(file, moviekit::Atom("OP02", moviekit::MakeAudioLevel(-1200))));
     std::vector<moviekit::Tag> tags = moviekit::MakeTrimTags(0, 0, 30000, 1001);
@@ -113,40 +111,25 @@ TEST(MovieKitTest, DefaultMovieCarriesMakerAtoms)
 
 TEST(MovieKitTest, InvalidDescriptionsAreRefused)
 {
-    const std::vector<std::pair<const char*, void (*)(MovieSpec&)>> rows = {
-        {"no channels", [](MovieSpec& r) { r.sound.channels = 0; }},
-        {"rate beyond 16.16", [](MovieSpec& r) { r.sound.sampleRate = 96000; }},
-        {"ragged PCM", [](MovieSpec& r) { r.sound.pcm = {1, 2, 3}; }},
-        {"PCM and count disagree", [](MovieSpec& r) { r.sound.pcm = {1, 2}; r.sound.sampleCount = 5; }},
-        {"empty chunk", [](MovieSpec& r) { r.sound.chunkSampleCounts = {5, 0}; }},
-        {"chunks short of count", [](MovieSpec& r) { r.sound.sampleCount = 9; r.sound.chunkSampleCounts = {1, 2}; }},
-        {"generated 6-channel AAC", [](MovieSpec& r) { r.sound.codec = SoundCodec::Aac; r.sound.channels = 6; }},
-        {"no frames", [](MovieSpec& r) { r.video.frameCount = 0; }},
-        {"movie time scale 0", [](MovieSpec& r) { r.movieTimeScale = 0; }},
+    const std::vector<std::pair<const char*, void (*)(Recipe&)>> rows = {
+        {"no channels", [](Recipe& r) { r.sound.channels = 0; }},
+        {"rate beyond 16.16", [](Recipe& r) { r.sound.sampleRate = 96000; }},
+        {"ragged PCM", [](Recipe& r) { r.sound.pcm = {1, 2, 3}; }},
+        {"PCM and count disagree", [](Recipe& r) { r.sound.pcm = {1, 2}; r.sound.sampleCount = 5; }},
+        {"empty chunk", [](Recipe& r) { r.sound.chunkSampleCounts = {5, 0}; }},
+        {"chunks short of count", [](Recipe& r) { r.sound.sampleCount = 9; r.sound.chunkSampleCounts = {1, 2}; }},
+        {"generated 6-channel AAC", [](Recipe& r) { r.sound.codec = SoundCodec::Aac; r.sound.channels = 6; }},
+        {"no frames", [](Recipe& r) { r.video.frameCount = 0; }},
+        {"movie time scale 0", [](Recipe& r) { r.movieTimeScale = 0; }},
     };
     for (const auto& [name, apply] : rows) {
-        MovieSpec recipe;
+        Recipe recipe;
         apply(recipe);
         std::string error;
-        MovieLayout layout;
-        EXPECT_TRUE(moviekit::BuildMovie(recipe, &layout, &error).empty()) << name;
+        EXPECT_TRUE(moviekit::BuildMovie(recipe, nullptr, &error).empty()) << name;
         EXPECT_FALSE(error.empty()) << name;
     }
 }
-
-// ffprobe, an independent reader, must accept the movies and see what MovieLayout says.
-struct ProbeCase {
-    const char* name;
-    SoundCodec codec;
-    uint16_t channels;
-    uint32_t rate;
-    uint16_t descriptionVersion;
-    bool co64;
-    bool largeMdatHeader;
-    bool soundTrackFirst;
-    bool moovBeforeMdat;
-    const char* codecName;
-};
 
 using Fields = std::map<std::string, std::string>;
 
@@ -154,34 +137,36 @@ using Fields = std::map<std::string, std::string>;
 Fields ParseCompact(const std::string& line)
 {
     Fields fields;
-    std::stringstream stream(line);
-    std::string item;
-    std::getline(stream, item, '|');
-    fields["section"] = item;
-    while (std::getline(stream, item, '|')) {
+    std::stringstream stream("section=" + line);
+    for (std::string item; std::getline(stream, item, '|');) {
         const size_t eq = item.find('=');
         fields[item.substr(0, eq)] = eq == std::string::npos ? "" : item.substr(eq + 1);
     }
     return fields;
 }
 
-class FfprobeTest : public testing::TestWithParam<ProbeCase> {};
+// ffprobe, an independent reader, must accept the movies and see what MovieLayout says.
+struct ProbeCase {
+    SoundCodec codec;
+    uint16_t channels;
+    uint32_t rate;
+    uint16_t descriptionVersion;
+    bool wide;                // co64 and a 64-bit mdat size
+    bool soundAndMoovFirst;  // the sound track, and the movie atom before the media
+    const char* codecName;
+};
 
-TEST_P(FfprobeTest, ReadsTracksAndPacketsAsLaidOut)
+void ProbeMovie(const ProbeCase& c)
 {
-    ASSERT_TRUE(testsupport::HaveCommand("ffprobe")) << "ffprobe is required";
-    const ProbeCase& c = GetParam();
-    MovieSpec recipe;
+    Recipe recipe;
     recipe.sound.codec = c.codec;
     recipe.sound.channels = c.channels;
     recipe.sound.sampleRate = c.rate;
     recipe.sound.descriptionVersion = c.descriptionVersion;
     recipe.sound.samplesPerChunk = c.codec == SoundCodec::Aac ? 7 : 5000;  // short last chunks
     recipe.video.frameCount = 45;
-    recipe.co64 = c.co64;
-    recipe.largeMdatHeader = c.largeMdatHeader;
-    recipe.soundTrackFirst = c.soundTrackFirst;
-    recipe.moovBeforeMdat = c.moovBeforeMdat;
+    recipe.co64 = recipe.largeMdatHeader = c.wide;
+    recipe.soundTrackFirst = recipe.moovBeforeMdat = c.soundAndMoovFirst;
     testsupport::TempDir dir;
     const std::string path = dir.File("movie.mov");
     MovieLayout layout;
@@ -191,14 +176,14 @@ TEST_P(FfprobeTest, ReadsTracksAndPacketsAsLaidOut)
     ASSERT_EQ(file.size(), layout.fileSize);
 
     // ffprobe reads either form, so the choices are checked in the bytes.
-    EXPECT_EQ(layout.co64, c.co64);
-    EXPECT_EQ(Contains(Slice(file, layout.moovOffset, layout.moovSize), Text("co64")), c.co64);
-    EXPECT_EQ(layout.moovOffset < layout.mdatOffsets.at(0), c.moovBeforeMdat);
+    EXPECT_EQ(layout.co64, c.wide);
+    EXPECT_EQ(Contains(Slice(file, layout.moovOffset, layout.moovSize), Text("co64")), c.wide);
+    EXPECT_EQ(layout.moovOffset < layout.mdatOffsets.at(0), c.soundAndMoovFirst);
     const uint64_t mdat = layout.mdatOffsets[0];
-    const uint64_t header = c.largeMdatHeader ? 16 : 8;
+    const uint64_t header = c.wide ? 16 : 8;
     EXPECT_EQ(layout.mdatPayloadOffsets.at(0), mdat + header);
-    EXPECT_EQ(U32(file, mdat), c.largeMdatHeader ? 1 : header + layout.mdatPayloadSizes.at(0));
-    if (c.largeMdatHeader) {
+    EXPECT_EQ(U32(file, mdat), c.wide ? 1 : header + layout.mdatPayloadSizes.at(0));
+    if (c.wide) {
         EXPECT_EQ(U64(file, mdat + 8), header + layout.mdatPayloadSizes[0]);
     }
 
@@ -227,14 +212,11 @@ TEST_P(FfprobeTest, ReadsTracksAndPacketsAsLaidOut)
     ASSERT_EQ(streams.size(), 2U) << output;
     Fields& audio = streams["audio"];
     Fields& video = streams["video"];
-    EXPECT_EQ(audio["index"], c.soundTrackFirst ? "0" : "1");
-    EXPECT_EQ(audio["codec_name"], c.codecName);
-    EXPECT_EQ(audio["sample_rate"], std::to_string(c.rate));
-    EXPECT_EQ(audio["channels"], std::to_string(c.channels));
-    EXPECT_EQ(video["codec_name"], "rawvideo");
-    EXPECT_EQ(video["width"], "64");
-    EXPECT_EQ(video["height"], "36");
-    EXPECT_EQ(video["nb_read_frames"], "45");
+    EXPECT_EQ(audio["index"] + " " + audio["codec_name"] + " " + audio["sample_rate"] + " Hz " + audio["channels"],
+              (c.soundAndMoovFirst ? "0 " : "1 ") + std::string(c.codecName) + " " + std::to_string(c.rate) + " Hz " +
+                  std::to_string(c.channels));
+    EXPECT_EQ(video["codec_name"] + " " + video["width"] + "x" + video["height"] + " " + video["nb_read_frames"],
+              "rawvideo 64x36 45");
 
     std::vector<std::pair<uint64_t, uint64_t>> expectedVideo;
     for (const auto& chunk : layout.videoChunks) {
@@ -262,19 +244,21 @@ TEST_P(FfprobeTest, ReadsTracksAndPacketsAsLaidOut)
     }
     Bytes located;
     for (const auto& [pos, size] : packets[audio["index"]]) {
-        const Bytes piece = Slice(file, pos, size);
-        located.insert(located.end(), piece.begin(), piece.end());
+        located.insert(located.end(), file.begin() + pos, file.begin() + pos + size);
     }
     EXPECT_EQ(located, layout.soundBytes);
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Movies, FfprobeTest,
-    testing::Values(
-        ProbeCase{"TwosStcoMono", SoundCodec::Twos, 1, 32000, 0, false, false, false, false, "pcm_s16be"},
-        ProbeCase{"SowtCo64LargeMdat", SoundCodec::Sowt, 2, 48000, 1, true, true, false, false, "pcm_s16le"},
-        ProbeCase{"AacStco", SoundCodec::Aac, 2, 44100, 1, false, false, false, false, "aac"},
-        ProbeCase{"AacCo64SoundAndMoovFirst", SoundCodec::Aac, 2, 48000, 0, true, true, true, true, "aac"}),
-    [](const testing::TestParamInfo<ProbeCase>& info) { return std::string(info.param.name); });
+TEST(FfprobeTest, ReadsTracksAndPacketsAsLaidOut)
+{
+    ASSERT_TRUE(testsupport::HaveCommand("ffprobe")) << "ffprobe is required";
+    for (const ProbeCase& c : {ProbeCase{SoundCodec::Twos, 1, 32000, 0, false, false, "pcm_s16be"},
+                               ProbeCase{SoundCodec::Sowt, 2, 48000, 1, true, false, "pcm_s16le"},
+                               ProbeCase{SoundCodec::Aac, 2, 44100, 1, false, false, "aac"},
+                               ProbeCase{SoundCodec::Aac, 2, 48000, 0, true, true, "aac"}}) {
+        SCOPED_TRACE(std::string(c.codecName) + (c.wide ? " co64" : " stco"));
+        ProbeMovie(c);
+    }
+}
 
 }  // namespace

@@ -325,7 +325,7 @@ std::vector<int16_t> Sound(size_t frames, unsigned channels, double tone, double
 }
 
 // The filters are linear, so noise and tone are measured apart over the intervals.
-TEST_F(OvixTest, NoiseDropsInsideIntervalsAndToneStays)
+TEST_F(OvixTest, NoiseDropsInsideIntervalsToneStaysAndEdgesSaturate)
 {
     const auto inside = [](uint64_t t) { return (t >= 30000 && t < 60000) || (t >= 90000 && t < 120000); };
     const std::vector<int16_t> noise = Sound(3 * kRate, 2, 0.0, 250.0);
@@ -349,11 +349,8 @@ TEST_F(OvixTest, NoiseDropsInsideIntervalsAndToneStays)
         // The filters' state carries from block to block, wherever the blocks begin.
         EXPECT_EQ(Process({.afBlock = af, .pcm = noise, .audioFrameLimit = 700}), out);
     }
-}
 
-// A full-scale 50 Hz square wave: the high-pass doubles every edge, which must clip, not wrap.
-TEST_F(OvixTest, SaturatesInsteadOfWrapping)
-{
+    // A full-scale 50 Hz square wave: the high-pass doubles every edge, which must clip, not wrap.
     std::vector<int16_t> square(24000);
     for (size_t t = 0; t < square.size(); ++t) {
         square[t] = (t / 480) % 2 == 0 ? -32000 : 32000;

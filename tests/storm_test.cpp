@@ -29,9 +29,9 @@ class StormTest : public jobtest::HostTest {};
 
 TEST_F(StormTest, AbortedJobsBesideQueriesLeaveNothingBehind)
 {
-    moviekit::MovieSpec pcm;
+    moviekit::MovieRecipe pcm;
     pcm.video.frameCount = 300;
-    moviekit::MovieSpec aac = pcm;
+    moviekit::MovieRecipe aac = pcm;
     aac.sound.codec = moviekit::SoundCodec::Aac;
     const std::string sources[] = {Write(pcm, "pcm.mov"), Write(aac, "aac.mov")};
     const std::string destination = m_dir.File("dst.mov");

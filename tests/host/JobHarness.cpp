@@ -236,7 +236,7 @@ private:
 
 }  // namespace
 
-bool WriteSparseMovie(const std::string& path, const moviekit::MovieSpec& recipe, uint64_t holeBytes,
+bool WriteSparseMovie(const std::string& path, const moviekit::MovieRecipe& recipe, uint64_t holeBytes,
                       moviekit::MovieLayout* layout, std::string* error)
 {
     SparseFileSink sink(path, holeBytes);
@@ -304,7 +304,7 @@ void HostTest::SetUp()
 
 void HostTest::TearDown() { TqCloseOVIX(); }
 
-std::string HostTest::Write(const moviekit::MovieSpec& recipe, const std::string& name,
+std::string HostTest::Write(const moviekit::MovieRecipe& recipe, const std::string& name,
                             moviekit::MovieLayout* layout)
 {
     const std::string path = m_dir.File(name);

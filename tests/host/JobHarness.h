@@ -54,7 +54,7 @@ std::vector<uint8_t> ReadRange(const std::string& path, uint64_t offset, uint64_
 bool Contains(const std::vector<uint8_t>& bytes, const std::string& text);
 // Writes the movie as moviekit lays it out, but every single write of at least `holeBytes`
 // (video frames, when they are that large) becomes a hole that reads as zeros.
-bool WriteSparseMovie(const std::string& path, const moviekit::MovieSpec& recipe, uint64_t holeBytes,
+bool WriteSparseMovie(const std::string& path, const moviekit::MovieRecipe& recipe, uint64_t holeBytes,
                       moviekit::MovieLayout* layout, std::string* error);
 // Raw AAC-LC packets (ADTS headers removed) that ffmpeg's encoder makes of interleaved s16.
 bool EncodeAacPackets(const std::vector<int16_t>& pcm, uint32_t sampleRate, uint16_t channels, uint32_t bitRate,
@@ -65,7 +65,7 @@ protected:
     void SetUp() override;
     void TearDown() override;
 
-    std::string Write(const moviekit::MovieSpec& recipe, const std::string& name,
+    std::string Write(const moviekit::MovieRecipe& recipe, const std::string& name,
                       moviekit::MovieLayout* layout = nullptr);
     // Starts a job and waits for its end; the exported final state.
     int Run(const std::string& source, const std::string& destination);

@@ -99,7 +99,7 @@ Bytes MakeAudioSpecificConfig(uint32_t sampleRate, uint16_t channels, uint8_t ob
     return bits.Finish();
 }
 
-Bytes MakeEsdsPayload(const EsdsSpec& recipe, const Bytes& audioSpecificConfig, uint32_t maxBitRate,
+Bytes MakeEsdsPayload(const EsdsRecipe& recipe, const Bytes& audioSpecificConfig, uint32_t maxBitRate,
                       uint32_t averageBitRate)
 {
     if (recipe.rawPayload) {

@@ -14,7 +14,7 @@ inline constexpr uint32_t kAacFramesPerPacket = 1024;
 // AAC-LC (object type 2 unless given); rates outside the index table use the escape form.
 Bytes MakeAudioSpecificConfig(uint32_t sampleRate, uint16_t channels, uint8_t objectType = 2);
 
-struct EsdsSpec {
+struct EsdsRecipe {
     uint8_t objectType = 0x40;  // MPEG-4 audio
     uint8_t streamType = 0x15;  // audio stream, upstream 0, reserved 1
     uint32_t bufferSize = 6144; // 24 bits
@@ -28,7 +28,7 @@ struct EsdsSpec {
 };
 
 // The "esds" payload (version and flags included) with the bit rates already resolved.
-Bytes MakeEsdsPayload(const EsdsSpec& recipe, const Bytes& audioSpecificConfig, uint32_t maxBitRate,
+Bytes MakeEsdsPayload(const EsdsRecipe& recipe, const Bytes& audioSpecificConfig, uint32_t maxBitRate,
                       uint32_t averageBitRate);
 
 // A raw_data_block that decodes to silence: one SCE (mono) or CPE (stereo) with no spectral

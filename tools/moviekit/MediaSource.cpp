@@ -27,8 +27,8 @@ void MediaSource::VideoFrame(uint64_t index, Bytes& out) const
 int16_t MediaSource::ToneSample(uint64_t frame, uint32_t channel) const
 {
     // Integer phase, so that the millionth second is as exact as the first.
-    const uint64_t rate = m_spec.sound.sampleRate;
-    const uint64_t hz = (uint64_t{m_spec.sound.toneHz} * (channel + 1)) % rate;
+    const uint64_t rate = m_recipe.sound.sampleRate;
+    const uint64_t hz = (uint64_t{m_recipe.sound.toneHz} * (channel + 1)) % rate;
     const uint64_t phase = ((frame % rate) * hz) % rate;
     const double angle = 2.0 * std::numbers::pi * static_cast<double>(phase) / static_cast<double>(rate);
     return static_cast<int16_t>(std::lround(8000.0 * std::sin(angle)));
@@ -36,9 +36,9 @@ int16_t MediaSource::ToneSample(uint64_t frame, uint32_t channel) const
 
 void MediaSource::PcmFrames(uint64_t firstFrame, uint32_t frames, Bytes& out) const
 {
-    const uint32_t channels = m_spec.sound.channels;
+    const uint32_t channels = m_recipe.sound.channels;
     out.resize(uint64_t{frames} * channels * 2);
-    const std::vector<int16_t>& given = m_spec.sound.pcm;
+    const std::vector<int16_t>& given = m_recipe.sound.pcm;
     size_t pos = 0;
     for (uint64_t f = firstFrame; f < firstFrame + frames; ++f) {
         for (uint32_t c = 0; c < channels; ++c) {
@@ -54,10 +54,10 @@ void MediaSource::PcmFrames(uint64_t firstFrame, uint32_t frames, Bytes& out) co
 
 void MediaSource::AacPacket(uint64_t index, Bytes& out) const
 {
-    if (!m_spec.sound.aacPackets.empty()) {
-        out = m_spec.sound.aacPackets[index];
+    if (!m_recipe.sound.aacPackets.empty()) {
+        out = m_recipe.sound.aacPackets[index];
     } else {
-        out = MakeSilentAacPacket(m_spec.sound.channels, m_plan.aacFillBytes[index], index);
+        out = MakeSilentAacPacket(m_recipe.sound.channels, m_plan.aacFillBytes[index], index);
     }
 }
 

@@ -10,7 +10,7 @@ namespace moviekit {
 
 class MediaSource {
 public:
-    MediaSource(const MovieSpec& recipe, const MoviePlan& plan) : m_spec(recipe), m_plan(plan) {}
+    MediaSource(const MovieRecipe& recipe, const MoviePlan& plan) : m_recipe(recipe), m_plan(plan) {}
 
     // Replaces `out` with the frame's bytes.
     void VideoFrame(uint64_t index, Bytes& out) const;
@@ -24,7 +24,7 @@ public:
 private:
     int16_t ToneSample(uint64_t frame, uint32_t channel) const;
 
-    const MovieSpec& m_spec;
+    const MovieRecipe& m_recipe;
     const MoviePlan& m_plan;
     Bytes m_buffer;  // reused from piece to piece
 };

@@ -114,9 +114,9 @@ Bytes Dinf()
     return Container("dinf", {Atom("dref", dref)});
 }
 
-Bytes VideoTrack(const MovieSpec& recipe, const MoviePlan& plan, bool co64)
+Bytes VideoTrack(const MovieRecipe& recipe, const MoviePlan& plan, bool co64)
 {
-    const VideoSpec& video = recipe.video;
+    const VideoRecipe& video = recipe.video;
     const uint64_t mediaDuration = uint64_t{video.frameCount} * video.frameDuration;
     const uint32_t movieDuration = Rescale(mediaDuration, video.timeScale, recipe.movieTimeScale);
     std::vector<Bytes> minf = {Atom("vmhd", Bytes{0, 0, 0, 1, 0, 0x40, 0x80, 0, 0x80, 0, 0x80, 0})};
@@ -137,9 +137,9 @@ Bytes VideoTrack(const MovieSpec& recipe, const MoviePlan& plan, bool co64)
     return Container("trak", trak);
 }
 
-Bytes SoundTrack(const MovieSpec& recipe, const MoviePlan& plan, bool co64)
+Bytes SoundTrack(const MovieRecipe& recipe, const MoviePlan& plan, bool co64)
 {
-    const SoundSpec& sound = recipe.sound;
+    const SoundRecipe& sound = recipe.sound;
     const uint32_t rate = sound.sampleRate;
     const uint32_t movieDuration = Rescale(plan.soundFrames, rate, recipe.movieTimeScale);
     std::vector<Bytes> minf = {Atom("smhd", Bytes(8, 0))};
@@ -162,7 +162,7 @@ Bytes SoundTrack(const MovieSpec& recipe, const MoviePlan& plan, bool co64)
     return Container("trak", trak);
 }
 
-Bytes UserData(const MakerSpec& maker, const MoviePlan& plan)
+Bytes UserData(const MakerRecipe& maker, const MoviePlan& plan)
 {
     std::vector<Bytes> tcdb;
     if (maker.afInformation) {
@@ -190,7 +190,7 @@ Bytes UserData(const MakerSpec& maker, const MoviePlan& plan)
 
 }  // namespace
 
-Bytes BuildMoov(const MovieSpec& recipe, const MoviePlan& plan, bool co64)
+Bytes BuildMoov(const MovieRecipe& recipe, const MoviePlan& plan, bool co64)
 {
     uint32_t duration = 0;
     std::vector<Bytes> tracks;

@@ -7,6 +7,6 @@
 namespace moviekit {
 
 // The size of the result depends on `co64` but never on the chunk offsets themselves.
-Bytes BuildMoov(const MovieSpec& recipe, const MoviePlan& plan, bool co64);
+Bytes BuildMoov(const MovieRecipe& recipe, const MoviePlan& plan, bool co64);
 
 }  // namespace moviekit

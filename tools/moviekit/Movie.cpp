@@ -44,7 +44,7 @@ private:
 
 }  // namespace
 
-bool WriteMovie(const std::string& path, const MovieSpec& recipe, MovieLayout* layout, std::string* error)
+bool WriteMovie(const std::string& path, const MovieRecipe& recipe, MovieLayout* layout, std::string* error)
 {
     FileSink sink(path);
     if (!sink.IsOpen()) {
@@ -63,7 +63,7 @@ bool WriteMovie(const std::string& path, const MovieSpec& recipe, MovieLayout* l
     return written;
 }
 
-Bytes BuildMovie(const MovieSpec& recipe, MovieLayout* layout, std::string* error)
+Bytes BuildMovie(const MovieRecipe& recipe, MovieLayout* layout, std::string* error)
 {
     VectorSink sink;
     if (!WriteMovieTo(sink, recipe, layout, error)) {

@@ -13,7 +13,7 @@
 
 namespace moviekit {
 
-struct VideoSpec {
+struct VideoRecipe {
     bool present = true;
     std::string format = "raw ";  // any other four-cc gets the same pattern bytes
     uint16_t width = 64;
@@ -29,7 +29,7 @@ struct VideoSpec {
 
 enum class SoundCodec { Twos, Sowt, Aac };
 
-struct SoundSpec {
+struct SoundRecipe {
     bool present = true;
     SoundCodec codec = SoundCodec::Twos;
     std::string formatOverride;  // another four-cc for big-endian PCM, e.g. "lpcm"
@@ -45,14 +45,14 @@ struct SoundSpec {
     std::vector<int16_t> pcm;  // interleaved; empty: a deterministic tone
     uint32_t toneHz = 1000;
     std::vector<Bytes> aacPackets;  // empty: silent packets of varying size
-    EsdsSpec esds;
+    EsdsRecipe esds;
     bool edts = true;
     bool elst = true;
     // Unset: the priming a camera records (1024, but 0 for "sowt").
     std::optional<uint32_t> mediaTime;
 };
 
-struct MakerSpec {
+struct MakerRecipe {
     bool userData = true;
     bool afInformation = true;
     std::optional<Bytes> afPayload;  // unset: "AFR1" from the fields below
@@ -73,7 +73,7 @@ struct MakerSpec {
     std::vector<Bytes> extraTcdbChildren;
 };
 
-struct MovieSpec {
+struct MovieRecipe {
     std::string majorBrand = "qt  ";
     uint32_t minorVersion = 0x00000200;
     std::vector<std::string> compatibleBrands = {"qt  "};
@@ -90,9 +90,9 @@ struct MovieSpec {
     uint32_t movieTimeScale = 1000;
     Bytes trailingBytes;  // appended after the last atom, for size accounting tests
     bool keepSoundBytes = true;  // MovieLayout::soundBytes; off for very large movies
-    VideoSpec video;
-    SoundSpec sound;
-    MakerSpec maker;
+    VideoRecipe video;
+    SoundRecipe sound;
+    MakerRecipe maker;
 };
 
 struct ChunkLayout {
@@ -118,8 +118,8 @@ struct MovieLayout {
     uint32_t videoFrameSize = 0;
 };
 
-bool WriteMovie(const std::string& path, const MovieSpec& recipe, MovieLayout* layout, std::string* error);
+bool WriteMovie(const std::string& path, const MovieRecipe& recipe, MovieLayout* layout, std::string* error);
 // Same bytes as WriteMovie; empty on an invalid description (the reason in `error`).
-Bytes BuildMovie(const MovieSpec& recipe, MovieLayout* layout = nullptr, std::string* error = nullptr);
+Bytes BuildMovie(const MovieRecipe& recipe, MovieLayout* layout = nullptr, std::string* error = nullptr);
 
 }  // namespace moviekit

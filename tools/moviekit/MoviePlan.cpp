@@ -16,7 +16,7 @@ bool PlanFail(std::string* error, const std::string& reason)
 
 uint64_t DivCeil(uint64_t a, uint64_t b) { return a / b + (a % b != 0 ? 1 : 0); }
 
-uint64_t FramesForVideo(const VideoSpec& video, uint64_t videoFrames, uint32_t rate)
+uint64_t FramesForVideo(const VideoRecipe& video, uint64_t videoFrames, uint32_t rate)
 {
     return static_cast<uint64_t>(Wide{videoFrames} * video.frameDuration * rate / video.timeScale);
 }
@@ -32,9 +32,9 @@ std::vector<uint32_t> SplitIntoChunks(uint64_t total, uint32_t perChunk)
 
 namespace {
 
-void ResolveMaker(const MovieSpec& recipe, MoviePlan& plan)
+void ResolveMaker(const MovieRecipe& recipe, MoviePlan& plan)
 {
-    const MakerSpec& maker = recipe.maker;
+    const MakerRecipe& maker = recipe.maker;
     if (maker.afPayload) {
         plan.afPayload = *maker.afPayload;
     } else {
@@ -59,7 +59,7 @@ void ResolveMaker(const MovieSpec& recipe, MoviePlan& plan)
     }
 }
 
-bool PlanVideo(const VideoSpec& video, MoviePlan& plan, std::string* error)
+bool PlanVideo(const VideoRecipe& video, MoviePlan& plan, std::string* error)
 {
     if (!video.present) {
         return true;
@@ -91,7 +91,7 @@ bool PlanVideo(const VideoSpec& video, MoviePlan& plan, std::string* error)
 }
 
 // Sound chunks go with the video chunk period in which they start.
-void Interleave(const MovieSpec& recipe, MoviePlan& plan)
+void Interleave(const MovieRecipe& recipe, MoviePlan& plan)
 {
     std::vector<ChunkSlot> order;
     const size_t videoCount = plan.videoChunks.size();
@@ -99,7 +99,7 @@ void Interleave(const MovieSpec& recipe, MoviePlan& plan)
     for (uint32_t s = 0; s < plan.soundChunks.size(); ++s) {
         size_t period = 0;
         if (videoCount > 0) {
-            const VideoSpec& video = recipe.video;
+            const VideoRecipe& video = recipe.video;
             const uint64_t startFrame = plan.soundChunks[s].firstSample * (plan.aac ? kAacFramesPerPacket : 1);
             const Wide periodLength = Wide{video.framesPerChunk} * video.frameDuration * recipe.sound.sampleRate;
             const Wide index = Wide{startFrame} * video.timeScale / periodLength;
@@ -131,7 +131,7 @@ void Interleave(const MovieSpec& recipe, MoviePlan& plan)
 
 }  // namespace
 
-bool PlanMovie(const MovieSpec& recipe, MoviePlan* plan, std::string* error)
+bool PlanMovie(const MovieRecipe& recipe, MoviePlan* plan, std::string* error)
 {
     *plan = MoviePlan{};
     if (!PlanVideo(recipe.video, *plan, error)) {

@@ -37,7 +37,7 @@ struct MoviePlan {
     std::vector<std::vector<ChunkSlot>> mdats;  // the chunks of each "mdat" in file order
 };
 
-bool PlanMovie(const MovieSpec& recipe, MoviePlan* plan, std::string* error);
+bool PlanMovie(const MovieRecipe& recipe, MoviePlan* plan, std::string* error);
 std::vector<uint64_t> MdatPayloadSizes(const MoviePlan& plan);
 void AssignOffsets(MoviePlan& plan, const std::vector<uint64_t>& mdatPayloadOffsets);
 
@@ -46,7 +46,7 @@ using Wide = unsigned __int128;
 bool PlanFail(std::string* error, const std::string& reason);
 uint64_t DivCeil(uint64_t a, uint64_t b);
 // Audio frames that cover `videoFrames` frames of video.
-uint64_t FramesForVideo(const VideoSpec& video, uint64_t videoFrames, uint32_t rate);
+uint64_t FramesForVideo(const VideoRecipe& video, uint64_t videoFrames, uint32_t rate);
 std::vector<uint32_t> SplitIntoChunks(uint64_t total, uint32_t perChunk);
 
 }  // namespace moviekit

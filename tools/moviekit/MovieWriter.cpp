@@ -17,7 +17,7 @@ struct TopLevel {
     uint32_t mdat = 0;
 };
 
-std::vector<TopLevel> TopLevelOrder(const MovieSpec& recipe, size_t mdatCount)
+std::vector<TopLevel> TopLevelOrder(const MovieRecipe& recipe, size_t mdatCount)
 {
     std::vector<TopLevel> order;
     if (!recipe.ftypAfterMoov) {
@@ -63,7 +63,7 @@ Bytes MdatHeader(uint64_t payloadSize, bool large)
 
 class MovieWriter {
 public:
-    MovieWriter(const MovieSpec& recipe, Sink& sink) : m_spec(recipe), m_sink(sink) {}
+    MovieWriter(const MovieRecipe& recipe, Sink& sink) : m_recipe(recipe), m_sink(sink) {}
 
     bool Write(MovieLayout* layout, std::string* error);
 
@@ -71,7 +71,7 @@ private:
     bool Lay(bool co64);
     bool WriteFree();
 
-    const MovieSpec& m_spec;
+    const MovieRecipe& m_recipe;
     Sink& m_sink;
     MoviePlan m_plan;
     std::vector<uint64_t> m_payloadSizes;
@@ -87,7 +87,7 @@ private:
 // what "stco" can address.
 bool MovieWriter::Lay(bool co64)
 {
-    m_moov = BuildMoov(m_spec, m_plan, co64);
+    m_moov = BuildMoov(m_recipe, m_plan, co64);
     std::vector<uint64_t> payloadOffsets(m_payloadSizes.size());
     m_offsets.clear();
     uint64_t position = 0;
@@ -95,7 +95,7 @@ bool MovieWriter::Lay(bool co64)
         m_offsets.push_back(position);
         switch (item.part) {
         case Part::Ftyp: position += m_ftyp.size(); break;
-        case Part::Free: position += 8 + uint64_t{m_spec.freeSize}; break;
+        case Part::Free: position += 8 + uint64_t{m_recipe.freeSize}; break;
         case Part::Wide: position += 8; break;
         case Part::Moov: position += m_moov.size(); break;
         case Part::Mdat: {
@@ -106,7 +106,7 @@ bool MovieWriter::Lay(bool co64)
         }
         }
     }
-    m_fileSize = position + m_spec.trailingBytes.size();
+    m_fileSize = position + m_recipe.trailingBytes.size();
     AssignOffsets(m_plan, payloadOffsets);
     for (const auto* chunks : {&m_plan.soundChunks, &m_plan.videoChunks}) {
         for (const ChunkLayout& chunk : *chunks) {
@@ -116,18 +116,18 @@ bool MovieWriter::Lay(bool co64)
         }
     }
     // The moov holds offsets; its size does not depend on them, so one rebuild settles it.
-    m_moov = BuildMoov(m_spec, m_plan, co64);
+    m_moov = BuildMoov(m_recipe, m_plan, co64);
     return true;
 }
 
 bool MovieWriter::WriteFree()
 {
     Bytes piece;
-    PutU32(piece, m_spec.freeSize + 8);
+    PutU32(piece, m_recipe.freeSize + 8);
     PutType(piece, "free");
     bool written = m_sink.Write(piece);
     piece.assign(1 << 16, 0);
-    for (uint64_t left = m_spec.freeSize; left > 0 && written; left -= piece.size()) {
+    for (uint64_t left = m_recipe.freeSize; left > 0 && written; left -= piece.size()) {
         piece.resize(std::min<uint64_t>(left, piece.size()));
         written = m_sink.Write(piece);
     }
@@ -137,28 +137,28 @@ bool MovieWriter::WriteFree()
 bool MovieWriter::Write(MovieLayout* layout, std::string* error)
 {
     auto fail = [error](const std::string& reason) { return PlanFail(error, reason); };
-    if (m_spec.movieTimeScale == 0) {
+    if (m_recipe.movieTimeScale == 0) {
         return fail("movie time scale 0");
     }
-    if (m_spec.freeSize > UINT32_MAX - 8) {
+    if (m_recipe.freeSize > UINT32_MAX - 8) {
         return fail("free atom too large");
     }
-    if (!PlanMovie(m_spec, &m_plan, error)) {
+    if (!PlanMovie(m_recipe, &m_plan, error)) {
         return false;
     }
     m_payloadSizes = MdatPayloadSizes(m_plan);
     for (uint64_t size : m_payloadSizes) {
-        m_largeHeaders.push_back(m_spec.largeMdatHeader || size > UINT32_MAX - 8);
+        m_largeHeaders.push_back(m_recipe.largeMdatHeader || size > UINT32_MAX - 8);
     }
     Bytes ftyp;
-    PutType(ftyp, m_spec.majorBrand);
-    PutU32(ftyp, m_spec.minorVersion);
-    for (const std::string& brand : m_spec.compatibleBrands) {
+    PutType(ftyp, m_recipe.majorBrand);
+    PutU32(ftyp, m_recipe.minorVersion);
+    for (const std::string& brand : m_recipe.compatibleBrands) {
         PutType(ftyp, brand);
     }
     m_ftyp = Atom("ftyp", ftyp);
-    m_order = TopLevelOrder(m_spec, m_plan.mdats.size());
-    bool co64 = m_spec.co64;
+    m_order = TopLevelOrder(m_recipe, m_plan.mdats.size());
+    bool co64 = m_recipe.co64;
     if (!Lay(co64)) {
         co64 = true;
         Lay(co64);
@@ -185,8 +185,8 @@ bool MovieWriter::Write(MovieLayout* layout, std::string* error)
             out.mdatPayloadOffsets.push_back(m_offsets[i] + (large ? 16 : 8));
             out.mdatPayloadSizes.push_back(m_payloadSizes[item.mdat]);
             written = m_sink.Write(MdatHeader(m_payloadSizes[item.mdat], large));
-            MediaSource source(m_spec, m_plan);
-            Bytes* soundBytes = m_spec.keepSoundBytes ? &out.soundBytes : nullptr;
+            MediaSource source(m_recipe, m_plan);
+            Bytes* soundBytes = m_recipe.keepSoundBytes ? &out.soundBytes : nullptr;
             for (const ChunkSlot& slot : m_plan.mdats[item.mdat]) {
                 written = written && source.WriteChunk(slot, m_sink, soundBytes);
             }
@@ -197,7 +197,7 @@ bool MovieWriter::Write(MovieLayout* layout, std::string* error)
             return fail("cannot write the movie");
         }
     }
-    if (!m_sink.Write(m_spec.trailingBytes)) {
+    if (!m_sink.Write(m_recipe.trailingBytes)) {
         return fail("cannot write the movie");
     }
     if (m_sink.Written() != m_fileSize) {
@@ -215,7 +215,7 @@ bool MovieWriter::Write(MovieLayout* layout, std::string* error)
 
 }  // namespace
 
-bool WriteMovieTo(Sink& sink, const MovieSpec& recipe, MovieLayout* layout, std::string* error)
+bool WriteMovieTo(Sink& sink, const MovieRecipe& recipe, MovieLayout* layout, std::string* error)
 {
     MovieWriter writer(recipe, sink);
     return writer.Write(layout, error);

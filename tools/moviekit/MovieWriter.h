@@ -22,6 +22,6 @@ private:
     uint64_t m_written = 0;
 };
 
-bool WriteMovieTo(Sink& sink, const MovieSpec& recipe, MovieLayout* layout, std::string* error);
+bool WriteMovieTo(Sink& sink, const MovieRecipe& recipe, MovieLayout* layout, std::string* error);
 
 }  // namespace moviekit

@@ -66,7 +66,7 @@ Bytes ChunkOffsets(const std::vector<ChunkLayout>& chunks, bool co64)
     return Atom(co64 ? "co64" : "stco", p);
 }
 
-Bytes VideoDescription(const VideoSpec& video)
+Bytes VideoDescription(const VideoRecipe& video)
 {
     Bytes e;
     e.insert(e.end(), 6, 0);
@@ -92,7 +92,7 @@ Bytes VideoDescription(const VideoSpec& video)
     return Atom("stsd", p);
 }
 
-Bytes SoundDescription(const SoundSpec& sound, const MoviePlan& plan)
+Bytes SoundDescription(const SoundRecipe& sound, const MoviePlan& plan)
 {
     const uint16_t version = sound.descriptionVersion;
     Bytes e;

@@ -12,7 +12,7 @@ Bytes Stsc(const std::vector<ChunkLayout>& chunks);
 // `commonSize` 0 lists the chunks' sample sizes one by one.
 Bytes Stsz(const std::vector<ChunkLayout>& chunks, uint32_t commonSize, uint64_t sampleCount);
 Bytes ChunkOffsets(const std::vector<ChunkLayout>& chunks, bool co64);
-Bytes VideoDescription(const VideoSpec& video);
-Bytes SoundDescription(const SoundSpec& sound, const MoviePlan& plan);
+Bytes VideoDescription(const VideoRecipe& video);
+Bytes SoundDescription(const SoundRecipe& sound, const MoviePlan& plan);
 
 }  // namespace moviekit

@@ -6,11 +6,11 @@ namespace moviekit {
 
 namespace {
 
-bool ResolveSoundSamples(const MovieSpec& recipe, MoviePlan& plan, std::vector<uint32_t>& counts,
+bool ResolveSoundSamples(const MovieRecipe& recipe, MoviePlan& plan, std::vector<uint32_t>& counts,
                          std::string* error)
 {
-    const SoundSpec& sound = recipe.sound;
-    const VideoSpec& video = recipe.video;
+    const SoundRecipe& sound = recipe.sound;
+    const VideoRecipe& video = recipe.video;
     uint64_t samples = sound.sampleCount;
     if (plan.aac && !sound.aacPackets.empty()) {
         if (samples != 0 && samples != sound.aacPackets.size()) {
@@ -83,9 +83,9 @@ void BuildSoundChunks(MoviePlan& plan, const std::vector<uint32_t>& counts)
     }
 }
 
-void ResolveAac(const MovieSpec& recipe, MoviePlan& plan)
+void ResolveAac(const MovieRecipe& recipe, MoviePlan& plan)
 {
-    const SoundSpec& sound = recipe.sound;
+    const SoundRecipe& sound = recipe.sound;
     uint64_t totalBytes = 0;
     uint32_t largest = 0;
     for (uint64_t i = 0; i < plan.soundSamples; ++i) {
@@ -116,9 +116,9 @@ void ResolveAac(const MovieSpec& recipe, MoviePlan& plan)
 
 }  // namespace
 
-bool PlanSound(const MovieSpec& recipe, MoviePlan& plan, std::string* error)
+bool PlanSound(const MovieRecipe& recipe, MoviePlan& plan, std::string* error)
 {
-    const SoundSpec& sound = recipe.sound;
+    const SoundRecipe& sound = recipe.sound;
     if (sound.channels == 0 || sound.sampleRate == 0 || sound.sampleRate > 0xFFFF) {
         return PlanFail(error, "sound needs 1 or more channels and a rate of 1 to 65535 Hz");
     }

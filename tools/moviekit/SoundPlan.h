@@ -6,6 +6,6 @@
 
 namespace moviekit {
 
-bool PlanSound(const MovieSpec& recipe, MoviePlan& plan, std::string* error);
+bool PlanSound(const MovieRecipe& recipe, MoviePlan& plan, std::string* error);
 
 }  // namespace moviekit

@@ -104,7 +104,7 @@ int MakeSampleCommand(const Arguments& arguments)
         return 2;
     }
 
-    moviekit::MovieSpec recipe;
+    moviekit::MovieRecipe recipe;
     recipe.video.width = 320;
     recipe.video.height = 180;
     recipe.video.frameCount = static_cast<uint32_t>(seconds * 30000 / 1001);
