@@ -201,6 +201,11 @@ eTqovixErrorCode CTqovixFile::Flush()
     if (const int fault = InjectedFault(eTqovixFileOperation::Flush)) {
         return ConvertErrnoToLocalError(fault, m_bReadOnly);
     }
+    return FlushStream();
+}
+
+eTqovixErrorCode CTqovixFile::FlushStream()
+{
     if (std::fflush(m_stream) != 0) {
         const int error = errno;
         std::clearerr(m_stream);
@@ -225,10 +230,8 @@ eTqovixErrorCode CTqovixFile::CopyFrom(CTqovixFile& source, unsigned long long s
         return ConvertErrnoToLocalError(fault, false);
     }
     // Our buffered bytes go first; both streams' positions include what they buffer.
-    if (std::fflush(m_stream) != 0) {
-        const int error = errno;
-        std::clearerr(m_stream);
-        return ConvertErrnoToLocalError(error, false);
+    if (const eTqovixErrorCode flushed = FlushStream(); TqovixFailed(flushed)) {
+        return flushed;
     }
     off_t in = ftello(source.m_stream);
     off_t out = ftello(m_stream);

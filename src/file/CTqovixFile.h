@@ -66,6 +66,9 @@ public:
     static TqovixFaultHook SetFaultHook(TqovixFaultHook hook);
 
 private:
+    // fflush alone: the kernel copy must not count as a flush for the fault seam.
+    eTqovixErrorCode FlushStream();
+
     bool m_bOpened = false;
     bool m_bReadOnly = true;
     bool m_bKernelCopyRefused = false;  // asked once per destination, not once per chunk
