@@ -1,6 +1,5 @@
-// The exported interface as a host sees it: what the library exports, the engine's
-// lifecycle, the refusals of a job start, abort and the host's progress callback, and the
-// property query. Everything goes through the eight exported functions.
+// The exported interface as a host sees it: exports, the engine's lifecycle, the refusals
+// of a job start and the property query, all through the eight exported functions.
 #include "host/JobHarness.h"
 
 #include <grp.h>
@@ -11,7 +10,6 @@
 #include <atomic>
 #include <filesystem>
 #include <iterator>
-#include <mutex>
 #include <set>
 #include <sstream>
 #include <thread>
@@ -20,28 +18,12 @@
 namespace {
 
 using jobtest::Exists;
-using jobtest::FileStamp;
 using jobtest::StampFile;
-using jobtest::WaitForJob;
 using Recipe = moviekit::MovieRecipe;
 
-// The host's progress callback: what it answers and what it was shown.
-std::mutex g_callbackMutex;
-std::vector<std::pair<int, int>> g_callbackSeen;
-std::atomic<int> g_callbackAnswer{0};
-
-int HostCallback(int first, int second)
-{
-    std::lock_guard lock(g_callbackMutex);
-    g_callbackSeen.emplace_back(first, second);
-    return g_callbackAnswer.load();
-}
-
-std::vector<std::pair<int, int>> CallbackSeen()
-{
-    std::lock_guard lock(g_callbackMutex);
-    return g_callbackSeen;
-}
+// Answers 131, which would end a job with 131 if a refused installation had got in.
+std::atomic<int> g_callbackCalls{0};
+int HostCallback(int, int) { ++g_callbackCalls; return 131; }
 
 // Threads and open descriptors of this process.
 std::pair<long, long> Census()
@@ -51,27 +33,16 @@ std::pair<long, long> Census()
             std::distance(directory_iterator("/proc/self/fd"), directory_iterator())};
 }
 
-class ApiTest : public jobtest::HostTest {
-protected:
-    void SetUp() override
-    {
-        HostTest::SetUp();
-        std::lock_guard lock(g_callbackMutex);
-        g_callbackSeen.clear();
-        g_callbackAnswer.store(0);
-    }
+using ApiTest = jobtest::HostTest;
 
-    // About a minute of 48 kHz stereo PCM beside small frames: a job on it is still
-    // running when the host's next call arrives.
-    std::string WriteLong(const std::string& name)
-    {
-        Recipe recipe;
-        recipe.video.width = 16;
-        recipe.video.height = 16;
-        recipe.video.frameCount = 1800;
-        return Write(recipe, name);
-    }
-};
+// About a minute of 48 kHz stereo PCM beside small frames: still running at the host's next call.
+Recipe LongRecipe()
+{
+    Recipe recipe;
+    recipe.video.width = recipe.video.height = 16;
+    recipe.video.frameCount = 1800;
+    return recipe;
+}
 
 TEST(ApiExports, OnlyTheEightFunctionsAndTheEnginePointer)
 {
@@ -94,70 +65,46 @@ TEST_F(ApiTest, WithoutAnEngineEveryCallIsRefusedAndCloseIsHarmless)
 {
     const std::string source = Write(Recipe{}, "src.mov");
     const std::string destination = m_dir.File("dst.mov");
-    const FileStamp before = StampFile(source);
     TqCloseOVIX();
-
-    g_callbackAnswer.store(131);  // would end the job below with 131 if it were ever installed
     EXPECT_EQ(TqIsFinishedOVIX(), 190);
     EXPECT_EQ(TqGetPropertyOVIX(source.c_str()), 190);
     EXPECT_EQ(TqSetCallBackNotifyProgressOVIX(HostCallback), 190);
     EXPECT_EQ(TqExecuteOVIX(source.c_str(), destination.c_str()), 190);
-    int first = -7, second = -7;
-    EXPECT_EQ(TqGetProgressOVIX(&first, &second), 190);
+    int first = -7;
+    EXPECT_EQ(TqGetProgressOVIX(&first, nullptr), 190);
     EXPECT_EQ(first, -7);
-    EXPECT_EQ(second, -7);
     TqAbortOVIX();
     TqCloseOVIX();
-    EXPECT_EQ(TqIsFinishedOVIX(), 190);
     EXPECT_FALSE(Exists(destination));
-    EXPECT_EQ(StampFile(source), before);
 
     ASSERT_EQ(TqInitializeOVIX(), 0);
-    EXPECT_EQ(TqIsFinishedOVIX(), 1);
     EXPECT_EQ(Run(source, destination), 1);
-    EXPECT_TRUE(CallbackSeen().empty());
+    EXPECT_EQ(g_callbackCalls, 0);
 }
 
 // A failed start leaves its code (abort and a second initialisation keep it) and removes
-// what stood at the destination; the engine still takes the next job.
+// what stood at the destination.
 TEST_F(ApiTest, IdleEngineAndRefusedStarts)
 {
     EXPECT_EQ(TqIsFinishedOVIX(), 1);
-    EXPECT_EQ(TqGetProgressOVIX(nullptr, nullptr), 0);
-    int first = -7, second = -7;
-    EXPECT_EQ(TqGetProgressOVIX(&first, nullptr), 0);
-    EXPECT_EQ(TqGetProgressOVIX(nullptr, &second), 0);
-    EXPECT_EQ(first, 0);
-    EXPECT_EQ(second, 0);
-    TqAbortOVIX();
-    EXPECT_EQ(TqIsFinishedOVIX(), 1);
-
     const std::string source = Write(Recipe{}, "src.mov");
-    const FileStamp before = StampFile(source);
+    const auto before = StampFile(source);
     const std::string destination = m_dir.File("dst.mov");
     ASSERT_TRUE(testsupport::WriteFile(destination, {1, 2, 3}));
     EXPECT_EQ(TqExecuteOVIX(m_dir.File("absent.mov").c_str(), destination.c_str()), 110);
     EXPECT_FALSE(Exists(destination));
     TqAbortOVIX();
-    EXPECT_EQ(TqIsFinishedOVIX(), 110);
     EXPECT_EQ(TqInitializeOVIX(), 190);
     EXPECT_EQ(TqIsFinishedOVIX(), 110);
 
-    const std::string inAbsentDirectory = m_dir.File("absent/dst.mov");
-    EXPECT_EQ(TqExecuteOVIX(source.c_str(), inAbsentDirectory.c_str()), 111);
+    EXPECT_EQ(TqExecuteOVIX(source.c_str(), m_dir.File("absent/dst.mov").c_str()), 111);
     EXPECT_EQ(TqIsFinishedOVIX(), 111);
-    EXPECT_FALSE(Exists(inAbsentDirectory));
     EXPECT_EQ(StampFile(source), before);
-
-    EXPECT_EQ(Run(source, destination), 1);
-    TqAbortOVIX();
-    EXPECT_EQ(TqIsFinishedOVIX(), 1);
-    EXPECT_TRUE(Exists(destination));
 }
 
 TEST_F(ApiTest, RepeatedCyclesReleaseThreadsAndDescriptors)
 {
-    const std::string source = WriteLong("long.mov");
+    const std::string source = Write(LongRecipe(), "long.mov");
     const std::string destination = m_dir.File("dst.mov");
     TqCloseOVIX();
     // Sanitizer runtimes start a helper thread with the first thread: start one first.
@@ -182,56 +129,31 @@ TEST_F(ApiTest, RepeatedCyclesReleaseThreadsAndDescriptors)
 
 TEST_F(ApiTest, SecondJobAndCallbackAreRefusedWhileOneRuns)
 {
-    const std::string source = WriteLong("long.mov");
-    const std::string destination = m_dir.File("dst.mov");
+    const std::string source = Write(LongRecipe(), "long.mov");
     const std::string other = m_dir.File("other.mov");
-    const std::vector<uint8_t> otherBytes = {1, 2, 3};
-    ASSERT_TRUE(testsupport::WriteFile(other, otherBytes));
-    g_callbackAnswer.store(131);  // ends the job with 131 if the refused callback got in
-    ASSERT_EQ(TqExecuteOVIX(source.c_str(), destination.c_str()), 0);
+    ASSERT_TRUE(testsupport::WriteFile(other, {1, 2, 3}));
+    ASSERT_EQ(TqExecuteOVIX(source.c_str(), m_dir.File("dst.mov").c_str()), 0);
     EXPECT_EQ(TqSetCallBackNotifyProgressOVIX(HostCallback), 190);
-    EXPECT_EQ(TqSetCallBackNotifyProgressOVIX(nullptr), 190);
     EXPECT_EQ(TqExecuteOVIX(source.c_str(), other.c_str()), 190);
-    EXPECT_EQ(WaitForJob(), 1);
+    EXPECT_EQ(jobtest::WaitForJob(), 1);
     TqCloseOVIX();  // returns once the library's thread has left every callback
-    EXPECT_TRUE(CallbackSeen().empty());
-    EXPECT_TRUE(Exists(destination));
-    EXPECT_EQ(testsupport::ReadFile(other), otherBytes);
+    EXPECT_EQ(g_callbackCalls, 0);
+    EXPECT_EQ(testsupport::ReadFile(other), (std::vector<uint8_t>{1, 2, 3}));
 }
 
 TEST_F(ApiTest, SameFileUnderAnySpellingIsRefused)
 {
     const std::string source = Write(Recipe{}, "src.mov");
-    const FileStamp before = StampFile(source);
+    const auto before = StampFile(source);
     const std::string link = m_dir.File("link.mov");
     ASSERT_EQ(symlink(source.c_str(), link.c_str()), 0);
     for (const std::string& destination :
          {source, std::filesystem::relative(source).string(), m_dir.Path() + "/./src.mov", link}) {
         SCOPED_TRACE(destination);
         EXPECT_EQ(TqExecuteOVIX(source.c_str(), destination.c_str()), 190);
-        EXPECT_EQ(TqIsFinishedOVIX(), 190);
         EXPECT_EQ(StampFile(source), before);
         EXPECT_TRUE(std::filesystem::is_symlink(link));
     }
-}
-
-// Answers other than 0 are judged with whole jobs (job suite) and the scripted library
-// (engine suite); here the host sees the progress of a job it lets run.
-TEST_F(ApiTest, CallbackSeesRisingProgress)
-{
-    moviekit::MovieLayout layout;
-    const std::string source = Write(Recipe{}, "src.mov", &layout);
-    ASSERT_EQ(TqSetCallBackNotifyProgressOVIX(HostCallback), 0);
-    EXPECT_EQ(Run(source, m_dir.File("dst.mov")), 1);
-    TqCloseOVIX();  // returns once the library's thread has left every callback
-    const std::vector<std::pair<int, int>> seen = CallbackSeen();
-    const int total = static_cast<int>(layout.soundSampleCount);
-    ASSERT_GE(seen.size(), 2u);
-    for (size_t k = 0; k < seen.size(); ++k) {
-        EXPECT_EQ(seen[k].second, total) << "call " << k;
-        EXPECT_GE(seen[k].first, k > 0 ? seen[k - 1].first : 0) << "call " << k;
-    }
-    EXPECT_EQ(seen.back().first, total);
 }
 
 // Runs the query in a child process that has given up root, so that file modes apply.
@@ -266,20 +188,17 @@ TEST_F(ApiTest, PropertyVerdictsLeaveFileAndEngineAlone)
         Recipe recipe;
         edit(recipe);
         const std::string path = Write(recipe, "movie" + std::to_string(row++) + ".mov");
-        const FileStamp before = StampFile(path);
+        const auto before = StampFile(path);
         EXPECT_EQ(TqGetPropertyOVIX(path.c_str()), expected);
         EXPECT_EQ(StampFile(path), before);
         EXPECT_EQ(TqIsFinishedOVIX(), 1);
     }
     EXPECT_EQ(TqGetPropertyOVIX(m_dir.File("absent.mov").c_str()), 110);
-    EXPECT_EQ(TqGetPropertyOVIX(""), 110);
     EXPECT_EQ(TqGetPropertyOVIX(m_dir.Path().c_str()), 190);
 
     const std::string locked = Write(Recipe{}, "locked.mov");
-    ASSERT_EQ(chmod(m_dir.Path().c_str(), 0755), 0);
-    ASSERT_EQ(chmod(locked.c_str(), 0), 0);
+    ASSERT_EQ(chmod(m_dir.Path().c_str(), 0755) | chmod(locked.c_str(), 0), 0);
     EXPECT_EQ(geteuid() == 0 ? PropertyAsNobody(locked) : TqGetPropertyOVIX(locked.c_str()), 120);
-    EXPECT_EQ(TqIsFinishedOVIX(), 1);
 }
 
 }  // namespace

@@ -1,5 +1,5 @@
-// The AAC codec classes over the converter layer: statuses, the decoder's delay, the encoder's
-// block, drop and flush rules, and timing through decode → encode → decode.
+// The AAC codec classes over the converter layer: statuses, the decoder's delay and the
+// encoder's block, drop and flush rules.
 #include <gtest/gtest.h>
 
 #include <AudioToolbox/AudioToolbox.h>
@@ -7,9 +7,6 @@
 #include <algorithm>
 #include <array>
 #include <cmath>
-#include <cstring>
-#include <functional>
-#include <random>
 #include <string>
 #include <tuple>
 #include <vector>
@@ -31,7 +28,6 @@ constexpr size_t kBlockSamples = 1024 * kChannels;
 constexpr unsigned int kBlockBytes = 4096;
 constexpr unsigned int kDropBytes = 4352;
 constexpr unsigned int kFlush = 0;
-constexpr long kPriming = 2112;
 constexpr auto kAborted = static_cast<eConverterErrorCode>(eTqovixErrorAborted);
 constexpr auto kAccessDenied = static_cast<eConverterErrorCode>(eTqovixErrorSourceAccessDenied);
 
@@ -39,61 +35,30 @@ ACFormat AacFormat(double rate = kRate, uint32_t channels = kChannels)
 {
     return ACFormat{rate, ACFormatAAC, 0, 0, 1024, 0, channels, 0};
 }
-
 // What the codec adapter builds for a 16-bit track.
 ACFormat PcmFormat(double rate = kRate, uint32_t channels = kChannels)
 {
     return ACFormat{rate, ACFormatLinearPCM, 12, 2 * channels, 1, 2 * channels, channels, 16};
 }
 
-// A 1 kHz tone after `silentFrames`; the channels differ so that a swap would show.
-Pcm Tone(size_t frames, size_t silentFrames = 0)
+// A 1 kHz tone; the channels differ so that a swap would show.
+Pcm Tone(size_t frames)
 {
-    Pcm pcm(frames * kChannels, 0);
-    for (size_t i = silentFrames * kChannels; i < pcm.size(); ++i) {
+    Pcm pcm(frames * kChannels);
+    for (size_t i = 0; i < pcm.size(); ++i) {
         const double phase = 2 * M_PI * 1000.0 * static_cast<double>(i / kChannels) / kRate + (i % 2) * M_PI / 2;
         pcm[i] = static_cast<int16_t>(std::lround(12000 * std::sin(phase)));
     }
     return pcm;
 }
 
-// Silence with one short broadband click at frame `at`: it has exactly one best alignment.
-Pcm Click(size_t frames, size_t at)
-{
-    constexpr std::array<int, 8> kShape = {6000, 18000, 24000, 12000, -12000, -24000, -18000, -6000};
-    Pcm pcm(frames * kChannels, 0);
-    for (size_t k = 0; k < kShape.size() * kChannels; ++k) {
-        pcm[at * kChannels + k] = static_cast<int16_t>(kShape[k / kChannels]);
-    }
-    return pcm;
-}
-
-// The lag L within ±maxLag at which signal[i + L] best matches reference[i], first channel.
-long BestLag(const Pcm& reference, const Pcm& signal, long from, long length, long maxLag)
-{
-    const long signalFrames = static_cast<long>(signal.size() / kChannels);
-    long best = 0;
-    double bestScore = -1e300;
-    for (long lag = -maxLag; lag <= maxLag; ++lag) {
-        double score = 0;
-        for (long i = std::max(from, -lag); i < std::min(from + length, signalFrames - lag); ++i) {
-            score += static_cast<double>(reference[i * kChannels]) * signal[(i + lag) * kChannels];
-        }
-        if (score > bestScore) {
-            bestScore = score;
-            best = lag;
-        }
-    }
-    return best;
-}
-
-// An open encoder fed consecutive bytes of `pcm`, its stream lending a 4096-byte buffer as
-// the codec adapter does, and able to refuse one packet.
+// An open encoder fed consecutive bytes of `pcm`, lent a buffer as the codec adapter does,
+// and able to refuse one packet.
 struct EncoderRig {
-    explicit EncoderRig(bool lend = true, unsigned int bitRate = 256000)
+    explicit EncoderRig(bool lend = true)
     {
         stream = {lend ? Request : nullptr, Result, buffer.data(), static_cast<unsigned int>(buffer.size()), this};
-        EXPECT_EQ(encoder.Initialize(PcmFormat(), AacFormat(), bitRate, &stream), eConverterSuccess);
+        EXPECT_EQ(encoder.Initialize(PcmFormat(), AacFormat(), 256000, &stream), eConverterSuccess);
     }
 
     eConverterErrorCode Push(unsigned int bytes)
@@ -134,39 +99,18 @@ void OpenDecoder(AACDecoder& decoder, uint32_t channels = kChannels, unsigned in
     }
 }
 
-// One Decode's status and PCM size, the PCM appended to `out`. Past the argument checks a
-// success uses the whole packet, a failure nothing, and delivers nothing.
-std::pair<eConverterErrorCode, unsigned int> Decode(AACDecoder& decoder, const Packet& packet, Pcm* out = nullptr)
-{
-    std::array<int16_t, AACDecoder::kMaxPcmSize / sizeof(int16_t)> pcm{};
-    unsigned int pcmSize = 1;
-    unsigned int used = 1;
-    const auto status =
-        decoder.Decode(pcm.data(), &pcmSize, &used, packet.data(), static_cast<unsigned int>(packet.size()));
-    const bool ok = status == eConverterSuccess;
-    EXPECT_TRUE(packet.empty() || (used == (ok ? packet.size() : 0U) && (ok || pcmSize == 0))) << status;
-    if (out != nullptr) {
-        out->insert(out->end(), pcm.begin(), pcm.begin() + pcmSize / sizeof(int16_t));
-    }
-    return {status, pcmSize};
-}
-
+// One Decode's PCM size. Past the argument checks a success uses the whole packet, a failure
+// nothing, and delivers nothing.
 unsigned int Decoded(AACDecoder& decoder, const Packet& packet, eConverterErrorCode expected = eConverterSuccess)
 {
-    const auto [status, pcmSize] = Decode(decoder, packet);
+    std::array<int16_t, AACDecoder::kMaxPcmSize / sizeof(int16_t)> pcm{};
+    unsigned int pcmSize = 1, used = 1;
+    const auto status =
+        decoder.Decode(pcm.data(), &pcmSize, &used, packet.data(), static_cast<unsigned int>(packet.size()));
     EXPECT_EQ(status, expected);
+    const bool ok = status == eConverterSuccess;
+    EXPECT_TRUE(packet.empty() || (used == (ok ? packet.size() : 0U) && (ok || pcmSize == 0))) << status;
     return pcmSize;
-}
-
-Pcm DecodeAll(const Packets& packets, unsigned int delay)
-{
-    AACDecoder decoder;
-    OpenDecoder(decoder, kChannels, delay);
-    Pcm pcm;
-    for (const Packet& packet : packets) {
-        EXPECT_EQ(Decode(decoder, packet, &pcm).first, eConverterSuccess);
-    }
-    return pcm;
 }
 
 // Every whole block of `pcm` through the one-block Encode of a fresh encoder.
@@ -176,8 +120,7 @@ Packets EncodeBlocks(const Pcm& pcm)
     Packets packets;
     std::array<unsigned char, kBlockBytes> aac{};
     for (size_t at = 0; at + kBlockSamples <= pcm.size(); at += kBlockSamples) {
-        unsigned int aacSize = 0;
-        unsigned int used = 0;
+        unsigned int aacSize = 0, used = 0;
         EXPECT_EQ(rig.encoder.Encode(aac.data(), &aacSize, &used, pcm.data() + at, kBlockBytes), eConverterSuccess);
         EXPECT_EQ(used, kBlockBytes);
         packets.emplace_back(aac.data(), aac.data() + aacSize);
@@ -185,41 +128,13 @@ Packets EncodeBlocks(const Pcm& pcm)
     return packets;
 }
 
-// `pcm` through the streaming Encode in pushes cycling through `sizes`, then the flush.
-Packets EncodeStream(Pcm pcm, const std::vector<size_t>& sizes)
-{
-    EncoderRig rig;
-    rig.pcm = std::move(pcm);
-    const size_t total = rig.pcm.size() * sizeof(int16_t);
-    for (size_t i = 0; rig.pushed < total; ++i) {
-        EXPECT_EQ(rig.Push(static_cast<unsigned int>(std::min(sizes[i % sizes.size()], total - rig.pushed))),
-                  eConverterSuccess);
-    }
-    EXPECT_EQ(rig.Push(kFlush), eConverterSuccess);
-    return rig.packets;
-}
-
 Packets SilentPackets(size_t count)
 {
-    Packets packets;
+    Packets packets(count);
     for (size_t i = 0; i < count; ++i) {
-        packets.push_back(moviekit::MakeSilentAacPacket(kChannels, 40 + static_cast<uint32_t>(i), i));
+        packets[i] = moviekit::MakeSilentAacPacket(kChannels, 40 + static_cast<uint32_t>(i), i);
     }
     return packets;
-}
-
-TEST(AacRoundTripTest, ClickKeepsItsPositionThroughDecodeEncodeDecode)
-{
-    // The source as the platform encoder would have made it: primed by 2112 frames.
-    const long at = 6000;
-    const Pcm click = Click(24 * 1024, at);
-    const Packets source = EncodeBlocks(click);
-    const Pcm sourceDecoded = DecodeAll(source, 0);
-    ASSERT_EQ(BestLag(click, sourceDecoded, at - 256, 512, 4096), kPriming);
-
-    // One packet dropped by the decoder, pushes of any size, 4352 bytes dropped, the flush.
-    const Packets result = EncodeStream(DecodeAll(source, 1), {3000, 4096, 1234, 8192});
-    EXPECT_EQ(BestLag(sourceDecoded, DecodeAll(result, 0), at + kPriming - 256, 512, 4096), 0);
 }
 
 TEST(AacDecoderTest, DelayDropsExactlyTheFirstPackets)
@@ -234,13 +149,6 @@ TEST(AacDecoderTest, DelayDropsExactlyTheFirstPackets)
             EXPECT_EQ(Decoded(decoder, silent[i]), i < delay ? 0U : 4096U) << "delay " << delay << ", packet " << i;
         }
     }
-    // What is dropped is the first packet's output, not some other.
-    const Packets packets = EncodeBlocks(Tone(8 * 1024));
-    const Pcm whole = DecodeAll(packets, 0);
-    const Pcm delayed = DecodeAll(packets, 1);
-    ASSERT_EQ(whole.size(), 8 * kBlockSamples);
-    ASSERT_EQ(delayed.size(), 7 * kBlockSamples);
-    EXPECT_TRUE(std::equal(delayed.begin(), delayed.end(), whole.begin() + kBlockSamples));
 }
 
 TEST(AacDecoderTest, PrimingQueriedFromAMovieSetsTheDelay)
@@ -249,44 +157,19 @@ TEST(AacDecoderTest, PrimingQueriedFromAMovieSetsTheDelay)
     moviekit::MovieRecipe recipe;
     recipe.sound.codec = moviekit::SoundCodec::Aac;
     recipe.sound.aacPackets = packets;
-    moviekit::MovieLayout layout;
-    const moviekit::Bytes camera = moviekit::BuildMovie(recipe, &layout);  // priming 1024
+    const moviekit::Bytes camera = moviekit::BuildMovie(recipe, nullptr);  // priming 1024
     recipe.sound.mediaTime = 2112;
     const moviekit::Bytes platform = moviekit::BuildMovie(recipe, nullptr);
     recipe.sound.present = false;
-    const moviekit::Bytes silent = moviekit::BuildMovie(recipe, nullptr);
-
-    using Bytes = moviekit::Bytes;
-    using Change = std::function<void(Bytes&)>;
-    // Writes `value` into every `type` atom, `offset` bytes from its type field.
-    const auto patch = [](const char* type, ptrdiff_t offset, uint32_t value) {
-        return Change([=](Bytes& b) {
-            for (size_t at = 4, field = at + offset; std::max(at, field) + 4 <= b.size(); ++at, ++field) {
-                if (std::memcmp(b.data() + at, type, 4) == 0) {
-                    for (size_t i = 0; i < 4; ++i) {
-                        b[field + i] = static_cast<uint8_t>(value >> (24 - 8 * i));
-                    }
-                }
-            }
-        });
-    };
-    // name, change to the camera movie, status, delay after a delay of 5 was set
-    const std::vector<std::tuple<const char*, Change, eConverterErrorCode, unsigned int>> rows = {
-        {"PlatformPrimingMeansOnePacket", [&](Bytes& b) { b = platform; }, eConverterSuccess, 1},
-        {"OtherPrimingKeepsTheDelay", [](Bytes&) {}, eConverterSuccess, 5},
-        {"NoSoundTrack", [&](Bytes& b) { b = silent; }, kAccessDenied, 5},
-        {"Garbage", [](Bytes& b) { b.assign(100, 0xEE); }, kAccessDenied, 5},
-        {"MovieAtomCutShort", [&](Bytes& b) { b.resize(layout.moovOffset + layout.moovSize / 2); }, kAccessDenied, 5},
-        {"EditCountBeyondItsAtom", patch("elst", 8, ~0U), kAccessDenied, 5},
-        {"TimeToSampleCountBeyondItsAtom", patch("stts", 8, 1U << 28), kAccessDenied, 5},
-        {"MediaTimeScaleZero", patch("mdhd", 16, 0), kAccessDenied, 5},
-        {"AtomSizeBelowItsHeader", patch("trak", -4, 3), kAccessDenied, 5},
+    // name, movie, status, delay after a delay of 5 was set
+    const std::tuple<const char*, moviekit::Bytes, eConverterErrorCode, unsigned int> rows[] = {
+        {"PlatformPrimingMeansOnePacket", platform, eConverterSuccess, 1},
+        {"OtherPrimingKeepsTheDelay", camera, eConverterSuccess, 5},
+        {"NoSoundTrack", moviekit::BuildMovie(recipe, nullptr), kAccessDenied, 5},
     };
     testsupport::TempDir dir;
     AACDecoder decoder;
-    for (const auto& [name, change, status, delay] : rows) {
-        Bytes bytes = camera;
-        change(bytes);
+    for (const auto& [name, bytes, status, delay] : rows) {
         const std::string path = dir.File(std::string(name) + ".mov");
         ASSERT_TRUE(testsupport::WriteFile(path, bytes));
         ASSERT_NO_FATAL_FAILURE(OpenDecoder(decoder, kChannels, 5));
@@ -298,18 +181,15 @@ TEST(AacDecoderTest, PrimingQueriedFromAMovieSetsTheDelay)
     EXPECT_EQ(decoder.SetDecoderDelay(nullptr), eConverterInternal);
     EXPECT_EQ(decoder.SetDecoderDelay(""), eTqovixErrorSourceNotFound);
     EXPECT_EQ(decoder.SetDecoderDelay(dir.File("missing.mov").c_str()), eTqovixErrorSourceAccessDenied);
-    EXPECT_EQ(decoder.SetDecoderDelay(dir.Path().c_str()), eTqovixErrorSourceAccessDenied);
 }
 
 TEST(AacEncoderTest, PushesOfAnySizeAreCutIntoBlocksAfterTheDropAndFlushedWithSilence)
 {
-    struct Step {
-        unsigned int bytes;  // or kFlush
-        size_t packetsBy;
+    struct Step {  // bytes pushed or kFlush, packets by then, status
+        unsigned int bytes, packetsBy;
         eConverterErrorCode status = eConverterSuccess;
     };
     const std::vector<std::tuple<const char*, bool, size_t, std::vector<Step>>> rows = {  // name, lend, refuseAt
-        {"OneBlockPushes", true, SIZE_MAX, {{4096, 0}, {4096, 1}, {4096, 2}, {4096, 3}, {kFlush, 4}}},
         // 4352 dropped, a block, 1552 held; with the next push exactly one block; the flush
         // sends the 100 held bytes padded with silence, then silence; a second holds nothing.
         {"RemaindersWait", true, SIZE_MAX, {{10000, 1}, {2544, 2}, {100, 2}, {kFlush, 4}, {kFlush, 5}}},
@@ -322,33 +202,38 @@ TEST(AacEncoderTest, PushesOfAnySizeAreCutIntoBlocksAfterTheDropAndFlushedWithSi
         rig.refuseAt = refuseAt;
         for (const Step& step : steps) {
             EXPECT_EQ(rig.Push(step.bytes), step.status) << name;
-            EXPECT_EQ(rig.packets.size(), step.packetsBy) << name << " after pushing " << step.bytes;
+            EXPECT_EQ(rig.packets.size(), size_t{step.packetsBy}) << name << " after pushing " << step.bytes;
         }
-        for (size_t i = 0; i < rig.packets.size(); ++i) {
-            EXPECT_EQ(rig.writtenAt[i] == rig.buffer.data(), lend) << name;
-        }
+        EXPECT_EQ(static_cast<size_t>(std::ranges::count(rig.writtenAt, rig.buffer.data())),
+                  lend ? rig.packets.size() : 0) << name;
         // Asked for with the largest packet size, 6144 bits per channel.
         EXPECT_EQ(rig.requested, std::vector<unsigned int>(lend ? steps.size() : 0, 1536U)) << name;
     }
 
-    // Blocks from pushes of any size are the blocks of the PCM after its first 4352 bytes;
-    // the flush adds the remainder padded with silence, then silence.
-    const Pcm tone = Tone(20 * 1024 + 300, 500);
-    const Packets pushed = EncodeStream(tone, {3000, 777, 5000, 4096, 1});
-
-    Pcm blocks(tone.begin() + kDropBytes / 2, tone.end());
+    // Byte for byte, the blocks of the PCM after its first 4352 bytes; the flush adds the
+    // remainder padded with silence, then silence.
+    EncoderRig rig;
+    rig.pcm = Tone(20 * 1024 + 300);
+    const size_t total = rig.pcm.size() * sizeof(int16_t);
+    const std::array<size_t, 5> sizes = {3000, 777, 5000, 4096, 1};
+    for (size_t i = 0; rig.pushed < total; ++i) {
+        ASSERT_EQ(rig.Push(static_cast<unsigned int>(std::min(sizes[i % sizes.size()], total - rig.pushed))),
+                  eConverterSuccess);
+    }
+    ASSERT_EQ(rig.Push(kFlush), eConverterSuccess);
+    Pcm blocks(rig.pcm.begin() + kDropBytes / 2, rig.pcm.end());
     blocks.resize(blocks.size() - blocks.size() % kBlockSamples + 2 * kBlockSamples, 0);
     Packets expected = EncodeBlocks(blocks);
     expected.pop_back();  // the flush's last block holds only the remainder's length
-    ASSERT_EQ(pushed.size(), expected.size() + 1);
-    EXPECT_TRUE(std::equal(expected.begin(), expected.end(), pushed.begin()));
+    ASSERT_EQ(rig.packets.size(), expected.size() + 1);
+    EXPECT_TRUE(std::equal(expected.begin(), expected.end(), rig.packets.begin()));
 }
 
-TEST(CodecFormatTest, OnlyAacLcAndPcm16AtOneRateAreAcceptedThenFormatsAndBitRateReadBack)
+TEST(CodecFormatTest, OnlyAacLcAndPcm16AtOneRateAreAccepted)
 {
     const auto flags = [](ACFormat format, uint32_t formatFlags) { return format.formatFlags = formatFlags, format; };
     constexpr eConverterErrorCode kRefused = eConverterRefused;
-    const std::vector<std::tuple<const char*, bool, ACFormat, ACFormat, eConverterErrorCode>> rows = {
+    const std::tuple<const char*, bool, ACFormat, ACFormat, eConverterErrorCode> rows[] = {
         // name, encoding, AAC side, PCM side
         {"PcmToPcm", false, PcmFormat(), PcmFormat(), kRefused},
         {"FloatPcm", false, AacFormat(), flags(PcmFormat(), 1 | 8), kRefused},
@@ -359,11 +244,9 @@ TEST(CodecFormatTest, OnlyAacLcAndPcm16AtOneRateAreAcceptedThenFormatsAndBitRate
         {"SevenChannels", true, AacFormat(kRate, 7), PcmFormat(kRate, 7), kRefused},
         {"NoAacRate", false, AacFormat(44500), PcmFormat(44500), kRefused},
         {"WouldResample", true, AacFormat(), PcmFormat(44100), kRefused},
-        // Whole-kilohertz labels stand for the AAC rates near them.
-        {"Label44000", true, AacFormat(44100), PcmFormat(44000), eConverterSuccess},
-        {"Label22000", false, AacFormat(22000), PcmFormat(22050), eConverterSuccess},
-        {"Label11000", true, AacFormat(11025), PcmFormat(11000), eConverterSuccess},
-        {"Label88000", false, AacFormat(88000), PcmFormat(88200), eConverterSuccess},
+        // Whole-kilohertz labels, on either side, stand for the AAC rates near them.
+        {"LabelOnPcm", true, AacFormat(44100), PcmFormat(44000), eConverterSuccess},
+        {"LabelOnAac", false, AacFormat(22000), PcmFormat(22050), eConverterSuccess},
     };
     for (const auto& [name, encoding, aac, pcm, status] : rows) {
         AACEncoder encoder;
@@ -376,25 +259,6 @@ TEST(CodecFormatTest, OnlyAacLcAndPcm16AtOneRateAreAcceptedThenFormatsAndBitRate
                   status == eConverterSuccess ? eConverterSuccess : eConverterInternal)
             << name;
     }
-
-    // The formats are read back from what the converter settled on.
-    ACFormat aac = AacFormat();
-    aac.framesPerPacket = 0;
-    AACDecoder decoder;
-    ASSERT_EQ(decoder.Initialize(aac, PcmFormat()), eConverterSuccess);
-    decoder.GetInputFormat(aac);
-    EXPECT_EQ(std::tie(aac.formatID, aac.framesPerPacket, aac.channelsPerFrame), std::tuple(ACFormatAAC, 1024U, 2U));
-
-    // 0 keeps the converter's own rate; a rate it refuses closes the converter.
-    EncoderRig plain(true, 0);
-    EncoderRig camera;
-    UInt32 rate = 0;
-    unsigned int size = sizeof rate;
-    ASSERT_EQ(camera.encoder.GetACProperty(kAudioConverterEncodeBitRate, &size, &rate), eConverterSuccess);
-    EXPECT_EQ(rate, 256000U);
-    AACEncoder refused;
-    EXPECT_EQ(refused.Initialize(PcmFormat(), AacFormat(), 1, &camera.stream), eConverterRefused);
-    EXPECT_EQ(refused.GetACProperty(kAudioConverterEncodeBitRate, &size, &rate), eConverterInternal);
 }
 
 TEST(CodecBadInputTest, BadPacketsMissingConvertersAndNullArgumentsAreStatuses)
@@ -405,41 +269,21 @@ TEST(CodecBadInputTest, BadPacketsMissingConvertersAndNullArgumentsAreStatuses)
     EXPECT_EQ(Decoded(decoder, Packet(2000, 0x5A), eConverterRefused), 0U) << "oversized";
     EXPECT_EQ(Decoded(decoder, silent[0]), 4096U) << "the oversized packet used up the delay";
 
-    std::mt19937 random(5);
-    int failures = 0;
-    for (int i = 0; i < 40; ++i) {
-        Packet garbage(1 + random() % 700);
-        std::generate(garbage.begin(), garbage.end(), [&] { return static_cast<uint8_t>(random()); });
-        const eConverterErrorCode result = Decode(decoder, garbage).first;
-        failures += result != eConverterSuccess;
-        EXPECT_TRUE(result == eConverterSuccess || result == eConverterRefused || result == eConverterFailed) << result;
-    }
-    EXPECT_GT(failures, 0);
-    EXPECT_EQ(Decoded(decoder, silent[1]), 4096U) << "the decoder recovers";
-
     AACDecoder mono;
     ASSERT_NO_FATAL_FAILURE(OpenDecoder(mono, 1, 0));
-    EXPECT_EQ(Decoded(mono, silent[0], eConverterFailed) + Decoded(mono, silent[1], eConverterFailed), 0U);
+    EXPECT_EQ(Decoded(mono, silent[0], eConverterFailed), 0U) << "stereo packet, mono decoder";
 
-    // Missing converters and null arguments are statuses.
-    AACDecoder unopenedDecoder;
-    EXPECT_EQ(Decoded(unopenedDecoder, silent[0], eConverterInternal), 0U) << "never opened";
     unsigned int size = 0;
     EXPECT_EQ(decoder.Decode(nullptr, &size, &size, silent[0].data(), 10), eConverterInternal);
     decoder.Close();
     EXPECT_EQ(Decoded(decoder, silent[0], eConverterInternal), 0U) << "closed";
-
-    AACEncoder unopened;
     unsigned char bytes[kBlockBytes] = {};
-    EXPECT_EQ(unopened.Encode(bytes, 16), eConverterInternal);
-    EXPECT_EQ(unopened.EncodeDone(), eConverterInternal);
-    EXPECT_EQ(unopened.Encode(bytes, &size, &size, bytes, 16), eConverterInternal);
     EncoderRig rig;
     EXPECT_EQ(rig.encoder.Encode(bytes, &size, &size, nullptr, 16), eConverterInternal);
     EXPECT_EQ(rig.encoder.Encode(nullptr, 16), eConverterInternal);
-    AACEncoder wrongChannels;
-    EXPECT_EQ(wrongChannels.Initialize(PcmFormat(), AacFormat(kRate, 1), 0, &rig.stream), eConverterRefused);
-    EXPECT_EQ(wrongChannels.Encode(bytes, 16), eConverterInternal) << "the stream was not kept";
+    AACEncoder lowRate;
+    EXPECT_EQ(lowRate.Initialize(PcmFormat(), AacFormat(), 1, &rig.stream), eConverterRefused) << "bit rate 1";
+    EXPECT_EQ(lowRate.Encode(bytes, 16), eConverterInternal) << "neither converter nor stream was kept";
     ASSERT_EQ(rig.Push(kDropBytes), eConverterSuccess);
     rig.encoder.Close();
     EXPECT_EQ(rig.Push(4096), eConverterInternal) << "fed after close";

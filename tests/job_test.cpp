@@ -183,6 +183,8 @@ const Layout kLayouts[] = {
          r.soundFirstInPeriod = true;
      }},
     {"SowtMdatSize64", SoundCodec::Sowt, [](moviekit::MovieRecipe& r) { r.largeMdatHeader = true; }},
+    // AF intervals are placed in frames of the track's own rate, not 48 kHz ones.
+    {"Twos44100", SoundCodec::Twos, [](moviekit::MovieRecipe& r) { r.sound.sampleRate = 44100; }},
     {"AacMdatSize64ThreeMdats", SoundCodec::Aac,
      [](moviekit::MovieRecipe& r) {
          r.largeMdatHeader = true;

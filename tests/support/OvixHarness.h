@@ -1,6 +1,5 @@
-// Plays the system's side of the processing library for its tests: callbacks over in-memory
-// AF information, audio level and PCM, a record of what the library asked and pushed, and
-// scripted faults (a failing callback, an abort inside one, a callback held at a gate).
+// The system's side of the processing library for its tests: callbacks over in-memory blocks and
+// PCM, a record of what the library asked and pushed, and scripted faults.
 #pragma once
 
 #include <ovix/Ovix.h>
@@ -9,8 +8,6 @@
 #include <atomic>
 #include <chrono>
 #include <cstdint>
-#include <optional>
-#include <ostream>
 #include <string>
 #include <thread>
 #include <utility>
@@ -20,13 +17,10 @@ namespace ovixtest {
 
 using Bytes = std::vector<uint8_t>;
 
-inline constexpr auto kPatience = std::chrono::seconds(20);
-
-// Polls until `done` holds; false when the patience runs out, so no test can hang.
-template <typename Predicate>
-bool WaitFor(Predicate done)
+// Polls until `done` holds; false after 20 s, so that no test can hang.
+bool WaitFor(auto done)
 {
-    const auto deadline = std::chrono::steady_clock::now() + kPatience;
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
     while (!done() && std::chrono::steady_clock::now() < deadline) {
         std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
@@ -34,19 +28,9 @@ bool WaitFor(Predicate done)
 }
 
 // Holds one callback until the test opens it; both sides wait a bounded time.
-class Gate {
-public:
-    void Arrive()
-    {
-        m_arrived = true;
-        WaitFor([this] { return m_open.load(); });
-    }
-    bool WaitArrived() { return WaitFor([this] { return m_arrived.load(); }); }
-    void Open() { m_open = true; }
-
-private:
-    std::atomic<bool> m_arrived{false};
-    std::atomic<bool> m_open{false};
+struct Gate {
+    std::atomic<bool> arrived{false}, open{false};
+    bool WaitArrived() { return WaitFor([this] { return arrived.load(); }); }
 };
 
 // The n-th (0-based) call of one callback, by event letter: 'a' AF size query, 'A' AF read,
@@ -61,17 +45,14 @@ struct Script {
     bool zerosAfterEnd = false;  // decoded AAC: the track is followed by zeros forever
     size_t infoPieceLimit = SIZE_MAX;
     size_t audioFrameLimit = SIZE_MAX / 64;
-    std::optional<unsigned long> afSize = {};  // announced instead of the true size
+    unsigned long afSize = 0;  // if not 0, announced instead of the true size
     bool overDeliver = false;  // the audio reader claims one byte more than asked
-    Trigger failAt = {}, abortAt = {}, holdAt = {};
-    Gate* gate = nullptr;
+    Trigger failAt = {}, abortAt = {}, holdAt = {};  // held at the harness's gate
 };
 
 struct Note {
-    unsigned long done = 0, total = 0;
-    unsigned long state = 0;  // TqovixIsSessionFinished inside the notification
+    unsigned long done = 0, total = 0, state = 0;  // state: TqovixIsSessionFinished inside the notification
     bool operator==(const Note&) const = default;
-    friend void PrintTo(const Note& n, std::ostream* out) { *out << n.done << '/' << n.total << " state " << n.state; }
 };
 
 class Harness {
@@ -88,15 +69,24 @@ public:
             return s_current.load()->ReadInfo('l', to, got, n);
         });
         TqovixSetCallbackInputAudio(&Harness::InputAudio);
-        TqovixSetCallbackOutputAudio(&Harness::OutputAudio);
-        TqovixSetCallbackNotifyProgress(&Harness::Notify);
+        TqovixSetCallbackOutputAudio([](void* data, unsigned long size) {
+            Harness& h = *s_current;
+            const int16_t* samples = static_cast<const int16_t*>(data);
+            h.pushed.insert(h.pushed.end(), samples, samples + size / sizeof(int16_t));
+            return h.Enter('O') ? ovix::kSuccess : ovix::kFailure;
+        });
+        TqovixSetCallbackNotifyProgress([](unsigned long done, unsigned long total) {
+            Harness& h = *s_current;
+            h.Enter('N');
+            h.notes.push_back({done, total, TqovixIsSessionFinished()});
+        });
     }
 
     // Read only after the session is closed (its worker joined) or while it is held at the gate.
     std::string events;
     std::vector<int16_t> pushed;
     std::vector<Note> notes;
-    Bytes processedAtEnd;  // read inside the notification that first reports the end
+    Gate gate;
 
 private:
     static inline std::atomic<Harness*> s_current{nullptr};
@@ -109,14 +99,14 @@ private:
         if (now == m_script.abortAt) {
             TqovixAbortSession();
         }
-        if (now == m_script.holdAt && m_script.gate != nullptr) {
-            m_script.gate->Arrive();
+        if (now == m_script.holdAt) {
+            gate.arrived = true;
+            WaitFor([this] { return gate.open.load(); });
         }
         return now != m_script.failAt;
     }
 
-    // The system's sequential reader: a null buffer asks for the size; the end delivers 0 and
-    // rewinds.
+    // The system's sequential reader: a null buffer asks for the size; the end delivers 0 and rewinds.
     unsigned long ReadInfo(char event, void* buffer, unsigned long* delivered, unsigned long size)
     {
         const bool af = event == 'a';
@@ -126,7 +116,7 @@ private:
             return ovix::kFailure;
         }
         if (buffer == nullptr) {
-            *delivered = af ? m_script.afSize.value_or(block.size()) : block.size();
+            *delivered = af && m_script.afSize != 0 ? m_script.afSize : block.size();
             return !af && block.empty() ? ovix::kNoAudioLevel : ovix::kSuccess;
         }
         *delivered = std::min({block.size() - position, size_t{size}, m_script.infoPieceLimit});
@@ -154,36 +144,8 @@ private:
         return ovix::kSuccess;
     }
 
-    static unsigned long OutputAudio(void* data, unsigned long size)
-    {
-        Harness& h = *s_current;
-        const int16_t* samples = static_cast<const int16_t*>(data);
-        h.pushed.insert(h.pushed.end(), samples, samples + size / sizeof(int16_t));
-        return h.Enter('O') ? ovix::kSuccess : ovix::kFailure;
-    }
-
-    static void Notify(unsigned long done, unsigned long total)
-    {
-        Harness& h = *s_current;
-        h.Enter('N');
-        const unsigned long state = TqovixIsSessionFinished();
-        if (state != 0 && h.processedAtEnd.empty()) {
-            uint8_t piece[7];  // smaller than any block, so that it comes in pieces
-            unsigned long count = 0;
-            unsigned long result = 0;
-            do {
-                result = TqovixGetProcessedAFInfo(piece, sizeof piece, &count);
-                count = result <= ovix::kLastPiece ? count : 0;
-                h.processedAtEnd.insert(h.processedAtEnd.end(), piece, piece + count);
-            } while (result == ovix::kSuccess && h.processedAtEnd.size() < 4096);
-        }
-        h.notes.push_back({done, total, state});
-    }
-
     Script m_script;
-    size_t m_afPosition = 0;
-    size_t m_levelPosition = 0;
-    size_t m_samplePosition = 0;
+    size_t m_afPosition = 0, m_levelPosition = 0, m_samplePosition = 0;
 };
 
 }  // namespace ovixtest
