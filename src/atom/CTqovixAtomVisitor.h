@@ -19,6 +19,12 @@ public:
     virtual eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixLeafAtom& atom) const = 0;
     // Told on entering a "trak" whether it has an edit list, before any child is visited.
     virtual void SetNeedAnalyzeMediaTime(bool needAnalyzeMediaTime) const = 0;
+    // Told when every child of a container it went into has been visited, in both walks,
+    // so that a visitor can decide per track. 0 ends the walk; 155 or 156 goes on.
+    virtual eTqovixErrorCode Leave(const TqovixAtomPath&, const CTqovixContainerAtom&) const
+    {
+        return eTqovixVisitSkip;
+    }
 
 protected:
     // Visitors live on the stack for one walk and are never deleted through this base.

@@ -60,7 +60,8 @@ eTqovixErrorCode CTqovixContainerAtom::Analyze(CTqovixAtomVisitor& visitor, cons
             return result;
         }
     }
-    return eTqovixVisitSkip;
+    const eTqovixErrorCode left = visitor.Leave(childPath, *this);
+    return IsWalkContinuation(left) ? eTqovixVisitSkip : left;
 }
 
 eTqovixErrorCode CTqovixContainerAtom::Update(const CTqovixAtomVisitor& visitor, const TqovixAtomPath& path)
@@ -76,7 +77,8 @@ eTqovixErrorCode CTqovixContainerAtom::Update(const CTqovixAtomVisitor& visitor,
             return result;
         }
     }
-    return eTqovixVisitSkip;
+    const eTqovixErrorCode left = visitor.Leave(childPath, *this);
+    return IsWalkContinuation(left) ? eTqovixVisitSkip : left;
 }
 
 eTqovixErrorCode CTqovixContainerAtom::Write(CTqovixFile& file) const

@@ -21,6 +21,8 @@ public:
     eTqovixErrorCode Write(CTqovixFile& file) const override;
 
     void SetData(const void* data, uint64_t size);
+    // A table that outgrew its form (an "stco" turned "co64").
+    void SetType(eTqovixAtomType type) { m_type = type; }
 
     // GetData with the reason of a failure: the file layer's code, 4352 when the
     // payload cannot be held in memory, 4359 when it lies beyond the file's end.

@@ -1,7 +1,6 @@
 #include "codec/AACEncoder.h"
 
 #include <algorithm>
-#include <array>
 #include <cstring>
 #include <new>
 
@@ -48,6 +47,22 @@ eConverterErrorCode AACEncoder::Initialize(const ACFormat& input, const ACFormat
         return result;
     }
     m_pStream = stream;
+    const unsigned int frameBytes = m_inputDescription.mBytesPerFrame;
+    if (frameBytes == 0 || frameBytes > 16) {
+        CloseConverter();
+        return eConverterInternal;
+    }
+    m_blockBytes = kFramesPerPacket * frameBytes;
+    m_dropBytes = uint64_t{kDroppedFrames} * frameBytes;
+    m_droppedBytes = 0;
+    m_encodedBlocks = 0;
+    m_pRemainder.reset();
+    m_remainderSize = 0;
+    m_straddling = AllocateBytes(m_blockBytes);
+    if (m_straddling == nullptr) {
+        CloseConverter();
+        return static_cast<eConverterErrorCode>(eTqovixErrorOutOfMemory);
+    }
     if (bitRate == 0) {
         return eConverterSuccess;
     }
@@ -111,7 +126,7 @@ eConverterErrorCode AACEncoder::EncodeBlock(OutputBuffer& output, const unsigned
 
 eConverterErrorCode AACEncoder::Encode(void* pcm, unsigned int pcmSize)
 {
-    if (m_pStream == nullptr || (pcm == nullptr && pcmSize > 0)) {
+    if (m_pStream == nullptr || m_straddling == nullptr || (pcm == nullptr && pcmSize > 0)) {
         return eConverterInternal;
     }
     OutputBuffer output;
@@ -127,14 +142,19 @@ eConverterErrorCode AACEncoder::Encode(void* pcm, unsigned int pcmSize)
     m_remainderSize = 0;
     const auto* fresh = static_cast<const unsigned char*>(pcm);
     const uint64_t total = heldSize + pcmSize;
-    std::array<unsigned char, kBlockSize> straddling;
 
     uint64_t offset = 0;
     while (offset < total) {
         const uint64_t left = total - offset;
-        if (left < kBlockSize) {
+        if (m_droppedBytes < m_dropBytes) {
+            const uint64_t dropped = std::min(left, m_dropBytes - m_droppedBytes);
+            m_droppedBytes += dropped;
+            offset += dropped;
+            continue;
+        }
+        if (left < m_blockBytes) {
             if (held == nullptr) {
-                held = AllocateBytes(kBlockSize);
+                held = AllocateBytes(m_blockBytes);
                 if (held == nullptr) {
                     return static_cast<eConverterErrorCode>(eTqovixErrorOutOfMemory);
                 }
@@ -149,33 +169,28 @@ eConverterErrorCode AACEncoder::Encode(void* pcm, unsigned int pcmSize)
             m_remainderSize = static_cast<unsigned int>(left);
             break;
         }
-        if (m_encodedBlocks == 0) {
-            offset += std::min<uint64_t>(left, kFirstBlockSize);
-            ++m_encodedBlocks;
-            continue;
-        }
         const unsigned char* block = nullptr;
         if (offset >= heldSize) {
             block = fresh + (offset - heldSize);
         } else {
             // Only a block that starts in the remainder is copied.
             const uint64_t fromHeld = heldSize - offset;
-            std::memcpy(straddling.data(), held.get() + offset, fromHeld);
-            std::memcpy(straddling.data() + fromHeld, fresh, kBlockSize - fromHeld);
-            block = straddling.data();
+            std::memcpy(m_straddling.get(), held.get() + offset, fromHeld);
+            std::memcpy(m_straddling.get() + fromHeld, fresh, m_blockBytes - fromHeld);
+            block = m_straddling.get();
         }
-        result = EncodeBlock(output, block, kBlockSize);
+        result = EncodeBlock(output, block, m_blockBytes);
         if (TqovixFailed(result)) {
             break;
         }
-        offset += kBlockSize;
+        offset += m_blockBytes;
     }
     return result;
 }
 
 eConverterErrorCode AACEncoder::EncodeDone()
 {
-    if (m_pStream == nullptr) {
+    if (m_pStream == nullptr || m_blockBytes == 0) {
         return eConverterInternal;
     }
     OutputBuffer output;
@@ -184,15 +199,20 @@ eConverterErrorCode AACEncoder::EncodeDone()
         return result;
     }
 
-    std::array<unsigned char, 2 * kBlockSize> tail{};
+    // What is held, then one block of silence.
+    std::unique_ptr<unsigned char[]> tail = AllocateBytes(2 * m_blockBytes);
+    if (tail == nullptr) {
+        return static_cast<eConverterErrorCode>(eTqovixErrorOutOfMemory);
+    }
+    std::memset(tail.get(), 0, 2 * m_blockBytes);
     const unsigned int heldSize = HeldSize();
     if (heldSize > 0) {
-        std::memcpy(tail.data(), m_pRemainder.get(), heldSize);
+        std::memcpy(tail.get(), m_pRemainder.get(), heldSize);
     }
-    const unsigned int tailSize = heldSize + kSilenceSize;
+    const unsigned int tailSize = heldSize + m_blockBytes;
     for (unsigned int offset = 0; offset < tailSize;) {
-        const unsigned int count = std::min(tailSize - offset, kBlockSize);
-        result = EncodeBlock(output, tail.data() + offset, count);
+        const unsigned int count = std::min(tailSize - offset, m_blockBytes);
+        result = EncodeBlock(output, tail.get() + offset, count);
         if (TqovixFailed(result)) {
             break;
         }

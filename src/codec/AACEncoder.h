@@ -1,8 +1,10 @@
 // Processed PCM to AAC packets through a platform audio converter. Pushes of any size
-// are cut into 4096-byte blocks, one packet each, handed at once to the stream's result
-// procedure; the first 4352 bytes are dropped, and the flush appends 4096 bytes of silence.
+// are cut into blocks of 1024 frames, one packet each, handed at once to the stream's
+// result procedure; the first 1088 frames are dropped, and the flush appends one block
+// of silence. Block, drop and silence follow the input's frame size.
 #pragma once
 
+#include <cstdint>
 #include <memory>
 
 #include "codec/ACEncoderStream.h"
@@ -10,12 +12,13 @@
 
 class AACEncoder : public AudioConverterBase {
 public:
+    static constexpr unsigned int kFramesPerPacket = 1024;
+    // The platform encoder primes 2112 frames; dropping 1088 frames here as well as one
+    // packet in the decoder puts the processed sound exactly where the source's was.
+    static constexpr unsigned int kDroppedFrames = 1088;
+    // Room for one packet, whatever the channel count.
     static constexpr unsigned int kBlockSize = 4096;
-    // The platform encoder primes 2112 frames; dropping 1088 stereo frames here as well
-    // as one packet in the decoder puts the processed sound where the source's was.
-    static constexpr unsigned int kFirstBlockSize = 4352;
     static constexpr unsigned int kOwnBufferSize = 32768;
-    static constexpr unsigned int kSilenceSize = 4096;
 
     AACEncoder();
     ~AACEncoder() override;
@@ -24,7 +27,7 @@ public:
     // `stream` (not owned) must outlive the encoder; `bitRate` 0 keeps the converter's own.
     virtual eConverterErrorCode Initialize(const ACFormat& input, const ACFormat& output, unsigned int bitRate,
                                            const ACEncoderStream* stream);
-    // One push of PCM; fewer than 4096 bytes left over wait for the next push.
+    // One push of PCM; less than a block left over waits for the next push.
     virtual eConverterErrorCode Encode(void* pcm, unsigned int pcmSize);
     // One block into one packet, written into `aac` (room for kBlockSize bytes).
     virtual eConverterErrorCode Encode(void* aac, unsigned int* aacSize, unsigned int* usedSize, const void* pcm,
@@ -43,6 +46,10 @@ protected:
     unsigned int m_encodedBlocks;
     std::unique_ptr<unsigned char[]> m_pRemainder;
     unsigned int m_remainderSize;
+    unsigned int m_blockBytes = 0;    // 1024 frames of the input
+    uint64_t m_dropBytes = 0;         // 1088 frames of the input
+    uint64_t m_droppedBytes = 0;      // dropped so far, across pushes
+    std::unique_ptr<unsigned char[]> m_straddling;  // a block that starts in the remainder
 
 private:
     class OutputBuffer;

@@ -61,6 +61,7 @@ eTqovixErrorCode ReadSequentially(const std::vector<uint8_t>& block, uint64_t& p
 
 eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const char* destinationPath)
 {
+    m_refusal.clear();
     if (sourcePath == nullptr || sourcePath[0] == '\0') {
         return eTqovixErrorSourceNotFound;
     }
@@ -77,18 +78,19 @@ eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const cha
     }
     if (TqovixFailed(m_atomControl.Initialize(m_sourceFile))) {
         Close();
-        return eTqovixErrorInvalidMovie;
+        return Refuse(eTqovixErrorInvalidMovie, "not a QuickTime movie with brand 'qt  ' or 'mp42', or its atoms "
+                                                "do not account for every byte of the file");
     }
 
     CTqovixAFInformationVisitor af;
     result = m_atomControl.Analyze(af);
     if (TqovixFailed(result) || (result >= eTqovixEnable && result <= eTqovixVerdict20)) {
         Close();
-        return result;
+        return result == eTqovixErrorInvalidMovie ? Refuse(result, "no AF information") : result;
     }
     if (af.GetAFInformationSize() == 0) {
         Close();
-        return eTqovixErrorInvalidMovie;
+        return Refuse(eTqovixErrorInvalidMovie, "no AF information");
     }
     result = CopyBlock(m_afInformation, af.GetAFInformation(), af.GetAFInformationSize());
     if (TqovixFailed(result)) {
@@ -110,12 +112,11 @@ eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const cha
             return result;
         }
     }
-    if (destinationPath == nullptr) {
-        return eTqovixSuccess;
-    }
-    result = AnalyzeTracks();
+    result = AnalyzeTracks(destinationPath != nullptr);
     if (TqovixFailed(result)) {
+        const std::string refusal = m_refusal;
         Close();
+        m_refusal = refusal;
     }
     return result;
 }
@@ -138,64 +139,6 @@ eTqovixErrorCode CTqovixMovControl::InitializeDestination(const char* sourcePath
     return m_destinationFile.Open(destinationPath, kOpenWrite);
 }
 
-eTqovixErrorCode CTqovixMovControl::AnalyzeTracks()
-{
-    CTqovixAudioInformationVisitor information;
-    eTqovixErrorCode result = m_atomControl.Analyze(information);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    if (information.GetAudioSpecificConfigSize() != 0) {
-        m_bPCM = false;
-    }
-    long long fileSize = 0;
-    result = m_sourceFile.GetFileSize(&fileSize);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-
-    CTqovixAudioDataVisitor audio;
-    result = m_atomControl.Analyze(audio);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    const uint32_t frameBytes = (uint32_t{information.GetSize()} * information.GetChannel()) >> 3;
-    result = audio.GetAudioChunkInformation(m_audioChunks, frameBytes);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    CTqovixMovieDataVisitor video;
-    result = m_atomControl.Analyze(video);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    result = video.GetOffset(m_movieDataChunks);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    // Tables that point outside the file describe a damaged movie; refuse it before any work.
-    const auto size = static_cast<uint64_t>(fileSize);
-    if (m_audioChunks.empty() || TqovixFailed(TqovixCheckChunksInFile(m_audioChunks, size)) ||
-        TqovixFailed(TqovixCheckChunksInFile(m_movieDataChunks, size))) {
-        return eTqovixErrorInvalidMovie;
-    }
-    // A track that claims more sound than its chunks hold would have the library pull
-    // silence for as long as the claim says: refuse it.
-    uint64_t chunkSamples = 0;
-    for (const TqovixChunkInformation& chunk : m_audioChunks) {
-        chunkSamples += chunk.sampleCount;
-    }
-    if (information.GetCount() > chunkSamples) {
-        return eTqovixErrorInvalidMovie;
-    }
-    result = m_audioDataControl.Initialize(m_sourceFile, m_audioChunks, information.IsBigEndianFormat());
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    m_bBigEndian = information.IsBigEndianFormat();
-    return eTqovixSuccess;
-}
-
 void CTqovixMovControl::Close()
 {
     m_outputAudioChunkIndex = 0;
@@ -209,6 +152,10 @@ void CTqovixMovControl::Close()
     m_outputMovieDataChunks.clear();
     m_outputAudioChunks.clear();
     m_movieDataChunks.clear();
+    m_movieDataChunkTracks.clear();
+    m_carriedTracks.clear();
+    m_soundTrackIndex = 0;
+    m_frameBytes = 0;
     m_audioChunks.clear();
     m_afInformationPosition = 0;
     m_audioLevelInformationPosition = 0;

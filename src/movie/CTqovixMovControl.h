@@ -3,6 +3,8 @@
 #pragma once
 
 #include <cstdint>
+#include <string>
+#include <utility>
 #include <vector>
 
 #include "atom/CTqovixAtomControl.h"
@@ -12,6 +14,7 @@
 #include "visitor/TqovixChunkInformation.h"
 
 class CTqovixMainFrame;
+class CTqovixAudioInformationVisitor;
 
 class CTqovixMovControl {
 public:
@@ -19,8 +22,11 @@ public:
     CTqovixMovControl(const CTqovixMovControl&) = delete;
     CTqovixMovControl& operator=(const CTqovixMovControl&) = delete;
 
-    // Without a destination only the source and its AF and audio level information are opened.
+    // Without a destination the source is opened and analysed as for a job (what the
+    // property query asks), but nothing is prepared for writing.
     eTqovixErrorCode Initialize(const char* sourcePath, const char* destinationPath);
+    // Why the last Initialize refused the movie, in words for people; empty when it did not.
+    const std::string& GetRefusal() const { return m_refusal; }
     void Close();
 
     eTqovixErrorCode GetAFInformation(void* buffer, unsigned long* delivered, unsigned long size,
@@ -56,7 +62,14 @@ public:
 
 private:
     eTqovixErrorCode InitializeDestination(const char* sourcePath, const char* destinationPath);
-    eTqovixErrorCode AnalyzeTracks();
+    eTqovixErrorCode AnalyzeTracks(bool forJob);
+    eTqovixErrorCode AnalyzeSoundFormat(const CTqovixAudioInformationVisitor& information);
+    eTqovixErrorCode GatherCarriedTracks(uint32_t soundTrack, uint32_t soundFrameBytes, uint64_t fileSize);
+    eTqovixErrorCode Refuse(eTqovixErrorCode code, std::string reason);
+    // Planning the destination: the mdat header's form from what will go in.
+    bool NeedsLargeMediaDataHeader(bool largeSource) const;
+    // Rewriting the tables of every track whose chunks moved.
+    eTqovixErrorCode RewriteTables(const void* afInformation, unsigned long size);
     eTqovixErrorCode WriteLeadingAtoms();
     eTqovixErrorCode WritePcm(const uint8_t* data, unsigned long size, bool swap);
     eTqovixErrorCode WriteAacPacket(const uint8_t* packet, unsigned long size);
@@ -78,7 +91,15 @@ private:
     std::vector<uint8_t> m_audioLevelInformation;
     mutable uint64_t m_audioLevelInformationPosition = 0;
     std::vector<TqovixChunkInformation> m_audioChunks;
+    // Every chunk carried unchanged, of every track but the processed sound track, in
+    // source order; m_movieDataChunkTracks names the track ("trak" index) of each.
     std::vector<TqovixChunkInformation> m_movieDataChunks;
+    std::vector<uint32_t> m_movieDataChunkTracks;
+    // Carried tracks ("trak" index) with their chunk count, to rewrite their offsets.
+    std::vector<std::pair<uint32_t, size_t>> m_carriedTracks;
+    uint32_t m_soundTrackIndex = 0;
+    uint32_t m_frameBytes = 0;  // PCM: bytes per frame of the sound track
+    std::string m_refusal;
     std::vector<TqovixChunkInformation> m_outputAudioChunks;
     std::vector<TqovixChunkInformation> m_outputMovieDataChunks;
     bool m_bBigEndian = true;

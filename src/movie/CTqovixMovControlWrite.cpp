@@ -1,17 +1,12 @@
-// The writing half of the movie controller: leading atoms, one new mdat holding the
-// new sound chunks and the copied video chunks in source order, then the updated moov.
+// The movie controller moving media: new sound chunks written as the processing
+// library hands sound back, and every carried chunk copied in source order around them.
 #include <algorithm>
 #include <cstring>
 #include <new>
 
 #include "atom/CTqovixAtom.h"
-#include "atom/TqovixEndian.h"
 #include "engine/CTqovixMainFrame.h"
 #include "movie/CTqovixMovControl.h"
-#include "visitor/CTqovixAudioDataVisitor.h"
-#include "visitor/CTqovixMakerBlockVisitor.h"
-#include "visitor/CTqovixMovieDataVisitor.h"
-#include "visitor/CTqovixTCTGAtomVisitor.h"
 
 namespace {
 
@@ -19,8 +14,6 @@ namespace {
 // so memory stays flat whatever the chunk sizes.
 constexpr uint64_t kCopyPiece = 1 << 20;
 constexpr uint64_t kMax32 = CTqovixAtom::kMaxCompactAtomSize;
-// Room for an AAC track re-encoded larger than its source when choosing the mdat header.
-constexpr uint64_t kAacGrowthMargin = 1 << 20;
 
 void SwapPairs(uint8_t* bytes, uint64_t size)
 {
@@ -76,69 +69,6 @@ eTqovixErrorCode CTqovixMovControl::SetMovieMetaData(const void* data, unsigned 
         }
     }
     return WritePcm(bytes, size, m_bBigEndian);
-}
-
-eTqovixErrorCode CTqovixMovControl::WriteLeadingAtoms()
-{
-    TqovixAtomList atoms;
-    eTqovixErrorCode result = m_atomControl.GetAtoms(atoms);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    bool largeSource = false;
-    for (const auto& atom : atoms) {
-        const eTqovixAtomType type = atom->GetType();
-        if (type == TqovixAtom::kMdat) {
-            largeSource = largeSource || atom->GetSize() > kMax32;
-        } else if (type != TqovixAtom::kMoov) {
-            result = atom->Write(m_destinationFile);
-            if (TqovixFailed(result)) {
-                return result;
-            }
-        }
-    }
-    // One mdat for all media, whatever the source had; its size form is chosen now from
-    // what will go in, because the header cannot grow once media follows it.
-    uint64_t projected = kAacGrowthMargin;
-    for (const auto& chunk : m_movieDataChunks) {
-        projected += chunk.size;
-    }
-    for (const auto& chunk : m_audioChunks) {
-        projected += m_bPCM ? chunk.size : 2 * uint64_t{chunk.size};
-    }
-    m_bLargeMediaDataHeader = largeSource || projected + 16 > kMax32;
-
-    uint8_t header[16] = {};
-    unsigned int headerSize = 8;
-    unsigned int sizeField = 0;
-    if (m_bLargeMediaDataHeader) {
-        TqovixWriteBE32(header, 1);
-        std::memcpy(header + 4, "mdat", 4);
-        headerSize = 16;
-        sizeField = 8;
-    } else {
-        std::memcpy(header + 4, "mdat", 4);
-    }
-    long long position = 0;
-    result = m_destinationFile.GetPosition(&position);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    m_mediaDataSizePosition = position + sizeField;
-    result = m_destinationFile.Write(header, headerSize);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    try {
-        if (m_bPCM) {
-            m_outputAudioChunks = m_audioChunks;
-        }
-        m_outputMovieDataChunks = m_movieDataChunks;
-    } catch (const std::bad_alloc&) {
-        return eTqovixErrorOutOfMemory;
-    }
-    result = m_atomControl.Update(CTqovixTCTGAtomVisitor());
-    return TqovixFailed(result) ? result : eTqovixSuccess;
 }
 
 eTqovixErrorCode CTqovixMovControl::WriteMetaData(const void* data, unsigned long size)
@@ -452,94 +382,3 @@ eTqovixErrorCode CTqovixMovControl::CopySourceSoundTail()
     return CopyRemainingVideo();
 }
 
-eTqovixErrorCode CTqovixMovControl::SetMovieDataInformation(const void* afInformation, unsigned long size)
-{
-    if (m_bHeaderPending) {
-        return eTqovixErrorInternal;
-    }
-    eTqovixErrorCode result = eTqovixSuccess;
-    if (!IsMediaDataComplete()) {
-        if (!m_bPCM) {
-            return eTqovixErrorInternal;
-        }
-        result = CopySourceSoundTail();
-        if (TqovixFailed(result)) {
-            return result;
-        }
-    }
-    CTqovixAudioDataVisitor audio;
-    audio.SetAudioChunkInformation(m_outputAudioChunks);
-    result = m_atomControl.Update(audio);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    CTqovixAFInformationVisitor af;
-    af.SetAFInformation(afInformation, size);
-    result = m_atomControl.Update(af);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    if (!m_audioLevelInformation.empty()) {
-        CTqovixAudioLevelInformationVisitor level;
-        level.SetAudioLevelInformation(m_audioLevelInformation.data(), m_audioLevelInformation.size());
-        result = m_atomControl.Update(level);
-        if (TqovixFailed(result)) {
-            return result;
-        }
-    }
-    CTqovixMovieDataVisitor video;
-    video.SetOffset(m_outputMovieDataChunks);
-    result = m_atomControl.Update(video);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    TqovixAtomList atoms;
-    result = m_atomControl.GetAtoms(atoms);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    for (const auto& atom : atoms) {
-        if (atom->GetType() == TqovixAtom::kMoov) {
-            result = atom->Write(m_destinationFile);
-            if (TqovixFailed(result)) {
-                return result;
-            }
-        }
-    }
-    result = WriteMediaDataSize();
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    // Buffered bytes that a full disk refuses only show up here.
-    result = m_destinationFile.Flush();
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    m_bDestinationComplete = true;
-    return eTqovixSuccess;
-}
-
-eTqovixErrorCode CTqovixMovControl::WriteMediaDataSize()
-{
-    uint8_t field[8];
-    unsigned int fieldSize = 4;
-    if (m_bLargeMediaDataHeader) {
-        TqovixWriteBE64(field, m_mediaDataSize + 16);
-        fieldSize = 8;
-    } else if (m_mediaDataSize + 8 > kMax32) {
-        // An 8-byte header was written; a size that does not fit it would make a broken file.
-        return eTqovixErrorInternal;
-    } else {
-        TqovixWriteBE32(field, static_cast<uint32_t>(m_mediaDataSize + 8));
-    }
-    m_mediaDataSize += fieldSize == 8 ? 16 : 8;
-    eTqovixErrorCode result = m_destinationFile.Seek(m_mediaDataSizePosition, CTqovixFile::eTqovixSeekBegin);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    result = m_destinationFile.Write(field, fieldSize);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    return m_destinationFile.Seek(0, CTqovixFile::eTqovixSeekEnd);
-}

@@ -6,19 +6,17 @@
 
 class CTqovixAudioDataVisitor : public CTqovixSampleTableVisitor {
 public:
-    CTqovixAudioDataVisitor() : CTqovixSampleTableVisitor("soun", false) {}
-
-    using CTqovixSampleTableVisitor::Update;
-    eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixLeafAtom& atom) const override;
+    CTqovixAudioDataVisitor() : CTqovixSampleTableVisitor("soun") {}
 
     eTqovixErrorCode IsSoundMediaTrack(const CTqovixLeafAtom& handler) const;
-    // `bytesPerFrame` turns a common sample size of PCM frames into chunk bytes.
+    // `bytesPerFrame` is the frame size of uncompressed sound, 0 for compressed sound.
     eTqovixErrorCode GetAudioChunkInformation(std::vector<TqovixChunkInformation>& out, unsigned int bytesPerFrame) const
     {
         return BuildChunkList(out, bytesPerFrame);
     }
-    void SetAudioChunkInformation(const std::vector<TqovixChunkInformation>& chunks);
-
-private:
-    eTqovixErrorCode RewriteSampleSizes(std::vector<uint8_t>& payload) const;
+    // For the first sound track; SetTrackChunks names another by its index.
+    void SetAudioChunkInformation(const std::vector<TqovixChunkInformation>& chunks)
+    {
+        SetFirstTrackChunks(chunks, true);
+    }
 };

@@ -6,12 +6,17 @@
 
 class CTqovixMovieDataVisitor : public CTqovixSampleTableVisitor {
 public:
-    CTqovixMovieDataVisitor() : CTqovixSampleTableVisitor("vide", true) {}
-
-    using CTqovixSampleTableVisitor::Update;
-    eTqovixErrorCode Update(const TqovixAtomPath& path, CTqovixLeafAtom& atom) const override;
+    CTqovixMovieDataVisitor() : CTqovixSampleTableVisitor("vide") {}
 
     eTqovixErrorCode IsVideoMediaTrack(const CTqovixLeafAtom& handler) const;
-    eTqovixErrorCode GetOffset(std::vector<TqovixChunkInformation>& out) const { return BuildChunkList(out, 1); }
-    void SetOffset(const std::vector<TqovixChunkInformation>& chunks);
+    eTqovixErrorCode GetOffset(std::vector<TqovixChunkInformation>& out) const { return BuildChunkList(out, 0); }
+    // For the first video track; SetTrackChunks names any other track by its index.
+    void SetOffset(const std::vector<TqovixChunkInformation>& chunks) { SetFirstTrackChunks(chunks, false); }
+};
+
+// Every track of the movie, whatever its media: what the controller picks the
+// sound track from and carries the others with.
+class CTqovixTrackListVisitor : public CTqovixSampleTableVisitor {
+public:
+    CTqovixTrackListVisitor() : CTqovixSampleTableVisitor(nullptr) {}
 };

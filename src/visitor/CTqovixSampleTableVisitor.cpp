@@ -1,247 +1,271 @@
 #include "visitor/CTqovixSampleTableVisitor.h"
 
-#include <algorithm>
+#include <cstring>
+#include <new>
 
 #include "atom/CTqovixLeafAtom.h"
-#include "atom/TqovixEndian.h"
 #include "visitor/TqovixTrackPath.h"
 
 using namespace TqovixTrackPath;
 
 namespace {
 
-// Entry j lands at position j; tables only grow while reading.
-template <typename T>
-void Reserve(std::vector<T>& table, uint64_t entries)
+constexpr eTqovixAtomType kDref = TqovixMakeAtomType("dref");
+
+TqovixPayload PayloadOf(const CTqovixLeafAtom& atom, bool& loaded)
 {
-    if (table.size() < entries) {
-        table.resize(entries);
-    }
+    const uint64_t size = atom.GetDataSize();
+    const uint8_t* data = size == 0 ? nullptr : atom.GetData();
+    loaded = size == 0 || data != nullptr;
+    return data == nullptr ? TqovixPayload{} : TqovixPayload{data, static_cast<size_t>(size)};
+}
+
+bool IsTrackPath(const TqovixAtomPath& path)
+{
+    static const TqovixAtomPath track = TqovixMakeAtomPath("moovtrak");
+    return path == track;
 }
 
 }  // namespace
 
-CTqovixSampleTableVisitor::CTqovixSampleTableVisitor(const char (&handlerSubtype)[5], bool emptyPathIsError)
-    : m_handlerSubtype(handlerSubtype), m_bEmptyPathIsError(emptyPathIsError)
+CTqovixSampleTableVisitor::CTqovixSampleTableVisitor(const char* handlerSubtype) : m_handlerSubtype(handlerSubtype)
 {
 }
 
 bool CTqovixSampleTableVisitor::IsNecessary(const TqovixAtomPath& path) const
 {
     static const TqovixAtomPath handler = TqovixMakeAtomPath("moovtrakmdiahdlr");
-    const bool isHandler = !path.empty() && path.back() == kHdlr;
-    return IsWanted(path, isHandler ? handler : SampleTablePath(), {kStsc, kStsz, kStco, kCo64, kHdlr});
+    static const TqovixAtomPath references = TqovixMakeAtomPath("moovtrakmdiaminfdinfdref");
+    const eTqovixAtomType last = path.empty() ? eTqovixAtomType{} : path.back();
+    if (last == kHdlr) {
+        return IsWanted(path, handler, {kHdlr});
+    }
+    if (path.size() >= 5 && path[4] == TqovixMakeAtomType("dinf")) {
+        return IsWanted(path, references, {kDref});
+    }
+    return IsWanted(path, SampleTablePath(), {kStsd, kStsc, kStsz, kStco, kCo64});
 }
 
-eTqovixErrorCode CTqovixSampleTableVisitor::AnswerHandler(const CTqovixLeafAtom& handler) const
+bool CTqovixSampleTableVisitor::Matches(const TqovixTrackTables& track) const
 {
-    const eTqovixErrorCode answer = HandlerAnswer(handler, m_handlerSubtype);
-    m_bTrack = answer == eTqovixVisitContinue;
-    return answer;
+    if (m_handlerSubtype == nullptr) {
+        return true;
+    }
+    char subtype[5] = {};
+    std::memcpy(subtype, m_handlerSubtype, 4);
+    return track.handler && TqovixTrackAtoms::IsMediaHandler(*track.handler, subtype);
+}
+
+void CTqovixSampleTableVisitor::SetTrackChunks(uint32_t index, const std::vector<TqovixChunkInformation>& chunks,
+                                               bool withSizes)
+{
+    m_rewrites[index] = Rewrite{chunks, withSizes};
+}
+
+void CTqovixSampleTableVisitor::SetFirstTrackChunks(const std::vector<TqovixChunkInformation>& chunks, bool withSizes)
+{
+    m_firstRewrite = Rewrite{chunks, withSizes};
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::Analyze(const TqovixAtomPath& path, const CTqovixContainerAtom&) const
+{
+    if (!IsNecessary(path)) {
+        return eTqovixVisitSkip;
+    }
+    if (IsTrackPath(path)) {
+        m_current = TqovixTrackTables{};
+        m_current.index = static_cast<uint32_t>(++m_trackIndex);
+    }
+    return eTqovixVisitContinue;
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::Update(const TqovixAtomPath& path, CTqovixContainerAtom&) const
+{
+    if (!IsNecessary(path)) {
+        return eTqovixVisitSkip;
+    }
+    if (IsTrackPath(path)) {
+        m_current = TqovixTrackTables{};
+        m_current.index = static_cast<uint32_t>(++m_trackIndex);
+        m_bFirstRewriteHere = false;
+    }
+    return eTqovixVisitContinue;
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::Leave(const TqovixAtomPath& path, const CTqovixContainerAtom&) const
+{
+    // A visitor of every track (or of tracks named by index) is done with the movie atom.
+    if (path.size() == 1 && path[0] == TqovixAtom::kMoov) {
+        return m_handlerSubtype == nullptr || !m_rewrites.empty() ? eTqovixSuccess : eTqovixVisitSkip;
+    }
+    if (!IsTrackPath(path) || !Matches(m_current)) {
+        return eTqovixVisitSkip;
+    }
+    try {
+        m_tracks.push_back(m_current);
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    // A visitor after one track has it now; one gathering every track goes on.
+    return m_handlerSubtype != nullptr && m_rewrites.empty() && !m_firstRewrite ? eTqovixSuccess : eTqovixVisitSkip;
 }
 
 eTqovixErrorCode CTqovixSampleTableVisitor::Analyze(const TqovixAtomPath& path, const CTqovixLeafAtom& atom) const
 {
-    if (!IsNecessary(path)) {
+    if (!IsNecessary(path) || path.empty()) {
         return eTqovixVisitSkip;
     }
-    if (path.empty() && m_bEmptyPathIsError) {
-        return eTqovixErrorInternal;
-    }
-    if (atom.GetType() == kHdlr) {
-        return AnswerHandler(atom);
-    }
-    const uint64_t size = atom.GetDataSize();
-    const uint8_t* payload = size == 0 ? nullptr : atom.GetData();
-    if (!m_bTrack || payload == nullptr) {
-        return eTqovixVisitSkip;
-    }
-    const eTqovixErrorCode result = ReadTable(atom.GetType(), payload, size);
-    if (result != eTqovixSuccess) {
-        return result;
-    }
-    if (++m_analyzedTableCount < 3) {
-        return eTqovixVisitSkip;
-    }
-    m_analyzedTableCount = 0;
-    return eTqovixSuccess;
+    return ReadLeaf(atom.GetType(), atom);
 }
 
-eTqovixErrorCode CTqovixSampleTableVisitor::ReadTable(eTqovixAtomType type, const uint8_t* payload, uint64_t size) const
+eTqovixErrorCode CTqovixSampleTableVisitor::ReadLeaf(eTqovixAtomType type, const CTqovixLeafAtom& atom) const
 {
-    // Entries follow from the payload size; the count field is not trusted.
-    const uint64_t entriesBytes = size >= 8 ? size - 8 : 0;
-    if (type == kCo64 || type == kStco) {
-        const uint64_t width = type == kCo64 ? 8 : 4;
-        const uint64_t entries = entriesBytes / width;
-        if (entries > kMaxTableEntries) {
-            return eTqovixErrorInvalidMovie;
+    bool loaded = false;
+    const TqovixPayload payload = PayloadOf(atom, loaded);
+    if (!loaded) {
+        return eTqovixVisitSkip;  // the leaf reports its own read failure to the walk
+    }
+    TqovixTrackTables& track = m_current;
+    bool readable = true;
+    if (type == kHdlr) {
+        track.handler = TqovixTrackAtoms::ParseHandler(payload);
+    } else if (type == kStsd) {
+        track.soundEntry = TqovixSoundEntry::Parse(payload);
+        if (track.soundEntry) {
+            track.format = track.soundEntry->format;
+            track.soundEntry->children = {};
+        } else if (payload.size() >= 16) {
+            std::memcpy(&track.format, payload.data() + 12, 4);
         }
-        Reserve(m_chunkTable, entries);
-        for (uint64_t j = 0; j < entries; ++j) {
-            const uint8_t* entry = payload + 8 + width * j;
-            m_chunkTable[j].offset = width == 8 ? TqovixReadBE64(entry) : TqovixReadBE32(entry);
-        }
-        m_recordCount = entries;
+    } else if (type == kDref) {
+        const std::optional<bool> inFile = TqovixTrackAtoms::ParseDataInFile(payload);
+        readable = inFile.has_value();
+        track.dataInFile = inFile.value_or(false);
     } else if (type == kStsc) {
-        const uint64_t entries = entriesBytes / 12;
-        if (entries > kMaxTableEntries) {
-            return eTqovixErrorInvalidMovie;
-        }
-        Reserve(m_sampleToChunkTable, entries);
-        for (uint64_t j = 0; j < entries; ++j) {
-            const uint8_t* entry = payload + 8 + 12 * j;
-            m_sampleToChunkTable[j] = {TqovixReadBE32(entry), TqovixReadBE32(entry + 4)};
-        }
-        m_runEntries = entries;
+        track.runs = TqovixTrackAtoms::ParseSampleToChunk(payload);
+        readable = track.runs.has_value();
     } else if (type == kStsz) {
-        if (size < 8) {
-            return eTqovixErrorInvalidMovie;
+        track.sizes = TqovixTrackAtoms::ParseSampleSizes(payload);
+        readable = track.sizes.has_value();
+    } else if (type == kStco || type == kCo64) {
+        track.wideOffsets = type == kCo64;
+        track.offsets = TqovixTrackAtoms::ParseChunkOffsets(payload, track.wideOffsets);
+        readable = track.offsets.has_value();
+    }
+    if (!readable && !TqovixFailed(track.failure)) {
+        track.failure = eTqovixErrorInvalidMovie;
+    }
+    return eTqovixVisitContinue;
+}
+
+const CTqovixSampleTableVisitor::Rewrite* CTqovixSampleTableVisitor::CurrentRewrite() const
+{
+    if (m_bFirstRewriteHere) {
+        return &*m_firstRewrite;
+    }
+    const auto found = m_rewrites.find(m_current.index);
+    return found == m_rewrites.end() ? nullptr : &found->second;
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::Update(const TqovixAtomPath& path, CTqovixLeafAtom& atom) const
+{
+    if (!IsNecessary(path) || path.empty()) {
+        return eTqovixVisitSkip;
+    }
+    const eTqovixAtomType type = atom.GetType();
+    if (type == kHdlr) {
+        ReadLeaf(type, atom);
+        if (m_firstRewrite && !m_bFirstRewriteTaken && Matches(m_current)) {
+            m_bFirstRewriteTaken = true;
+            m_bFirstRewriteHere = true;
         }
-        const uint32_t commonSize = TqovixReadBE32(payload + 4);
-        if (commonSize != 0) {
-            m_constantSampleSize = commonSize;
-            return eTqovixSuccess;
-        }
-        const uint64_t entries = size >= 12 ? (size - 12) / 4 : 0;
-        if (entries > kMaxTableEntries) {
-            return eTqovixErrorInvalidMovie;
-        }
-        Reserve(m_sampleSizeTable, entries);
-        for (uint64_t j = 0; j < entries; ++j) {
-            m_sampleSizeTable[j] = TqovixReadBE32(payload + 12 + 4 * j);
-        }
-        m_sizeEntries = entries;
-    } else {
+        return eTqovixVisitContinue;
+    }
+    const Rewrite* rewrite = CurrentRewrite();
+    if (rewrite == nullptr) {
+        return eTqovixVisitSkip;
+    }
+    if (type == kStco || type == kCo64) {
+        return RewriteOffsets(atom, *rewrite);
+    }
+    if (type == kStsz && rewrite->withSizes) {
+        return RewriteSampleSizes(atom, *rewrite);
+    }
+    return eTqovixVisitSkip;
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::RewriteOffsets(CTqovixLeafAtom& atom, const Rewrite& rewrite) const
+{
+    bool loaded = false;
+    const TqovixPayload payload = PayloadOf(atom, loaded);
+    bool wide = atom.GetType() == kCo64;
+    const auto entries = loaded ? TqovixTrackAtoms::ParseChunkOffsets(payload, wide) : std::nullopt;
+    // The destination keeps the source's chunk structure: one record per entry.
+    if (!entries || entries->size() != rewrite.chunks.size()) {
         return eTqovixErrorInternal;
     }
-    return eTqovixSuccess;
+    std::vector<uint64_t> offsets;
+    std::vector<uint8_t> written;
+    try {
+        offsets.reserve(rewrite.chunks.size());
+        for (const TqovixChunkInformation& chunk : rewrite.chunks) {
+            offsets.push_back(chunk.offset);
+            // An "stco" that cannot say where a chunk lies becomes a "co64".
+            wide = wide || chunk.offset > UINT32_MAX;
+        }
+        written = TqovixTrackAtoms::WriteChunkOffsets(offsets, wide);
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    std::memcpy(written.data(), payload.data(), 4);  // version and flags as they were
+    if (wide && atom.GetType() == kStco) {
+        atom.SetType(kCo64);
+    }
+    atom.SetData(written.data(), written.size());
+    return eTqovixVisitContinue;
+}
+
+eTqovixErrorCode CTqovixSampleTableVisitor::RewriteSampleSizes(CTqovixLeafAtom& atom, const Rewrite& rewrite) const
+{
+    bool loaded = false;
+    const TqovixPayload payload = PayloadOf(atom, loaded);
+    const auto sizes = loaded ? TqovixTrackAtoms::ParseSampleSizes(payload) : std::nullopt;
+    if (!sizes) {
+        return eTqovixErrorInternal;
+    }
+    TqovixTrackAtoms::SampleSizes rewritten;
+    uint64_t total = 0;
+    for (const TqovixChunkInformation& chunk : rewrite.chunks) {
+        total += chunk.sampleSizes.size();
+    }
+    if (total == 0) {
+        return eTqovixVisitContinue;  // PCM: sizes do not change, the table keeps its form
+    }
+    // Every sample gets its new size, and no more: the count is the source's.
+    if (total != sizes->count) {
+        return eTqovixErrorInternal;
+    }
+    std::vector<uint8_t> written;
+    try {
+        rewritten.sizes.reserve(total);
+        for (const TqovixChunkInformation& chunk : rewrite.chunks) {
+            rewritten.sizes.insert(rewritten.sizes.end(), chunk.sampleSizes.begin(), chunk.sampleSizes.end());
+        }
+        written = TqovixTrackAtoms::WriteSampleSizes(rewritten);
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    std::memcpy(written.data(), payload.data(), 4);
+    atom.SetData(written.data(), written.size());
+    return eTqovixVisitContinue;
 }
 
 eTqovixErrorCode CTqovixSampleTableVisitor::BuildChunkList(std::vector<TqovixChunkInformation>& out,
-                                                          uint32_t bytesPerSample) const
+                                                          uint32_t frameBytes) const
 {
-    const uint64_t chunkCount = m_recordCount;
-    uint64_t position = 0;
-    uint64_t sample = 0;
-    bool consistent = chunkCount > 0 && m_runEntries > 0;
-    for (uint64_t r = 0; consistent && r < m_runEntries; ++r) {
-        const uint64_t first = m_sampleToChunkTable[r].firstChunk;
-        const uint64_t next = r + 1 < m_runEntries ? m_sampleToChunkTable[r + 1].firstChunk : chunkCount + 1;
-        const uint32_t samplesPerChunk = m_sampleToChunkTable[r].samplesPerChunk;
-        // Runs start at chunk 1, rise strictly and name only chunks the offset table has.
-        if (first != position + 1 || next <= first || next > chunkCount + 1) {
-            consistent = false;
-            break;
-        }
-        for (uint64_t k = first; k < next; ++k, ++position) {
-            TqovixChunkInformation& record = m_chunkTable[position];
-            uint64_t bytes = 0;
-            if (m_constantSampleSize == 0) {
-                if (samplesPerChunk > m_sizeEntries - sample) {
-                    consistent = false;  // the size table runs out
-                    break;
-                }
-                const auto begin = m_sampleSizeTable.begin() + static_cast<std::ptrdiff_t>(sample);
-                record.sampleSizes.assign(begin, begin + samplesPerChunk);
-                for (uint32_t size : record.sampleSizes) {
-                    bytes += size;
-                }
-                sample += samplesPerChunk;
-            } else {
-                // Two steps, each product of 32-bit factors, so nothing wraps in 64 bits.
-                bytes = uint64_t{samplesPerChunk} * bytesPerSample;
-                if (bytes <= UINT32_MAX) {
-                    bytes *= m_constantSampleSize;
-                }
-            }
-            if (bytes > UINT32_MAX) {
-                consistent = false;
-                break;
-            }
-            record.size = static_cast<uint32_t>(bytes);
-            record.chunkNumber = static_cast<uint32_t>(k);
-            record.sampleCount = samplesPerChunk;
-        }
+    if (m_tracks.empty()) {
+        out.clear();
+        return eTqovixErrorInvalidMovie;
     }
-    // Every chunk belongs to a run, and a size table holds no sample nobody uses.
-    if (position != chunkCount || (m_constantSampleSize == 0 && sample != m_sizeEntries)) {
-        consistent = false;
-    }
-    out.assign(m_chunkTable.begin(), m_chunkTable.begin() + static_cast<std::ptrdiff_t>(chunkCount));
-    return consistent ? eTqovixSuccess : eTqovixErrorInvalidMovie;
-}
-
-void CTqovixSampleTableVisitor::LoadRecords(const std::vector<TqovixChunkInformation>& chunks, bool withSizes)
-{
-    if (chunks.empty()) {
-        return;
-    }
-    m_chunkTable.resize(chunks.size());
-    for (size_t j = 0; j < chunks.size(); ++j) {
-        m_chunkTable[j].offset = chunks[j].offset;
-        if (withSizes) {
-            m_chunkTable[j].size = chunks[j].size;
-            if (m_constantSampleSize == 0) {
-                m_chunkTable[j].sampleSizes = chunks[j].sampleSizes;
-            }
-        }
-    }
-    m_recordCount = chunks.size();
-}
-
-eTqovixErrorCode CTqovixSampleTableVisitor::BeginUpdate(const TqovixAtomPath& path, CTqovixLeafAtom& atom,
-                                                       std::vector<uint8_t>& payload) const
-{
-    if (!IsNecessary(path)) {
-        return eTqovixVisitSkip;
-    }
-    if (path.empty() && m_bEmptyPathIsError) {
-        return eTqovixErrorInternal;
-    }
-    if (atom.GetType() == kHdlr) {
-        return AnswerHandler(atom);
-    }
-    if (!m_bTrack) {
-        return eTqovixVisitSkip;
-    }
-    const uint8_t* data = atom.GetDataSize() == 0 ? nullptr : atom.GetData();
-    if (data == nullptr) {
-        return eTqovixErrorOutOfMemory;
-    }
-    payload.assign(data, data + atom.GetDataSize());
-    return eTqovixSuccess;
-}
-
-eTqovixErrorCode CTqovixSampleTableVisitor::RewriteOffsets(std::vector<uint8_t>& payload, eTqovixAtomType type,
-                                                          bool exactCount) const
-{
-    const bool wide = type == kCo64;
-    const uint64_t width = wide ? 8 : 4;
-    const uint64_t entries = payload.size() >= 8 ? (payload.size() - 8) / width : 0;
-    if (entries > m_recordCount || (exactCount && entries != m_recordCount)) {
-        return eTqovixErrorInternal;
-    }
-    for (uint64_t j = 0; j < entries; ++j) {
-        const uint64_t offset = m_chunkTable[j].offset;
-        if (wide) {
-            TqovixWriteBE64(payload.data() + 8 + 8 * j, offset);
-        } else if (offset > UINT32_MAX) {
-            return eTqovixErrorInternal;  // only a "co64" table can say where this chunk lies
-        } else {
-            TqovixWriteBE32(payload.data() + 8 + 4 * j, static_cast<uint32_t>(offset));
-        }
-    }
-    return eTqovixSuccess;
-}
-
-eTqovixErrorCode CTqovixSampleTableVisitor::FinishUpdate(CTqovixLeafAtom& atom, const std::vector<uint8_t>& payload,
-                                                        uint32_t tablesPerTrack, eTqovixErrorCode unfinished) const
-{
-    atom.SetData(payload.data(), payload.size());
-    if (++m_analyzedTableCount < tablesPerTrack) {
-        return unfinished;
-    }
-    m_analyzedTableCount = 0;
-    return eTqovixSuccess;
+    return TqovixBuildChunkList(m_tracks.front(), frameBytes, out);
 }

@@ -4,6 +4,7 @@
 #include <cstring>
 
 #include "atom/CTqovixLeafAtom.h"
+#include "atom/TqovixTrackAtoms.h"
 
 namespace TqovixTrackPath {
 
@@ -34,11 +35,11 @@ const TqovixAtomPath& SampleTablePath()
 eTqovixErrorCode HandlerAnswer(const CTqovixLeafAtom& handler, const char (&subtype)[5])
 {
     const uint8_t* payload = handler.GetData();
-    if (payload == nullptr || handler.GetDataSize() < 12) {
+    if (payload == nullptr) {
         return eTqovixVisitSkip;
     }
-    return std::memcmp(payload + 4, "mhlr", 4) == 0 && std::memcmp(payload + 8, subtype, 4) == 0 ? eTqovixVisitContinue
-                                                                                                  : eTqovixVisitSkip;
+    const auto parsed = TqovixTrackAtoms::ParseHandler({payload, static_cast<size_t>(handler.GetDataSize())});
+    return parsed && TqovixTrackAtoms::IsMediaHandler(*parsed, subtype) ? eTqovixVisitContinue : eTqovixVisitSkip;
 }
 
 }  // namespace TqovixTrackPath

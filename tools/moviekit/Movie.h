@@ -48,7 +48,7 @@ struct SoundRecipe {
     EsdsRecipe esds;
     bool edts = true;
     bool elst = true;
-    // Unset: the priming a camera records (1024, but 0 for "sowt").
+    // Unset: the priming a camera records (1024 for AAC, 0 for PCM).
     std::optional<uint32_t> mediaTime;
 };
 

@@ -140,7 +140,8 @@ bool PlanSound(const MovieRecipe& recipe, MoviePlan& plan, std::string* error)
         ResolveAac(recipe, plan);
     }
     BuildSoundChunks(plan, counts);
-    plan.soundMediaTime = sound.mediaTime.value_or(plan.littleEndianPcm ? 0 : kAacFramesPerPacket);
+    // Only AAC carries priming; PCM starts at its first frame.
+    plan.soundMediaTime = sound.mediaTime.value_or(plan.aac ? kAacFramesPerPacket : 0);
     return true;
 }
 

@@ -1,0 +1,238 @@
+#include "atom/TqovixSoundEntry.h"
+
+#include <cstring>
+
+#include "atom/TqovixByteReader.h"
+
+namespace TqovixSoundEntry {
+
+namespace {
+
+constexpr uint8_t kESDescrTag = 3;
+constexpr uint8_t kDecoderConfigDescrTag = 4;
+constexpr uint8_t kDecSpecificInfoTag = 5;
+constexpr eTqovixAtomType kEsds = TqovixMakeAtomType("esds");
+constexpr eTqovixAtomType kWave = TqovixMakeAtomType("wave");
+// A "wave" holds a handful of small atoms; nesting deeper than this is not a sound description.
+constexpr int kMaxWaveDepth = 2;
+
+bool ReadDescriptorSize(TqovixByteReader& reader, uint32_t& size)
+{
+    uint8_t first = 0;
+    if (!reader.U8(first)) {
+        return false;
+    }
+    if (first < 0x80) {
+        size = first;
+        return true;
+    }
+    uint8_t second = 0;
+    uint8_t third = 0;
+    uint8_t last = 0;
+    if (first != 0x80 || !reader.U8(second) || !reader.U8(third) || !reader.U8(last) || second != 0x80 ||
+        third != 0x80 || last >= 0x80) {
+        return false;
+    }
+    size = last;
+    return true;
+}
+
+// One tag-size-body descriptor; the body must fit what holds it.
+bool ReadDescriptor(TqovixByteReader& reader, uint8_t& tag, std::span<const uint8_t>& body)
+{
+    uint32_t size = 0;
+    return reader.U8(tag) && ReadDescriptorSize(reader, size) && reader.Bytes(size, body);
+}
+
+std::optional<DecoderConfig> ParseDecoderConfig(std::span<const uint8_t> body)
+{
+    TqovixByteReader reader(body);
+    DecoderConfig config;
+    uint32_t maxBitRate = 0;
+    uint8_t tag = 0;
+    std::span<const uint8_t> info;
+    if (!reader.U8(config.objectType) || !reader.Skip(4) || !reader.U32(maxBitRate) ||
+        !reader.U32(config.averageBitRate) || !ReadDescriptor(reader, tag, info) || tag != kDecSpecificInfoTag) {
+        return std::nullopt;
+    }
+    // Anything after the decoder-specific information (a profile descriptor) is not understood.
+    if (reader.Remaining() != 0) {
+        return std::nullopt;
+    }
+    config.audioSpecificConfig.assign(info.begin(), info.end());
+    return config;
+}
+
+std::optional<DecoderConfig> ParseEsDescriptor(std::span<const uint8_t> body)
+{
+    TqovixByteReader reader(body);
+    uint8_t flags = 0;
+    if (!reader.Skip(2) || !reader.U8(flags)) {
+        return std::nullopt;
+    }
+    if ((flags & 0x80) != 0 && !reader.Skip(2)) {
+        return std::nullopt;
+    }
+    if ((flags & 0x40) != 0) {
+        uint8_t urlLength = 0;
+        if (!reader.U8(urlLength) || !reader.Skip(urlLength)) {
+            return std::nullopt;
+        }
+    }
+    if ((flags & 0x20) != 0 && !reader.Skip(2)) {
+        return std::nullopt;
+    }
+    std::optional<DecoderConfig> config;
+    while (reader.Remaining() > 0) {
+        uint8_t tag = 0;
+        std::span<const uint8_t> inner;
+        if (!ReadDescriptor(reader, tag, inner)) {
+            return std::nullopt;
+        }
+        if (tag == kDecoderConfigDescrTag) {
+            config = ParseDecoderConfig(inner);
+            if (!config) {
+                return std::nullopt;
+            }
+        }
+    }
+    return config;
+}
+
+std::optional<std::span<const uint8_t>> FindEsdsAt(std::span<const uint8_t> children, int depth)
+{
+    TqovixByteReader reader(children);
+    // Trailing bytes too short for an atom (QuickTime's 4-byte terminator) end the list.
+    while (reader.Remaining() >= 8) {
+        uint32_t size = 0;
+        std::span<const uint8_t> typeBytes;
+        reader.U32(size);
+        reader.Bytes(4, typeBytes);
+        std::span<const uint8_t> payload;
+        if (size < 8 || !reader.Bytes(size - 8, payload)) {
+            return std::nullopt;
+        }
+        eTqovixAtomType type;
+        std::memcpy(&type, typeBytes.data(), 4);
+        if (type == kEsds) {
+            return payload;
+        }
+        if (type == kWave && depth < kMaxWaveDepth) {
+            const auto inner = FindEsdsAt(payload, depth + 1);
+            if (inner) {
+                return inner;
+            }
+        }
+    }
+    return std::nullopt;
+}
+
+}  // namespace
+
+std::optional<Entry> Parse(std::span<const uint8_t> stsd)
+{
+    TqovixByteReader table(stsd);
+    uint32_t versionAndFlags = 0;
+    uint32_t count = 0;
+    uint32_t size = 0;
+    std::span<const uint8_t> body;
+    if (!table.U32(versionAndFlags) || !table.U32(count) || count == 0 || !table.U32(size) || size < 8 ||
+        !table.Bytes(size - 4, body)) {
+        return std::nullopt;
+    }
+    TqovixByteReader reader(body);
+    Entry entry;
+    std::span<const uint8_t> format;
+    uint16_t channels = 0;
+    uint16_t bits = 0;
+    uint32_t rate = 0;
+    reader.Bytes(4, format);
+    std::memcpy(&entry.format, format.data(), 4);
+    if (!reader.Skip(8) || !reader.U16(entry.version) || !reader.Skip(6) || !reader.U16(channels) ||
+        !reader.U16(bits) || !reader.Skip(4) || !reader.U32(rate)) {
+        return std::nullopt;
+    }
+    entry.channels = channels;
+    entry.bitsPerChannel = bits;
+    entry.sampleRateHz = rate >> 16;
+    if (entry.version == 1) {
+        uint32_t bytesPerSample = 0;
+        if (!reader.U32(entry.samplesPerPacket) || !reader.U32(entry.bytesPerPacket) ||
+            !reader.U32(entry.bytesPerFrame) || !reader.U32(bytesPerSample)) {
+            return std::nullopt;
+        }
+    } else if (entry.version == 2) {
+        uint32_t structSize = 0;
+        uint64_t rateBits = 0;
+        uint32_t marker = 0;
+        uint32_t framesPerPacket = 0;
+        if (!reader.U32(structSize) || !reader.U64(rateBits) || !reader.U32(entry.channels) || !reader.U32(marker) ||
+            !reader.U32(entry.bitsPerChannel) || !reader.U32(entry.formatFlags) || !reader.U32(entry.bytesPerPacket) ||
+            !reader.U32(framesPerPacket)) {
+            return std::nullopt;
+        }
+        double hz = 0;
+        std::memcpy(&hz, &rateBits, sizeof hz);
+        entry.sampleRateHz = hz > 0 && hz < 4294967296.0 ? static_cast<uint32_t>(hz) : 0;
+        entry.samplesPerPacket = framesPerPacket;
+        entry.bytesPerFrame = framesPerPacket == 1 ? entry.bytesPerPacket : 0;
+    } else if (entry.version != 0) {
+        return std::nullopt;
+    }
+    entry.children = reader.Rest();
+    return entry;
+}
+
+uint32_t FrameBytes(const Entry& entry)
+{
+    if (entry.version != 0 && entry.bytesPerFrame != 0) {
+        return entry.bytesPerFrame;
+    }
+    return entry.channels * (entry.bitsPerChannel / 8);
+}
+
+bool IsPcmFormat(const Entry& entry)
+{
+    static constexpr eTqovixAtomType kPcm[] = {TqovixMakeAtomType("twos"), TqovixMakeAtomType("sowt"),
+                                               TqovixMakeAtomType("lpcm"), TqovixMakeAtomType("in24"),
+                                               TqovixMakeAtomType("in32"), TqovixMakeAtomType("fl32"),
+                                               TqovixMakeAtomType("fl64"), TqovixMakeAtomType("raw "),
+                                               TqovixMakeAtomType("NONE")};
+    for (eTqovixAtomType type : kPcm) {
+        if (entry.format == type) {
+            return true;
+        }
+    }
+    return false;
+}
+
+bool IsLittleEndianPcm(const Entry& entry) { return entry.format == TqovixMakeAtomType("sowt"); }
+
+bool IsAac(const Entry& entry) { return entry.format == TqovixMakeAtomType("mp4a"); }
+
+std::optional<std::span<const uint8_t>> FindEsds(std::span<const uint8_t> children)
+{
+    return FindEsdsAt(children, 0);
+}
+
+std::optional<DecoderConfig> ParseEsds(std::span<const uint8_t> esds)
+{
+    TqovixByteReader reader(esds);
+    if (!reader.Skip(4)) {
+        return std::nullopt;
+    }
+    std::optional<DecoderConfig> config;
+    while (reader.Remaining() > 0) {
+        uint8_t tag = 0;
+        std::span<const uint8_t> body;
+        if (!ReadDescriptor(reader, tag, body)) {
+            return std::nullopt;
+        }
+        if (tag == kESDescrTag) {
+            config = ParseEsDescriptor(body);
+        }
+    }
+    return config;
+}
+
+}  // namespace TqovixSoundEntry

@@ -1,0 +1,212 @@
+// The movie controller's analysis of the source's tracks: which sound track is
+// processed and whether it can be, and which tracks are carried unchanged.
+#include <algorithm>
+#include <new>
+#include <numeric>
+
+#include "atom/CTqovixContainerAtom.h"
+#include "movie/CTqovixMovControl.h"
+#include "visitor/CTqovixAudioInformationVisitor.h"
+#include "visitor/CTqovixMovieDataVisitor.h"
+
+namespace {
+
+constexpr uint32_t kMaxPcmChannels = 8;  // what the processing library takes
+constexpr uint32_t kMaxAacChannels = 2;
+constexpr uint8_t kAacLowComplexity = 2;
+
+std::string FourCC(eTqovixAtomType type) { return "'" + TqovixAtomTypeName(type) + "'"; }
+
+std::string TrackName(const TqovixTrackTables& track)
+{
+    const std::string kind = track.handler ? FourCC(track.handler->subtype) : "without a handler";
+    return "track " + std::to_string(track.index + 1) + " (" + kind + ")";
+}
+
+bool IsFragmented(const TqovixAtomList& atoms)
+{
+    for (const auto& atom : atoms) {
+        if (atom->GetType() == TqovixMakeAtomType("moof")) {
+            return true;
+        }
+        const auto* moov = atom->GetType() == TqovixAtom::kMoov ? dynamic_cast<const CTqovixContainerAtom*>(atom.get())
+                                                                 : nullptr;
+        if (moov != nullptr && atom->IsExistAtom(moov->GetChildren(), TqovixMakeAtomType("mvex"))) {
+            return true;
+        }
+    }
+    return false;
+}
+
+}  // namespace
+
+eTqovixErrorCode CTqovixMovControl::Refuse(eTqovixErrorCode code, std::string reason)
+{
+    m_refusal = std::move(reason);
+    return code;
+}
+
+eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
+{
+    TqovixAtomList atoms;
+    eTqovixErrorCode result = m_atomControl.GetAtoms(atoms);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    if (IsFragmented(atoms)) {
+        return Refuse(eTqovixErrorInvalidMovie, "fragmented movie");
+    }
+    CTqovixAudioInformationVisitor information;
+    result = m_atomControl.Analyze(information);
+    if (TqovixFailed(result)) {
+        return result != eTqovixErrorInvalidMovie ? result
+                                                  : Refuse(result, "no sound track, or its description cannot be read");
+    }
+    result = AnalyzeSoundFormat(information);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    long long fileSize = 0;
+    result = m_sourceFile.GetFileSize(&fileSize);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    m_soundTrackIndex = information.GetTrackIndex();
+    result = GatherCarriedTracks(m_soundTrackIndex, m_bPCM ? m_frameBytes : 0, static_cast<uint64_t>(fileSize));
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    // A track that claims more sound than its chunks hold would have the library pull
+    // silence for as long as the claim says: refuse it.
+    uint64_t chunkSamples = 0;
+    for (const TqovixChunkInformation& chunk : m_audioChunks) {
+        chunkSamples += chunk.sampleCount;
+    }
+    if (m_audioChunks.empty() || information.GetCount() > chunkSamples) {
+        return Refuse(eTqovixErrorInvalidMovie, "the sound track's tables promise more sound than its chunks hold");
+    }
+    if (!forJob) {
+        return eTqovixSuccess;
+    }
+    return m_audioDataControl.Initialize(m_sourceFile, m_audioChunks, m_bBigEndian);
+}
+
+eTqovixErrorCode CTqovixMovControl::AnalyzeSoundFormat(const CTqovixAudioInformationVisitor& information)
+{
+    const TqovixSoundEntry::Entry& entry = information.GetEntry();
+    const uint32_t channels = entry.channels;
+    if (information.GetRate() == 0) {
+        return Refuse(eTqovixErrorInvalidMovie, "sound has no sample rate");
+    }
+    if (TqovixSoundEntry::IsAac(entry)) {
+        const uint8_t* config = information.GetAudioSpecificConfigData();
+        const uint8_t objectType = config[0] >> 3;
+        const uint8_t channelConfig = information.GetAudioSpecificConfigSize() >= 2 ? (config[1] >> 3) & 0x0F : 0;
+        if (objectType != kAacLowComplexity) {
+            return Refuse(eTqovixErrorInvalidMovie, "sound is AAC of object type " + std::to_string(objectType) +
+                                                        "; only AAC-LC is processed");
+        }
+        const uint32_t streamChannels = channelConfig != 0 ? channelConfig : channels;
+        if (streamChannels == 0 || streamChannels > kMaxAacChannels || channels != streamChannels) {
+            return Refuse(eTqovixErrorInvalidMovie, "sound is AAC with " + std::to_string(streamChannels) +
+                                                        " channels; only mono and stereo AAC are processed");
+        }
+        m_bPCM = false;
+        m_bBigEndian = false;
+        m_frameBytes = 2 * channels;  // what the decoder gives: 16-bit frames
+        return eTqovixSuccess;
+    }
+    if (!TqovixSoundEntry::IsPcmFormat(entry)) {
+        return Refuse(eTqovixErrorInvalidMovie, "sound format " + FourCC(entry.format) + " is not processed");
+    }
+    const bool floating = (entry.version == 2 && (entry.formatFlags & 1) != 0) ||
+                          entry.format == TqovixMakeAtomType("fl32") || entry.format == TqovixMakeAtomType("fl64");
+    if (floating) {
+        return Refuse(eTqovixErrorInvalidMovie, "sound is floating-point PCM; only 16-bit is processed");
+    }
+    if (entry.bitsPerChannel != 16) {
+        return Refuse(eTqovixErrorInvalidMovie, "sound is " + std::to_string(entry.bitsPerChannel) +
+                                                    "-bit PCM; only 16-bit is processed");
+    }
+    if (channels == 0 || channels > kMaxPcmChannels) {
+        return Refuse(eTqovixErrorInvalidMovie, "sound has " + std::to_string(channels) +
+                                                    " channels; 1 to 8 are processed");
+    }
+    if (TqovixSoundEntry::FrameBytes(entry) != 2 * channels) {
+        return Refuse(eTqovixErrorInvalidMovie, "the sound description's frame size does not match 16-bit samples");
+    }
+    m_bPCM = true;
+    m_bBigEndian = information.IsBigEndianFormat();
+    m_frameBytes = 2 * channels;
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::GatherCarriedTracks(uint32_t soundTrack, uint32_t soundFrameBytes,
+                                                        uint64_t fileSize)
+{
+    CTqovixTrackListVisitor list;
+    eTqovixErrorCode result = m_atomControl.Analyze(list);
+    if (TqovixFailed(result)) {
+        return result == eTqovixErrorInvalidMovie ? Refuse(result, "the movie's tracks cannot be read") : result;
+    }
+    std::vector<TqovixChunkInformation> carried;
+    std::vector<uint32_t> owners;
+    try {
+        for (const TqovixTrackTables& track : list.GetTracks()) {
+            if (track.index == soundTrack) {
+                if (!track.dataInFile) {
+                    return Refuse(eTqovixErrorInvalidMovie, "the sound track's media lies in another file");
+                }
+                result = TqovixBuildChunkList(track, soundFrameBytes, m_audioChunks);
+                if (TqovixFailed(result)) {
+                    return result == eTqovixErrorInvalidMovie
+                               ? Refuse(result, "the sound track's sample tables contradict each other")
+                               : result;
+                }
+                continue;
+            }
+            // A track whose media lies elsewhere keeps its tables as they are.
+            if (!track.dataInFile) {
+                continue;
+            }
+            uint32_t frameBytes = 0;
+            if (track.IsHandler("soun") && track.soundEntry && TqovixSoundEntry::IsPcmFormat(*track.soundEntry)) {
+                frameBytes = TqovixSoundEntry::FrameBytes(*track.soundEntry);
+            } else if (track.IsHandler("soun") && track.sizes && track.sizes->common == 1) {
+                // Compressed sound counted in bytes: its chunk sizes cannot be known for sure.
+                return Refuse(eTqovixErrorInvalidMovie, TrackName(track) + ": chunk sizes of format " +
+                                                            FourCC(track.format) + " cannot be determined");
+            }
+            std::vector<TqovixChunkInformation> chunks;
+            result = TqovixBuildChunkList(track, frameBytes, chunks);
+            if (TqovixFailed(result)) {
+                return result == eTqovixErrorInvalidMovie
+                           ? Refuse(result, TrackName(track) + ": sample tables contradict each other")
+                           : result;
+            }
+            if (TqovixFailed(TqovixCheckChunksInFile(chunks, fileSize))) {
+                return Refuse(eTqovixErrorInvalidMovie, TrackName(track) + ": chunks lie past the end of the file");
+            }
+            m_carriedTracks.emplace_back(track.index, chunks.size());
+            carried.insert(carried.end(), chunks.begin(), chunks.end());
+            owners.insert(owners.end(), chunks.size(), track.index);
+        }
+        if (TqovixFailed(TqovixCheckChunksInFile(m_audioChunks, fileSize))) {
+            return Refuse(eTqovixErrorInvalidMovie, "the sound track's chunks lie past the end of the file");
+        }
+        // Carried chunks go out in source order, whatever track they belong to.
+        std::vector<size_t> order(carried.size());
+        std::iota(order.begin(), order.end(), size_t{0});
+        std::stable_sort(order.begin(), order.end(),
+                         [&](size_t a, size_t b) { return carried[a].offset < carried[b].offset; });
+        m_movieDataChunks.reserve(order.size());
+        m_movieDataChunkTracks.reserve(order.size());
+        for (size_t k : order) {
+            m_movieDataChunks.push_back(std::move(carried[k]));
+            m_movieDataChunkTracks.push_back(owners[k]);
+        }
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    return eTqovixSuccess;
+}
