@@ -94,21 +94,18 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
 eTqovixErrorCode CTqovixMovControl::AnalyzeSoundFormat(const CTqovixAudioInformationVisitor& information)
 {
     const TqovixSoundEntry::Entry& entry = information.GetEntry();
-    const uint32_t channels = entry.channels;
+    const uint32_t channels = information.GetChannel();
     if (information.GetRate() == 0) {
         return Refuse(eTqovixErrorInvalidMovie, "sound has no sample rate");
     }
     if (TqovixSoundEntry::IsAac(entry)) {
-        const uint8_t* config = information.GetAudioSpecificConfigData();
-        const uint8_t objectType = config[0] >> 3;
-        const uint8_t channelConfig = information.GetAudioSpecificConfigSize() >= 2 ? (config[1] >> 3) & 0x0F : 0;
+        const uint8_t objectType = information.GetAudioSpecificConfigData()[0] >> 3;
         if (objectType != kAacLowComplexity) {
             return Refuse(eTqovixErrorInvalidMovie, "sound is AAC of object type " + std::to_string(objectType) +
                                                         "; only AAC-LC is processed");
         }
-        const uint32_t streamChannels = channelConfig != 0 ? channelConfig : channels;
-        if (streamChannels == 0 || streamChannels > kMaxAacChannels || channels != streamChannels) {
-            return Refuse(eTqovixErrorInvalidMovie, "sound is AAC with " + std::to_string(streamChannels) +
+        if (channels == 0 || channels > kMaxAacChannels) {
+            return Refuse(eTqovixErrorInvalidMovie, "sound is AAC with " + std::to_string(channels) +
                                                         " channels; only mono and stereo AAC are processed");
         }
         m_bPCM = false;

@@ -158,7 +158,15 @@ eTqovixErrorCode CTqovixAudioInformationVisitor::AnalyzeSampleDescription(std::s
         !Analyze_ESDSAtom(reinterpret_cast<const char*>(esds->data()), static_cast<unsigned int>(esds->size()))) {
         return eTqovixErrorInvalidMovie;
     }
-    return m_audioSpecificConfigSize == 0 || m_averageBitRate == 0 ? eTqovixErrorInvalidMovie : eTqovixSuccess;
+    if (m_audioSpecificConfigSize == 0 || m_averageBitRate == 0) {
+        return eTqovixErrorInvalidMovie;
+    }
+    // ISO files write a template channel count; the stream's own configuration says what it holds.
+    const uint8_t channelConfig = m_audioSpecificConfigSize >= 2 ? (m_audioSpecificConfig[1] >> 3) & 0x0F : 0;
+    if (channelConfig >= 1 && channelConfig <= 7) {
+        m_channelCount = channelConfig == 7 ? 8 : channelConfig;
+    }
+    return eTqovixSuccess;
 }
 
 bool CTqovixAudioInformationVisitor::Analyze_ESDSAtom(const char* data, unsigned int size) const

@@ -162,6 +162,9 @@ Bytes SoundTrack(const MovieRecipe& recipe, const MoviePlan& plan, bool co64)
     return Container("trak", trak);
 }
 
+
+}  // namespace
+
 Bytes UserData(const MakerRecipe& maker, const MoviePlan& plan)
 {
     std::vector<Bytes> tcdb;
@@ -187,8 +190,6 @@ Bytes UserData(const MakerRecipe& maker, const MoviePlan& plan)
     udta.insert(udta.end(), maker.extraUdtaChildren.begin(), maker.extraUdtaChildren.end());
     return Container("udta", udta);
 }
-
-}  // namespace
 
 Bytes BuildMoov(const MovieRecipe& recipe, const MoviePlan& plan, bool co64)
 {

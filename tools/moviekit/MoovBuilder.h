@@ -8,5 +8,7 @@ namespace moviekit {
 
 // The size of the result depends on `co64` but never on the chunk offsets themselves.
 Bytes BuildMoov(const MovieRecipe& recipe, const MoviePlan& plan, bool co64);
+// The "udta" atom holding the maker containers.
+Bytes UserData(const MakerRecipe& maker, const MoviePlan& plan);
 
 }  // namespace moviekit

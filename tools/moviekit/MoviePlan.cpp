@@ -30,8 +30,6 @@ std::vector<uint32_t> SplitIntoChunks(uint64_t total, uint32_t perChunk)
     return counts;
 }
 
-namespace {
-
 void ResolveMaker(const MovieRecipe& recipe, MoviePlan& plan)
 {
     const MakerRecipe& maker = recipe.maker;
@@ -58,6 +56,8 @@ void ResolveMaker(const MovieRecipe& recipe, MoviePlan& plan)
         plan.tagPayload = SerializeTags(tags);
     }
 }
+
+namespace {
 
 bool PlanVideo(const VideoRecipe& video, MoviePlan& plan, std::string* error)
 {

@@ -38,6 +38,8 @@ struct MoviePlan {
 };
 
 bool PlanMovie(const MovieRecipe& recipe, MoviePlan* plan, std::string* error);
+// The maker payloads (AF information, audio level, tags) of `recipe`; needs plan.soundFrames.
+void ResolveMaker(const MovieRecipe& recipe, MoviePlan& plan);
 std::vector<uint64_t> MdatPayloadSizes(const MoviePlan& plan);
 void AssignOffsets(MoviePlan& plan, const std::vector<uint64_t>& mdatPayloadOffsets);
 

@@ -1,0 +1,281 @@
+// Movies that another writer made (the ffmpeg command, at test time), given the camera's
+// maker atoms: each is processed right in every respect or refused up front, and the
+// property query agrees with the job. Judged by ffprobe, ffmpeg and a walker of our own
+// that shares nothing with the library's parser.
+#include "host/ChunkAccount.h"
+#include "host/JobHarness.h"
+#include "MakerInjector.h"
+
+#include <algorithm>
+#include <cmath>
+#include <filesystem>
+#include <string>
+#include <vector>
+
+namespace {
+
+using jobtest::HostTest;
+using moviekit::AfInterval;
+
+constexpr int kDone = 1;
+constexpr int kRefused = 8;
+constexpr double kSeconds = 2.0;
+
+enum class Sound { Pcm, Aac };
+
+struct Writer {
+    const char* name;
+    std::string codec;        // ffmpeg's sound encoder and its options
+    uint32_t rate;
+    uint32_t channels;
+    const char* extension;    // ".mov" or ".mp4"
+    std::string extra;        // more of ffmpeg's options (brand, timecode, a second track)
+    int expected;             // the property query's answer, and the job's refusal code
+    Sound sound = Sound::Pcm;
+};
+
+void PrintTo(const Writer& writer, std::ostream* out) { *out << writer.name; }
+
+std::string Shell(const std::string& command)
+{
+    std::string output;
+    const int status = testsupport::RunCommand(command + " 2>&1", &output);
+    return status == 0 ? "" : output.empty() ? "exit " + std::to_string(status) : output;
+}
+
+// A sweep under a slow swell: no two stretches alike, so a cross-correlation has one peak.
+std::string SoundSource(uint32_t rate, uint32_t channels)
+{
+    std::string expression;
+    for (uint32_t c = 0; c < channels; ++c) {
+        expression += (c ? "|" : "") + std::string("(0.3+0.1*sin(2*PI*1.3*t+") + std::to_string(c) +
+                      "))*sin(2*PI*(180*t+260*t*t))+0.08*sin(2*PI*(2100+" + std::to_string(150 * c) + ")*t)";
+    }
+    return "-f lavfi -i \"aevalsrc='" + expression + "':s=" + std::to_string(rate) + ":d=" +
+           std::to_string(kSeconds) + "\"";
+}
+
+std::vector<std::string> StreamList(const std::string& path)
+{
+    std::string output;
+    testsupport::RunCommand("ffprobe -v error -show_entries stream=codec_type,codec_name,sample_rate,channels "
+                            "-of csv=p=0 " + testsupport::ShellQuote(path),
+                            &output);
+    std::vector<std::string> lines;
+    for (size_t at = 0; at < output.size();) {
+        const size_t end = output.find('\n', at);
+        lines.push_back(output.substr(at, end - at));
+        at = end == std::string::npos ? output.size() : end + 1;
+    }
+    return lines;
+}
+
+std::string Timecode(const std::string& path)
+{
+    std::string output;
+    testsupport::RunCommand("ffprobe -v error -show_entries stream_tags=timecode -of csv=p=0 " +
+                                testsupport::ShellQuote(path),
+                            &output);
+    output.erase(std::remove(output.begin(), output.end(), '\n'), output.end());
+    return output;
+}
+
+// Interleaved s16 of sound stream `index`.
+std::vector<int16_t> Decode(const std::string& path, int index)
+{
+    testsupport::TempDir scratch;
+    const std::string raw = scratch.File("sound.raw");
+    EXPECT_EQ(Shell("ffmpeg -v error -nostdin -i " + testsupport::ShellQuote(path) + " -map 0:a:" +
+                  std::to_string(index) + " -f s16le -acodec pcm_s16le " + testsupport::ShellQuote(raw)),
+              "");
+    const std::vector<uint8_t> bytes = testsupport::ReadFile(raw);
+    std::vector<int16_t> samples(bytes.size() / 2);
+    for (size_t k = 0; k < samples.size(); ++k) {
+        samples[k] = static_cast<int16_t>(bytes[2 * k] | (bytes[2 * k + 1] << 8));
+    }
+    return samples;
+}
+
+bool Outside(uint64_t frame, const std::vector<AfInterval>& intervals, uint64_t margin)
+{
+    for (const AfInterval& span : intervals) {
+        if (frame + margin >= span.startFrame && frame < span.endFrame + margin) {
+            return false;
+        }
+    }
+    return true;
+}
+
+// Normalised correlation of channel 0 of a[f] with b[f + lag] over the frames `use` takes.
+template <typename Use>
+double Correlation(const std::vector<int16_t>& a, const std::vector<int16_t>& b, uint32_t channels, int64_t lag,
+                   int64_t from, int64_t to, Use use)
+{
+    double ab = 0;
+    double aa = 0;
+    double bb = 0;
+    const auto frames = static_cast<int64_t>(b.size() / channels);
+    for (int64_t f = std::max<int64_t>({from, 0, -lag}); f < to && f + lag < frames; ++f) {
+        if (use(f)) {
+            const double x = a[f * channels];
+            const double y = b[(f + lag) * channels];
+            ab += x * y;
+            aa += x * x;
+            bb += y * y;
+        }
+    }
+    return aa > 0 && bb > 0 ? ab / std::sqrt(aa * bb) : 0.0;
+}
+
+class InteropTest : public HostTest, public ::testing::WithParamInterface<Writer> {
+protected:
+    // The movie as ffmpeg writes it, with the maker atoms added; empty on failure.
+    std::string Make(const Writer& w, const std::vector<AfInterval>& intervals)
+    {
+        const std::string path = m_dir.File(std::string("source") + w.extension);
+        const std::string video = "-f lavfi -i testsrc=size=64x36:rate=30:d=" + std::to_string(kSeconds);
+        EXPECT_EQ(Shell("ffmpeg -v error -nostdin -y " + video + " " + SoundSource(w.rate, w.channels) +
+                        " -map 0:v -map 1:a -c:v mjpeg -c:a " + w.codec + " -ac " + std::to_string(w.channels) +
+                        " " + w.extra + " " + testsupport::ShellQuote(path)),
+                  "");
+        moviekit::MovieRecipe recipe;
+        recipe.sound.sampleRate = w.rate;
+        recipe.maker.afIntervals = intervals;
+        std::string error;
+        const bool fragmented = w.extra.find("frag_keyframe") != std::string::npos;
+        if (!fragmented && !moviekit::AddMakerData(path, recipe, static_cast<uint64_t>(kSeconds * w.rate), &error)) {
+            ADD_FAILURE() << error;
+            return "";
+        }
+        return path;
+    }
+
+    void ExpectPcmExactOutside(const std::string& source, const std::string& destination, const Writer& w,
+                               const std::vector<AfInterval>& intervals)
+    {
+        const std::vector<int16_t> before = Decode(source, 0);
+        const std::vector<int16_t> after = Decode(destination, 0);
+        ASSERT_EQ(after.size(), before.size()) << "the sound changed its length";
+        // Outside each interval widened by the library's 10 ms ramp: bit-exact, with no other slack.
+        const uint64_t ramp = w.rate / 100;
+        uint64_t changedOutside = 0;
+        uint64_t firstChanged = UINT64_MAX;
+        std::vector<uint64_t> inside(intervals.size());
+        std::vector<uint64_t> changedInside(intervals.size());
+        for (uint64_t f = 0; f < before.size() / w.channels; ++f) {
+            const auto at = static_cast<std::ptrdiff_t>(f * w.channels);
+            const bool changed = !std::equal(before.begin() + at, before.begin() + at + w.channels, after.begin() + at);
+            if (Outside(f, intervals, ramp) && changed) {
+                ++changedOutside;
+                firstChanged = std::min(firstChanged, f);
+            }
+            for (size_t i = 0; i < intervals.size(); ++i) {
+                if (f >= intervals[i].startFrame + ramp && f + ramp < intervals[i].endFrame) {
+                    ++inside[i];
+                    changedInside[i] += changed ? 1 : 0;
+                }
+            }
+        }
+        EXPECT_EQ(changedOutside, 0u) << "first changed frame outside: " << firstChanged;
+        for (size_t i = 0; i < intervals.size(); ++i) {
+            EXPECT_GT(changedInside[i] * 2, inside[i]) << "AF interval " << i << " left as it was";
+        }
+    }
+
+    void ExpectAacInSync(const std::string& source, const std::string& destination, const Writer& w,
+                         const std::vector<AfInterval>& intervals)
+    {
+        const std::vector<int16_t> a = Decode(source, 0);
+        const std::vector<int16_t> b = Decode(destination, 0);
+        ASSERT_EQ(b.size(), a.size()) << "the sound changed its length";
+        // The encoder's lead-in (its first packet) cannot match; the rest outside the intervals must.
+        const int64_t from = 2048;
+        const auto frames = static_cast<int64_t>(a.size() / w.channels);
+        const auto outside = [&](int64_t f) { return Outside(static_cast<uint64_t>(f), intervals, 2048); };
+        int64_t lag = 0;
+        double best = -2;
+        for (int64_t candidate = -1200; candidate <= 1200; ++candidate) {
+            const double c = Correlation(a, b, w.channels, candidate, from, from + 8192, outside);
+            if (c > best) {
+                best = c;
+                lag = candidate;
+            }
+        }
+        EXPECT_EQ(lag, 0) << "the sound moved against the video";
+        EXPECT_GT(Correlation(a, b, w.channels, 0, from, frames, outside), 0.99);
+    }
+};
+
+TEST_P(InteropTest, ProcessedRightOrRefusedUpFront)
+{
+    const Writer& w = GetParam();
+    const uint64_t frames = static_cast<uint64_t>(kSeconds * w.rate);
+    const std::vector<AfInterval> intervals = {{frames / 5, frames / 5 + frames / 8, 1000},
+                                               {frames / 2 + 777, frames / 2 + frames / 6, 700}};
+    const std::string source = Make(w, intervals);
+    ASSERT_FALSE(source.empty());
+    const jobtest::FileStamp before = jobtest::StampFile(source);
+    const std::string destination = m_dir.File(std::string("processed") + w.extension);
+
+    // The property query runs the job's own analysis: it never promises what the job refuses.
+    const int promised = TqGetPropertyOVIX(source.c_str());
+    EXPECT_EQ(promised, w.expected);
+    const int ended = HostTest::Run(source, destination);
+    EXPECT_EQ(jobtest::StampFile(source), before) << "the source was written";
+    if (w.expected != 0) {
+        EXPECT_EQ(ended, w.expected);
+        EXPECT_FALSE(jobtest::Exists(destination));
+        return;
+    }
+    ASSERT_EQ(ended, kDone);
+    EXPECT_EQ(jobtest::ProbeErrors(destination), "");
+    EXPECT_EQ(StreamList(destination), StreamList(source));
+    EXPECT_EQ(Timecode(destination), Timecode(source));
+    EXPECT_EQ(jobtest::AccountForEveryByte(destination), "");
+    // Every stream but the processed sound is the source's, packet for packet.
+    const std::vector<std::string> streams = StreamList(source);
+    int sounds = 0;
+    for (size_t s = 0; s < streams.size(); ++s) {
+        const bool processed = streams[s].find(",audio") != std::string::npos && sounds++ == 0;
+        if (!processed) {
+            EXPECT_EQ(jobtest::PacketHashes(destination, std::to_string(s)),
+                      jobtest::PacketHashes(source, std::to_string(s)))
+                << "stream " << s << ": " << streams[s];
+        }
+    }
+    if (w.sound == Sound::Pcm) {
+        ExpectPcmExactOutside(source, destination, w, intervals);
+        // PCM keeps its bytes: only the movie atom may change the size.
+        const auto grown = static_cast<int64_t>(std::filesystem::file_size(destination)) -
+                           static_cast<int64_t>(std::filesystem::file_size(source));
+        EXPECT_LT(std::abs(grown), 4096);
+    } else {
+        ExpectAacInSync(source, destination, w, intervals);
+    }
+    EXPECT_EQ(TqGetPropertyOVIX(destination.c_str()), 20) << "processed movies say so";
+}
+
+const std::string kTimecode = "-timecode 10:00:00:00";
+const std::string kMp42 = "-brand mp42";
+const std::string kSecondSound = "-map 1:a -c:a:1 aac";  // a second microphone, copied bit for bit
+
+INSTANTIATE_TEST_SUITE_P(
+    Writers, InteropTest,
+    ::testing::Values(Writer{"PcmBigEndian48kStereo", "pcm_s16be", 48000, 2, ".mov", "", 0},
+                      Writer{"PcmLittleEndian48kMono", "pcm_s16le", 48000, 1, ".mov", "", 0},
+                      Writer{"PcmBigEndian44kMono", "pcm_s16be", 44100, 1, ".mov", "", 0},
+                      Writer{"PcmLittleEndian44kStereo", "pcm_s16le", 44100, 2, ".mov", "", 0},
+                      Writer{"PcmSixChannels", "pcm_s16le", 48000, 6, ".mov", "", 0},
+                      Writer{"AacStereo48kMov", "aac", 48000, 2, ".mov", "", 0, Sound::Aac},
+                      Writer{"AacMono44kMov", "aac", 44100, 1, ".mov", "", 0, Sound::Aac},
+                      Writer{"AacMono48kMp4", "aac", 48000, 1, ".mp4", kMp42, 0, Sound::Aac},
+                      Writer{"AacStereo44kMp4", "aac", 44100, 2, ".mp4", kMp42, 0, Sound::Aac},
+                      Writer{"TimecodeTrack", "pcm_s16le", 48000, 2, ".mov", kTimecode, 0},
+                      Writer{"TwoSoundTracks", "pcm_s16be", 48000, 2, ".mov", kSecondSound, 0},
+                      Writer{"Pcm24Bit", "pcm_s24le", 48000, 2, ".mov", "", kRefused},
+                      Writer{"PcmFloat", "pcm_f32le", 48000, 2, ".mov", "", kRefused},
+                      Writer{"Fragmented", "aac", 48000, 2, ".mov", "-movflags frag_keyframe+empty_moov",
+                             kRefused, Sound::Aac}),
+    [](const ::testing::TestParamInfo<Writer>& info) { return std::string(info.param.name); });
+
+}  // namespace
