@@ -55,10 +55,12 @@ Pcm Tone(size_t frames)
 // An open encoder fed consecutive bytes of `pcm`, lent a buffer as the codec adapter does,
 // and able to refuse one packet.
 struct EncoderRig {
-    explicit EncoderRig(bool lend = true)
+    explicit EncoderRig(bool lend = true, uint32_t channels = kChannels)
     {
         stream = {lend ? Request : nullptr, Result, buffer.data(), static_cast<unsigned int>(buffer.size()), this};
-        EXPECT_EQ(encoder.Initialize(PcmFormat(), AacFormat(), 256000, &stream), eConverterSuccess);
+        EXPECT_EQ(encoder.Initialize(PcmFormat(kRate, channels), AacFormat(kRate, channels), 128000 * channels,
+                                     &stream),
+                  eConverterSuccess);
     }
 
     eConverterErrorCode Push(unsigned int bytes)
@@ -189,16 +191,21 @@ TEST(AacEncoderTest, PushesOfAnySizeAreCutIntoBlocksAfterTheDropAndFlushedWithSi
         unsigned int bytes, packetsBy;
         eConverterErrorCode status = eConverterSuccess;
     };
-    const std::vector<std::tuple<const char*, bool, size_t, std::vector<Step>>> rows = {  // name, lend, refuseAt
+    // name, lend, refuseAt, channels
+    const std::vector<std::tuple<const char*, bool, size_t, uint32_t, std::vector<Step>>> rows = {
         // 4352 dropped, a block, 1552 held; with the next push exactly one block; the flush
         // sends the 100 held bytes padded with silence, then silence; a second holds nothing.
-        {"RemaindersWait", true, SIZE_MAX, {{10000, 1}, {2544, 2}, {100, 2}, {kFlush, 4}, {kFlush, 5}}},
-        {"ShortFirstPushDroppedWhole", true, SIZE_MAX, {{4200, 0}, {4096, 1}, {kFlush, 2}}},
-        {"OwnBufferWhenNoneIsLent", false, SIZE_MAX, {{kDropBytes + 2 * 4096, 2}}},
-        {"RefusedPacketEndsThePushAndItsRest", true, 1, {{kDropBytes, 0}, {4 * 4096 + 10, 2, kAborted}, {kFlush, 3}}},
+        {"RemaindersWait", true, SIZE_MAX, 2, {{10000, 1}, {2544, 2}, {100, 2}, {kFlush, 4}, {kFlush, 5}}},
+        // The drop is 1088 frames however the pushes fall: 4200 bytes, then 152 of the next.
+        {"DropSpansPushes", true, SIZE_MAX, 2, {{4200, 0}, {4096, 0}, {4248, 2}, {kFlush, 3}}},
+        // Mono: 2176 bytes dropped, blocks of 2048 bytes, silence of 2048.
+        {"MonoBlocksFollowTheFrame", true, SIZE_MAX, 1, {{2176 + 2048, 1}, {2047, 1}, {1, 2}, {kFlush, 3}}},
+        {"OwnBufferWhenNoneIsLent", false, SIZE_MAX, 2, {{kDropBytes + 2 * 4096, 2}}},
+        {"RefusedPacketEndsThePushAndItsRest", true, 1, 2,
+         {{kDropBytes, 0}, {4 * 4096 + 10, 2, kAborted}, {kFlush, 3}}},
     };
-    for (const auto& [name, lend, refuseAt, steps] : rows) {
-        EncoderRig rig(lend);
+    for (const auto& [name, lend, refuseAt, channels, steps] : rows) {
+        EncoderRig rig(lend, channels);
         rig.refuseAt = refuseAt;
         for (const Step& step : steps) {
             EXPECT_EQ(rig.Push(step.bytes), step.status) << name;
@@ -207,7 +214,7 @@ TEST(AacEncoderTest, PushesOfAnySizeAreCutIntoBlocksAfterTheDropAndFlushedWithSi
         EXPECT_EQ(static_cast<size_t>(std::ranges::count(rig.writtenAt, rig.buffer.data())),
                   lend ? rig.packets.size() : 0) << name;
         // Asked for with the largest packet size, 6144 bits per channel.
-        EXPECT_EQ(rig.requested, std::vector<unsigned int>(lend ? steps.size() : 0, 1536U)) << name;
+        EXPECT_EQ(rig.requested, std::vector<unsigned int>(lend ? steps.size() : 0, 768U * channels)) << name;
     }
 
     // Byte for byte, the blocks of the PCM after its first 4352 bytes; the flush adds the

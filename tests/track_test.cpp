@@ -1,14 +1,18 @@
+// The track layer: typed readers of the track atoms, chunk lists built from a track's
+// tables, per-track decisions of the visitors, and table rewrites for the destination.
 #include <gtest/gtest.h>
 
 #include <cstdint>
 #include <functional>
+#include <sstream>
 #include <string>
-#include <utility>
 #include <vector>
 
 #include "ByteWriter.h"
 #include "Movie.h"
 #include "atom/CTqovixAtomControl.h"
+#include "atom/TqovixSoundEntry.h"
+#include "atom/TqovixTrackAtoms.h"
 #include "file/CTqovixFile.h"
 #include "support/ChunkTables.h"
 #include "support/TestSupport.h"
@@ -22,6 +26,8 @@ using moviekit::Container;
 using moviekit::SoundCodec;
 using Chunks = std::vector<TqovixChunkInformation>;
 using Recipe = moviekit::MovieRecipe;
+namespace ta = TqovixTrackAtoms;
+namespace se = TqovixSoundEntry;
 
 namespace {
 
@@ -34,34 +40,223 @@ Bytes U32s(const std::vector<uint32_t>& values)
     return out;
 }
 
-// A movie whose only track holds the given handler subtype and sample tables.
-Bytes TrackMovie(const char* subtype, const std::vector<Bytes>& tables, const std::vector<Bytes>& beforeMedia = {})
+Bytes Text(const char* text) { return Bytes(text, text + 4); }
+
+Bytes Handler(const char* type, const char* subtype)
 {
-    const Bytes handler =
-        moviekit::Concat({Bytes(4, 0), Bytes{'m', 'h', 'l', 'r'}, Bytes(subtype, subtype + 4), Bytes(12, 0)});
+    return moviekit::Concat({Bytes(4, 0), type ? Text(type) : Bytes(4, 0), Text(subtype), Bytes(12, 0)});
+}
+
+// A track whose media handler names `subtype`, with the given sample tables.
+Bytes Track(const char* subtype, const std::vector<Bytes>& tables, const std::vector<Bytes>& beforeMedia = {})
+{
     std::vector<Bytes> track = beforeMedia;
-    track.push_back(Container("mdia", {Atom("hdlr", handler), Container("minf", {Container("stbl", tables)})}));
-    return moviekit::Concat({Atom("ftyp", Bytes{'q', 't', ' ', ' '}), Container("moov", {Container("trak", track)})});
+    track.push_back(Container("mdia", {Atom("hdlr", Handler("mhlr", subtype)), Container("minf", {Container("stbl", tables)})}));
+    return Container("trak", track);
 }
 
-Bytes Table(const char* type, uint32_t declaredCount, const Bytes& entries)
+Bytes MovieOf(const std::vector<Bytes>& tracks)
 {
-    return Atom(type, moviekit::Concat({U32s({0, declaredCount}), entries}));
+    return moviekit::Concat({Atom("ftyp", Text("qt  ")), Container("moov", tracks)});
 }
 
-Bytes Sizes(uint32_t common, std::vector<uint32_t> sizes)
+Bytes Table(const char* type, uint32_t count, const Bytes& entries)
 {
-    sizes.insert(sizes.begin(), static_cast<uint32_t>(sizes.size()));
-    return Table("stsz", common, U32s(sizes));
+    return Atom(type, moviekit::Concat({U32s({0, count}), entries}));
 }
 
-eTqovixErrorCode UpdateChunks(const CTqovixAtomControl& tree, bool video, const Chunks& chunks)
+// A 16-bit PCM sound description of the given version (1 adds the per-packet fields).
+Bytes PcmDescription(const char* format, uint16_t channels, uint16_t version = 0, uint32_t bytesPerFrame = 0)
 {
-    CTqovixAudioDataVisitor sound;
-    CTqovixMovieDataVisitor picture;
-    video ? picture.SetOffset(chunks) : sound.SetAudioChunkInformation(chunks);
-    return video ? tree.Update(picture) : tree.Update(sound);
+    Bytes entry = moviekit::Concat({Text(format), Bytes(6, 0), Bytes{0, 1}});
+    moviekit::PutU16(entry, version);
+    entry.insert(entry.end(), 6, 0);
+    moviekit::PutU16(entry, channels);
+    moviekit::PutU16(entry, 16);
+    entry.insert(entry.end(), 4, 0);
+    moviekit::PutU32(entry, 48000u << 16);
+    if (version == 1) {
+        entry = moviekit::Concat({entry, U32s({1, 2, bytesPerFrame, 2})});
+    }
+    return Table("stsd", 1, moviekit::Concat({U32s({static_cast<uint32_t>(entry.size() + 4)}), entry}));
 }
+
+// ---- Typed readers: each row reads a payload and shows what it understood ----
+
+struct ReaderRow {
+    const char* name;
+    std::function<std::string()> read;
+    std::string expected;  // "refused" when the reader gives nothing
+};
+void PrintTo(const ReaderRow& row, std::ostream* out) { *out << row.name; }
+
+template <typename T, typename Show>
+std::string Shown(const std::optional<T>& value, Show show)
+{
+    return value ? show(*value) : "refused";
+}
+
+std::string Edits(const Bytes& payload)
+{
+    return Shown(ta::ParseEditList(payload), [](const std::vector<ta::Edit>& edits) {
+        std::ostringstream out;
+        for (const ta::Edit& edit : edits) {
+            out << edit.duration << "@" << edit.mediaTime << " ";
+        }
+        out << "first " << ta::FirstMediaTime(edits);
+        return out.str();
+    });
+}
+
+std::string Offsets(const Bytes& payload, bool wide)
+{
+    return Shown(ta::ParseChunkOffsets(payload, wide), [](const std::vector<uint64_t>& offsets) {
+        std::ostringstream out;
+        for (uint64_t offset : offsets) {
+            out << offset << " ";
+        }
+        return out.str();
+    });
+}
+
+std::string Entry(const Bytes& stsdAtom)
+{
+    const Bytes payload(stsdAtom.begin() + 8, stsdAtom.end());
+    return Shown(se::Parse(payload), [](const se::Entry& e) {
+        return TqovixAtomTypeName(e.format) + " v" + std::to_string(e.version) + " " + std::to_string(e.channels) +
+               "ch " + std::to_string(e.bitsPerChannel) + "bit " + std::to_string(e.sampleRateHz) + "Hz frame " +
+               std::to_string(se::FrameBytes(e));
+    });
+}
+
+std::string Esds(const Bytes& children)
+{
+    const auto payload = se::FindEsds(children);
+    if (!payload) {
+        return "none";
+    }
+    return Shown(se::ParseEsds(*payload), [](const se::DecoderConfig& c) {
+        return "rate " + std::to_string(c.averageBitRate) + " config " + std::to_string(c.audioSpecificConfig.size());
+    });
+}
+
+// version/flags, ES_Descriptor(ES_ID, flags, DecoderConfig(type, stream, buffer, max, avg, DSI(2 bytes))).
+const Bytes kEsdsPayload = {0, 0, 0, 0, 3, 22, 0, 1, 0, 4, 17, 0x40, 0x15, 0, 0, 0, 0, 0, 0, 1,
+                            0, 0, 0, 2, 5, 2, 0x11, 0x90};
+
+class TypedReaderTest : public ::testing::TestWithParam<ReaderRow> {};
+
+TEST_P(TypedReaderTest, ReadsWhatThePayloadHoldsOrRefuses)
+{
+    EXPECT_EQ(GetParam().read(), GetParam().expected);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Readers, TypedReaderTest,
+    ::testing::Values(
+        ReaderRow{"HandlerQuickTime", [] { return ta::IsMediaHandler(*ta::ParseHandler(Handler("mhlr", "soun")), "soun") ? "yes" : "no"; }, "yes"},
+        ReaderRow{"HandlerIso", [] { return ta::IsMediaHandler(*ta::ParseHandler(Handler(nullptr, "soun")), "soun") ? "yes" : "no"; }, "yes"},
+        ReaderRow{"HandlerOfData", [] { return ta::IsMediaHandler(*ta::ParseHandler(Handler("dhlr", "soun")), "soun") ? "yes" : "no"; }, "no"},
+        ReaderRow{"HandlerTooShort", [] { return ta::ParseHandler(Bytes(11, 0)) ? "read" : "refused"; }, "refused"},
+        ReaderRow{"EditListVersion0", [] { return Edits(U32s({0, 2, 500, 0xFFFFFFFF, 0x10000, 900, 2112, 0x10000})); }, "500@-1 900@2112 first 2112"},
+        ReaderRow{"EditListVersion1", [] { return Edits(U32s({0x01000000, 1, 0, 900, 0, 1024, 0x10000})); }, "900@1024 first 1024"},
+        ReaderRow{"EditListCountPastPayload", [] { return Edits(U32s({0, 2, 900, 1024, 0x10000})); }, "refused"},
+        ReaderRow{"EditListOnlyEmpty", [] { return Edits(U32s({0, 1, 500, 0xFFFFFFFF, 0x10000})); }, "500@-1 first 0"},
+        ReaderRow{"OffsetsNarrow", [] { return Offsets(U32s({0, 2, 8, 16}), false); }, "8 16 "},
+        ReaderRow{"OffsetsWide", [] { return Offsets(U32s({0, 1, 1, 0}), true); }, "4294967296 "},
+        ReaderRow{"OffsetsCountPastPayload", [] { return Offsets(U32s({0, 3, 8, 16}), false); }, "refused"},
+        ReaderRow{"OffsetsAbsurdCount", [] { return Offsets(U32s({0, 0xFFFFFFFF}), false); }, "refused"},
+        ReaderRow{"SizesCommon", [] { return Shown(ta::ParseSampleSizes(U32s({0, 4, 1000})), [](const ta::SampleSizes& s) { return std::to_string(s.common) + "x" + std::to_string(s.count); }); }, "4x1000"},
+        ReaderRow{"SizesListPastPayload", [] { return Shown(ta::ParseSampleSizes(U32s({0, 0, 3, 5, 6})), [](const ta::SampleSizes&) { return std::string("read"); }); }, "refused"},
+        ReaderRow{"RunsCountPastPayload", [] { return ta::ParseSampleToChunk(U32s({0, 2, 1, 5, 1})) ? "read" : "refused"; }, "refused"},
+        ReaderRow{"TimeToSampleTotal", [] { return Shown(ta::ParseSampleTotal(U32s({0, 2, 3, 1, 4, 1})), [](uint64_t t) { return std::to_string(t); }); }, "7"},
+        ReaderRow{"TimeToSampleHalfEntry", [] { return ta::ParseSampleTotal(U32s({0, 3, 3, 1, 4, 1, 777})) ? "read" : "refused"; }, "refused"},
+        ReaderRow{"DataInFile", [] { return Shown(ta::ParseDataInFile(moviekit::Concat({U32s({0, 1, 12}), Text("url "), U32s({1})})), [](bool in) { return in ? "here" : "elsewhere"; }); }, "here"},
+        ReaderRow{"DataElsewhere", [] { return Shown(ta::ParseDataInFile(moviekit::Concat({U32s({0, 1, 16}), Text("alis"), U32s({0, 7})})), [](bool in) { return in ? "here" : "elsewhere"; }); }, "elsewhere"},
+        ReaderRow{"SoundEntryVersion0", [] { return Entry(PcmDescription("twos", 2)); }, "twos v0 2ch 16bit 48000Hz frame 4"},
+        ReaderRow{"SoundEntryVersion1FrameField", [] { return Entry(PcmDescription("sowt", 6, 1, 12)); }, "sowt v1 6ch 16bit 48000Hz frame 12"},
+        ReaderRow{"SoundEntryVersion1Cut", [] { Bytes d = PcmDescription("sowt", 2, 1, 4); d.resize(d.size() - 8); return Entry(d); }, "refused"},
+        ReaderRow{"SoundEntryVersion3", [] { return Entry(PcmDescription("twos", 2, 3)); }, "refused"},
+        ReaderRow{"EsdsDirect", [] { return Esds(Atom("esds", kEsdsPayload)); }, "rate 2 config 2"},
+        ReaderRow{"EsdsInsideWave", [] { return Esds(Container("wave", {Atom("frma", Text("mp4a")), Atom("esds", kEsdsPayload), Bytes(8, 0)})); }, "rate 2 config 2"},
+        // Bytes that spell "esds" inside another child are no decoder configuration.
+        ReaderRow{"EsdsSpelledInsideAnotherAtom", [] { return Esds(Atom("btrt", moviekit::Concat({Bytes{0, 0, 0, 20}, Text("esds"), kEsdsPayload}))); }, "none"},
+        ReaderRow{"EsdsTwoByteSize", [] { Bytes p = kEsdsPayload; p[5] = 0x81; return Esds(Atom("esds", p)); }, "refused"},
+        ReaderRow{"EsdsProfileAfterConfig", [] { Bytes p = kEsdsPayload; p[5] += 2; p[10] += 2; p.insert(p.end(), {6, 0}); return Esds(Atom("esds", p)); }, "refused"},
+        ReaderRow{"EsdsDescriptorPastItsParent", [] { Bytes p = kEsdsPayload; p[10] += 1; return Esds(Atom("esds", p)); }, "refused"}),
+    [](const ::testing::TestParamInfo<ReaderRow>& info) { return std::string(info.param.name); });
+
+// ---- Chunk lists from a track's tables ----
+
+struct ChunkRow {
+    const char* name;
+    std::vector<ta::ChunkRun> runs;
+    ta::SampleSizes sizes;
+    uint32_t chunks;
+    uint32_t frameBytes;
+    std::vector<uint32_t> expectedBytes;  // per chunk; empty when refused
+};
+void PrintTo(const ChunkRow& row, std::ostream* out) { *out << row.name; }
+
+class ChunkListTest : public ::testing::TestWithParam<ChunkRow> {};
+
+TEST_P(ChunkListTest, TablesGiveChunksOrARefusal)
+{
+    const ChunkRow& row = GetParam();
+    TqovixTrackTables tables;
+    tables.runs = row.runs;
+    tables.sizes = row.sizes;
+    tables.offsets = std::vector<uint64_t>(row.chunks);
+    for (uint32_t k = 0; k < row.chunks; ++k) {
+        (*tables.offsets)[k] = 1000 * (k + 1);
+    }
+    Chunks chunks;
+    const eTqovixErrorCode built = TqovixBuildChunkList(tables, row.frameBytes, chunks);
+    ASSERT_EQ(built, row.expectedBytes.empty() && row.chunks != 0 ? eTqovixErrorInvalidMovie : eTqovixSuccess);
+    std::vector<uint32_t> bytes;
+    for (size_t k = 0; k < chunks.size(); ++k) {
+        bytes.push_back(chunks[k].size);
+        EXPECT_EQ(chunks[k].offset, 1000 * (k + 1));
+        EXPECT_EQ(chunks[k].chunkNumber, k + 1);
+    }
+    EXPECT_EQ(bytes, row.expectedBytes);
+}
+
+const ta::SampleSizes kOne{1, 0, {}};
+const ta::SampleSizes kFrame{4, 0, {}};
+
+INSTANTIATE_TEST_SUITE_P(
+    Tables, ChunkListTest,
+    ::testing::Values(
+        ChunkRow{"TwoRuns", {{1, 3}, {5, 2}}, kOne, 6, 4, {12, 12, 12, 12, 8, 8}},
+        ChunkRow{"CameraCommonSizeOne", {{1, 1024}}, kOne, 2, 2, {2048, 2048}},
+        ChunkRow{"WritersCommonSizeOfAFrame", {{1, 1024}}, kFrame, 2, 4, {4096, 4096}},
+        ChunkRow{"CommonSizeNeitherOneNorAFrame", {{1, 1024}}, ta::SampleSizes{2, 0, {}}, 2, 4, {}},
+        ChunkRow{"CompressedCommonSize", {{1, 3}}, ta::SampleSizes{7, 0, {}}, 1, 0, {21}},
+        ChunkRow{"SampleSizeList", {{1, 2}}, ta::SampleSizes{0, 4, {5, 6, 7, 8}}, 2, 0, {11, 15}},
+        ChunkRow{"FirstChunkNotOne", {{2, 3}}, kOne, 6, 4, {}},
+        ChunkRow{"RunRepeatsItsFirstChunk", {{1, 3}, {1, 2}}, kOne, 6, 4, {}},
+        ChunkRow{"RunPastTheChunks", {{1, 3}, {9, 2}}, kOne, 6, 4, {}},
+        ChunkRow{"NoRunsForChunks", {}, kOne, 2, 4, {}},
+        ChunkRow{"SizesRunOut", {{1, 2}}, ta::SampleSizes{0, 3, {4, 4, 4}}, 2, 0, {}},
+        ChunkRow{"SizesLeftOver", {{1, 1}}, ta::SampleSizes{0, 3, {4, 4, 4}}, 2, 0, {}},
+        ChunkRow{"SizesPast4GiB", {{1, 2}}, ta::SampleSizes{0, 2, {~0u, 1}}, 1, 0, {}},
+        ChunkRow{"ChunkOfExactly4GiB", {{1, 0x40000000}}, kOne, 1, 4, {}},
+        ChunkRow{"EmptyTrack", {}, kOne, 0, 0, {}}),
+    [](const ::testing::TestParamInfo<ChunkRow>& info) { return std::string(info.param.name); });
+
+TEST(ChunkBoundsTest, ChunksMayEndAtTheFileEndButNotBeyondOrWrapAround)
+{
+    Chunks chunks = {{100, 50, {}, 1, 0}, {150, 0, {}, 2, 0}};  // offset, size, sizes, number, samples
+    EXPECT_EQ(TqovixCheckChunksInFile(chunks, 150), eTqovixSuccess);
+    EXPECT_EQ(TqovixCheckChunksInFile(chunks, 149), eTqovixErrorInvalidMovie);
+    chunks[0].size = 0;
+    EXPECT_EQ(TqovixCheckChunksInFile(chunks, 149), eTqovixErrorInvalidMovie) << "an empty chunk past the end";
+    chunks[1] = {~0ULL - 2, 8, {}, 2, 0};
+    EXPECT_EQ(TqovixCheckChunksInFile(chunks, ~0ULL), eTqovixErrorInvalidMovie);
+}
+
+// ---- Visitors over whole trees ----
 
 class TrackTest : public ::testing::Test {
 protected:
@@ -95,191 +290,166 @@ protected:
     int m_files = 0;
 };
 
-TEST_F(TrackTest, SoundDescriptionsAreReadOrRefused)
+struct DescriptionRow {
+    const char* name;
+    std::function<void(Recipe&)> change;
+    eTqovixErrorCode expected;
+};
+void PrintTo(const DescriptionRow& row, std::ostream* out) { *out << row.name; }
+
+class SoundDescriptionTest : public TrackTest, public ::testing::WithParamInterface<DescriptionRow> {};
+
+TEST_P(SoundDescriptionTest, FirstSoundTrackIsReadOrRefused)
 {
-    const auto esds = [](const Bytes& descriptors) {
-        return [descriptors](Recipe& s) { s.sound.esds.rawPayload = moviekit::Concat({U32s({0}), descriptors}); };
-    };
-    const eTqovixErrorCode ok = eTqovixSuccess, bad = eTqovixErrorInvalidMovie;
-    const struct {
-        const char* name;
-        std::function<void(Recipe&)> change;
-        eTqovixErrorCode expected;
-    } cases[] = {
-        {"sowt", [](Recipe& s) { s.sound.codec = SoundCodec::Sowt; }, ok},
-        {"no edit list", [](Recipe& s) { s.sound.edts = false; }, ok},
-        {"edits without a list", [](Recipe& s) { s.sound.elst = false; }, bad},
-        {"description version 2", [](Recipe& s) { s.sound.descriptionVersion = 2; }, bad},
-        {"long descriptor sizes", [](Recipe& s) { s.sound.esds.longSizes = true; }, ok},
-        {"optional ES fields", [](Recipe& s) { s.sound.esds.esFlags = 0xE0; }, ok},
-        {"profile after config", [](Recipe& s) { s.sound.esds.profileLevelAfterConfig = true; }, bad},
-        {"zero average bit rate", [](Recipe& s) { s.sound.esds.averageBitRate = 0; }, bad},
-        {"empty esds", esds({}), bad},
-        {"decoder config deeper than its parent",
-         esds({3, 20, 0, 1, 0, 4, 16, 0x40, 0x15, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1, 0, 5, 60, 0x11}), bad},
-        {"two-byte size form", esds({3, 0x81, 0x10, 0, 1, 0, 4, 13, 0x40, 0x15, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1, 0}), bad},
-    };
-    for (const auto& c : cases) {
-        SCOPED_TRACE(c.name);
-        Recipe recipe;
-        recipe.sound.codec = SoundCodec::Aac;
-        recipe.sound.sampleRate = 44100;
-        recipe.sound.channels = 1;
-        recipe.sound.mediaTime = 2112;
-        c.change(recipe);
-        moviekit::MovieLayout layout;
-        ASSERT_EQ(Load(moviekit::BuildMovie(recipe, &layout)), eTqovixSuccess);
-        CTqovixAudioInformationVisitor v;
-        EXPECT_EQ(m_tree.Analyze(v), c.expected);
-        EXPECT_EQ(m_tree.Update(v), eTqovixErrorInternal) << "the format visitor only reads";
-        if (c.expected != ok) {
-            continue;
-        }
-        const SoundCodec codec = recipe.sound.codec;
-        EXPECT_EQ(v.GetRate(), recipe.sound.sampleRate / 1000);
-        EXPECT_EQ(v.GetChannel(), recipe.sound.channels);
-        EXPECT_EQ(v.GetCount(), layout.soundSampleCount);
-        EXPECT_EQ(v.IsBigEndianFormat(), codec == SoundCodec::Twos);
-        EXPECT_EQ(v.GetPriming(), codec == SoundCodec::Sowt ? 0u : 1024u);
-        EXPECT_EQ(v.GetMediaTime(), recipe.sound.edts ? 2112u : 0u);
-        const Bytes config = codec == SoundCodec::Aac
-                                 ? moviekit::MakeAudioSpecificConfig(recipe.sound.sampleRate, recipe.sound.channels)
-                                 : Bytes{};
-        ASSERT_EQ(v.GetAudioSpecificConfigSize(), config.size());
-        EXPECT_EQ(Bytes(v.GetAudioSpecificConfigData(), v.GetAudioSpecificConfigData() + config.size()), config);
+    Recipe recipe;
+    recipe.sound.codec = SoundCodec::Aac;
+    recipe.sound.sampleRate = 44100;
+    recipe.sound.channels = 1;
+    recipe.sound.mediaTime = 2112;
+    GetParam().change(recipe);
+    moviekit::MovieLayout layout;
+    ASSERT_EQ(Load(moviekit::BuildMovie(recipe, &layout)), eTqovixSuccess);
+    CTqovixAudioInformationVisitor v;
+    ASSERT_EQ(m_tree.Analyze(v), GetParam().expected);
+    EXPECT_EQ(m_tree.Update(v), eTqovixErrorInternal) << "the format visitor only reads";
+    if (GetParam().expected != eTqovixSuccess) {
+        return;
     }
+    const SoundCodec codec = recipe.sound.codec;
+    EXPECT_EQ(v.GetRate(), recipe.sound.sampleRate / 1000);
+    EXPECT_EQ(v.GetChannel(), recipe.sound.channels);
+    EXPECT_EQ(v.GetCount(), layout.soundSampleCount);
+    EXPECT_EQ(v.IsBigEndianFormat(), codec == SoundCodec::Twos);
+    // Priming belongs to AAC alone: PCM in either byte order starts at its first frame.
+    EXPECT_EQ(v.GetPriming(), codec == SoundCodec::Aac ? 1024u : 0u);
+    EXPECT_EQ(v.GetMediaTime(), recipe.sound.edts ? 2112u : 0u);
+    EXPECT_EQ(v.GetFrameBytes(), codec == SoundCodec::Aac ? 0u : 2u * recipe.sound.channels);
+    const Bytes config = codec == SoundCodec::Aac
+                             ? moviekit::MakeAudioSpecificConfig(recipe.sound.sampleRate, recipe.sound.channels)
+                             : Bytes{};
+    ASSERT_EQ(v.GetAudioSpecificConfigSize(), config.size());
+    EXPECT_EQ(Bytes(v.GetAudioSpecificConfigData(), v.GetAudioSpecificConfigData() + config.size()), config);
 }
 
-TEST_F(TrackTest, SampleTotalComesFromWholeEntriesOnly)
+const auto kEsds = [](const Bytes& descriptors) {
+    return [descriptors](Recipe& s) { s.sound.esds.rawPayload = moviekit::Concat({U32s({0}), descriptors}); };
+};
+
+INSTANTIATE_TEST_SUITE_P(
+    Descriptions, SoundDescriptionTest,
+    ::testing::Values(
+        DescriptionRow{"Aac", [](Recipe&) {}, eTqovixSuccess},
+        DescriptionRow{"Sowt", [](Recipe& s) { s.sound.codec = SoundCodec::Sowt; }, eTqovixSuccess},
+        DescriptionRow{"Twos", [](Recipe& s) { s.sound.codec = SoundCodec::Twos; s.sound.channels = 2; }, eTqovixSuccess},
+        DescriptionRow{"NoEditList", [](Recipe& s) { s.sound.edts = false; }, eTqovixSuccess},
+        DescriptionRow{"EditsWithoutAList", [](Recipe& s) { s.sound.elst = false; }, eTqovixErrorInvalidMovie},
+        DescriptionRow{"Version2InAVersion0Layout", [](Recipe& s) { s.sound.descriptionVersion = 2; }, eTqovixErrorInvalidMovie},
+        DescriptionRow{"LongDescriptorSizes", [](Recipe& s) { s.sound.esds.longSizes = true; }, eTqovixSuccess},
+        DescriptionRow{"OptionalEsFields", [](Recipe& s) { s.sound.esds.esFlags = 0xE0; }, eTqovixSuccess},
+        DescriptionRow{"ProfileAfterConfig", [](Recipe& s) { s.sound.esds.profileLevelAfterConfig = true; }, eTqovixErrorInvalidMovie},
+        DescriptionRow{"ZeroAverageBitRate", [](Recipe& s) { s.sound.esds.averageBitRate = 0; }, eTqovixErrorInvalidMovie},
+        DescriptionRow{"EmptyEsds", kEsds({}), eTqovixErrorInvalidMovie},
+        DescriptionRow{"DecoderConfigDeeperThanItsParent",
+                       kEsds({3, 20, 0, 1, 0, 4, 16, 0x40, 0x15, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1, 0, 5, 60, 0x11}),
+                       eTqovixErrorInvalidMovie}),
+    [](const ::testing::TestParamInfo<DescriptionRow>& info) { return std::string(info.param.name); });
+
+TEST_F(TrackTest, EachTrackIsDecidedWhenItEnds)
 {
-    const Bytes stsd = Atom("stsd", moviekit::Concat({U32s({0, 1, 36}), Bytes{'t', 'w', 'o', 's'}, Bytes(8, 0),
-                                                       U32s({0, 0, 0x00020010, 0, 48000u << 16})}));
-    const Bytes stts = Table("stts", 1, U32s({10, 1}));
-    const std::pair<const char*, Bytes> refused[] = {
-        {"edit without its rate",
-         TrackMovie("soun", {stsd, stts}, {Container("edts", {Atom("elst", U32s({0, 1, 900, 2112}))})})},
-        {"total past 32 bits", TrackMovie("soun", {stsd, Table("stts", 2, U32s({0xFFFFFFF0, 1, 0x20, 1}))})},
-        {"description too short", TrackMovie("soun", {Atom("stsd", Bytes(20, 0)), stts})},
-        {"only a video track", TrackMovie("vide", {stsd, stts})},
+    const Bytes stsc = Table("stsc", 1, U32s({1, 2, 1}));
+    const Bytes one = Table("stsz", 0, {});  // common size 0, no list
+    const Bytes pcmSizes = Atom("stsz", U32s({0, 1, 4}));
+    const Bytes stts = Table("stts", 1, U32s({4, 1}));
+    const Bytes video = Track("vide", {Atom("stsd", Bytes(16, 0)), stsc, Atom("stsz", U32s({0, 7, 4})), Table("stco", 2, U32s({8, 22}))});
+    const Bytes first = Track("soun", {PcmDescription("sowt", 1), stts, stsc, pcmSizes, Table("stco", 2, U32s({36, 40}))});
+    const Bytes second = Track("soun", {PcmDescription("twos", 2), Table("stts", 1, U32s({9, 1})), stsc, pcmSizes,
+                                        Table("co64", 2, U32s({0, 44, 0, 52}))});
+    (void)one;
+    ASSERT_EQ(Load(MovieOf({video, first, second})), eTqovixSuccess);
+
+    // The first sound track is the one read, with its own tables, not the second's.
+    CTqovixAudioInformationVisitor information;
+    ASSERT_EQ(m_tree.Analyze(information), eTqovixSuccess);
+    EXPECT_EQ(information.GetTrackIndex(), 1u);
+    EXPECT_EQ(information.GetChannel(), 1u);
+    EXPECT_EQ(information.GetCount(), 4u);
+    CTqovixAudioDataVisitor sound;
+    Chunks chunks;
+    ASSERT_EQ(m_tree.Analyze(sound), eTqovixSuccess);
+    ASSERT_EQ(sound.GetAudioChunkInformation(chunks, 2), eTqovixSuccess);
+    ASSERT_EQ(chunks.size(), 2u);
+    EXPECT_EQ(chunks[1].offset, 40u);
+    EXPECT_EQ(chunks[1].size, 4u);
+
+    // Every track, with its index, handler and table form.
+    CTqovixTrackListVisitor all;
+    ASSERT_EQ(m_tree.Analyze(all), eTqovixSuccess);
+    ASSERT_EQ(all.GetTracks().size(), 3u);
+    EXPECT_TRUE(all.GetTracks()[0].IsHandler("vide"));
+    EXPECT_TRUE(all.GetTracks()[2].wideOffsets);
+    ASSERT_EQ(TqovixBuildChunkList(all.GetTracks()[2], 4, chunks), eTqovixSuccess);
+    EXPECT_EQ(chunks[1].offset, 52u);
+    EXPECT_EQ(chunks[1].size, 8u);
+
+    // A sound track that cannot be read refuses the movie even when a later one could be.
+    ASSERT_EQ(Load(MovieOf({Track("soun", {PcmDescription("twos", 2), Table("stts", 3, U32s({1, 1}))}), second})),
+              eTqovixSuccess);
+    CTqovixAudioInformationVisitor broken;
+    EXPECT_EQ(m_tree.Analyze(broken), eTqovixErrorInvalidMovie);
+    // No sound track at all: the walk runs out.
+    ASSERT_EQ(Load(MovieOf({video})), eTqovixSuccess);
+    CTqovixAudioInformationVisitor none;
+    EXPECT_EQ(m_tree.Analyze(none), eTqovixErrorInvalidMovie);
+}
+
+TEST_F(TrackTest, RewritesKeepEachTableOrGrowItIntoCo64)
+{
+    Recipe recipe;
+    recipe.sound.codec = SoundCodec::Aac;
+    moviekit::MovieLayout layout;
+    const Bytes movie = moviekit::BuildMovie(recipe, &layout);
+    const Chunks sound = testsupport::ChunkTableOf(layout.soundChunks, true);
+    const Chunks video = testsupport::ChunkTableOf(layout.videoChunks, false);
+
+    // Records that do not match the table's entries change nothing.
+    const std::pair<const char*, std::function<void(Chunks&, Chunks&)>> refused[] = {
+        {"fewer sound records", [](Chunks& s, Chunks&) { s.pop_back(); }},
+        {"more sample sizes", [](Chunks& s, Chunks&) { s.front().sampleSizes.push_back(9); }},
+        {"fewer video records", [](Chunks&, Chunks& v) { v.pop_back(); }},
+        {"more video records", [](Chunks&, Chunks& v) { v.push_back(v.back()); }},
     };
-    for (const auto& [name, movie] : refused) {
+    for (const auto& [name, change] : refused) {
         SCOPED_TRACE(name);
         ASSERT_EQ(Load(movie), eTqovixSuccess);
-        CTqovixAudioInformationVisitor visitor;
-        EXPECT_EQ(m_tree.Analyze(visitor), eTqovixErrorInvalidMovie);
-    }
-    // Without edits the second table finishes the walk; a count cut off from its duration is no run.
-    ASSERT_EQ(Load(TrackMovie("soun", {stsd, Table("stts", 3, U32s({3, 1, 4, 1, 777}))})), eTqovixSuccess);
-    CTqovixAudioInformationVisitor visitor;
-    EXPECT_EQ(m_tree.Analyze(visitor), eTqovixSuccess);
-    EXPECT_EQ(visitor.GetCount(), 7u);
-}
-
-TEST_F(TrackTest, SampleTablesBuildChunksOrRefuseContradictions)
-{
-    const Bytes six = Table("stco", 6, U32s({100, 200, 300, 400, 500, 600})), one = Table("stco", 1, U32s({8}));
-    const Bytes two = Table("stco", 2, U32s({8, 16})), common = Sizes(1, {});
-    const auto runs = [](std::initializer_list<uint32_t> entries) {
-        return Table("stsc", static_cast<uint32_t>(entries.size() / 3), U32s(entries));
-    };
-    const struct {
-        const char* name;
-        std::vector<Bytes> tables;
-        std::vector<uint32_t> sampleCounts;  // per chunk; none when refused
-        unsigned int bytesPerFrame = 4;
-    } cases[] = {
-        {"two runs", {runs({1, 3, 1, 5, 2, 1}), common, six}, {3, 3, 3, 3, 2, 2}},
-        {"count fields ignored", {Table("stsc", ~0u, U32s({1, 2, 1})), common, Table("stco", ~0u, U32s({8}))}, {2}},
-        {"size count field ignored",
-         {runs({1, 2, 1}), Table("stsz", 0, U32s({~0u, 4, 4})), Table("co64", 9, U32s({0, 8}))}, {2}},
-        {"first chunk not one", {runs({2, 3, 1}), common, six}, {}},
-        {"run repeats its first chunk", {runs({1, 3, 1, 1, 2, 1}), common, six}, {}},
-        {"run past the chunks", {runs({1, 3, 1, 9, 2, 1}), common, six}, {}},
-        {"no chunks", {runs({1, 3, 1}), common, Table("stco", 0, {})}, {}},
-        {"missing table", {runs({1, 3, 1}), six}, {}},
-        {"sizes run out", {runs({1, 2, 1}), Sizes(0, {4, 4, 4}), two}, {}},
-        {"sizes left over", {runs({1, 1, 1}), Sizes(0, {4, 4, 4}), two}, {}},
-        {"sizes past 4 GiB", {runs({1, 2, 1}), Sizes(0, {~0u, 1}), one}, {}},
-        {"chunk of exactly 4 GiB", {runs({1, 0x40000000, 1}), common, one}, {}},
-        // 2^31 samples of 2^31 bytes, 8 each: a product past 64 bits must not wrap to a small chunk.
-        {"product past 64 bits", {runs({1, 0x80000000, 1}), Sizes(8, {}), one}, {}, 0x80000000},
-    };
-    for (const auto& c : cases) {
-        SCOPED_TRACE(c.name);
-        ASSERT_EQ(Load(TrackMovie("soun", c.tables)), eTqovixSuccess);
-        CTqovixAudioDataVisitor visitor;
-        Chunks chunks;
-        eTqovixErrorCode built = m_tree.Analyze(visitor);
-        built = built == eTqovixSuccess ? visitor.GetAudioChunkInformation(chunks, c.bytesPerFrame) : built;
-        EXPECT_EQ(built, c.sampleCounts.empty() ? eTqovixErrorInvalidMovie : eTqovixSuccess);
-        if (built != eTqovixSuccess) {
-            continue;
-        }
-        std::vector<uint32_t> counts;
-        for (const auto& chunk : chunks) {
-            counts.push_back(chunk.sampleCount);
-            EXPECT_EQ(chunk.size, chunk.sampleCount * c.bytesPerFrame);
-        }
-        EXPECT_EQ(counts, c.sampleCounts);
-    }
-}
-
-TEST(ChunkBoundsTest, ChunksMayEndAtTheFileEndButNotBeyondOrWrapAround)
-{
-    Chunks chunks = {{100, 50, {}, 1, 0}, {150, 0, {}, 2, 0}};  // offset, size, sizes, number, samples
-    EXPECT_EQ(TqovixCheckChunksInFile(chunks, 150), eTqovixSuccess);
-    EXPECT_EQ(TqovixCheckChunksInFile(chunks, 149), eTqovixErrorInvalidMovie);
-    chunks[0].size = 0;
-    EXPECT_EQ(TqovixCheckChunksInFile(chunks, 149), eTqovixErrorInvalidMovie) << "an empty chunk past the end";
-    chunks[1] = {~0ULL - 2, 8, {}, 2, 0};
-    EXPECT_EQ(TqovixCheckChunksInFile(chunks, ~0ULL), eTqovixErrorInvalidMovie);
-}
-
-TEST_F(TrackTest, UpdatesThatCannotBeWrittenReplaceNoPayload)
-{
-    const struct {
-        const char* name;
-        SoundCodec codec;
-        bool video;
-        std::function<void(Chunks&)> change;
-        eTqovixErrorCode expected = eTqovixErrorInternal;
-    } cases[] = {
-        {"sound offset past an stco", SoundCodec::Twos, false, [](Chunks& c) { c.back().offset = 1ULL << 32; }},
-        {"fewer sound records", SoundCodec::Twos, false, [](Chunks& c) { c.pop_back(); }},
-        {"more sample sizes", SoundCodec::Aac, false, [](Chunks& c) { c.front().sampleSizes.push_back(9); }},
-        {"fewer video records", SoundCodec::Twos, true, [](Chunks& c) { c.pop_back(); }},
-        // More video records than entries are ignored, so this one rewrites the same offsets.
-        {"more video records", SoundCodec::Twos, true, [](Chunks& c) { c.push_back(c.back()); }, eTqovixSuccess},
-    };
-    for (const auto& c : cases) {
-        SCOPED_TRACE(c.name);
-        Recipe recipe;
-        recipe.sound.codec = c.codec;
-        moviekit::MovieLayout layout;
-        const Bytes movie = moviekit::BuildMovie(recipe, &layout);
-        ASSERT_EQ(Load(movie), eTqovixSuccess);
-        Chunks chunks = testsupport::ChunkTableOf(c.video ? layout.videoChunks : layout.soundChunks,
-                                                  !c.video && c.codec == SoundCodec::Aac);
-        c.change(chunks);
-        EXPECT_EQ(UpdateChunks(m_tree, c.video, chunks), c.expected);
+        Chunks s = sound;
+        Chunks v = video;
+        change(s, v);
+        CTqovixAudioDataVisitor soundUpdate;
+        soundUpdate.SetAudioChunkInformation(s);
+        CTqovixMovieDataVisitor videoUpdate;
+        videoUpdate.SetOffset(v);
+        const bool soundChanged = s != sound;
+        EXPECT_EQ(soundChanged ? m_tree.Update(soundUpdate) : m_tree.Update(videoUpdate), eTqovixErrorInternal);
         EXPECT_EQ(WriteTree(), movie);
     }
 
-    // An empty offset table cannot be rewritten, and no list at all must not
-    // write the visitor's blank record over a one-chunk table.
-    for (const char* subtype : {"soun", "vide"}) {
-        SCOPED_TRACE(subtype);
-        const bool video = subtype[0] == 'v';
-        const Bytes stsc = Table("stsc", 1, U32s({1, 1, 1})), common = Sizes(1, {});
-        const Bytes empty = TrackMovie(subtype, {stsc, common, Atom("stco", {})});
-        ASSERT_EQ(Load(empty), eTqovixSuccess);
-        EXPECT_EQ(UpdateChunks(m_tree, video, Chunks(1)), eTqovixErrorOutOfMemory);
-        EXPECT_EQ(WriteTree(), empty);
-        const Bytes oneChunk = TrackMovie(subtype, {stsc, common, Table("stco", 1, U32s({4096}))});
-        ASSERT_EQ(Load(oneChunk), eTqovixSuccess);
-        EXPECT_EQ(UpdateChunks(m_tree, video, {}), eTqovixErrorInternal);
-        EXPECT_EQ(WriteTree(), oneChunk);
-    }
+    // An offset past 4 GiB turns the sound track's "stco" into a "co64"; the video keeps its "stco".
+    ASSERT_EQ(Load(movie), eTqovixSuccess);
+    Chunks far = sound;
+    far.back().offset = (uint64_t{1} << 32) + 12;
+    CTqovixAudioDataVisitor update;
+    update.SetAudioChunkInformation(far);
+    EXPECT_NE(m_tree.Update(update), eTqovixErrorInternal);
+    const Bytes written = WriteTree();
+    ASSERT_EQ(Load(written), eTqovixSuccess);
+    CTqovixTrackListVisitor tracks;
+    ASSERT_EQ(m_tree.Analyze(tracks), eTqovixSuccess);
+    ASSERT_EQ(tracks.GetTracks().size(), 2u);
+    EXPECT_FALSE(tracks.GetTracks()[0].wideOffsets);
+    EXPECT_TRUE(tracks.GetTracks()[1].wideOffsets);
+    Chunks read;
+    ASSERT_EQ(TqovixBuildChunkList(tracks.GetTracks()[1], 0, read), eTqovixSuccess);
+    EXPECT_EQ(read, far);
 }
 
 }  // namespace
