@@ -62,7 +62,7 @@ TEST_F(AudioFileTest, ChunkRefusesBadArgumentsAndAFileNotOpen)
     uint8_t small[8] = {};
     unsigned int got = 0;
     EXPECT_EQ(chunk.PushDecodedData(nullptr, 4), eTqovixErrorInternal);
-    EXPECT_EQ(chunk.PushOutputData(small, 0), eTqovixErrorInternal);
+    EXPECT_EQ(chunk.PushDecodedData(small, 0), eTqovixErrorInternal);
     EXPECT_EQ(chunk.PopInputData(small, &got, 4), eTqovixErrorInternal);
 }
 
@@ -122,6 +122,10 @@ TEST_F(AudioFileTest, ByteOrderAndBadChunks)
     EXPECT_EQ(empty.Initialize(m_file, {}, true), eTqovixErrorInternal);
     EXPECT_EQ(empty.PopAudioData(buffer, &size, 4), eTqovixErrorInternal);
     EXPECT_EQ(empty.PushAudioData(buffer, 4), eTqovixErrorInternal);
+    // PCM goes from the writer straight to the file: a PCM control takes no processed sound.
+    CTqovixAudioDataControl pcm;
+    ASSERT_EQ(pcm.Initialize(m_file, {{0, 8, {}}}, true), eTqovixSuccess);
+    EXPECT_EQ(pcm.PushAudioData(buffer, 4), eTqovixErrorInternal);
 }
 
 // A chunk is decoded only when a request reaches it; past the track comes silence.

@@ -29,7 +29,6 @@ constexpr unsigned int kBlockBytes = 4096;
 constexpr unsigned int kDropBytes = 4352;
 constexpr unsigned int kFlush = 0;
 constexpr auto kAborted = static_cast<eConverterErrorCode>(eTqovixErrorAborted);
-constexpr auto kAccessDenied = static_cast<eConverterErrorCode>(eTqovixErrorSourceAccessDenied);
 
 ACFormat AacFormat(double rate = kRate, uint32_t channels = kChannels)
 {
@@ -167,7 +166,7 @@ TEST(AacDecoderTest, PrimingQueriedFromAMovieSetsTheDelay)
     const std::tuple<const char*, moviekit::Bytes, eConverterErrorCode, unsigned int> rows[] = {
         {"PlatformPrimingMeansOnePacket", platform, eConverterSuccess, 1},
         {"OtherPrimingKeepsTheDelay", camera, eConverterSuccess, 5},
-        {"NoSoundTrack", moviekit::BuildMovie(recipe, nullptr), kAccessDenied, 5},
+        {"NoSoundTrack", moviekit::BuildMovie(recipe, nullptr), static_cast<eConverterErrorCode>(eTqovixErrorInvalidMovie), 5},
     };
     testsupport::TempDir dir;
     AACDecoder decoder;
@@ -182,7 +181,7 @@ TEST(AacDecoderTest, PrimingQueriedFromAMovieSetsTheDelay)
     }
     EXPECT_EQ(decoder.SetDecoderDelay(nullptr), eConverterInternal);
     EXPECT_EQ(decoder.SetDecoderDelay(""), eTqovixErrorSourceNotFound);
-    EXPECT_EQ(decoder.SetDecoderDelay(dir.File("missing.mov").c_str()), eTqovixErrorSourceAccessDenied);
+    EXPECT_EQ(decoder.SetDecoderDelay(dir.File("missing.mov").c_str()), eTqovixErrorSourceNotFound);
 }
 
 TEST(AacEncoderTest, PushesOfAnySizeAreCutIntoBlocksAfterTheDropAndFlushedWithSilence)

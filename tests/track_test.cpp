@@ -357,14 +357,12 @@ INSTANTIATE_TEST_SUITE_P(
 TEST_F(TrackTest, EachTrackIsDecidedWhenItEnds)
 {
     const Bytes stsc = Table("stsc", 1, U32s({1, 2, 1}));
-    const Bytes one = Table("stsz", 0, {});  // common size 0, no list
     const Bytes pcmSizes = Atom("stsz", U32s({0, 1, 4}));
     const Bytes stts = Table("stts", 1, U32s({4, 1}));
     const Bytes video = Track("vide", {Atom("stsd", Bytes(16, 0)), stsc, Atom("stsz", U32s({0, 7, 4})), Table("stco", 2, U32s({8, 22}))});
     const Bytes first = Track("soun", {PcmDescription("sowt", 1), stts, stsc, pcmSizes, Table("stco", 2, U32s({36, 40}))});
     const Bytes second = Track("soun", {PcmDescription("twos", 2), Table("stts", 1, U32s({9, 1})), stsc, pcmSizes,
                                         Table("co64", 2, U32s({0, 44, 0, 52}))});
-    (void)one;
     ASSERT_EQ(Load(MovieOf({video, first, second})), eTqovixSuccess);
 
     // The first sound track is the one read, with its own tables, not the second's.

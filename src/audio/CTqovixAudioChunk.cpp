@@ -16,8 +16,6 @@ void CTqovixAudioChunk::Close()
 {
     m_readPosition = 0;
     m_decodedData.Clear();
-    m_processedData.Clear();
-    m_outputData.Clear();
     m_pFile = nullptr;
 }
 
@@ -61,37 +59,12 @@ eTqovixErrorCode CTqovixAudioChunk::PopDecodedData(void* buffer, unsigned long* 
     return eTqovixSuccess;
 }
 
-eTqovixErrorCode CTqovixAudioChunk::PopProcessedData(void* buffer, unsigned long long* size,
-                                                     unsigned long long requested)
-{
-    if (buffer == nullptr || size == nullptr || requested == 0) {
-        return eTqovixErrorInternal;
-    }
-    *size = m_processedData.Pop(buffer, requested);
-    return eTqovixSuccess;
-}
-
-eTqovixErrorCode CTqovixAudioChunk::Push(TqovixByteQueue& queue, const void* data, unsigned long long size)
+eTqovixErrorCode CTqovixAudioChunk::PushDecodedData(const void* data, unsigned long long size)
 {
     if (data == nullptr || size == 0) {
         return eTqovixErrorInternal;
     }
-    return queue.Push(data, size);
-}
-
-eTqovixErrorCode CTqovixAudioChunk::PushDecodedData(const void* data, unsigned long long size)
-{
-    return Push(m_decodedData, data, size);
-}
-
-eTqovixErrorCode CTqovixAudioChunk::PushProcessedData(const void* data, unsigned long long size)
-{
-    return Push(m_processedData, data, size);
-}
-
-eTqovixErrorCode CTqovixAudioChunk::PushOutputData(const void* data, unsigned long long size)
-{
-    return Push(m_outputData, data, size);
+    return m_decodedData.Push(data, size);
 }
 
 uint32_t CTqovixAudioChunk::GetSampleSize(int index) const
@@ -104,6 +77,5 @@ uint32_t CTqovixAudioChunk::GetSampleSize(int index) const
 
 uint64_t CTqovixAudioChunk::GetHeldByteCount() const
 {
-    return m_decodedData.Capacity() + m_processedData.Capacity() +
-           m_outputData.Capacity();
+    return m_decodedData.Capacity();
 }

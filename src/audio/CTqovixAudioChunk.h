@@ -1,5 +1,5 @@
 // One chunk of the source's sound track: where it lies, its sample sizes, and
-// the queues audio passes through after it is read (decoded, processed, output).
+// the queue its sound waits in once read and decoded.
 #pragma once
 
 #include <cstdint>
@@ -22,26 +22,14 @@ public:
     eTqovixErrorCode PopDecodedData(void* buffer, unsigned long* size, unsigned long long requested);
     eTqovixErrorCode PushDecodedData(const void* data, unsigned long long size);
 
-    uint64_t GetProcessedDataSize() const { return m_processedData.Size(); }
-    eTqovixErrorCode PopProcessedData(void* buffer, unsigned long long* size, unsigned long long requested);
-    eTqovixErrorCode PushProcessedData(const void* data, unsigned long long size);
-
-    uint64_t GetOutputDataSize() const { return m_outputData.Size(); }
-    const uint8_t* GetOutputData() const { return m_outputData.Data(); }
-    eTqovixErrorCode PushOutputData(const void* data, unsigned long long size);
-
     uint32_t GetSampleSize(int index) const;
     const TqovixChunkInformation& GetChunkInformation() const { return m_chunkInformation; }
-    // Storage held by the four queues, for tests that watch memory.
+    // Storage held by the queue, for tests that watch memory.
     uint64_t GetHeldByteCount() const;
 
 private:
-    static eTqovixErrorCode Push(TqovixByteQueue& queue, const void* data, unsigned long long size);
-
     CTqovixFile* m_pFile = nullptr;
     TqovixChunkInformation m_chunkInformation;
     TqovixByteQueue m_decodedData;
-    TqovixByteQueue m_processedData;
-    TqovixByteQueue m_outputData;
     uint64_t m_readPosition = 0;
 };

@@ -172,34 +172,22 @@ eTqovixErrorCode CTqovixAudioDataControl::PopAudioData(void* buffer, unsigned lo
     return eTqovixSuccess;
 }
 
-eTqovixErrorCode CTqovixAudioDataControl::PopFinishedAudioChunk(std::shared_ptr<CTqovixAudioChunk>& chunk)
-{
-    if (m_outputChunkIndex >= m_chunks.size()) {
-        return eTqovixErrorInternal;
-    }
-    chunk = m_chunks[m_outputChunkIndex];
-    return eTqovixSuccess;
-}
-
 eTqovixErrorCode CTqovixAudioDataControl::PushAudioData(const void* data, unsigned long size)
 {
     if (data == nullptr || size == 0 || m_chunks.empty()) {
         return eTqovixErrorInternal;
     }
-    if (IsAACCodec()) {
-        // Encoded packets reach the writer inside this call; it may announce the end.
-        const eTqovixErrorCode result = EncodePCM2AAC(const_cast<void*>(data), static_cast<unsigned int>(size));
-        if (TqovixFailed(result) || m_outputChunkIndex < m_chunks.size()) {
-            return result;
-        }
-        const eTqovixErrorCode flushed = EncodeDone();
-        return TqovixFailed(flushed) ? eTqovixErrorInternal : flushed;
-    }
-    if (m_inputChunkIndex >= m_chunks.size()) {
+    // PCM goes straight from the writer to the file; only AAC passes through here.
+    if (!IsAACCodec()) {
         return eTqovixErrorInternal;
     }
-    m_outputChunkIndex = m_inputChunkIndex;
-    return m_chunks[m_inputChunkIndex]->PushOutputData(data, size);
+    // Encoded packets reach the writer inside this call; it may announce the end.
+    const eTqovixErrorCode result = EncodePCM2AAC(const_cast<void*>(data), static_cast<unsigned int>(size));
+    if (TqovixFailed(result) || m_outputChunkIndex < m_chunks.size()) {
+        return result;
+    }
+    const eTqovixErrorCode flushed = EncodeDone();
+    return TqovixFailed(flushed) ? eTqovixErrorInternal : flushed;
 }
 
 eTqovixErrorCode CTqovixAudioDataControl::SetOutputChunkIndex(unsigned long index)

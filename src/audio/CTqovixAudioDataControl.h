@@ -26,7 +26,6 @@ public:
                                         bool bigEndian);
     virtual eTqovixErrorCode Close();
     virtual eTqovixErrorCode PopAudioData(void* buffer, unsigned long* size, unsigned long requested);
-    virtual eTqovixErrorCode PopFinishedAudioChunk(std::shared_ptr<CTqovixAudioChunk>& chunk);
     virtual eTqovixErrorCode PushAudioData(const void* data, unsigned long size);
     virtual bool IsInitialized() const { return !m_chunks.empty(); }
     virtual eTqovixErrorCode SetOutputChunkIndex(unsigned long index);
@@ -46,7 +45,6 @@ public:
     virtual eTqovixErrorCode EncodeDone();
     virtual bool IsAACCodec() { return false; }
 
-    uint32_t GetOutputChunkIndex() const { return m_outputChunkIndex; }
     // Storage held by the chunks and the pool, for tests that watch memory.
     uint64_t GetHeldByteCount() const;
 

@@ -4,10 +4,14 @@
 #include <new>
 #include <vector>
 
+#include "atom/CTqovixAtomControl.h"
+#include "file/CTqovixFile.h"
+#include "visitor/CTqovixAudioInformationVisitor.h"
+
 namespace {
 
 // The priming of the platform encoder, which the default delay of one packet matches.
-constexpr SInt32 kPlatformPrimingFrames = 2112;
+constexpr uint32_t kPlatformPrimingFrames = 2112;
 constexpr UInt32 kFramesWanted = 1024;
 
 // What DecoderDataProc offers, again on every call.
@@ -16,26 +20,6 @@ struct DecoderInput {
     unsigned int packetSize;
     AudioStreamBasicDescription description;
     AudioStreamPacketDescription packetDescription;
-};
-
-// Releases the URL and the audio file on every path out of SetDecoderDelay.
-class PrimingQuery {
-public:
-    PrimingQuery() = default;
-    ~PrimingQuery()
-    {
-        if (m_file != nullptr) {
-            AudioFileClose(m_file);
-        }
-        if (m_url != nullptr) {
-            CFRelease(m_url);
-        }
-    }
-    PrimingQuery(const PrimingQuery&) = delete;
-    PrimingQuery& operator=(const PrimingQuery&) = delete;
-
-    CFURLRef m_url = nullptr;
-    AudioFileID m_file = nullptr;
 };
 
 }  // namespace
@@ -63,20 +47,21 @@ eConverterErrorCode AACDecoder::SetDecoderDelay(const char* path)
     if (path == nullptr) {
         return eConverterInternal;
     }
-    PrimingQuery query;
-    query.m_url = CFURLCreateFromFileSystemRepresentation(kCFAllocatorDefault, reinterpret_cast<const UInt8*>(path),
-                                                          static_cast<CFIndex>(std::strlen(path)), false);
-    if (query.m_url == nullptr) {
-        return static_cast<eConverterErrorCode>(eTqovixErrorSourceNotFound);
+    // The priming is the media time of the sound track's first edit, read as a job reads it.
+    CTqovixFile file;
+    eTqovixErrorCode result = path[0] == '\0' ? eTqovixErrorSourceNotFound : file.Open(path, 1);
+    CTqovixAtomControl tree;
+    if (!TqovixFailed(result)) {
+        result = tree.Initialize(file);
     }
-    if (AudioFileOpenURL(query.m_url, kAudioFileReadPermission, 0, &query.m_file) != noErr) {
-        query.m_file = nullptr;
-        return static_cast<eConverterErrorCode>(eTqovixErrorSourceAccessDenied);
+    CTqovixAudioInformationVisitor information;
+    if (!TqovixFailed(result)) {
+        result = tree.Analyze(information);
     }
-    AudioFilePacketTableInfo packetTable{};
-    UInt32 size = sizeof packetTable;
-    if (AudioFileGetProperty(query.m_file, kAudioFilePropertyPacketTableInfo, &size, &packetTable) == noErr &&
-        packetTable.mPrimingFrames == kPlatformPrimingFrames) {
+    if (TqovixFailed(result)) {
+        return static_cast<eConverterErrorCode>(result);
+    }
+    if (information.GetMediaTime() == kPlatformPrimingFrames) {
         m_decoderDelay = 1;
     }
     return eConverterSuccess;

@@ -1,6 +1,5 @@
-// Umbrella header of the audio toolbox subset: converter and audio file.
+// Umbrella header of the audio toolbox subset: the converter.
 #pragma once
 
 #include <AudioToolbox/AudioConverter.h>
-#include <AudioToolbox/AudioFile.h>
 #include <CoreAudioTypes/CoreAudioTypes.h>
