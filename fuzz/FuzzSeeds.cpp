@@ -29,7 +29,7 @@ int main(int argc, char** argv)
         return 2;
     }
     const std::filesystem::path directory = argv[1];
-    for (const char* kind : {"movie", "tag", "esds"}) {
+    for (const char* kind : {"movie", "tag", "esds", "tables"}) {
         std::filesystem::create_directories(directory / kind);
     }
     const auto small = [] {
@@ -76,6 +76,30 @@ int main(int argc, char** argv)
     written = written && WriteBytes(directory / "esds" / "plain.bin", moviekit::MakeEsdsPayload(plain, config, 256000, 256000)) &&
               WriteBytes(directory / "esds" / "flags-long-sizes.bin",
                          moviekit::MakeEsdsPayload(everything, config, 320000, 256000));
+    // Table payloads for the typed readers: offsets, runs, sizes, edits, sound descriptions.
+    const auto words = [](std::initializer_list<uint32_t> values) {
+        moviekit::Bytes out;
+        for (uint32_t value : values) {
+            moviekit::PutU32(out, value);
+        }
+        return out;
+    };
+    const moviekit::Bytes esds = moviekit::Atom("esds", moviekit::MakeEsdsPayload(plain, config, 256000, 256000));
+    moviekit::Bytes mp4a = moviekit::Concat({{'m', 'p', '4', 'a'}, moviekit::Bytes(6, 0), {0, 1, 0, 1},
+                                             moviekit::Bytes(6, 0), {0, 2, 0, 16, 0xFF, 0xFE, 0, 0},
+                                             words({48000u << 16, 1024, 0, 4, 2}),
+                                             moviekit::Container("wave", {moviekit::Atom("frma", {'m', 'p', '4', 'a'}), esds})});
+    const std::pair<const char*, moviekit::Bytes> tables[] = {
+        {"stco.bin", words({0, 3, 8, 4096, 70000})},
+        {"co64.bin", words({0, 2, 1, 0, 0, 64})},
+        {"stsc.bin", words({0, 2, 1, 1024, 1, 3, 512, 1})},
+        {"stsz.bin", words({0, 0, 3, 371, 402, 388})},
+        {"elst-v1.bin", words({0x01000000, 2, 0, 500, 0xFFFFFFFF, 0xFFFFFFFF, 0x10000, 0, 900, 0, 1024, 0x10000})},
+        {"stsd-mp4a-wave.bin", moviekit::Concat({words({0, 1, static_cast<uint32_t>(mp4a.size() + 4)}), mp4a})},
+    };
+    for (const auto& [name, bytes] : tables) {
+        written = written && WriteBytes(directory / "tables" / name, bytes);
+    }
     if (!written) {
         std::fprintf(stderr, "fuzz_seeds: cannot write the payload seeds\n");
         return 1;

@@ -11,6 +11,8 @@
 
 #include "atom/CTqovixAtomControl.h"
 #include "atom/CTqovixTCTGAtom.h"
+#include "atom/TqovixSoundEntry.h"
+#include "atom/TqovixTrackAtoms.h"
 #include "engine/CTqovixMainFrame.h"
 #include "file/CTqovixFile.h"
 #include "visitor/CTqovixAudioDataVisitor.h"
@@ -72,8 +74,15 @@ int AtomTree(const uint8_t* data, size_t size)
         CTqovixAudioDataVisitor audio;
         std::vector<TqovixChunkInformation> chunks;
         if (!TqovixFailed(tree.Analyze(audio))) {
-            const uint32_t frameBytes = (uint32_t{information.GetSize()} * information.GetChannel()) >> 3;
-            audio.GetAudioChunkInformation(chunks, frameBytes);
+            audio.GetAudioChunkInformation(chunks, information.GetFrameBytes());
+        }
+    }
+    CTqovixTrackListVisitor tracks;
+    if (!TqovixFailed(tree.Analyze(tracks))) {
+        for (const TqovixTrackTables& track : tracks.GetTracks()) {
+            std::vector<TqovixChunkInformation> trackChunks;
+            TqovixBuildChunkList(track, track.soundEntry ? TqovixSoundEntry::FrameBytes(*track.soundEntry) : 0,
+                                 trackChunks);
         }
     }
     CTqovixMovieDataVisitor video;
@@ -135,6 +144,57 @@ int Esds(const uint8_t* data, size_t size)
             (configSize > 0 && std::search(data, data + size, config, config + configSize) == data + size)) {
             std::abort();
         }
+    }
+    return 0;
+}
+
+int TrackAtoms(const uint8_t* data, size_t size)
+{
+    // A copy of exactly the input's length, so reading one byte past it is caught.
+    const std::vector<uint8_t> bytes(data, data + size);
+    const TqovixPayload payload(bytes);
+    namespace ta = TqovixTrackAtoms;
+    ta::ParseHandler(payload);
+    ta::ParseMediaTimeScale(payload);
+    ta::ParseDataInFile(payload);
+    ta::ParseSampleTotal(payload);
+    if (const auto edits = ta::ParseEditList(payload)) {
+        ta::FirstMediaTime(*edits);
+    }
+    // What a table reader accepts fits the payload, and writes back as the bytes it came from.
+    const auto fits = [&](uint64_t entries, uint64_t width) {
+        if (8 + entries * width > size) {
+            std::abort();
+        }
+    };
+    if (const auto runs = ta::ParseSampleToChunk(payload)) {
+        fits(runs->size(), 12);
+    }
+    if (const auto sizes = ta::ParseSampleSizes(payload)) {
+        fits(sizes->sizes.size(), 4);
+    }
+    for (const bool wide : {false, true}) {
+        const auto offsets = ta::ParseChunkOffsets(payload, wide);
+        if (!offsets) {
+            continue;
+        }
+        fits(offsets->size(), wide ? 8 : 4);
+        const std::vector<uint8_t> written = ta::WriteChunkOffsets(*offsets, wide);
+        if (!std::equal(written.begin() + 4, written.end(), bytes.begin() + 4)) {
+            std::abort();
+        }
+    }
+    if (const auto entry = TqovixSoundEntry::Parse(payload)) {
+        if (entry->children.data() != nullptr &&
+            (entry->children.data() < bytes.data() || entry->children.data() + entry->children.size() > bytes.data() + size)) {
+            std::abort();
+        }
+        if (const auto esds = TqovixSoundEntry::FindEsds(entry->children)) {
+            TqovixSoundEntry::ParseEsds(*esds);
+        }
+    }
+    if (const auto esds = TqovixSoundEntry::FindEsds(payload)) {
+        TqovixSoundEntry::ParseEsds(*esds);
     }
     return 0;
 }

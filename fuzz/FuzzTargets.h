@@ -16,6 +16,9 @@ int TagCursor(const uint8_t* data, size_t size);
 // The "esds" descriptor chain (version and flags included); a decoder configuration it
 // accepts must lie inside the input (aborts otherwise).
 int Esds(const uint8_t* data, size_t size);
+// Every typed reader of the track atoms and the sound description over the input as a
+// payload; what a table reader accepts must fit the input and write back as its bytes.
+int TrackAtoms(const uint8_t* data, size_t size);
 // The property query over a movie made of the input.
 int Property(const uint8_t* data, size_t size);
 // A whole job over a movie made of the input, through the real processing library.

@@ -20,6 +20,7 @@ TEST(FuzzReplayTest, KeptInputsRunCleanly)
     for (const auto& [name, target] : {std::pair<const char*, Target>{"atomtree", fuzztarget::AtomTree},
                                        {"tagcursor", fuzztarget::TagCursor},
                                        {"esds", fuzztarget::Esds},
+                                       {"trackatoms", fuzztarget::TrackAtoms},
                                        {"property", fuzztarget::Property},
                                        {"job", fuzztarget::Job}}) {
         const std::filesystem::path directory = root / name;
