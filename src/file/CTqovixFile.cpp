@@ -455,3 +455,31 @@ bool CTqovixFile::QueryVolume(const char* directory, TqovixVolumeInformation* in
     information->typeName = FileSystemTypeName(static_cast<uint32_t>(statistics.f_type));
     return true;
 }
+
+eTqovixErrorCode CTqovixFile::ReadAt(unsigned long long offset, void* buffer, unsigned int size,
+                                     unsigned int* readSize)
+{
+    if (readSize == nullptr || m_stream == nullptr || (buffer == nullptr && size != 0)) {
+        return eTqovixErrorInternal;
+    }
+    *readSize = 0;
+    if (const int fault = InjectedFault(eTqovixFileOperation::Read)) {
+        return ConvertErrnoToLocalError(fault, m_bReadOnly);
+    }
+    auto* bytes = static_cast<uint8_t*>(buffer);
+    while (*readSize < size) {
+        const ssize_t got = pread(fileno(m_stream), bytes + *readSize, size - *readSize,
+                                  static_cast<off_t>(offset + *readSize));
+        if (got < 0 && errno == EINTR) {
+            continue;
+        }
+        if (got < 0) {
+            return ConvertErrnoToLocalError(errno, m_bReadOnly);
+        }
+        if (got == 0) {
+            break;
+        }
+        *readSize += static_cast<unsigned int>(got);
+    }
+    return eTqovixSuccess;
+}

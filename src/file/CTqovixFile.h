@@ -52,6 +52,9 @@ public:
     // kernel: the bytes never visit our memory. *copied is false (and nothing moved) when
     // the two files do not allow it; the caller then copies through a buffer.
     eTqovixErrorCode CopyFrom(CTqovixFile& source, unsigned long long size, bool* copied);
+    // Reads at `offset` without moving or refilling the stream: for a look at bytes that the
+    // stream's reader is not reading in order. Fewer bytes than asked only at the file's end.
+    eTqovixErrorCode ReadAt(unsigned long long offset, void* buffer, unsigned int size, unsigned int* readSize);
 
     eTqovixErrorCode ComfirmWritable(long long size, const char* path);
     static eTqovixErrorCode Delete(const char* path);

@@ -169,6 +169,9 @@ void CTqovixMovControl::Close()
     m_bDestinationComplete = false;
     m_carriedByte = -1;
     std::vector<uint8_t>().swap(m_copyBuffer);
+    m_bPatching = false;
+    m_moovOffset = 0;
+    std::vector<uint8_t>().swap(m_compareBuffer);
     if (m_audioDataControl.IsInitialized() || m_audioDataControl.IsAACCodec()) {
         m_audioDataControl.Close();
     }

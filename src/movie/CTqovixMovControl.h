@@ -59,6 +59,12 @@ public:
     bool TakeFinishPending();
     // AAC: makes the encoder give up what it holds when the library has ended early.
     eTqovixErrorCode FlushEncoder();
+    // Copy, then patch: a PCM source laid out as leading atoms, one mdat that its chunks fill
+    // exactly, then the moov, becomes a kernel copy of itself (sharing extents where the file
+    // system can) with only changed sound and the new moov written over it. The result is
+    // byte for byte what the general writer gives. Tests turn it off to compare the two.
+    static void SetPatchWriting(bool enabled);
+    bool IsPatching() const { return m_bPatching; }
 
 private:
     eTqovixErrorCode InitializeDestination(const char* sourcePath, const char* destinationPath);
@@ -68,9 +74,17 @@ private:
     eTqovixErrorCode Refuse(eTqovixErrorCode code, std::string reason);
     // Planning the destination: the mdat header's form from what will go in.
     bool NeedsLargeMediaDataHeader(bool largeSource) const;
+    // Whether the destination the general writer would give is the source with new sound
+    // bytes and a new moov at `moovOffset`.
+    bool CanPatch(const TqovixAtomList& atoms, uint64_t& moovOffset) const;
+    eTqovixErrorCode BeginPatching(bool& started);
+    // Writes processed PCM over the copy at `offset`, and only where it differs from the source.
+    eTqovixErrorCode PatchSound(uint64_t offset, const uint8_t* data, uint32_t size, bool swap);
+    eTqovixErrorCode WriteMovieAtom();
     // Rewriting the tables of every track whose chunks moved.
     eTqovixErrorCode RewriteTables(const void* afInformation, unsigned long size);
     eTqovixErrorCode WriteLeadingAtoms();
+    eTqovixErrorCode WriteMediaDataHeader(const TqovixAtomList& atoms);
     eTqovixErrorCode WritePcm(const uint8_t* data, unsigned long size, bool swap);
     eTqovixErrorCode WriteAacPacket(const uint8_t* packet, unsigned long size);
     eTqovixErrorCode CopyPrecedingVideo();
@@ -117,4 +131,7 @@ private:
     bool m_bDestinationComplete = false;
     int m_carriedByte = -1;  // big-endian PCM: the odd byte of a piece waits for its pair
     std::vector<uint8_t> m_copyBuffer;  // reused for swapped PCM and video chunks the kernel cannot copy
+    bool m_bPatching = false;
+    uint64_t m_moovOffset = 0;            // patching: where the source's moov starts
+    std::vector<uint8_t> m_compareBuffer;  // patching: the source's sound, to find what changed
 };

@@ -42,18 +42,44 @@ eTqovixErrorCode CTqovixMovControl::WriteLeadingAtoms()
     }
     bool largeSource = false;
     for (const auto& atom : atoms) {
+        largeSource = largeSource || (atom->GetType() == TqovixAtom::kMdat && atom->GetSize() > kMax32);
+    }
+    m_bLargeMediaDataHeader = NeedsLargeMediaDataHeader(largeSource);
+    bool patching = false;
+    result = BeginPatching(patching);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    if (!patching) {
+        result = WriteMediaDataHeader(atoms);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+    }
+    try {
+        if (m_bPCM) {
+            m_outputAudioChunks = m_audioChunks;
+        }
+        m_outputMovieDataChunks = m_movieDataChunks;
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    result = m_atomControl.Update(CTqovixTCTGAtomVisitor());
+    return TqovixFailed(result) ? result : eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::WriteMediaDataHeader(const TqovixAtomList& atoms)
+{
+    // One mdat for all media, whatever the source had, behind every other leading atom.
+    for (const auto& atom : atoms) {
         const eTqovixAtomType type = atom->GetType();
-        if (type == TqovixAtom::kMdat) {
-            largeSource = largeSource || atom->GetSize() > kMax32;
-        } else if (type != TqovixAtom::kMoov) {
-            result = atom->Write(m_destinationFile);
+        if (type != TqovixAtom::kMdat && type != TqovixAtom::kMoov) {
+            const eTqovixErrorCode result = atom->Write(m_destinationFile);
             if (TqovixFailed(result)) {
                 return result;
             }
         }
     }
-    m_bLargeMediaDataHeader = NeedsLargeMediaDataHeader(largeSource);
-
     uint8_t header[16] = {};
     unsigned int headerSize = 8;
     unsigned int sizeField = 0;
@@ -66,25 +92,12 @@ eTqovixErrorCode CTqovixMovControl::WriteLeadingAtoms()
         std::memcpy(header + 4, "mdat", 4);
     }
     long long position = 0;
-    result = m_destinationFile.GetPosition(&position);
+    eTqovixErrorCode result = m_destinationFile.GetPosition(&position);
     if (TqovixFailed(result)) {
         return result;
     }
     m_mediaDataSizePosition = position + sizeField;
-    result = m_destinationFile.Write(header, headerSize);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    try {
-        if (m_bPCM) {
-            m_outputAudioChunks = m_audioChunks;
-        }
-        m_outputMovieDataChunks = m_movieDataChunks;
-    } catch (const std::bad_alloc&) {
-        return eTqovixErrorOutOfMemory;
-    }
-    result = m_atomControl.Update(CTqovixTCTGAtomVisitor());
-    return TqovixFailed(result) ? result : eTqovixSuccess;
+    return m_destinationFile.Write(header, headerSize);
 }
 
 eTqovixErrorCode CTqovixMovControl::SetMovieDataInformation(const void* afInformation, unsigned long size)
@@ -106,20 +119,12 @@ eTqovixErrorCode CTqovixMovControl::SetMovieDataInformation(const void* afInform
     if (TqovixFailed(result)) {
         return result;
     }
-    TqovixAtomList atoms;
-    result = m_atomControl.GetAtoms(atoms);
+    result = WriteMovieAtom();
     if (TqovixFailed(result)) {
         return result;
     }
-    for (const auto& atom : atoms) {
-        if (atom->GetType() == TqovixAtom::kMoov) {
-            result = atom->Write(m_destinationFile);
-            if (TqovixFailed(result)) {
-                return result;
-            }
-        }
-    }
-    result = WriteMediaDataSize();
+    // A patched copy kept the source's mdat, whose size the chunks fill exactly.
+    result = m_bPatching ? eTqovixSuccess : WriteMediaDataSize();
     if (TqovixFailed(result)) {
         return result;
     }
@@ -130,6 +135,33 @@ eTqovixErrorCode CTqovixMovControl::SetMovieDataInformation(const void* afInform
     }
     m_bDestinationComplete = true;
     return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::WriteMovieAtom()
+{
+    TqovixAtomList atoms;
+    eTqovixErrorCode result = m_atomControl.GetAtoms(atoms);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    if (m_bPatching) {
+        // Over the copy's moov, and the file ends where the new one does.
+        result = m_destinationFile.Seek(static_cast<long long>(m_moovOffset), CTqovixFile::eTqovixSeekBegin);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+    }
+    uint64_t end = m_moovOffset;
+    for (const auto& atom : atoms) {
+        if (atom->GetType() == TqovixAtom::kMoov) {
+            result = atom->Write(m_destinationFile);
+            if (TqovixFailed(result)) {
+                return result;
+            }
+            end += atom->GetSize();
+        }
+    }
+    return m_bPatching ? m_destinationFile.SetFileSize(static_cast<long long>(end)) : eTqovixSuccess;
 }
 
 eTqovixErrorCode CTqovixMovControl::RewriteTables(const void* afInformation, unsigned long size)

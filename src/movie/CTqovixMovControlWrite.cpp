@@ -152,22 +152,30 @@ eTqovixErrorCode CTqovixMovControl::WritePcm(const uint8_t* data, unsigned long 
     }
     unsigned long consumed = 0;
     while (size != 0 && m_outputAudioChunkIndex < count) {
-        eTqovixErrorCode result = CopyPrecedingVideo();
-        if (TqovixFailed(result)) {
-            return result;
-        }
-        TqovixChunkInformation& output = m_outputAudioChunks[m_outputAudioChunkIndex];
-        if (m_bytesInOutputChunk == 0) {
-            long long position = 0;
-            result = m_destinationFile.GetPosition(&position);
+        const TqovixChunkInformation& source = m_audioChunks[m_outputAudioChunkIndex];
+        eTqovixErrorCode result = eTqovixSuccess;
+        // A patched copy has every chunk in place already; the general writer lays them out.
+        if (!m_bPatching) {
+            result = CopyPrecedingVideo();
             if (TqovixFailed(result)) {
                 return result;
             }
-            output.offset = static_cast<uint64_t>(position);
+            if (m_bytesInOutputChunk == 0) {
+                long long position = 0;
+                result = m_destinationFile.GetPosition(&position);
+                if (TqovixFailed(result)) {
+                    return result;
+                }
+                m_outputAudioChunks[m_outputAudioChunkIndex].offset = static_cast<uint64_t>(position);
+            }
         }
-        const uint32_t need = m_audioChunks[m_outputAudioChunkIndex].size - m_bytesInOutputChunk;
+        const uint32_t need = source.size - m_bytesInOutputChunk;
         const auto n = static_cast<uint32_t>(std::min<uint64_t>(size - consumed, need));
-        result = swap ? WriteSwapped(data + consumed, n) : m_destinationFile.Write(data + consumed, n);
+        if (m_bPatching) {
+            result = PatchSound(source.offset + m_bytesInOutputChunk, data + consumed, n, swap);
+        } else {
+            result = swap ? WriteSwapped(data + consumed, n) : m_destinationFile.Write(data + consumed, n);
+        }
         if (TqovixFailed(result)) {
             return result;
         }
@@ -335,7 +343,12 @@ bool CTqovixMovControl::IsMediaDataComplete() const
 eTqovixErrorCode CTqovixMovControl::CopySourceSoundTail()
 {
     // The library ended before the track did: the rest of the sound goes out unprocessed
-    // rather than leaving chunks whose offsets point nowhere.
+    // rather than leaving chunks whose offsets point nowhere. A patched copy holds it already.
+    if (m_bPatching) {
+        m_outputAudioChunkIndex = m_audioChunks.size();
+        m_bytesInOutputChunk = 0;
+        return eTqovixSuccess;
+    }
     std::vector<uint8_t> piece;
     try {
         piece.resize(kCopyPiece);

@@ -1,0 +1,141 @@
+// The two writers of a PCM job: copying then patching, and laying the destination out
+// chunk by chunk. Wherever both can take a movie they must give the same bytes; the copy
+// must be taken whenever the layout allows it, and the general writer everywhere else.
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <string>
+#include <thread>
+
+#include "MakerInjector.h"
+#include "Movie.h"
+#include "engine/CTqovixMainFrame.h"
+#include "movie/CTqovixMovControl.h"
+#include "support/TestSupport.h"
+
+namespace {
+
+using moviekit::SoundCodec;
+using Recipe = moviekit::MovieRecipe;
+
+std::atomic<long> g_writes{0};
+
+int CountWrites(eTqovixFileOperation operation)
+{
+    if (operation == eTqovixFileOperation::Write) {
+        ++g_writes;
+    }
+    return 0;
+}
+
+// Runs one job to its end; the count of file writes it made, -1 when it did not finish.
+long RunJob(const std::string& source, const std::string& destination)
+{
+    g_writes = 0;
+    CTqovixFile::SetFaultHook(CountWrites);
+    CTqovixMainFrame engine;
+    g_pMainFrame = &engine;
+    EXPECT_EQ(engine.Initialize(), eTqovixSuccess);
+    EXPECT_EQ(engine.Execute(source.c_str(), destination.c_str(), 0), eTqovixSuccess);
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
+    while (engine.GetProcessingState() == eTqovixRunning && std::chrono::steady_clock::now() < deadline) {
+        std::this_thread::sleep_for(std::chrono::microseconds(200));
+    }
+    const bool done = engine.GetProcessingState() == eTqovixFinished;
+    engine.Close();
+    g_pMainFrame = nullptr;
+    CTqovixFile::SetFaultHook(nullptr);
+    return done ? g_writes.load() : -1;
+}
+
+struct WriterRow {
+    const char* name;
+    std::function<std::string(const testsupport::TempDir&)> make;  // writes the source, gives its path
+    bool patched;  // the layout lets the copy be taken
+};
+void PrintTo(const WriterRow& row, std::ostream* out) { *out << row.name; }
+
+// One short interval: most sound leaves as it came, as in a real movie.
+const std::vector<moviekit::AfInterval> kInterval = {{12000, 14000, 1000}};
+
+std::function<std::string(const testsupport::TempDir&)> Kit(std::function<void(Recipe&)> shape)
+{
+    return [shape](const testsupport::TempDir& dir) {
+        Recipe recipe;
+        recipe.maker.afIntervals = kInterval;
+        shape(recipe);
+        const std::string path = dir.File("source.mov");
+        std::string error;
+        EXPECT_TRUE(moviekit::WriteMovie(path, recipe, nullptr, &error)) << error;
+        return path;
+    };
+}
+
+// A movie the ffmpeg command writes, given the maker atoms.
+std::function<std::string(const testsupport::TempDir&)> Ffmpeg(std::string sound)
+{
+    return [sound](const testsupport::TempDir& dir) {
+        const std::string path = dir.File("source.mov");
+        std::string output;
+        EXPECT_EQ(testsupport::RunCommand("ffmpeg -v error -nostdin -y -f lavfi -i testsrc=size=64x36:rate=30:d=1 "
+                                          "-f lavfi -i \"aevalsrc='0.3*sin(2*PI*(300+900*t)*t)':s=48000:d=1\" "
+                                          "-map 0:v -map 1:a -c:v mjpeg " + sound + " " + testsupport::ShellQuote(path) +
+                                          " 2>&1",
+                                          &output),
+                  0)
+            << output;
+        Recipe recipe;
+        recipe.maker.afIntervals = kInterval;
+        std::string error;
+        EXPECT_TRUE(moviekit::AddMakerData(path, recipe, 48000, &error)) << error;
+        return path;
+    };
+}
+
+class WriterTest : public ::testing::TestWithParam<WriterRow> {
+protected:
+    void TearDown() override { CTqovixMovControl::SetPatchWriting(true); }
+    testsupport::TempDir m_dir;
+};
+
+TEST_P(WriterTest, BothWritersGiveTheSameBytes)
+{
+    const std::string source = GetParam().make(m_dir);
+    const std::string copied = m_dir.File("copied.mov");
+    const std::string laidOut = m_dir.File("laid-out.mov");
+    CTqovixMovControl::SetPatchWriting(true);
+    const long copiedWrites = RunJob(source, copied);
+    CTqovixMovControl::SetPatchWriting(false);
+    const long laidOutWrites = RunJob(source, laidOut);
+    ASSERT_GT(copiedWrites, 0);
+    ASSERT_GT(laidOutWrites, 0);
+    const std::vector<uint8_t> a = testsupport::ReadFile(copied);
+    ASSERT_FALSE(a.empty());
+    EXPECT_TRUE(a == testsupport::ReadFile(laidOut)) << "the two writers disagree";
+    // The copy writes only the changed sound and the movie atom; the general writer every chunk.
+    if (GetParam().patched) {
+        EXPECT_LT(copiedWrites, laidOutWrites);
+    } else {
+        EXPECT_EQ(copiedWrites, laidOutWrites);
+    }
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Layouts, WriterTest,
+    ::testing::Values(
+        WriterRow{"Twos", Kit([](Recipe&) {}), true},
+        WriterRow{"Sowt", Kit([](Recipe& r) { r.sound.codec = SoundCodec::Sowt; }), true},
+        WriterRow{"TwosUnevenChunks", Kit([](Recipe& r) { r.sound.chunkSampleCounts = {1, 7001, 20000, 3, 21043}; }), true},
+        WriterRow{"SowtSoundFirstCo64", Kit([](Recipe& r) { r.soundFirstInPeriod = r.co64 = true; }), true},
+        WriterRow{"Twos44100Mono", Kit([](Recipe& r) { r.sound.sampleRate = 44100; r.sound.channels = 1; }), true},
+        WriterRow{"FfmpegBigEndianWithTimecode", Ffmpeg("-c:a pcm_s16be -timecode 10:00:00:00"), true},
+        WriterRow{"FfmpegLittleEndianMono", Ffmpeg("-c:a pcm_s16le -ac 1"), true},
+        // Layouts the general writer changes: the copy would not be its result.
+        WriterRow{"MoovFirst", Kit([](Recipe& r) { r.moovBeforeMdat = true; }), false},
+        WriterRow{"ThreeMdats", Kit([](Recipe& r) { r.mdatCount = 3; }), false},
+        WriterRow{"LargeMdatHeader", Kit([](Recipe& r) { r.largeMdatHeader = true; }), false},
+        WriterRow{"Aac", Kit([](Recipe& r) { r.sound.codec = SoundCodec::Aac; }), false}),
+    [](const ::testing::TestParamInfo<WriterRow>& info) { return std::string(info.param.name); });
+
+}  // namespace
