@@ -6,6 +6,7 @@
 #include "ByteWriter.h"
 #include "MakerData.h"
 #include "support/OvixHarness.h"
+#include "NoiseSuppressor.h"
 
 #include <algorithm>
 #include <cmath>
@@ -246,3 +247,66 @@ TEST_F(OvixTest, NoiseDropsInsideIntervalsToneStaysAndEdgesSaturate)
 }
 
 }  // namespace
+
+// Outside the spans the filters are skipped and restarted a warm-up before the next ramp:
+// what comes out must be what a filter that ran through the whole track gives.
+struct SuppressorRow {
+    const char* name;
+    uint64_t rate;
+    unsigned channels;
+};
+void PrintTo(const SuppressorRow& row, std::ostream* out) { *out << row.name; }
+
+class SuppressorWarmUp : public ::testing::TestWithParam<SuppressorRow> {};
+
+TEST_P(SuppressorWarmUp, SkippingMatchesTheFilterThatRanThroughout)
+{
+    const auto [name, rate, channels] = GetParam();
+    const uint64_t frames = 3 * rate;
+    std::vector<int16_t> input(frames * channels);
+    uint32_t seed = 7;
+    for (size_t k = 0; k < input.size(); ++k) {
+        seed = seed * 1664525u + 1013904223u;
+        const double t = static_cast<double>(k / channels) / static_cast<double>(rate);
+        input[k] = static_cast<int16_t>(6000 * std::sin(2 * std::numbers::pi * 90 * t) + ((seed >> 16) % 4000) - 2000);
+    }
+    const std::vector<ovix::DriveSpan> spans = {
+        {rate / 2, rate / 2 + rate / 5, 1.0f}, {rate + 300, rate + 900, 0.5f}, {2 * rate, 2 * rate + rate / 3, 0.8f}};
+    const auto run = [&](uint64_t warmUp, const std::vector<ovix::DriveSpan>& processed) {
+        ovix::NoiseSuppressor suppressor(rate, channels);
+        suppressor.SetWarmUpFrames(warmUp);
+        suppressor.SetSpans(processed);
+        std::vector<int16_t> out = input;
+        for (uint64_t at = 0; at < frames; at += 1024) {
+            suppressor.Process(out.data() + at * channels, at, std::min<uint64_t>(1024, frames - at));
+        }
+        return out;
+    };
+    const std::vector<int16_t> skipping = run(rate / 10, spans);
+    const std::vector<int16_t> throughout = run(UINT64_MAX, spans);
+    ASSERT_NE(throughout, input) << "the spans were not processed";
+    size_t differing = 0;
+    int largest = 0;
+    for (size_t k = 0; k < input.size(); ++k) {
+        const int difference = std::abs(skipping[k] - throughout[k]);
+        differing += difference != 0 ? 1 : 0;
+        largest = std::max(largest, difference);
+    }
+    EXPECT_LE(largest, 1) << "a restarted filter had not settled";
+    EXPECT_LT(differing, input.size() / 10000);
+    // No warm-up, with a ramp that starts on a block: the test tells a cold filter from a settled one.
+    const uint64_t ramp = rate / 100;
+    const std::vector<ovix::DriveSpan> aligned = {{1024 * 40 + ramp, 1024 * 60, 1.0f}};
+    const std::vector<int16_t> cold = run(0, aligned);
+    const std::vector<int16_t> settled = run(UINT64_MAX, aligned);
+    int coldLargest = 0;
+    for (size_t k = 0; k < input.size(); ++k) {
+        coldLargest = std::max(coldLargest, std::abs(cold[k] - settled[k]));
+    }
+    EXPECT_GT(coldLargest, 1);
+}
+
+INSTANTIATE_TEST_SUITE_P(Rates, SuppressorWarmUp,
+                         ::testing::Values(SuppressorRow{"Stereo48k", 48000, 2}, SuppressorRow{"Mono44k", 44100, 1},
+                                           SuppressorRow{"SixChannels48k", 48000, 6}),
+                         [](const ::testing::TestParamInfo<SuppressorRow>& info) { return std::string(info.param.name); });

@@ -14,6 +14,9 @@ constexpr double kHighPassQ = std::numbers::sqrt2 / 2.0;
 constexpr double kShelfHz = 800.0;
 constexpr double kShelfGainDb = -24.0;
 constexpr uint64_t kRampsPerSecond = 100;  // 10 ms
+// The slowest pole (the high-pass's) decays by e in about 2 ms: after 100 ms a filter started
+// cold differs from one that ran all along by far less than one step of 16 bits.
+constexpr uint64_t kWarmUpsPerSecond = 10;
 
 uint64_t SaturatingAdd(uint64_t a, uint64_t b)
 {
@@ -31,7 +34,8 @@ int16_t Saturate(double value)
 NoiseSuppressor::NoiseSuppressor(uint64_t rateHz, unsigned channels)
     : m_channels(std::clamp(channels, 1u, kMaxChannels)),
       m_ramp(std::max<uint64_t>(1, rateHz / kRampsPerSecond)),
-      m_mix(kBlockFrames)
+      m_mix(kBlockFrames),
+      m_warmUp(std::max<uint64_t>(1, rateHz / kWarmUpsPerSecond))
 {
     const double rate = static_cast<double>(std::max<uint64_t>(rateHz, 1));
     // Keep both corners well below Nyquist at unusually low rates.
@@ -91,9 +95,35 @@ bool NoiseSuppressor::FillMix(uint64_t firstFrame, size_t frames)
     return any;
 }
 
+bool NoiseSuppressor::NeedsFilter(uint64_t firstFrame, size_t frames) const
+{
+    const uint64_t lead = SaturatingAdd(m_ramp.size(), m_warmUp);
+    const uint64_t blockEnd = firstFrame + frames;
+    for (size_t i = m_cursor; i < m_spans.size(); ++i) {
+        const uint64_t from = m_spans[i].start > lead ? m_spans[i].start - lead : 0;
+        if (from >= blockEnd) {
+            return false;  // spans are sorted: later ones begin later still
+        }
+        if (SaturatingAdd(m_spans[i].end, m_ramp.size()) > firstFrame) {
+            return true;
+        }
+    }
+    return false;
+}
+
 void NoiseSuppressor::ProcessBlock(int16_t* samples, uint64_t firstFrame, size_t frames)
 {
     const bool mixAny = FillMix(firstFrame, frames);
+    // Outside every span, ramp and warm-up the sound leaves as it came: nothing to compute.
+    if (!mixAny && !NeedsFilter(firstFrame, frames)) {
+        m_bSettled = false;
+        return;
+    }
+    if (!m_bSettled) {
+        m_highPassState.fill({});
+        m_lowShelfState.fill({});
+        m_bSettled = true;
+    }
     switch (m_channels) {
     case 1: Filter<1>(samples, frames, mixAny); break;
     case 2: Filter<2>(samples, frames, mixAny); break;
@@ -110,8 +140,8 @@ void NoiseSuppressor::ProcessBlock(int16_t* samples, uint64_t firstFrame, size_t
     }
 }
 
-// The filters run on every frame, touched or not, so that their state is settled when a
-// ramp begins; only frames with a mix above zero are written.
+// The filters run on every frame of a block they are needed in, touched or not, so that their
+// state is settled when a ramp begins; only frames with a mix above zero are written.
 template <unsigned Channels>
 void NoiseSuppressor::Filter(int16_t* samples, size_t frames, bool mixAny)
 {

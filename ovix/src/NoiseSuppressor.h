@@ -1,5 +1,6 @@
 // Attenuates the band where lens motor noise lives, inside the AF drive spans only: a high-pass
-// and a low-shelf section run continuously, and their output is mixed in by strength x ramp.
+// and a low-shelf section run through each span from a warm-up before it, and their output is
+// mixed in by strength x ramp.
 // Frames outside the spans and their ramps leave bit-exact.
 #pragma once
 
@@ -27,10 +28,16 @@ public:
     void Process(int16_t* samples, uint64_t firstFrame, size_t frames);
 
     size_t RampFrames() const { return m_ramp.size(); }
+    // Frames filtered before each ramp so that the filters have settled when it begins;
+    // elsewhere outside the spans nothing is computed. The default (100 ms) is far past the
+    // filters' decay; UINT64_MAX filters every frame (what tests compare with).
+    void SetWarmUpFrames(uint64_t frames) { m_warmUp = frames; }
 
 private:
     // Fills m_mix for one block; false when no frame of it is touched.
     bool FillMix(uint64_t firstFrame, size_t frames);
+    // Whether a block lies within a span, its ramps or the warm-up before them.
+    bool NeedsFilter(uint64_t firstFrame, size_t frames) const;
     void ProcessBlock(int16_t* samples, uint64_t firstFrame, size_t frames);
     template <unsigned Channels>
     void Filter(int16_t* samples, size_t frames, bool mixAny);
@@ -40,6 +47,8 @@ private:
     std::vector<float> m_mix;
     std::vector<DriveSpan> m_spans;
     size_t m_cursor = 0;  // first span whose ramp-out may still reach the next block
+    uint64_t m_warmUp;
+    bool m_bSettled = true;  // the filter states follow the sound (false after skipped blocks)
     BiquadCoefficients m_highPass;
     BiquadCoefficients m_lowShelf;
     std::array<BiquadState, kMaxChannels> m_highPassState{};
