@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <new>
 #include <numeric>
+#include <string_view>
 
 #include "atom/CTqovixContainerAtom.h"
 #include "movie/CTqovixMovControl.h"
@@ -15,12 +16,23 @@ constexpr uint32_t kMaxPcmChannels = 8;  // what the processing library takes
 constexpr uint32_t kMaxAacChannels = 2;
 constexpr uint8_t kAacLowComplexity = 2;
 
-std::string FourCC(eTqovixAtomType type) { return "'" + TqovixAtomTypeName(type) + "'"; }
+// Messages are appended piece by piece: `"text" + std::string` trips a false -Werror=restrict
+// in some optimising compilers.
+std::string Words(std::initializer_list<std::string_view> pieces)
+{
+    std::string text;
+    for (std::string_view piece : pieces) {
+        text.append(piece);
+    }
+    return text;
+}
+
+std::string FourCC(eTqovixAtomType type) { return Words({"'", TqovixAtomTypeName(type), "'"}); }
 
 std::string TrackName(const TqovixTrackTables& track)
 {
     const std::string kind = track.handler ? FourCC(track.handler->subtype) : "without a handler";
-    return "track " + std::to_string(track.index + 1) + " (" + kind + ")";
+    return Words({"track ", std::to_string(track.index + 1), " (", kind, ")"});
 }
 
 bool IsFragmented(const TqovixAtomList& atoms)
@@ -101,12 +113,12 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeSoundFormat(const CTqovixAudioInforma
     if (TqovixSoundEntry::IsAac(entry)) {
         const uint8_t objectType = information.GetAudioSpecificConfigData()[0] >> 3;
         if (objectType != kAacLowComplexity) {
-            return Refuse(eTqovixErrorInvalidMovie, "sound is AAC of object type " + std::to_string(objectType) +
-                                                        "; only AAC-LC is processed");
+            return Refuse(eTqovixErrorInvalidMovie,
+                          Words({"sound is AAC of object type ", std::to_string(objectType), "; only AAC-LC is processed"}));
         }
         if (channels == 0 || channels > kMaxAacChannels) {
-            return Refuse(eTqovixErrorInvalidMovie, "sound is AAC with " + std::to_string(channels) +
-                                                        " channels; only mono and stereo AAC are processed");
+            return Refuse(eTqovixErrorInvalidMovie, Words({"sound is AAC with ", std::to_string(channels),
+                                                           " channels; only mono and stereo AAC are processed"}));
         }
         m_bPCM = false;
         m_bBigEndian = false;
@@ -114,7 +126,7 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeSoundFormat(const CTqovixAudioInforma
         return eTqovixSuccess;
     }
     if (!TqovixSoundEntry::IsPcmFormat(entry)) {
-        return Refuse(eTqovixErrorInvalidMovie, "sound format " + FourCC(entry.format) + " is not processed");
+        return Refuse(eTqovixErrorInvalidMovie, Words({"sound format ", FourCC(entry.format), " is not processed"}));
     }
     const bool floating = (entry.version == 2 && (entry.formatFlags & 1) != 0) ||
                           entry.format == TqovixMakeAtomType("fl32") || entry.format == TqovixMakeAtomType("fl64");
@@ -122,12 +134,12 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeSoundFormat(const CTqovixAudioInforma
         return Refuse(eTqovixErrorInvalidMovie, "sound is floating-point PCM; only 16-bit is processed");
     }
     if (entry.bitsPerChannel != 16) {
-        return Refuse(eTqovixErrorInvalidMovie, "sound is " + std::to_string(entry.bitsPerChannel) +
-                                                    "-bit PCM; only 16-bit is processed");
+        return Refuse(eTqovixErrorInvalidMovie,
+                      Words({"sound is ", std::to_string(entry.bitsPerChannel), "-bit PCM; only 16-bit is processed"}));
     }
     if (channels == 0 || channels > kMaxPcmChannels) {
-        return Refuse(eTqovixErrorInvalidMovie, "sound has " + std::to_string(channels) +
-                                                    " channels; 1 to 8 are processed");
+        return Refuse(eTqovixErrorInvalidMovie,
+                      Words({"sound has ", std::to_string(channels), " channels; 1 to 8 are processed"}));
     }
     if (TqovixSoundEntry::FrameBytes(entry) != 2 * channels) {
         return Refuse(eTqovixErrorInvalidMovie, "the sound description's frame size does not match 16-bit samples");
@@ -171,18 +183,18 @@ eTqovixErrorCode CTqovixMovControl::GatherCarriedTracks(uint32_t soundTrack, uin
                 frameBytes = TqovixSoundEntry::FrameBytes(*track.soundEntry);
             } else if (track.IsHandler("soun") && track.sizes && track.sizes->common == 1) {
                 // Compressed sound counted in bytes: its chunk sizes cannot be known for sure.
-                return Refuse(eTqovixErrorInvalidMovie, TrackName(track) + ": chunk sizes of format " +
-                                                            FourCC(track.format) + " cannot be determined");
+                return Refuse(eTqovixErrorInvalidMovie, Words({TrackName(track), ": chunk sizes of format ",
+                                                               FourCC(track.format), " cannot be determined"}));
             }
             std::vector<TqovixChunkInformation> chunks;
             result = TqovixBuildChunkList(track, frameBytes, chunks);
             if (TqovixFailed(result)) {
                 return result == eTqovixErrorInvalidMovie
-                           ? Refuse(result, TrackName(track) + ": sample tables contradict each other")
+                           ? Refuse(result, Words({TrackName(track), ": sample tables contradict each other"}))
                            : result;
             }
             if (TqovixFailed(TqovixCheckChunksInFile(chunks, fileSize))) {
-                return Refuse(eTqovixErrorInvalidMovie, TrackName(track) + ": chunks lie past the end of the file");
+                return Refuse(eTqovixErrorInvalidMovie, Words({TrackName(track), ": chunks lie past the end of the file"}));
             }
             m_carriedTracks.emplace_back(track.index, chunks.size());
             carried.insert(carried.end(), chunks.begin(), chunks.end());
