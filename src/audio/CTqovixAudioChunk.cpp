@@ -34,14 +34,10 @@ eTqovixErrorCode CTqovixAudioChunk::PopInputData(void* buffer, unsigned int* siz
     if (m_readPosition > static_cast<uint64_t>(INT64_MAX)) {
         return eTqovixErrorInvalidMovie;
     }
-    eTqovixErrorCode result = m_pFile->Seek(static_cast<long long>(m_readPosition), CTqovixFile::eTqovixSeekBegin);
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    // Straight into the caller's buffer: a chunk is always read whole, so a
-    // queue in between would only add a copy.
+    // Straight into the caller's buffer, at the chunk's own place: a chunk is always read
+    // whole, so neither a queue nor the stream's read-ahead would serve it.
     unsigned int got = 0;
-    result = m_pFile->Read(buffer, &got, count);
+    const eTqovixErrorCode result = m_pFile->ReadAt(m_readPosition, buffer, count, &got);
     if (TqovixFailed(result)) {
         return result;
     }

@@ -170,6 +170,9 @@ void CTqovixMovControl::Close()
     m_carriedByte = -1;
     std::vector<uint8_t>().swap(m_copyBuffer);
     m_bPatching = false;
+    m_bPatchCandidate = false;
+    m_servedSound.Clear();
+    m_bServedOverflow = false;
     m_moovOffset = 0;
     std::vector<uint8_t>().swap(m_compareBuffer);
     if (m_audioDataControl.IsInitialized() || m_audioDataControl.IsAACCodec()) {
@@ -206,7 +209,9 @@ eTqovixErrorCode CTqovixMovControl::GetAudioLevelInformation(void* buffer, unsig
 eTqovixErrorCode CTqovixMovControl::GetAudioData(void* buffer, unsigned long* delivered, unsigned long size,
                                                  unsigned long) const
 {
-    return m_audioDataControl.PopAudioData(buffer, delivered, size);
+    const eTqovixErrorCode result = m_audioDataControl.PopAudioData(buffer, delivered, size);
+    KeepServedSound(result, buffer, delivered);
+    return result;
 }
 
 eTqovixErrorCode CTqovixMovControl::GetAudioInformation(TqovixInterfaceConvert::TqovixAudioInformation& record)

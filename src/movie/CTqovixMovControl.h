@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "atom/CTqovixAtomControl.h"
+#include "audio/TqovixByteQueue.h"
 #include "bridge/TqovixInterfaceConvert.h"
 #include "codec/CTqovixAudioDataControlMac.h"
 #include "file/CTqovixFile.h"
@@ -81,6 +82,9 @@ private:
     // Writes processed PCM over the copy at `offset`, and only where it differs from the source.
     eTqovixErrorCode PatchSound(uint64_t offset, const uint8_t* data, uint32_t size, bool swap);
     eTqovixErrorCode WriteMovieAtom();
+    void KeepServedSound(eTqovixErrorCode served, const void* buffer, const unsigned long* delivered) const;
+    // The next `size` bytes of the source's sound as served, into m_compareBuffer.
+    eTqovixErrorCode TakeServedSound(uint64_t offset, uint32_t size, bool swapped);
     // Rewriting the tables of every track whose chunks moved.
     eTqovixErrorCode RewriteTables(const void* afInformation, unsigned long size);
     eTqovixErrorCode WriteLeadingAtoms();
@@ -132,6 +136,11 @@ private:
     int m_carriedByte = -1;  // big-endian PCM: the odd byte of a piece waits for its pair
     std::vector<uint8_t> m_copyBuffer;  // reused for swapped PCM and video chunks the kernel cannot copy
     bool m_bPatching = false;
+    bool m_bPatchCandidate = false;        // the layout allows it: the served sound is kept
     uint64_t m_moovOffset = 0;            // patching: where the source's moov starts
     std::vector<uint8_t> m_compareBuffer;  // patching: the source's sound, to find what changed
+    // Patching: the PCM served to the processing library and not yet handed back, so that
+    // what comes back is compared with what went out without reading the file again.
+    mutable TqovixByteQueue m_servedSound;
+    mutable bool m_bServedOverflow = false;
 };

@@ -12,6 +12,9 @@
 namespace {
 
 constexpr uint64_t kComparePiece = 1 << 20;
+// A processing library that pulls this far ahead of what it hands back is compared with the
+// file instead: the served sound is not held without bound.
+constexpr uint64_t kMaxServedBytes = 4 << 20;
 
 std::atomic<bool> g_bPatchWriting{true};
 
@@ -79,7 +82,9 @@ eTqovixErrorCode CTqovixMovControl::BeginPatching(bool& started)
     TqovixAtomList atoms;
     eTqovixErrorCode result = m_atomControl.GetAtoms(atoms);
     uint64_t moovOffset = 0;
-    if (TqovixFailed(result) || !g_bPatchWriting || !CanPatch(atoms, moovOffset)) {
+    if (TqovixFailed(result) || !g_bPatchWriting || !m_bPatchCandidate || !CanPatch(atoms, moovOffset)) {
+        m_bPatchCandidate = false;
+        m_servedSound.Clear();
         return result;
     }
     long long size = 0;
@@ -93,12 +98,50 @@ eTqovixErrorCode CTqovixMovControl::BeginPatching(bool& started)
     }
     // Where the kernel cannot copy between the two files, the general writer starts afresh.
     if (TqovixFailed(result) || !copied) {
+        m_bPatchCandidate = false;
+        m_servedSound.Clear();
         return result;
     }
     m_bPatching = true;
     m_moovOffset = moovOffset;
     m_outputMovieDataChunkIndex = m_movieDataChunks.size();
     started = true;
+    return eTqovixSuccess;
+}
+
+void CTqovixMovControl::KeepServedSound(eTqovixErrorCode served, const void* buffer,
+                                        const unsigned long* delivered) const
+{
+    if (!m_bPatchCandidate || m_bServedOverflow || TqovixFailed(served) || delivered == nullptr || *delivered == 0) {
+        return;
+    }
+    if (m_servedSound.Size() + *delivered > kMaxServedBytes ||
+        TqovixFailed(m_servedSound.Push(buffer, *delivered))) {
+        m_bServedOverflow = true;
+        m_servedSound.Clear();
+    }
+}
+
+eTqovixErrorCode CTqovixMovControl::TakeServedSound(uint64_t offset, uint32_t size, bool swapped)
+{
+    if (!m_bServedOverflow && m_servedSound.Size() >= size) {
+        m_servedSound.Pop(m_compareBuffer.data(), size);
+        return eTqovixSuccess;
+    }
+    // What was served is gone (or was never kept): the source's bytes, in the served byte order.
+    m_bServedOverflow = true;
+    m_servedSound.Clear();
+    unsigned int got = 0;
+    const eTqovixErrorCode result = m_sourceFile.ReadAt(offset, m_compareBuffer.data(), size, &got);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    if (got != size) {
+        return eTqovixErrorInternal;  // the tables were checked against the file: it shrank
+    }
+    if (swapped) {
+        SwapPairs(m_compareBuffer.data(), size);
+    }
     return eTqovixSuccess;
 }
 
@@ -113,19 +156,18 @@ eTqovixErrorCode CTqovixMovControl::PatchSound(uint64_t offset, const uint8_t* d
     }
     for (uint32_t done = 0; done < size;) {
         const auto piece = static_cast<unsigned int>(std::min<uint64_t>(size - done, m_copyBuffer.size()));
-        const uint8_t* bytes = data + done;
-        if (swap) {
-            std::memcpy(m_copyBuffer.data(), bytes, piece);
-            SwapPairs(m_copyBuffer.data(), piece);
-            bytes = m_copyBuffer.data();
-        }
-        unsigned int got = 0;
-        eTqovixErrorCode result = m_sourceFile.ReadAt(offset + done, m_compareBuffer.data(), piece, &got);
+        eTqovixErrorCode result = TakeServedSound(offset + done, piece, swap);
         if (TqovixFailed(result)) {
             return result;
         }
         // Unchanged sound stays as copied, so the blocks it shares with the source stay shared.
-        if (got != piece || std::memcmp(m_compareBuffer.data(), bytes, piece) != 0) {
+        if (std::memcmp(m_compareBuffer.data(), data + done, piece) != 0) {
+            const uint8_t* bytes = data + done;
+            if (swap) {
+                std::memcpy(m_copyBuffer.data(), bytes, piece);
+                SwapPairs(m_copyBuffer.data(), piece);
+                bytes = m_copyBuffer.data();
+            }
             result = m_destinationFile.Seek(static_cast<long long>(offset + done), CTqovixFile::eTqovixSeekBegin);
             if (!TqovixFailed(result)) {
                 result = m_destinationFile.Write(bytes, piece);

@@ -100,6 +100,15 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
     if (!forJob) {
         return eTqovixSuccess;
     }
+    // Whether copying then patching will do, so that the sound served from now on is kept to
+    // compare with; the writer decides for good when it starts.
+    bool largeSource = false;
+    for (const auto& atom : atoms) {
+        largeSource = largeSource || (atom->GetType() == TqovixAtom::kMdat && atom->GetSize() > UINT32_MAX);
+    }
+    uint64_t moovOffset = 0;
+    m_bLargeMediaDataHeader = NeedsLargeMediaDataHeader(largeSource);
+    m_bPatchCandidate = CanPatch(atoms, moovOffset);
     return m_audioDataControl.Initialize(m_sourceFile, m_audioChunks, m_bBigEndian);
 }
 
