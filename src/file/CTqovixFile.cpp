@@ -5,6 +5,7 @@
 
 #include "file/CTqovixFile.h"
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <cstring>
@@ -223,24 +224,56 @@ eTqovixErrorCode CTqovixFile::CopyFrom(CTqovixFile& source, unsigned long long s
     if (m_bKernelCopyRefused) {
         return eTqovixSuccess;
     }
+    // Our buffered bytes go first; both streams' positions include what they buffer.
+    if (const eTqovixErrorCode flushed = FlushStream(); TqovixFailed(flushed)) {
+        return flushed;
+    }
+    const off_t in = ftello(source.m_stream);
+    const off_t out = ftello(m_stream);
+    if (in < 0 || out < 0) {
+        return ConvertErrnoToLocalError(errno, false);
+    }
+    const eTqovixErrorCode result = CopyRange(source, static_cast<unsigned long long>(in),
+                                              static_cast<unsigned long long>(out), size, copied, nullptr);
+    if (TqovixFailed(result) || !*copied) {
+        return result;
+    }
+    // The descriptors' own offsets never moved; the streams are put where the copy ended.
+    if (fseeko(source.m_stream, in + static_cast<off_t>(size), SEEK_SET) != 0 ||
+        fseeko(m_stream, out + static_cast<off_t>(size), SEEK_SET) != 0) {
+        return ConvertErrnoToLocalError(errno, false);
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixFile::CopyRange(CTqovixFile& source, unsigned long long from, unsigned long long to,
+                                        unsigned long long size, bool* copied, const std::atomic<bool>* cancel,
+                                        std::atomic<unsigned long long>* reached)
+{
+    if (copied == nullptr || m_stream == nullptr || source.m_stream == nullptr) {
+        return eTqovixErrorInternal;
+    }
+    *copied = false;
+    if (m_bKernelCopyRefused) {
+        return eTqovixSuccess;
+    }
     if (const int fault = InjectedFault(eTqovixFileOperation::Read)) {
         return ConvertErrnoToLocalError(fault, true);
     }
     if (const int fault = InjectedFault(eTqovixFileOperation::Write)) {
         return ConvertErrnoToLocalError(fault, false);
     }
-    // Our buffered bytes go first; both streams' positions include what they buffer.
-    if (const eTqovixErrorCode flushed = FlushStream(); TqovixFailed(flushed)) {
-        return flushed;
-    }
-    off_t in = ftello(source.m_stream);
-    off_t out = ftello(m_stream);
-    if (in < 0 || out < 0) {
-        return ConvertErrnoToLocalError(errno, false);
-    }
+    // Pieces, so that a copy asked to stop stops soon.
+    constexpr unsigned long long kPiece = 16ULL << 20;
+    auto in = static_cast<off_t>(from);
+    auto out = static_cast<off_t>(to);
     unsigned long long left = size;
     while (left > 0) {
-        const ssize_t done = copy_file_range(fileno(source.m_stream), &in, fileno(m_stream), &out, left, 0);
+        if (cancel != nullptr && cancel->load(std::memory_order_relaxed)) {
+            return eTqovixErrorAborted;
+        }
+        const ssize_t done =
+            copy_file_range(fileno(source.m_stream), &in, fileno(m_stream), &out, std::min(left, kPiece), 0);
         if (done < 0) {
             const int error = errno;
             if (error == EINTR) {
@@ -260,10 +293,9 @@ eTqovixErrorCode CTqovixFile::CopyFrom(CTqovixFile& source, unsigned long long s
             return eTqovixErrorInternal;
         }
         left -= static_cast<unsigned long long>(done);
-    }
-    // The descriptors' own offsets never moved; the streams are put where the copy ended.
-    if (fseeko(source.m_stream, in, SEEK_SET) != 0 || fseeko(m_stream, out, SEEK_SET) != 0) {
-        return ConvertErrnoToLocalError(errno, false);
+        if (reached != nullptr) {
+            reached->store(static_cast<unsigned long long>(out), std::memory_order_release);
+        }
     }
     *copied = true;
     return eTqovixSuccess;

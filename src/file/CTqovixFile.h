@@ -2,6 +2,7 @@
 // positions whose failures come back as eTqovixErrorCode, never as exceptions.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <cstdio>
 #include <memory>
@@ -52,6 +53,13 @@ public:
     // kernel: the bytes never visit our memory. *copied is false (and nothing moved) when
     // the two files do not allow it; the caller then copies through a buffer.
     eTqovixErrorCode CopyFrom(CTqovixFile& source, unsigned long long size, bool* copied);
+    // The same between explicit offsets, by descriptors alone: neither stream moves, so the
+    // copy may run on a thread of its own while the streams serve others. `cancel`, when
+    // given, is looked at between pieces; a copy stopped so ends with 4608. `reached`, when
+    // given, says after each piece where in our file the copied bytes end.
+    eTqovixErrorCode CopyRange(CTqovixFile& source, unsigned long long from, unsigned long long to,
+                               unsigned long long size, bool* copied, const std::atomic<bool>* cancel,
+                               std::atomic<unsigned long long>* reached = nullptr);
     // Reads at `offset` without moving or refilling the stream: for a look at bytes that the
     // stream's reader is not reading in order. Fewer bytes than asked only at the file's end.
     eTqovixErrorCode ReadAt(unsigned long long offset, void* buffer, unsigned int size, unsigned int* readSize);

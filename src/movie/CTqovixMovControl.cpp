@@ -141,6 +141,7 @@ eTqovixErrorCode CTqovixMovControl::InitializeDestination(const char* sourcePath
 
 void CTqovixMovControl::Close()
 {
+    m_copy.Stop();
     m_outputAudioChunkIndex = 0;
     m_outputMovieDataChunkIndex = 0;
     m_samplesInOutputChunk = 0;

@@ -9,6 +9,7 @@
 
 #include "atom/CTqovixAtomControl.h"
 #include "audio/TqovixByteQueue.h"
+#include "movie/CTqovixBackgroundCopy.h"
 #include "bridge/TqovixInterfaceConvert.h"
 #include "codec/CTqovixAudioDataControlMac.h"
 #include "file/CTqovixFile.h"
@@ -143,4 +144,7 @@ private:
     // what comes back is compared with what went out without reading the file again.
     mutable TqovixByteQueue m_servedSound;
     mutable bool m_bServedOverflow = false;
+    // Patching: the kernel copy of the source runs beside the sound processing. Declared
+    // after the files it copies between, so that it stops before they close.
+    CTqovixBackgroundCopy m_copy;
 };

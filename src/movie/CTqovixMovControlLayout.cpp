@@ -146,6 +146,10 @@ eTqovixErrorCode CTqovixMovControl::WriteMovieAtom()
     }
     if (m_bPatching) {
         // Over the copy's moov, and the file ends where the new one does.
+        result = m_copy.Join();
+        if (TqovixFailed(result)) {
+            return result;
+        }
         result = m_destinationFile.Seek(static_cast<long long>(m_moovOffset), CTqovixFile::eTqovixSeekBegin);
         if (TqovixFailed(result)) {
             return result;

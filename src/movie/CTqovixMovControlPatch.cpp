@@ -12,6 +12,7 @@
 namespace {
 
 constexpr uint64_t kComparePiece = 1 << 20;
+constexpr unsigned long long kFirstCopy = 64 << 10;
 // A processing library that pulls this far ahead of what it hands back is compared with the
 // file instead: the served sound is not held without bound.
 constexpr uint64_t kMaxServedBytes = 4 << 20;
@@ -92,11 +93,14 @@ eTqovixErrorCode CTqovixMovControl::BeginPatching(bool& started)
     if (!TqovixFailed(result)) {
         result = m_sourceFile.Seek(0, CTqovixFile::eTqovixSeekBegin);
     }
+    // The first piece here: where the kernel cannot copy between the two files, the general
+    // writer starts afresh before anything is decided.
+    const auto total = static_cast<unsigned long long>(size);
+    const unsigned long long first = std::min<unsigned long long>(total, kFirstCopy);
     bool copied = false;
     if (!TqovixFailed(result)) {
-        result = m_destinationFile.CopyFrom(m_sourceFile, static_cast<unsigned long long>(size), &copied);
+        result = m_destinationFile.CopyRange(m_sourceFile, 0, 0, first, &copied, nullptr);
     }
-    // Where the kernel cannot copy between the two files, the general writer starts afresh.
     if (TqovixFailed(result) || !copied) {
         m_bPatchCandidate = false;
         m_servedSound.Clear();
@@ -106,6 +110,8 @@ eTqovixErrorCode CTqovixMovControl::BeginPatching(bool& started)
     m_moovOffset = moovOffset;
     m_outputMovieDataChunkIndex = m_movieDataChunks.size();
     started = true;
+    // The rest beside the sound processing: the two take different cores.
+    m_copy.Start(m_destinationFile, m_sourceFile, first, total);
     return eTqovixSuccess;
 }
 
@@ -168,7 +174,11 @@ eTqovixErrorCode CTqovixMovControl::PatchSound(uint64_t offset, const uint8_t* d
                 SwapPairs(m_copyBuffer.data(), piece);
                 bytes = m_copyBuffer.data();
             }
-            result = m_destinationFile.Seek(static_cast<long long>(offset + done), CTqovixFile::eTqovixSeekBegin);
+            // The copy must never write over it: claimed first, it is passed over.
+            result = m_copy.Claim(offset + done, piece);
+            if (!TqovixFailed(result)) {
+                result = m_destinationFile.Seek(static_cast<long long>(offset + done), CTqovixFile::eTqovixSeekBegin);
+            }
             if (!TqovixFailed(result)) {
                 result = m_destinationFile.Write(bytes, piece);
             }

@@ -1,0 +1,138 @@
+#include "movie/CTqovixBackgroundCopy.h"
+
+#include <algorithm>
+#include <atomic>
+#include <system_error>
+#include <vector>
+
+#include "file/CTqovixFile.h"
+
+namespace {
+
+// Small enough that a writer at the copy's very place waits only a few milliseconds.
+constexpr uint64_t kPiece = 16ULL << 20;
+
+}  // namespace
+
+void CTqovixBackgroundCopy::Start(CTqovixFile& destination, CTqovixFile& source, uint64_t from, uint64_t end)
+{
+    Stop();
+    m_pDestination = &destination;
+    m_pSource = &source;
+    m_claims.clear();
+    m_claimedEnd = from;
+    m_reached = from;
+    m_bDone = from >= end;
+    m_bCancel = false;
+    m_result = eTqovixSuccess;
+    if (m_bDone) {
+        return;
+    }
+    try {
+        m_thread = std::thread([this, from, end] { Run(from, end); });
+    } catch (const std::system_error&) {
+        Run(from, end);  // no thread to be had: the copy is simply not beside anything
+    }
+}
+
+void CTqovixBackgroundCopy::Run(uint64_t from, uint64_t end)
+{
+    eTqovixErrorCode result = eTqovixSuccess;
+    for (uint64_t begin = from; begin < end && !TqovixFailed(result);) {
+        const uint64_t stop = std::min(end, begin + kPiece);
+        std::map<uint64_t, uint64_t> claims;
+        {
+            std::lock_guard lock(m_mutex);
+            if (m_bCancel) {
+                result = eTqovixErrorAborted;
+                break;
+            }
+            // Claims made until now stand; later ones lie past what the copy owns.
+            m_claimedEnd = stop;
+            std::vector<std::pair<uint64_t, uint64_t>> beyond;
+            for (auto it = m_claims.begin(); it != m_claims.end() && it->first < stop;) {
+                claims.insert(*it);
+                if (it->second > stop) {
+                    beyond.emplace_back(stop, it->second);  // the rest stays claimed for the next piece
+                }
+                it = m_claims.erase(it);
+            }
+            for (const auto& [claimBegin, claimEnd] : beyond) {
+                auto& kept = m_claims[claimBegin];
+                kept = std::max(kept, claimEnd);
+            }
+        }
+        result = CopyPiece(begin, stop, claims);
+        std::lock_guard lock(m_mutex);
+        if (!TqovixFailed(result)) {
+            m_reached = stop;
+        }
+        m_progress.notify_all();
+        begin = stop;
+    }
+    std::lock_guard lock(m_mutex);
+    m_result = result;
+    m_bDone = true;
+    m_progress.notify_all();
+}
+
+eTqovixErrorCode CTqovixBackgroundCopy::CopyPiece(uint64_t begin, uint64_t end,
+                                                  const std::map<uint64_t, uint64_t>& claims)
+{
+    // The gaps between the claimed ranges, each copied as it stands.
+    uint64_t at = begin;
+    const auto copy = [&](uint64_t until) {
+        if (until <= at) {
+            return eTqovixSuccess;
+        }
+        bool copied = false;
+        const eTqovixErrorCode result = m_pDestination->CopyRange(*m_pSource, at, at, until - at, &copied, nullptr);
+        return TqovixFailed(result) ? result : copied ? eTqovixSuccess : eTqovixErrorInternal;
+    };
+    for (const auto& [claimBegin, claimEnd] : claims) {
+        const eTqovixErrorCode result = copy(std::min(claimBegin, end));
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        at = std::max(at, std::min(claimEnd, end));
+    }
+    return copy(end);
+}
+
+eTqovixErrorCode CTqovixBackgroundCopy::Claim(uint64_t offset, uint64_t size)
+{
+    std::unique_lock lock(m_mutex);
+    for (;;) {
+        if (m_bDone || offset + size <= m_reached) {
+            return m_result;
+        }
+        if (offset >= m_claimedEnd) {
+            const auto [it, added] = m_claims.emplace(offset, offset + size);
+            if (!added) {
+                it->second = std::max(it->second, offset + size);
+            }
+            return eTqovixSuccess;
+        }
+        m_progress.wait(lock);
+    }
+}
+
+eTqovixErrorCode CTqovixBackgroundCopy::Join()
+{
+    if (m_thread.joinable()) {
+        m_thread.join();
+    }
+    std::lock_guard lock(m_mutex);
+    return m_result;
+}
+
+void CTqovixBackgroundCopy::Stop()
+{
+    {
+        std::lock_guard lock(m_mutex);
+        m_bCancel = true;
+    }
+    if (m_thread.joinable()) {
+        m_thread.join();
+    }
+}
