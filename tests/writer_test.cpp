@@ -11,6 +11,8 @@
 #include "MakerInjector.h"
 #include "Movie.h"
 #include "engine/CTqovixMainFrame.h"
+#include "file/CTqovixFile.h"
+#include "movie/CTqovixBackgroundCopy.h"
 #include "movie/CTqovixMovControl.h"
 #include "support/TestSupport.h"
 
@@ -137,5 +139,51 @@ INSTANTIATE_TEST_SUITE_P(
         WriterRow{"LargeMdatHeader", Kit([](Recipe& r) { r.largeMdatHeader = true; }), false},
         WriterRow{"Aac", Kit([](Recipe& r) { r.sound.codec = SoundCodec::Aac; }), false}),
     [](const ::testing::TestParamInfo<WriterRow>& info) { return std::string(info.param.name); });
+
+}  // namespace
+
+namespace {
+
+// Writes claimed while the copy runs survive it, wherever they fall against its pieces;
+// everything else is the source's.
+TEST(BackgroundCopyTest, ClaimedRangesAreNeverCopiedOver)
+{
+    testsupport::TempDir dir;
+    constexpr uint64_t kSize = 40ULL << 20;  // pieces of 16 MiB: claims fall inside and across them
+    std::vector<uint8_t> bytes(kSize);
+    for (uint64_t k = 0; k < kSize; ++k) {
+        bytes[k] = static_cast<uint8_t>(k * 2654435761u >> 13);
+    }
+    const std::string sourcePath = dir.File("source.bin");
+    ASSERT_TRUE(testsupport::WriteFile(sourcePath, bytes));
+    CTqovixFile source;
+    CTqovixFile destination;
+    ASSERT_EQ(source.Open(sourcePath.c_str(), 1), eTqovixSuccess);
+    ASSERT_EQ(destination.Open(dir.File("copy.bin").c_str(), 2), eTqovixSuccess);
+    CTqovixBackgroundCopy copy;
+    copy.Start(destination, source, 0, kSize);
+    // Near the start (likely under the copy's current piece), across a piece's end, far ahead.
+    const std::vector<std::pair<uint64_t, uint64_t>> claims = {
+        {4096, 8192}, {(16ULL << 20) - 100, 300}, {(32ULL << 20) + 5, 4096}, {kSize - 10, 10}};
+    for (const auto& [offset, size] : claims) {
+        ASSERT_EQ(copy.Claim(offset, size), eTqovixSuccess);
+        const std::vector<uint8_t> patch(size, 0xA5);
+        ASSERT_EQ(destination.Seek(static_cast<long long>(offset), CTqovixFile::eTqovixSeekBegin), eTqovixSuccess);
+        ASSERT_EQ(destination.Write(patch.data(), static_cast<unsigned int>(size)), eTqovixSuccess);
+        std::fill_n(bytes.begin() + static_cast<std::ptrdiff_t>(offset), size, 0xA5);
+    }
+    EXPECT_EQ(copy.Join(), eTqovixSuccess);
+    ASSERT_EQ(destination.Flush(), eTqovixSuccess);
+    destination.Close();
+    EXPECT_TRUE(testsupport::ReadFile(dir.File("copy.bin")) == bytes);
+
+    // A copy asked to stop ends with the abort code and leaves no thread behind.
+    CTqovixFile again;
+    ASSERT_EQ(again.Open(dir.File("again.bin").c_str(), 2), eTqovixSuccess);
+    copy.Start(again, source, 0, kSize);
+    copy.Stop();
+    const eTqovixErrorCode stopped = copy.Join();
+    EXPECT_TRUE(stopped == eTqovixSuccess || stopped == eTqovixErrorAborted);
+}
 
 }  // namespace
