@@ -11,7 +11,10 @@
 #include <cstring>
 #include <new>
 #include <libgen.h>
+#include <linux/fs.h>
 #include <linux/magic.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
 #include <sys/statfs.h>
 #include <sys/types.h>
 #include <unistd.h>
@@ -514,4 +517,20 @@ eTqovixErrorCode CTqovixFile::ReadAt(unsigned long long offset, void* buffer, un
         *readSize += static_cast<unsigned int>(got);
     }
     return eTqovixSuccess;
+}
+
+void CTqovixFile::HintSmallCopyOnWrite()
+{
+    if (m_stream == nullptr) {
+        return;
+    }
+    const int descriptor = fileno(m_stream);
+    struct stat status {};
+    fsxattr attributes {};
+    if (fstat(descriptor, &status) != 0 || ioctl(descriptor, FS_IOC_FSGETXATTR, &attributes) != 0) {
+        return;
+    }
+    attributes.fsx_xflags |= FS_XFLAG_COWEXTSIZE;
+    attributes.fsx_cowextsize = static_cast<uint32_t>(status.st_blksize);
+    ioctl(descriptor, FS_IOC_FSSETXATTR, &attributes);
 }

@@ -60,6 +60,10 @@ public:
     eTqovixErrorCode CopyRange(CTqovixFile& source, unsigned long long from, unsigned long long to,
                                unsigned long long size, bool* copied, const std::atomic<bool>* cancel,
                                std::atomic<unsigned long long>* reached = nullptr);
+    // Asks the file system to unshare no more than one block around a write into extents
+    // this file shares with another (XFS's copy-on-write extent size). Where there is no
+    // such setting nothing happens; it is only a hint.
+    void HintSmallCopyOnWrite();
     // Reads at `offset` without moving or refilling the stream: for a look at bytes that the
     // stream's reader is not reading in order. Fewer bytes than asked only at the file's end.
     eTqovixErrorCode ReadAt(unsigned long long offset, void* buffer, unsigned int size, unsigned int* readSize);

@@ -99,6 +99,8 @@ eTqovixErrorCode CTqovixMovControl::BeginPatching(bool& started)
     const unsigned long long first = std::min<unsigned long long>(total, kFirstCopy);
     bool copied = false;
     if (!TqovixFailed(result)) {
+        // Where the copy shares extents, a patch should unshare only the blocks it writes.
+        m_destinationFile.HintSmallCopyOnWrite();
         result = m_destinationFile.CopyRange(m_sourceFile, 0, 0, first, &copied, nullptr);
     }
     if (TqovixFailed(result) || !copied) {
