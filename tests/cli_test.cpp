@@ -73,6 +73,7 @@ TEST(CliTest, ReportsAndRefusals)
     const std::string done = Movie(dir, "done.mov", [](Recipe& r) { r.maker.afProcessed = true; });
     const std::string foreign = Movie(dir, "isom.mp4", ForeignBrand);
     const std::string noAf = Movie(dir, "noaf.mov", [](Recipe& r) { r.maker.afInformation = false; });
+    const std::string tenChannels = Movie(dir, "ten.mov", [](Recipe& r) { r.sound.channels = 10; });
     const std::string text = dir.File("notes.txt");
     std::ofstream(text) << "not a movie\n";
     const std::string kept = dir.File("kept.mov");
@@ -89,6 +90,8 @@ TEST(CliTest, ReportsAndRefusals)
         {check + Q(done), 1, {done + ": not processable: already processed\n"}},
         {check + Q(foreign), 1, {foreign + ": not processable: not a camera movie (brand 'isom')\n"}},
         {check + Q(noAf), 1, {noAf + ": not processable: no AF information"}},
+        // The parser words what the exported code cannot tell apart.
+        {check + Q(tenChannels), 1, {tenChannels + ": not processable: sound has 10 channels; 1 to 8 are processed\n"}},
         {check + Q(text), 1, {text + ": not processable: no AF information, or not a camera movie"}},
         {check + Q(dir.File("missing.mov")), 1, {"missing.mov: not processable: file not found\n"}},
         {"process " + Q(source) + " " + Q(json) + " --json", 0,

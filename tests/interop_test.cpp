@@ -32,6 +32,7 @@ struct Writer {
     std::string extra;        // more of ffmpeg's options (brand, timecode, a second track)
     int expected;             // the property query's answer, and the job's refusal code
     Sound sound = Sound::Pcm;
+    const char* reason = "";  // what `tqovix check` says of a refused movie
 };
 
 void PrintTo(const Writer& writer, std::ostream* out) { *out << writer.name; }
@@ -225,6 +226,9 @@ TEST_P(InteropTest, ProcessedRightOrRefusedUpFront)
     if (w.expected != 0) {
         EXPECT_EQ(ended, w.expected);
         EXPECT_FALSE(jobtest::Exists(destination));
+        std::string said;
+        testsupport::RunCommand(std::string(TQOVIX_TOOL) + " check " + testsupport::ShellQuote(source), &said);
+        EXPECT_NE(said.find(std::string("not processable: ") + w.reason), std::string::npos) << said;
         return;
     }
     ASSERT_EQ(ended, kDone);
@@ -272,10 +276,12 @@ INSTANTIATE_TEST_SUITE_P(
                       Writer{"AacStereo44kMp4", "aac", 44100, 2, ".mp4", kMp42, 0, Sound::Aac},
                       Writer{"TimecodeTrack", "pcm_s16le", 48000, 2, ".mov", kTimecode, 0},
                       Writer{"TwoSoundTracks", "pcm_s16be", 48000, 2, ".mov", kSecondSound, 0},
-                      Writer{"Pcm24Bit", "pcm_s24le", 48000, 2, ".mov", "", kRefused},
-                      Writer{"PcmFloat", "pcm_f32le", 48000, 2, ".mov", "", kRefused},
+                      Writer{"Pcm24Bit", "pcm_s24le", 48000, 2, ".mov", "", kRefused, Sound::Pcm,
+                             "sound is 24-bit PCM; only 16-bit is processed"},
+                      Writer{"PcmFloat", "pcm_f32le", 48000, 2, ".mov", "", kRefused, Sound::Pcm,
+                             "sound is floating-point PCM"},
                       Writer{"Fragmented", "aac", 48000, 2, ".mov", "-movflags frag_keyframe+empty_moov",
-                             kRefused, Sound::Aac}),
+                             kRefused, Sound::Aac, "fragmented movie"}),
     [](const ::testing::TestParamInfo<Writer>& info) { return std::string(info.param.name); });
 
 }  // namespace

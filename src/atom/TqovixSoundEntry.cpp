@@ -180,6 +180,21 @@ std::optional<Entry> Parse(std::span<const uint8_t> stsd)
         return std::nullopt;
     }
     entry.children = reader.Rest();
+    // QuickTime keeps 16 in the sample size field of versions 0 and 1 whatever the samples are:
+    // the format, or the bytes a frame takes, say what they really are.
+    if (entry.version != 2 && IsPcmFormat(entry)) {
+        const eTqovixAtomType format = entry.format;
+        if (format == TqovixMakeAtomType("in24")) {
+            entry.bitsPerChannel = 24;
+        } else if (format == TqovixMakeAtomType("in32") || format == TqovixMakeAtomType("fl32")) {
+            entry.bitsPerChannel = 32;
+        } else if (format == TqovixMakeAtomType("fl64")) {
+            entry.bitsPerChannel = 64;
+        } else if (entry.version == 1 && entry.channels != 0 && entry.bytesPerFrame % entry.channels == 0 &&
+                   entry.bytesPerFrame != 0) {
+            entry.bitsPerChannel = 8 * (entry.bytesPerFrame / entry.channels);
+        }
+    }
     return entry;
 }
 

@@ -82,6 +82,11 @@ eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const cha
                                                 "do not account for every byte of the file");
     }
 
+    result = RefuseFragmented();
+    if (TqovixFailed(result)) {
+        Close();  // the refusal's words stay for GetRefusal
+        return result;
+    }
     CTqovixAFInformationVisitor af;
     result = m_atomControl.Analyze(af);
     if (TqovixFailed(result) || (result >= eTqovixEnable && result <= eTqovixVerdict20)) {
@@ -114,9 +119,7 @@ eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const cha
     }
     result = AnalyzeTracks(destinationPath != nullptr);
     if (TqovixFailed(result)) {
-        const std::string refusal = m_refusal;
         Close();
-        m_refusal = refusal;
     }
     return result;
 }

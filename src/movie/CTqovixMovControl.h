@@ -71,6 +71,8 @@ public:
 private:
     eTqovixErrorCode InitializeDestination(const char* sourcePath, const char* destinationPath);
     eTqovixErrorCode AnalyzeTracks(bool forJob);
+    // Fragments keep their samples outside the tables: such a movie is refused before anything else.
+    eTqovixErrorCode RefuseFragmented();
     eTqovixErrorCode AnalyzeSoundFormat(const CTqovixAudioInformationVisitor& information);
     eTqovixErrorCode GatherCarriedTracks(uint32_t soundTrack, uint32_t soundFrameBytes, uint64_t fileSize);
     eTqovixErrorCode Refuse(eTqovixErrorCode code, std::string reason);

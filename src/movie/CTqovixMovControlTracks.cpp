@@ -58,15 +58,22 @@ eTqovixErrorCode CTqovixMovControl::Refuse(eTqovixErrorCode code, std::string re
     return code;
 }
 
+eTqovixErrorCode CTqovixMovControl::RefuseFragmented()
+{
+    TqovixAtomList atoms;
+    const eTqovixErrorCode result = m_atomControl.GetAtoms(atoms);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    return IsFragmented(atoms) ? Refuse(eTqovixErrorInvalidMovie, "fragmented movie") : eTqovixSuccess;
+}
+
 eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
 {
     TqovixAtomList atoms;
     eTqovixErrorCode result = m_atomControl.GetAtoms(atoms);
     if (TqovixFailed(result)) {
         return result;
-    }
-    if (IsFragmented(atoms)) {
-        return Refuse(eTqovixErrorInvalidMovie, "fragmented movie");
     }
     CTqovixAudioInformationVisitor information;
     result = m_atomControl.Analyze(information);

@@ -6,6 +6,7 @@
 
 #include "Commands.h"
 #include "api/TqOVIXUtility.h"
+#include "movie/CTqovixMovControl.h"
 
 namespace {
 
@@ -79,8 +80,16 @@ std::string Printable(std::string text)
 std::string Reason(int code, const std::string& path)
 {
     if (code == 8) {
-        // The library does not say which of its reasons it had; the brand is easy to tell.
+        // The exported code does not say which of its reasons the library had: the parser,
+        // running the same analysis as a job, words it.
+        CTqovixMovControl control;
+        const bool opened = !TqovixFailed(control.Initialize(path.c_str(), nullptr));
+        const std::string refusal = control.GetRefusal();
+        control.Close();
         const std::string brand = MajorBrand(path);
+        if (!opened && !refusal.empty() && (brand == "qt  " || brand == "mp42")) {
+            return refusal;
+        }
         if (!brand.empty() && brand != "qt  " && brand != "mp42") {
             return "not a camera movie (brand '" + Printable(brand) + "')";
         }

@@ -1,0 +1,134 @@
+#include "Inspection.h"
+
+#include "api/TqOVIXUtility.h"
+#include "atom/CTqovixAtomControl.h"
+#include "atom/CTqovixContainerAtom.h"
+#include "atom/TqovixEndian.h"
+#include "atom/TqovixTrackAtoms.h"
+#include "movie/CTqovixMovControl.h"
+#include "visitor/CTqovixAudioInformationVisitor.h"
+#include "visitor/CTqovixMakerBlockVisitor.h"
+#include "visitor/CTqovixMovieDataVisitor.h"
+#include "visitor/CTqovixTrimInformationVisitor.h"
+
+namespace {
+
+void CollectAtoms(const TqovixAtomList& atoms, uint64_t offset, int depth, std::vector<InspectedAtom>& rows)
+{
+    for (const auto& atom : atoms) {
+        const uint64_t size = atom->GetSize();
+        rows.push_back({offset, size, TqovixAtomTypeName(atom->GetType()), depth});
+        if (const auto* container = dynamic_cast<const CTqovixContainerAtom*>(atom.get())) {
+            uint64_t childBytes = 0;
+            for (const auto& child : container->GetChildren()) {
+                childBytes += child->GetSize();
+            }
+            CollectAtoms(container->GetChildren(), offset + size - childBytes, depth + 1, rows);
+        }
+        offset += size;
+    }
+}
+
+// The leaf at `types` (concatenated four-character codes) below `parent`, as a payload.
+TqovixPayload Payload(const CTqovixAtom* parent, const std::string& types)
+{
+    for (size_t at = 0; parent != nullptr && at < types.size(); at += 4) {
+        const auto* container = dynamic_cast<const CTqovixContainerAtom*>(parent);
+        parent = nullptr;
+        for (const auto& child : container ? container->GetChildren() : TqovixAtomList{}) {
+            if (TqovixAtomTypeName(child->GetType()) == types.substr(at, 4)) {
+                parent = child.get();
+                break;
+            }
+        }
+    }
+    const uint8_t* data = parent != nullptr ? parent->GetData() : nullptr;
+    return data == nullptr ? TqovixPayload{} : TqovixPayload{data, static_cast<size_t>(parent->GetDataSize())};
+}
+
+std::vector<InspectedTrack> CollectTracks(const CTqovixAtomControl& tree, const TqovixAtomList& atoms)
+{
+    std::vector<InspectedTrack> tracks;
+    for (const auto& top : atoms) {
+        const auto* moov = dynamic_cast<const CTqovixContainerAtom*>(top.get());
+        for (const auto& trak : moov && top->GetType() == TqovixAtom::kMoov ? moov->GetChildren() : TqovixAtomList{}) {
+            if (trak->GetType() != TqovixAtom::kTrak) {
+                continue;
+            }
+            InspectedTrack track;
+            const auto handler = TqovixTrackAtoms::ParseHandler(Payload(trak.get(), "mdiahdlr"));
+            track.handler = handler ? TqovixAtomTypeName(handler->subtype) : "?";
+            track.timeScale = TqovixTrackAtoms::ParseMediaTimeScale(Payload(trak.get(), "mdiamdhd")).value_or(0);
+            const TqovixPayload stts = Payload(trak.get(), "mdiaminfstblstts");
+            const uint32_t delta = stts.size() >= 16 ? TqovixReadBE32(stts.data() + 12) : 0;
+            track.rate = delta != 0 ? static_cast<double>(track.timeScale) / delta : 0;
+            tracks.push_back(track);
+        }
+    }
+    // What the library's own walk reads of every track: format, chunks, samples.
+    CTqovixTrackListVisitor list;
+    if (!TqovixFailed(tree.Analyze(list))) {
+        for (const TqovixTrackTables& tables : list.GetTracks()) {
+            if (tables.index >= tracks.size()) {
+                continue;
+            }
+            InspectedTrack& track = tracks[tables.index];
+            track.codec = TqovixAtomTypeName(tables.format);
+            const bool sound = tables.IsHandler("soun");
+            if (sound && tables.soundEntry) {
+                track.rate = tables.soundEntry->sampleRateHz;
+                track.channels = tables.soundEntry->channels;
+                track.bits = tables.soundEntry->bitsPerChannel;
+                track.aac = TqovixSoundEntry::IsAac(*tables.soundEntry);
+            }
+            const uint32_t frameBytes = sound && tables.soundEntry && TqovixSoundEntry::IsPcmFormat(*tables.soundEntry)
+                                            ? TqovixSoundEntry::FrameBytes(*tables.soundEntry)
+                                            : 0;
+            std::vector<TqovixChunkInformation> chunks;
+            track.known = !TqovixFailed(TqovixBuildChunkList(tables, frameBytes, chunks));
+            for (const TqovixChunkInformation& chunk : chunks) {
+                track.samples += chunk.sampleCount;
+            }
+            track.chunks = chunks.size();
+        }
+    }
+    // The processed sound track's channels as its decoder configuration gives them.
+    CTqovixAudioInformationVisitor sound;
+    if (!TqovixFailed(tree.Analyze(sound)) && sound.GetTrackIndex() < tracks.size()) {
+        tracks[sound.GetTrackIndex()].channels = sound.GetChannel();
+    }
+    return tracks;
+}
+
+}  // namespace
+
+Inspection Inspect(const std::string& path, const CTqovixAtomControl& tree)
+{
+    Inspection inspection;
+    inspection.path = path;
+    TqovixAtomList atoms;
+    tree.GetAtoms(atoms);
+    CollectAtoms(atoms, 0, 0, inspection.atoms);
+    inspection.tracks = CollectTracks(tree, atoms);
+    CTqovixTrimInformationVisitor trim;
+    if (tree.Analyze(trim) == eTqovixSuccess) {
+        inspection.trim = InspectedTrim{trim.GetRemovedFrameForward(), trim.GetRemovedFrameBackward(),
+                                        trim.GetFrameRateNumerator(), trim.GetFrameRateDenominator()};
+    }
+    CTqovixAFInformationVisitor af;
+    inspection.afBytes = TqovixFailed(tree.Analyze(af)) ? 0 : af.GetAFInformationSize();
+    CTqovixAudioLevelInformationVisitor level;
+    inspection.levelBytes = TqovixFailed(tree.Analyze(level)) ? 0 : level.GetAudioLevelInformationSize();
+    inspection.libraryAnswer = TqInitializeOVIX();
+    if (inspection.libraryAnswer == 0) {
+        inspection.libraryAnswer = TqGetPropertyOVIX(path.c_str());
+        TqCloseOVIX();
+    }
+    if (inspection.libraryAnswer == 8) {
+        CTqovixMovControl control;
+        control.Initialize(path.c_str(), nullptr);
+        inspection.refusal = control.GetRefusal();
+        control.Close();
+    }
+    return inspection;
+}
