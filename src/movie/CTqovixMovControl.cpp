@@ -178,6 +178,7 @@ void CTqovixMovControl::Close()
     m_servedSound.Clear();
     m_bServedOverflow = false;
     m_moovOffset = 0;
+    m_patchEnd = UINT64_MAX;
     std::vector<uint8_t>().swap(m_compareBuffer);
     if (m_audioDataControl.IsInitialized() || m_audioDataControl.IsAACCodec()) {
         m_audioDataControl.Close();

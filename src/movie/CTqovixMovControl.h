@@ -141,6 +141,7 @@ private:
     bool m_bPatching = false;
     bool m_bPatchCandidate = false;        // the layout allows it: the served sound is kept
     uint64_t m_moovOffset = 0;            // patching: where the source's moov starts
+    uint64_t m_patchEnd = UINT64_MAX;     // patching: where the last patch ended (no seek needed there)
     std::vector<uint8_t> m_compareBuffer;  // patching: the source's sound, to find what changed
     // Patching: the PCM served to the processing library and not yet handed back, so that
     // what comes back is compared with what went out without reading the file again.

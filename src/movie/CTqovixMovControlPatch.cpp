@@ -178,12 +178,14 @@ eTqovixErrorCode CTqovixMovControl::PatchSound(uint64_t offset, const uint8_t* d
             }
             // The copy must never write over it: claimed first, it is passed over.
             result = m_copy.Claim(offset + done, piece);
-            if (!TqovixFailed(result)) {
+            // Runs of changed sound go out through the stream's buffer: a seek would flush it.
+            if (!TqovixFailed(result) && m_patchEnd != offset + done) {
                 result = m_destinationFile.Seek(static_cast<long long>(offset + done), CTqovixFile::eTqovixSeekBegin);
             }
             if (!TqovixFailed(result)) {
                 result = m_destinationFile.Write(bytes, piece);
             }
+            m_patchEnd = TqovixFailed(result) ? UINT64_MAX : offset + done + piece;
             if (TqovixFailed(result)) {
                 return result;
             }
