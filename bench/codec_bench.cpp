@@ -188,11 +188,11 @@ int main(int argc, char** argv)
     std::filesystem::create_directories(work);
 
     const std::vector<int16_t> sound = MakeSound();
-    // Our encoder drops the first 4352 bytes and the layer puts as much silence in their
+    // Our encoder drops the first 1088 frames and the layer puts as much silence in their
     // place; ffmpeg gets exactly the samples that libavcodec then sees from us. (Leading
     // silence steers the encoder's rate control, which alone moves its time by several %.)
     std::vector<int16_t> ffmpegSound = sound;
-    std::fill_n(ffmpegSound.begin(), AACEncoder::kFirstBlockSize / sizeof(int16_t), 0);
+    std::fill_n(ffmpegSound.begin(), AACEncoder::kDroppedFrames * 2, 0);  // stereo
     const std::filesystem::path pcmPath = work / "sound.pcm";
     std::ofstream(pcmPath, std::ios::binary)
         .write(reinterpret_cast<const char*>(ffmpegSound.data()),

@@ -1,0 +1,155 @@
+#include "SoundComparison.h"
+
+#include <algorithm>
+#include <cmath>
+
+namespace {
+
+constexpr uint64_t kBlockFrames = 4096;
+constexpr int64_t kMaxOffset = 2048;       // more than any codec's delay
+constexpr uint64_t kWindowFrames = 16384;  // the stretch the offset is measured on
+constexpr double kSilenceDb = -120.0;
+
+double Decibels(double sumOfSquares, uint64_t count)
+{
+    if (count == 0 || sumOfSquares <= 0) {
+        return kSilenceDb;
+    }
+    return std::max(kSilenceDb, 10.0 * std::log10(sumOfSquares / static_cast<double>(count) / (32768.0 * 32768.0)));
+}
+
+bool Outside(uint64_t frame, const std::vector<SoundInterval>& intervals, uint64_t margin)
+{
+    for (const SoundInterval& span : intervals) {
+        if (frame + margin >= span.start && frame < span.end + margin) {
+            return false;
+        }
+    }
+    return true;
+}
+
+// Mono mixes of the first stretch of both sounds, for the offset.
+std::string MeasureOffset(const std::string& sourcePath, const std::string& destinationPath,
+                          const std::vector<SoundInterval>& intervals, uint64_t margin, SoundComparison& result)
+{
+    SoundStream a;
+    SoundStream b;
+    if (!a.Open(sourcePath).empty() || !b.Open(destinationPath).empty()) {
+        return "cannot be read twice";
+    }
+    const uint64_t length = std::min<uint64_t>(a.Frames(), kWindowFrames + 3 * kMaxOffset);
+    std::vector<int16_t> sa(length * a.Channels());
+    std::vector<int16_t> sb(length * b.Channels());
+    const uint64_t na = a.Read(sa.data(), length);
+    const uint64_t nb = b.Read(sb.data(), length);
+    const auto mono = [](const std::vector<int16_t>& s, uint32_t channels, uint64_t frames) {
+        std::vector<double> m(frames);
+        for (uint64_t f = 0; f < frames; ++f) {
+            for (uint32_t c = 0; c < channels; ++c) {
+                m[f] += s[f * channels + c];
+            }
+        }
+        return m;
+    };
+    const std::vector<double> ma = mono(sa, a.Channels(), na);
+    const std::vector<double> mb = mono(sb, b.Channels(), nb);
+    // The encoder's lead-in is no part of the comparison: start a packet in.
+    const auto from = static_cast<int64_t>(std::min<uint64_t>(na, kMaxOffset));
+    const auto to = static_cast<int64_t>(na);
+    double best = -2;
+    for (int64_t lag = -kMaxOffset; lag <= kMaxOffset; ++lag) {
+        double ab = 0;
+        double aa = 0;
+        double bb = 0;
+        for (int64_t f = std::max<int64_t>(from, -lag); f < to && f + lag < static_cast<int64_t>(nb); ++f) {
+            if (Outside(static_cast<uint64_t>(f), intervals, margin)) {
+                ab += ma[f] * mb[f + lag];
+                aa += ma[f] * ma[f];
+                bb += mb[f + lag] * mb[f + lag];
+            }
+        }
+        const double c = aa > 0 && bb > 0 ? ab / std::sqrt(aa * bb) : (aa == 0 && bb == 0 && lag == 0 ? 1.0 : 0.0);
+        if (c > best) {
+            best = c;
+            result.offset = lag;
+        }
+    }
+    result.correlation = best;
+    return "";
+}
+
+}  // namespace
+
+std::string CompareSounds(const std::string& sourcePath, const std::string& destinationPath, SoundComparison& result,
+                          const SoundBlockSink& sink)
+{
+    SoundStream source;
+    SoundStream destination;
+    if (const std::string why = source.Open(sourcePath); !why.empty()) {
+        return sourcePath + ": " + why;
+    }
+    if (const std::string why = destination.Open(destinationPath); !why.empty()) {
+        return destinationPath + ": " + why;
+    }
+    if (source.Rate() != destination.Rate() || source.Channels() != destination.Channels() ||
+        source.Frames() != destination.Frames()) {
+        return destinationPath + ": not the processed form of " + sourcePath +
+               " (its sound differs in rate, channels or length)";
+    }
+    result.rate = source.Rate();
+    result.channels = source.Channels();
+    result.frames = source.Frames();
+    result.aac = source.IsAac();
+    const uint64_t ramp = result.rate / 100;  // the processing library's ramps
+    const std::vector<SoundInterval>& intervals = source.Intervals();
+    std::vector<double> before(intervals.size());
+    std::vector<double> after(intervals.size());
+    std::vector<uint64_t> counted(intervals.size());
+    std::vector<int16_t> a(kBlockFrames * result.channels);
+    std::vector<int16_t> b(kBlockFrames * result.channels);
+    for (uint64_t first = 0; first < result.frames;) {
+        const uint64_t na = source.Read(a.data(), kBlockFrames);
+        const uint64_t nb = destination.Read(b.data(), kBlockFrames);
+        const uint64_t n = std::min(na, nb);
+        if (n == 0) {
+            break;
+        }
+        for (uint64_t f = 0; f < n; ++f) {
+            const uint64_t frame = first + f;
+            const int16_t* x = a.data() + f * result.channels;
+            const int16_t* y = b.data() + f * result.channels;
+            for (size_t i = 0; i < intervals.size(); ++i) {
+                if (frame >= intervals[i].start && frame < intervals[i].end) {
+                    for (uint32_t c = 0; c < result.channels; ++c) {
+                        before[i] += double{x[c]} * x[c];
+                        after[i] += double{y[c]} * y[c];
+                    }
+                    counted[i] += result.channels;
+                }
+            }
+            if (Outside(frame, intervals, ramp)) {
+                bool differs = false;
+                for (uint32_t c = 0; c < result.channels; ++c) {
+                    const int difference = std::abs(int{x[c]} - int{y[c]});
+                    result.largestDifference = std::max(result.largestDifference, difference);
+                    differs = differs || difference != 0;
+                }
+                result.differingFrames += differs ? 1 : 0;
+            }
+        }
+        if (sink) {
+            sink(a.data(), b.data(), first, n);
+        }
+        first += n;
+    }
+    for (size_t i = 0; i < intervals.size(); ++i) {
+        result.intervals.push_back({intervals[i], Decibels(before[i], counted[i]), Decibels(after[i], counted[i])});
+    }
+    if (const std::string why = MeasureOffset(sourcePath, destinationPath, intervals, ramp, result); !why.empty()) {
+        return why;
+    }
+    if (result.correlation < 0.5) {
+        return destinationPath + ": not the processed form of " + sourcePath + " (its sound does not match)";
+    }
+    return "";
+}

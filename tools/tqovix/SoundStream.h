@@ -1,0 +1,49 @@
+// The sound of a movie as the processing library is served it: the first sound track,
+// decoded through our own pipeline (byte-swapped PCM or AAC through the codecs), frame
+// by frame, with the AF intervals of its maker block placed on the same frames.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <vector>
+
+class CTqovixFile;
+class CTqovixAtomControl;
+class CTqovixAudioDataControlMac;
+
+struct SoundInterval {
+    uint64_t start = 0;  // frames of the stream, end exclusive
+    uint64_t end = 0;
+    uint16_t strength = 0;  // per mille
+};
+
+class SoundStream {
+public:
+    SoundStream();
+    ~SoundStream();
+    SoundStream(const SoundStream&) = delete;
+    SoundStream& operator=(const SoundStream&) = delete;
+
+    // Empty on success, else why the movie's sound cannot be read.
+    std::string Open(const std::string& path);
+    uint32_t Rate() const { return m_rate; }
+    uint32_t Channels() const { return m_channels; }
+    uint64_t Frames() const { return m_frames; }
+    bool IsAac() const { return m_bAac; }
+    // The AF intervals of the "AFR1" maker block, on this stream's frames; none for a foreign block.
+    const std::vector<SoundInterval>& Intervals() const { return m_intervals; }
+    // Up to `frames` interleaved frames; fewer only at the end.
+    uint64_t Read(int16_t* samples, uint64_t frames);
+
+private:
+    std::unique_ptr<CTqovixFile> m_file;
+    std::unique_ptr<CTqovixAtomControl> m_tree;
+    std::unique_ptr<CTqovixAudioDataControlMac> m_audio;
+    uint32_t m_rate = 0;
+    uint32_t m_channels = 0;
+    uint64_t m_frames = 0;
+    uint64_t m_position = 0;
+    bool m_bAac = false;
+    std::vector<SoundInterval> m_intervals;
+};
