@@ -121,8 +121,8 @@ std::string CompareSounds(const std::string& sourcePath, const std::string& dest
             for (size_t i = 0; i < intervals.size(); ++i) {
                 if (frame >= intervals[i].start && frame < intervals[i].end) {
                     for (uint32_t c = 0; c < result.channels; ++c) {
-                        before[i] += double{x[c]} * x[c];
-                        after[i] += double{y[c]} * y[c];
+                        before[i] += static_cast<double>(x[c]) * x[c];
+                        after[i] += static_cast<double>(y[c]) * y[c];
                     }
                     counted[i] += result.channels;
                 }
