@@ -1,11 +1,13 @@
 // tqovix as people run it: the built tool in a child process, judged by its exit status and
 // what it prints; Ctrl-C through a real terminal (tmux).
+#include "MakerInjector.h"
 #include "Movie.h"
 #include "support/TestSupport.h"
 
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <cmath>
 #include <chrono>
 #include <filesystem>
 #include <fstream>
@@ -184,6 +186,116 @@ TEST(CliTerminalTest, CtrlCAbortsAJob)
     EXPECT_EQ(testsupport::ReadFile(status), (std::vector<uint8_t>{'1', '3', '0', '\n'})) << screen();
     EXPECT_FALSE(Exists(destination));
     EXPECT_NE(screen().find("aborted"), std::string::npos) << screen();
+}
+
+}  // namespace
+
+namespace {
+
+// Every number that follows `key` in a JSON text.
+std::vector<double> Numbers(const std::string& json, const std::string& key)
+{
+    std::vector<double> values;
+    const std::string quoted = "\"" + key + "\":";
+    for (size_t at = json.find(quoted); at != std::string::npos; at = json.find(quoted, at + 1)) {
+        values.push_back(std::stod(json.substr(at + quoted.size())));
+    }
+    return values;
+}
+
+// compare on what a job did: the removal measured per interval, nothing else moved, no offset,
+// the picture where the intervals lie; and a clear refusal for a movie that is no such result.
+TEST(CliCompareTest, MeasuresDrawsAndRefuses)
+{
+    TempDir dir;
+    const std::string source = dir.File("src.mov");
+    const std::string processed = dir.File("dst.mov");
+    ASSERT_EQ(Tool("make-sample " + Q(source) + " --seconds 4").status, 0);
+    ASSERT_EQ(Tool("process " + Q(source) + " " + Q(processed) + " --quiet").status, 0);
+
+    const Outcome measured = Tool("compare " + Q(source) + " " + Q(processed) + " --json --png " +
+                                  Q(dir.File("picture.png")));
+    ASSERT_EQ(measured.status, 0) << measured.output;
+    const std::vector<double> reductions = Numbers(measured.output, "reductionDb");
+    ASSERT_EQ(reductions.size(), 2u) << measured.output;
+    for (double reduction : reductions) {
+        // The shelf takes the motor band down by up to 24 dB; on the sample's broadband bursts
+        // that is a few dB of the whole level.
+        EXPECT_GT(reduction, 3.0) << measured.output;
+    }
+    EXPECT_EQ(Numbers(measured.output, "differingFrames"), std::vector<double>{0}) << "PCM outside the intervals";
+    EXPECT_EQ(Numbers(measured.output, "offsetFrames"), std::vector<double>{0});
+
+    const Outcome itself = Tool("compare " + Q(source) + " " + Q(source) + " --json");
+    ASSERT_EQ(itself.status, 0) << itself.output;
+    EXPECT_EQ(Numbers(itself.output, "reductionDb"), (std::vector<double>{0, 0}));
+    EXPECT_EQ(Numbers(itself.output, "largestDifference"), std::vector<double>{0});
+
+    // The picture: its size, and the marks above the source panel exactly over the intervals.
+    std::string size;
+    testsupport::RunCommand("ffprobe -v error -show_entries stream=width,height -of csv=p=0 " +
+                                Q(dir.File("picture.png")),
+                            &size);
+    EXPECT_EQ(size, "1600,900\n");
+    const std::string raw = dir.File("picture.rgb");
+    ASSERT_EQ(testsupport::RunCommand("ffmpeg -v error -nostdin -i " + Q(dir.File("picture.png")) +
+                                          " -f rawvideo -pix_fmt rgb24 " + Q(raw),
+                                      &size),
+              0);
+    const std::vector<uint8_t> pixels = testsupport::ReadFile(raw);
+    ASSERT_EQ(pixels.size(), 1600u * 900u * 3u);
+    const double frames = Numbers(measured.output, "frames").at(0);
+    const double perColumn = std::ceil(frames / 1400);
+    const auto marked = [&](double frame) {
+        const size_t x = 90 + static_cast<size_t>(frame / perColumn);
+        const size_t y = 40 - 8 + 2;  // inside the mark strip above the source panel
+        const uint8_t* p = pixels.data() + (y * 1600 + x) * 3;
+        return p[0] == 0x40 && p[1] == 0xC0 && p[2] == 0xFF;
+    };
+    const std::vector<double> starts = Numbers(measured.output, "startFrame");
+    const std::vector<double> ends = Numbers(measured.output, "endFrame");
+    ASSERT_EQ(starts.size(), 2u);
+    for (size_t i = 0; i < starts.size(); ++i) {
+        EXPECT_TRUE(marked((starts[i] + ends[i]) / 2)) << "interval " << i;
+        EXPECT_FALSE(marked(starts[i] - 3 * perColumn)) << "before interval " << i;
+        EXPECT_FALSE(marked(ends[i] + 3 * perColumn)) << "after interval " << i;
+    }
+
+    // Not the processed form of the source: another movie, or no movie at all.
+    const std::string other = dir.File("other.mov");
+    ASSERT_EQ(Tool("make-sample " + Q(other) + " --seconds 3").status, 0);
+    const Outcome different = Tool("compare " + Q(source) + " " + Q(other));
+    EXPECT_EQ(different.status, 1);
+    EXPECT_NE(different.output.find("not the processed form"), std::string::npos) << different.output;
+    const std::string text = dir.File("notes.txt");
+    std::ofstream(text) << "not a movie\n";
+    const Outcome none = Tool("compare " + Q(source) + " " + Q(text));
+    EXPECT_EQ(none.status, 1);
+    EXPECT_NE(none.output.find("notes.txt: not a movie"), std::string::npos) << none.output;
+}
+
+// AAC re-encoded by a job: no offset against the source, and a close match outside the intervals.
+TEST(CliCompareTest, AacDestinationsMatchTheirSourceWithoutOffset)
+{
+    TempDir dir;
+    const std::string source = dir.File("src.mov");
+    std::string output;
+    ASSERT_EQ(testsupport::RunCommand("ffmpeg -v error -nostdin -f lavfi -i testsrc=size=64x36:rate=30:d=3 -f lavfi "
+                                      "-i \"aevalsrc='0.3*sin(2*PI*(180*t+260*t*t))':s=48000:d=3\" -map 0:v -map 1:a "
+                                      "-c:v mjpeg -c:a aac -ac 2 " + Q(source) + " 2>&1",
+                                      &output),
+              0)
+        << output;
+    Recipe recipe;
+    recipe.maker.afIntervals = std::vector<moviekit::AfInterval>{{48000, 72000, 1000}};
+    std::string error;
+    ASSERT_TRUE(moviekit::AddMakerData(source, recipe, 3 * 48000, &error)) << error;
+    const std::string processed = dir.File("dst.mov");
+    ASSERT_EQ(Tool("process " + Q(source) + " " + Q(processed) + " --quiet").status, 0);
+    const Outcome measured = Tool("compare " + Q(source) + " " + Q(processed) + " --json");
+    ASSERT_EQ(measured.status, 0) << measured.output;
+    EXPECT_EQ(Numbers(measured.output, "offsetFrames"), std::vector<double>{0}) << measured.output;
+    EXPECT_GT(Numbers(measured.output, "correlation").at(0), 0.99) << measured.output;
 }
 
 }  // namespace

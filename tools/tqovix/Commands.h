@@ -11,6 +11,7 @@ int MakeSampleCommand(const Arguments& arguments);
 int CheckCommand(const Arguments& arguments);
 int ProcessCommand(const Arguments& arguments);
 int BatchCommand(const Arguments& arguments);
+int CompareCommand(Arguments arguments);
 
 // A sentence for an internal result code, for people reading a terminal.
 std::string DescribeInternalCode(int code);

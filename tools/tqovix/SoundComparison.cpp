@@ -7,7 +7,7 @@ namespace {
 
 constexpr uint64_t kBlockFrames = 4096;
 constexpr int64_t kMaxOffset = 2048;       // more than any codec's delay
-constexpr uint64_t kWindowFrames = 16384;  // the stretch the offset is measured on
+constexpr uint64_t kWindowFrames = 8192;  // the stretch the offset is measured on
 constexpr double kSilenceDb = -120.0;
 
 double Decibels(double sumOfSquares, uint64_t count)
@@ -57,7 +57,9 @@ std::string MeasureOffset(const std::string& sourcePath, const std::string& dest
     const auto from = static_cast<int64_t>(std::min<uint64_t>(na, kMaxOffset));
     const auto to = static_cast<int64_t>(na);
     double best = -2;
-    for (int64_t lag = -kMaxOffset; lag <= kMaxOffset; ++lag) {
+    // Nearest lags first, so that a periodic sound (a tone) matches at the smallest lag that fits.
+    for (int64_t step = 0; step <= 2 * kMaxOffset; ++step) {
+        const int64_t lag = step % 2 == 0 ? step / 2 : -(step + 1) / 2;
         double ab = 0;
         double aa = 0;
         double bb = 0;
@@ -69,7 +71,7 @@ std::string MeasureOffset(const std::string& sourcePath, const std::string& dest
             }
         }
         const double c = aa > 0 && bb > 0 ? ab / std::sqrt(aa * bb) : (aa == 0 && bb == 0 && lag == 0 ? 1.0 : 0.0);
-        if (c > best) {
+        if (c > best + 1e-9) {
             best = c;
             result.offset = lag;
         }

@@ -15,6 +15,7 @@ constexpr const char* kUsage =
     "  batch -o OUTDIR FILE...    process many movies, several at a time\n"
     "  inspect FILE [--json]      atom tree, tracks, trim tags and maker data of a movie\n"
     "  make-sample DST [opts]     write a camera-style movie to try the others on\n"
+    "  compare SRC DST [opts]     measure and draw what processing did to the sound\n"
     "\n"
     "  tqovix COMMAND --help      the options of a command\n"
     "\n"
@@ -47,6 +48,9 @@ int main(int argc, char** argv)
     }
     if (std::strcmp(argv[1], "batch") == 0) {
         return BatchCommand(arguments);
+    }
+    if (std::strcmp(argv[1], "compare") == 0) {
+        return CompareCommand(arguments);
     }
     std::fprintf(stderr, "tqovix: unknown command '%s'\n%s", argv[1], kUsage);
     return 2;

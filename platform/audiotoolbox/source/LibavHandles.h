@@ -11,6 +11,7 @@ extern "C" {
 #include <libavutil/channel_layout.h>
 #include <libavutil/frame.h>
 #include <libavutil/log.h>
+#include <libavutil/tx.h>
 #include <libswresample/swresample.h>
 }
 
@@ -27,6 +28,8 @@ struct LibavApi {
     decltype(&::av_log_set_level) av_log_set_level;
     decltype(&::av_mallocz) av_mallocz;
     decltype(&::av_new_packet) av_new_packet;
+    decltype(&::av_tx_init) av_tx_init;
+    decltype(&::av_tx_uninit) av_tx_uninit;
     decltype(&::av_packet_alloc) av_packet_alloc;
     decltype(&::av_packet_free) av_packet_free;
     decltype(&::av_packet_unref) av_packet_unref;

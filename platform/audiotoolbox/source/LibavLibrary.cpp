@@ -37,7 +37,8 @@ bool Load(LibavApi* api)
            ATCOMPAT_RESOLVE(util, av_frame_alloc) && ATCOMPAT_RESOLVE(util, av_frame_free) &&
            ATCOMPAT_RESOLVE(util, av_frame_get_buffer) && ATCOMPAT_RESOLVE(util, av_frame_make_writable) &&
            ATCOMPAT_RESOLVE(util, av_frame_unref) && ATCOMPAT_RESOLVE(util, av_log_set_level) &&
-           ATCOMPAT_RESOLVE(util, av_mallocz) && ATCOMPAT_RESOLVE(codec, av_new_packet) &&
+           ATCOMPAT_RESOLVE(util, av_mallocz) && ATCOMPAT_RESOLVE(util, av_tx_init) &&
+           ATCOMPAT_RESOLVE(util, av_tx_uninit) && ATCOMPAT_RESOLVE(codec, av_new_packet) &&
            ATCOMPAT_RESOLVE(codec, av_packet_alloc) && ATCOMPAT_RESOLVE(codec, av_packet_free) &&
            ATCOMPAT_RESOLVE(codec, av_packet_unref) && ATCOMPAT_RESOLVE(codec, avcodec_alloc_context3) &&
            ATCOMPAT_RESOLVE(codec, avcodec_find_decoder) && ATCOMPAT_RESOLVE(codec, avcodec_find_encoder) &&

@@ -1,0 +1,133 @@
+// tqovix compare: what a job did to the sound, measured and drawn. Both sounds are decoded
+// through our own pipeline and compared frame for frame, streaming.
+#include <cinttypes>
+#include <cstdio>
+#include <string>
+
+#include "Commands.h"
+#include "SoundComparison.h"
+#include "Spectrogram.h"
+
+namespace {
+
+constexpr const char* kUsage =
+    "usage: tqovix compare SRC DST [--png FILE] [--json]\n"
+    "  measures what processing did to SRC's sound in DST: per AF interval the level before\n"
+    "  and after and the reduction, elsewhere how many frames differ (PCM: none should) or\n"
+    "  the largest difference (AAC), and DST's offset against SRC in frames; --png draws both\n"
+    "  spectrograms with the AF intervals and the level difference over time\n"
+    "  exit status: 0 compared, 1 DST is not the processed form of SRC (or unreadable), 2 usage\n";
+
+double Seconds(uint64_t frame, uint32_t rate) { return static_cast<double>(frame) / rate; }
+
+void PrintJson(const std::string& source, const std::string& destination, const SoundComparison& c,
+               const std::string& png)
+{
+    std::printf("{\"version\":1,\"source\":%s,\"destination\":%s,\"rate\":%u,\"channels\":%u,\"frames\":%" PRIu64
+                ",\"codec\":\"%s\",\"intervals\":[",
+                JsonString(source).c_str(), JsonString(destination).c_str(), c.rate, c.channels, c.frames,
+                c.aac ? "aac" : "pcm");
+    for (size_t i = 0; i < c.intervals.size(); ++i) {
+        const IntervalLevels& l = c.intervals[i];
+        std::printf("%s{\"startFrame\":%" PRIu64 ",\"endFrame\":%" PRIu64
+                    ",\"start\":%.3f,\"end\":%.3f,\"beforeDb\":%.2f,\"afterDb\":%.2f,\"reductionDb\":%.2f}",
+                    i ? "," : "", l.interval.start, l.interval.end, Seconds(l.interval.start, c.rate),
+                    Seconds(l.interval.end, c.rate), l.beforeDb, l.afterDb, l.beforeDb - l.afterDb);
+    }
+    std::printf("],\"outside\":{\"differingFrames\":%" PRIu64 ",\"largestDifference\":%d},\"offsetFrames\":%" PRId64
+                ",\"correlation\":%.4f,\"png\":%s}\n",
+                c.differingFrames, c.largestDifference, c.offset, c.correlation,
+                png.empty() ? "null" : JsonString(png).c_str());
+}
+
+void PrintText(const std::string& source, const std::string& destination, const SoundComparison& c,
+               const std::string& png)
+{
+    std::printf("%s -> %s: %s, %u Hz, %u channels, %.3f s\n", source.c_str(), destination.c_str(),
+                c.aac ? "AAC" : "PCM", c.rate, c.channels, Seconds(c.frames, c.rate));
+    for (size_t i = 0; i < c.intervals.size(); ++i) {
+        const IntervalLevels& l = c.intervals[i];
+        std::printf("  AF interval %zu: %.3f-%.3f s  before %.1f dB  after %.1f dB  reduction %.1f dB\n", i + 1,
+                    Seconds(l.interval.start, c.rate), Seconds(l.interval.end, c.rate), l.beforeDb, l.afterDb,
+                    l.beforeDb - l.afterDb);
+    }
+    if (c.intervals.empty()) {
+        std::printf("  no AF intervals\n");
+    }
+    if (c.aac) {
+        std::printf("  outside the intervals: largest difference %d (re-encoded)\n", c.largestDifference);
+    } else {
+        std::printf("  outside the intervals: %" PRIu64 " frames differ\n", c.differingFrames);
+    }
+    std::printf("  offset: %" PRId64 " frames (correlation %.4f)\n", c.offset, c.correlation);
+    if (!png.empty()) {
+        std::printf("  picture: %s\n", png.c_str());
+    }
+}
+
+}  // namespace
+
+int CompareCommand(Arguments arguments)
+{
+    bool json = false;
+    std::string png;
+    Arguments paths;
+    for (size_t i = 0; i < arguments.size(); ++i) {
+        const std::string& a = arguments[i];
+        if (a == "--help" || a == "-h") {
+            std::fputs(kUsage, stdout);
+            return 0;
+        }
+        if (a == "--json") {
+            json = true;
+        } else if (a == "--png" && i + 1 < arguments.size()) {
+            png = arguments[++i];
+        } else if (a.starts_with("--png=")) {
+            png = a.substr(6);
+        } else if (a.starts_with("-")) {
+            std::fprintf(stderr, "tqovix compare: unknown option '%s'\n%s", a.c_str(), kUsage);
+            return 2;
+        } else {
+            paths.push_back(a);
+        }
+    }
+    if (paths.size() != 2) {
+        std::fputs(kUsage, stderr);
+        return 2;
+    }
+    // The picture needs the sound's shape before the first block: open it once to learn it.
+    Spectrogram picture;
+    bool drawing = false;
+    if (!png.empty()) {
+        SoundStream probe;
+        if (const std::string why = probe.Open(paths[0]); !why.empty()) {
+            std::fprintf(stderr, "tqovix compare: %s: %s\n", paths[0].c_str(), why.c_str());
+            return 1;
+        }
+        if (const std::string why = picture.Begin(probe.Rate(), probe.Channels(), probe.Frames(), probe.Intervals());
+            !why.empty()) {
+            std::fprintf(stderr, "tqovix compare: no picture: %s\n", why.c_str());
+            return 1;
+        }
+        drawing = true;
+    }
+    SoundComparison comparison;
+    const std::string why = CompareSounds(paths[0], paths[1], comparison,
+                                          [&](const int16_t* a, const int16_t* b, uint64_t first, uint64_t frames) {
+                                              if (drawing) {
+                                                  picture.Add(a, b, first, frames);
+                                              }
+                                          });
+    if (!why.empty()) {
+        std::fprintf(stderr, "tqovix compare: %s\n", why.c_str());
+        return 1;
+    }
+    if (drawing) {
+        if (const std::string failed = picture.Save(png); !failed.empty()) {
+            std::fprintf(stderr, "tqovix compare: %s\n", failed.c_str());
+            return 1;
+        }
+    }
+    (json ? PrintJson : PrintText)(paths[0], paths[1], comparison, png);
+    return 0;
+}
