@@ -123,7 +123,7 @@ TEST_F(EngineTest, SessionEndsReportedByTheLibrary)
         int hostAnswer;  // heard only while the library reports no end of its own
     };
     const std::vector<Row> rows = {
-        {"verdict 8 keeps the destination", ovix::kVerdictNotAfBlock, kOk, {1}, eTqovixVerdict8, true, 131},
+        {"verdict 8 publishes nothing", ovix::kVerdictNotAfBlock, kOk, {1}, eTqovixVerdict8, false, 131},
         {"library failure", ovix::kFailure, kOk, {1}, eTqovixErrorGeneral, false, 131},
         {"empty processed AF information", 1, kOk, {}, eTqovixErrorInternal, false, 131},
         {"processed AF information unreadable", 1, ovix::kOutOfMemory, {1}, eTqovixErrorOutOfMemory, false, 131},

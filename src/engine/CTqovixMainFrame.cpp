@@ -64,11 +64,9 @@ void CTqovixMainFrame::Close()
         // Returns only when the library's thread has left every callback for good.
         ovixbridge::TqovixLibraryClose();
         if (m_progressDataControl.GetErrorResult() == eTqovixRunning) {
-            // The library stopped before a callback could see the request: end the job here.
+            // The library stopped before a callback could see the request: end the job here
+            // (the unfinished destination, never named, goes with the controller).
             m_movControl.Close();
-            if (!m_destinationPath.empty()) {
-                CTqovixFile::Delete(m_destinationPath.data());
-            }
             m_destinationPath.clear();
             m_progressDataControl.SetFinished(eTqovixErrorAborted);
         }
@@ -136,14 +134,11 @@ eTqovixErrorCode CTqovixMainFrame::Execute(const char* sourcePath, const char* d
     return result;
 }
 
-void CTqovixMainFrame::FailStart(eTqovixErrorCode code, const char* sourcePath, const char* destinationPath)
+void CTqovixMainFrame::FailStart(eTqovixErrorCode code, const char*, const char*)
 {
+    // What stands at the destination's path was never touched: the job wrote under no name.
     m_movControl.Close();
     m_progressDataControl.SetFinished(code);
-    // A destination that is the source under another name was never ours to remove.
-    if (sourcePath == nullptr || !CTqovixUtil::IsSameFile(sourcePath, destinationPath)) {
-        CTqovixFile::Delete(destinationPath);
-    }
 }
 
 void CTqovixMainFrame::Abort()
@@ -162,11 +157,15 @@ void CTqovixMainFrame::Abort(eTqovixErrorCode code)
 
 void CTqovixMainFrame::CloseSession(eTqovixErrorCode code)
 {
+    // Only a complete movie takes the destination's name; every other ending leaves the path as
+    // it was, and the unnamed file goes with the controller.
+    if (code == eTqovixFinished) {
+        const eTqovixErrorCode published =
+            m_movControl.IsDestinationComplete() ? m_movControl.PublishDestination() : eTqovixErrorInternal;
+        code = TqovixFailed(published) ? published : code;
+    }
     StartCloseThread(code);
     m_movControl.Close();
-    if (TqovixFailed(code) && !m_destinationPath.empty()) {
-        CTqovixFile::Delete(m_destinationPath.data());
-    }
     m_destinationPath.clear();
     m_progressDataControl.SetFinished(code);
 }

@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <cstring>
 #include <new>
+#include <fcntl.h>
 #include <libgen.h>
 #include <linux/fs.h>
 #include <linux/magic.h>
@@ -70,6 +71,24 @@ const char* FileSystemTypeName(uint32_t magic)
 
 std::atomic<TqovixVolumeQuery> g_volumeQuery{&CTqovixFile::QueryVolume};
 std::atomic<TqovixFaultHook> g_faultHook{nullptr};
+
+std::atomic<bool> g_bUnnamedDestinations{true};
+
+std::string DirectoryOf(const std::string& path)
+{
+    const size_t slash = path.rfind('/');
+    return slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
+}
+
+// ".NAME.PID-N.tqovix-partial" beside `path`: hidden, and plainly ours.
+std::string PartialNameFor(const std::string& path)
+{
+    static std::atomic<unsigned> s_counter{0};
+    const size_t slash = path.rfind('/');
+    const std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
+    return DirectoryOf(path) + "/." + name + "." + std::to_string(getpid()) + "-" + std::to_string(++s_counter) +
+           CTqovixFile::kPartialSuffix;
+}
 
 int InjectedFault(eTqovixFileOperation operation)
 {
@@ -140,8 +159,105 @@ void CTqovixFile::Close()
         std::fclose(m_stream);
         m_stream = nullptr;
     }
+    // An unnamed destination vanishes with its descriptor; a hidden one is removed.
+    if (m_bUnpublished && !m_partialPath.empty()) {
+        unlink(m_partialPath.c_str());
+    }
+    m_bUnpublished = false;
+    m_partialPath.clear();
+    m_finalPath.clear();
     m_buffer.reset();
     m_bOpened = false;
+}
+
+eTqovixErrorCode CTqovixFile::OpenDestination(const char* path)
+{
+    if (m_bOpened) {
+        return eTqovixErrorInternal;
+    }
+    if (IsEmptyPath(path)) {
+        return eTqovixErrorGeneral;
+    }
+    const std::string finalPath = path;
+    struct stat status {};
+    if (stat(path, &status) == 0 && S_ISDIR(status.st_mode)) {
+        return eTqovixErrorIsDirectory;
+    }
+    int descriptor = -1;
+    if (g_bUnnamedDestinations.load()) {
+        descriptor = open(DirectoryOf(finalPath).c_str(), O_TMPFILE | O_RDWR | O_CLOEXEC, 0666);
+    }
+    std::string partial;
+    if (descriptor < 0) {
+        // No unnamed files here (or not wanted): a hidden name that says what it is.
+        partial = PartialNameFor(finalPath);
+        descriptor = open(partial.c_str(), O_CREAT | O_EXCL | O_RDWR | O_CLOEXEC, 0666);
+        if (descriptor < 0) {
+            return ConvertErrnoToLocalError(errno, false);
+        }
+    }
+    FILE* stream = fdopen(descriptor, "w+");
+    if (stream == nullptr) {
+        const int error = errno;
+        close(descriptor);
+        if (!partial.empty()) {
+            unlink(partial.c_str());
+        }
+        return ConvertErrnoToLocalError(error, false);
+    }
+    m_buffer.reset(new (std::nothrow) char[kStreamBuffer]);
+    if (m_buffer != nullptr) {
+        setvbuf(stream, m_buffer.get(), _IOFBF, kStreamBuffer);
+    }
+    m_stream = stream;
+    m_bOpened = true;
+    m_bReadOnly = false;
+    m_finalPath = finalPath;
+    m_partialPath = partial;
+    m_bUnpublished = true;
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixFile::Publish(bool durable)
+{
+    if (!m_bUnpublished || m_stream == nullptr) {
+        return eTqovixErrorInternal;
+    }
+    eTqovixErrorCode result = Flush();
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    const int descriptor = fileno(m_stream);
+    if (durable && fsync(descriptor) != 0) {
+        return ConvertErrnoToLocalError(errno, false);
+    }
+    if (m_partialPath.empty()) {
+        // An unnamed file gets a hidden name first: a name can only replace another by rename.
+        const std::string hidden = PartialNameFor(m_finalPath);
+        const std::string self = "/proc/self/fd/" + std::to_string(descriptor);
+        if (linkat(AT_FDCWD, self.c_str(), AT_FDCWD, hidden.c_str(), AT_SYMLINK_FOLLOW) != 0) {
+            return ConvertErrnoToLocalError(errno, false);
+        }
+        m_partialPath = hidden;
+    }
+    if (rename(m_partialPath.c_str(), m_finalPath.c_str()) != 0) {
+        return ConvertErrnoToLocalError(errno, false);
+    }
+    m_partialPath.clear();
+    m_bUnpublished = false;
+    if (durable) {
+        const int directoryDescriptor = open(DirectoryOf(m_finalPath).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+        if (directoryDescriptor >= 0) {
+            result = fsync(directoryDescriptor) == 0 ? eTqovixSuccess : ConvertErrnoToLocalError(errno, false);
+            close(directoryDescriptor);
+        }
+    }
+    return result;
+}
+
+bool CTqovixFile::SetUnnamedDestinations(bool enabled)
+{
+    return g_bUnnamedDestinations.exchange(enabled);
 }
 
 eTqovixErrorCode CTqovixFile::Read(void* buffer, unsigned int* readSize, unsigned int size)

@@ -37,6 +37,15 @@ public:
     CTqovixFile& operator=(const CTqovixFile&) = delete;
 
     eTqovixErrorCode Open(const char* path, int mode);
+    // A destination that has no name yet: an unnamed file in `path`'s directory where the file
+    // system allows it, else a hidden one named ".NAME.ID" + kPartialSuffix there. It takes
+    // `path` only through Publish; closing it unpublished removes it, and a process killed
+    // meanwhile leaves nothing (or the recognisable hidden file) behind. `path` is not touched.
+    eTqovixErrorCode OpenDestination(const char* path);
+    // Flushes, then gives the destination its name, replacing what stood there in one step.
+    // `durable`: the data, then the directory entry, reach the device first.
+    eTqovixErrorCode Publish(bool durable);
+    // Closes; an unpublished destination is removed with it.
     void Close();
     bool IsOpened() const { return m_bOpened; }
 
@@ -79,6 +88,11 @@ public:
     static bool QueryVolume(const char* directory, TqovixVolumeInformation* information);
     // Installs a fault seam (null removes it); returns the previous one.
     static TqovixFaultHook SetFaultHook(TqovixFaultHook hook);
+    // Off: destinations are hidden named files even where unnamed ones are possible (tests
+    // of the fallback). Returns the previous setting.
+    static bool SetUnnamedDestinations(bool enabled);
+    // What ends the name of a destination not yet given its name.
+    static constexpr const char* kPartialSuffix = ".tqovix-partial";
 
 private:
     // fflush alone: the kernel copy must not count as a flush for the fault seam.
@@ -87,6 +101,9 @@ private:
     bool m_bOpened = false;
     bool m_bReadOnly = true;
     bool m_bKernelCopyRefused = false;  // asked once per destination, not once per chunk
+    std::string m_finalPath;      // a destination's name to be, until Publish gives it
+    std::string m_partialPath;    // its hidden name meanwhile, when it has one
+    bool m_bUnpublished = false;  // a destination not published yet
     FILE* m_stream = nullptr;
     std::unique_ptr<char[]> m_buffer;  // the stream's; outlives it
 };

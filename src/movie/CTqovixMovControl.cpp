@@ -14,7 +14,6 @@
 namespace {
 
 constexpr int kOpenRead = 1;
-constexpr int kOpenWrite = 2;
 
 eTqovixErrorCode CopyBlock(std::vector<uint8_t>& target, const uint8_t* data, uint64_t size)
 {
@@ -139,7 +138,8 @@ eTqovixErrorCode CTqovixMovControl::InitializeDestination(const char* sourcePath
     if (TqovixFailed(result)) {
         return result;
     }
-    return m_destinationFile.Open(destinationPath, kOpenWrite);
+    // Written under no name; the name is given only to a complete movie (PublishDestination).
+    return m_destinationFile.OpenDestination(destinationPath);
 }
 
 void CTqovixMovControl::Close()

@@ -56,6 +56,8 @@ public:
     bool IsMediaDataComplete() const;
     // The finishing step has written the moov and the media data size.
     bool IsDestinationComplete() const { return m_bDestinationComplete; }
+    // Gives the complete destination its name, replacing what stood there in one step.
+    eTqovixErrorCode PublishDestination() { return m_destinationFile.Publish(false); }
     // True once after EncodeCallback has written the last packet. The job is finished
     // only after the encoder has returned, so that no codec is closed under its own feet.
     bool TakeFinishPending();
