@@ -1,5 +1,5 @@
 // tqovix process: one job through the exported interface, with a progress display and
-// Ctrl-C turned into an orderly abort (the library then deletes the destination).
+// Ctrl-C turned into an orderly abort (the destination's path is then left as it was).
 #include <algorithm>
 #include <chrono>
 #include <csignal>
@@ -7,6 +7,9 @@
 #include <cstdio>
 #include <string>
 #include <sys/ioctl.h>
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <thread>
 #include <unistd.h>
@@ -17,13 +20,14 @@
 namespace {
 
 constexpr const char* kUsage =
-    "usage: tqovix process SRC DST [--force] [--quiet] [--json]\n"
+    "usage: tqovix process SRC DST [--force] [--quiet] [--json] [--sync]\n"
     "  removes the AF noise from the sound of SRC and writes the result to DST\n"
-    "  --force   overwrite an existing DST\n"
+    "  --force   overwrite an existing DST (it is replaced only by a complete movie)\n"
     "  --quiet   no progress and no \"done\" line\n"
     "  --json    print one JSON object with the outcome instead of text\n"
-    "  Ctrl-C aborts the job; DST is then removed. Exit status: 0 done, 1 failed,\n"
-    "  2 usage error or DST exists, 130 aborted\n";
+    "  --sync    make DST durable (on the device, not only in the page cache) before exiting\n"
+    "  DST appears only when complete; a failed or aborted job (Ctrl-C) leaves it as it was.\n"
+    "  Exit status: 0 done, 1 failed, 2 usage error or DST exists, 130 aborted\n";
 
 // Short, so that a job of a tenth of a second is not reported up to 50 ms late; the view
 // is redrawn less often.
@@ -126,6 +130,7 @@ struct Options {
     bool force = false;
     bool quiet = false;
     bool json = false;
+    bool sync = false;
 };
 
 // 0 when the arguments are complete, otherwise the exit status (0 too for --help, via `done`).
@@ -144,6 +149,8 @@ int Parse(const Arguments& arguments, Options& options, bool& done)
             options.quiet = true;
         } else if (argument == "--json") {
             options.json = true;
+        } else if (argument == "--sync") {
+            options.sync = true;
         } else if (argument.size() > 1 && argument[0] == '-') {
             std::fprintf(stderr, "tqovix process: unknown option '%s'\n%s", argument.c_str(), kUsage);
             return 2;
@@ -158,6 +165,27 @@ int Parse(const Arguments& arguments, Options& options, bool& done)
     options.source = paths[0];
     options.destination = paths[1];
     return 0;
+}
+
+// fsync of the file, then of its directory: the name and the bytes both reach the device.
+bool SyncFile(const std::string& path)
+{
+    const int file = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (file < 0 || fsync(file) != 0) {
+        if (file >= 0) {
+            close(file);
+        }
+        return false;
+    }
+    close(file);
+    const size_t slash = path.rfind('/');
+    const std::string directory = slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
+    const int folder = open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    const bool synced = folder >= 0 && fsync(folder) == 0;
+    if (folder >= 0) {
+        close(folder);
+    }
+    return synced;
 }
 
 void Report(const Options& options, const char* result, const std::string& message, double seconds)
@@ -176,6 +204,7 @@ int ProcessCommand(const Arguments& arguments)
     if (const int status = Parse(arguments, options, done); status != 0 || done) {
         return status;
     }
+    RemoveStalePartials(options.destination);
     struct stat info{};
     if (!options.force && lstat(options.destination.c_str(), &info) == 0) {
         const std::string message = "destination exists (use --force to overwrite it)";
@@ -200,7 +229,6 @@ int ProcessCommand(const Arguments& arguments)
     if (code == 0) {
         code = TqExecuteOVIX(options.source.c_str(), options.destination.c_str());
     }
-    const bool started = code == 0;
     double abortedAt = -1;
     double drawnAt = -kRedrawSeconds;
     while (code == 0) {
@@ -236,10 +264,10 @@ int ProcessCommand(const Arguments& arguments)
     }
     view.Close();
     TqCloseOVIX();
-    // The library keeps what a job wrote when the processing library itself refused the
-    // sound (a verdict, not an error); a user asked for a finished movie or none.
-    if (started && code != 0) {
-        unlink(options.destination.c_str());
+    if (code == 0 && options.sync && !SyncFile(options.destination)) {
+        std::fprintf(stderr, "tqovix: %s: cannot be made durable: %s\n", options.destination.c_str(),
+                     std::strerror(errno));
+        code = 190;
     }
 
     const std::string message = code == 0 ? "done" : DescribeResult(code);
