@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <fstream>
 #include <iterator>
+#include <optional>
 
 namespace jobtest {
 
@@ -47,14 +48,15 @@ std::vector<Box> Children(const Bytes& b, uint64_t begin, uint64_t end)
     return boxes;
 }
 
-const Box* Find(const std::vector<Box>& boxes, const std::string& type)
+// A copy: the lists boxes are found in are often temporaries.
+std::optional<Box> Find(const std::vector<Box>& boxes, const std::string& type)
 {
     for (const Box& box : boxes) {
         if (box.type == type) {
-            return &box;
+            return box;
         }
     }
-    return nullptr;
+    return std::nullopt;
 }
 
 bool Fail(std::string* reason, const std::string& text)
@@ -67,37 +69,37 @@ bool Fail(std::string* reason, const std::string& text)
 
 bool ReadTrack(const Bytes& b, const Box& trak, TrackChunks& track, bool& inFile, std::string* reason)
 {
-    const Box* mdia = Find(Children(b, trak.begin, trak.end), "mdia");
-    if (mdia == nullptr) {
+    const std::optional<Box> mdia = Find(Children(b, trak.begin, trak.end), "mdia");
+    if (!mdia) {
         return Fail(reason, "trak without mdia");
     }
     const std::vector<Box> media = Children(b, mdia->begin, mdia->end);
-    const Box* hdlr = Find(media, "hdlr");
-    const Box* minf = Find(media, "minf");
-    if (hdlr == nullptr || minf == nullptr) {
+    const std::optional<Box> hdlr = Find(media, "hdlr");
+    const std::optional<Box> minf = Find(media, "minf");
+    if (!hdlr || !minf) {
         return Fail(reason, "trak without hdlr or minf");
     }
     track.handler = std::string(b.begin() + static_cast<long>(hdlr->begin + 8), b.begin() + static_cast<long>(hdlr->begin + 12));
     const std::vector<Box> info = Children(b, minf->begin, minf->end);
     inFile = true;
-    if (const Box* dinf = Find(info, "dinf")) {
-        if (const Box* dref = Find(Children(b, dinf->begin, dinf->end), "dref")) {
+    if (const std::optional<Box> dinf = Find(info, "dinf")) {
+        if (const std::optional<Box> dref = Find(Children(b, dinf->begin, dinf->end), "dref")) {
             for (const Box& entry : Children(b, dref->begin + 8, dref->end)) {
                 inFile = inFile && (Be(b, entry.begin, 4) & 1) != 0;
             }
         }
     }
-    const Box* stbl = Find(info, "stbl");
-    if (stbl == nullptr) {
+    const std::optional<Box> stbl = Find(info, "stbl");
+    if (!stbl) {
         return Fail(reason, "no stbl");
     }
     const std::vector<Box> tables = Children(b, stbl->begin, stbl->end);
-    const Box* stsd = Find(tables, "stsd");
-    const Box* stsc = Find(tables, "stsc");
-    const Box* stsz = Find(tables, "stsz");
-    const Box* stco = Find(tables, "stco");
-    const Box* co64 = Find(tables, "co64");
-    if (stsd == nullptr || stsc == nullptr || stsz == nullptr || (stco == nullptr) == (co64 == nullptr)) {
+    const std::optional<Box> stsd = Find(tables, "stsd");
+    const std::optional<Box> stsc = Find(tables, "stsc");
+    const std::optional<Box> stsz = Find(tables, "stsz");
+    const std::optional<Box> stco = Find(tables, "stco");
+    const std::optional<Box> co64 = Find(tables, "co64");
+    if (!stsd || !stsc || !stsz || stco.has_value() == co64.has_value()) {
         return Fail(reason, "missing sample table in " + track.handler);
     }
     const uint64_t entry = stsd->begin + 8;
@@ -113,8 +115,8 @@ bool ReadTrack(const Bytes& b, const Box& trak, TrackChunks& track, bool& inFile
     }
     const uint64_t common = Be(b, stsz->begin + 4, 4);
     const uint64_t sampleCount = Be(b, stsz->begin + 8, 4);
-    const Box* offsets = stco != nullptr ? stco : co64;
-    const int width = stco != nullptr ? 4 : 8;
+    const std::optional<Box> offsets = stco ? stco : co64;
+    const int width = stco ? 4 : 8;
     const uint64_t chunkCount = Be(b, offsets->begin + 4, 4);
     const uint64_t runCount = Be(b, stsc->begin + 4, 4);
     uint64_t sample = 0;
@@ -147,10 +149,8 @@ bool ReadTrackChunks(const std::string& path, std::vector<TrackChunks>& tracks, 
 {
     std::ifstream in(path, std::ios::binary);
     const Bytes b((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    const Box* moov = nullptr;
-    const std::vector<Box> top = Children(b, 0, b.size());
-    moov = Find(top, "moov");
-    if (moov == nullptr) {
+    const std::optional<Box> moov = Find(Children(b, 0, b.size()), "moov");
+    if (!moov) {
         return Fail(reason, "no moov");
     }
     for (const Box& trak : Children(b, moov->begin, moov->end)) {
