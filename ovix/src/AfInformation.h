@@ -2,13 +2,15 @@
 // verdict, the AF drive intervals mapped onto a session's frames, and the processed copy.
 #pragma once
 
+#include <ovix/Ovix.h>
+
 #include <cstdint>
 #include <vector>
 
 namespace ovix {
 
 // Larger blocks are refused before anything is allocated for them.
-inline constexpr uint64_t kMaxBlockSize = 16u << 20;
+inline constexpr uint64_t kMaxBlockSize = kOvixMaxBlockSize;
 
 // A stretch of a session's frames where the lens motor ran; strength 0..1.
 struct DriveSpan {

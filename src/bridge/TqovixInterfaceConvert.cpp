@@ -1,5 +1,7 @@
 #include "bridge/TqovixInterfaceConvert.h"
 
+#include <new>
+
 namespace TqovixInterfaceConvert {
 
 InputFunc g_pfnInputAFInformationFunc = nullptr;
@@ -23,13 +25,26 @@ eTqovixErrorCode ConvertVerdict(unsigned long code)
     }
 }
 
+// The processing library's thread runs our callbacks: nothing thrown may unwind into it.
+template <typename Call>
+unsigned long Shielded(Call&& call) noexcept
+{
+    try {
+        return call();
+    } catch (const std::bad_alloc&) {
+        return ovix::kOutOfMemory;
+    } catch (...) {
+        return ovix::kFailure;
+    }
+}
+
 unsigned long CallInput(InputFunc callback, void* buffer, unsigned long* delivered, unsigned long size,
                         unsigned long skip)
 {
     if (callback == nullptr) {
         return ovix::kFailure;
     }
-    return ConvertToLibraryError(callback(buffer, delivered, size, skip));
+    return Shielded([&] { return ConvertToLibraryError(callback(buffer, delivered, size, skip)); });
 }
 
 }  // namespace
@@ -134,13 +149,16 @@ unsigned long OutputAudioFunc(void* data, unsigned long size)
     if (g_pfnOutputAudioFunc == nullptr) {
         return ovix::kFailure;
     }
-    return ConvertToLibraryError(g_pfnOutputAudioFunc(data, size));
+    return Shielded([&] { return ConvertToLibraryError(g_pfnOutputAudioFunc(data, size)); });
 }
 
 void NotifyProgressFunc(unsigned long first, unsigned long second)
 {
     if (g_pfnNotifyProgressFunc != nullptr) {
-        g_pfnNotifyProgressFunc(first, second);
+        Shielded([&] {
+            g_pfnNotifyProgressFunc(first, second);
+            return 0ul;
+        });
     }
 }
 

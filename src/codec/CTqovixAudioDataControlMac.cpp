@@ -59,8 +59,12 @@ eTqovixErrorCode CTqovixAudioDataControlMac::OpenDecoderAAC(const void* audioSpe
     } catch (const std::bad_alloc&) {
         return eTqovixErrorOutOfMemory;
     }
-    ConvertOVIXResult(m_pDecoder->Initialize(*m_pAACFormat, *m_pPCMFormat));
-    return eTqovixSuccess;
+    // A decoder that cannot open ends the job at its start, with the converter's reason.
+    const eTqovixErrorCode opened = ConvertOVIXResult(m_pDecoder->Initialize(*m_pAACFormat, *m_pPCMFormat));
+    if (TqovixFailed(opened)) {
+        m_pDecoder.reset();
+    }
+    return opened;
 }
 
 eTqovixErrorCode CTqovixAudioDataControlMac::OpenEncoderAAC(
@@ -85,8 +89,12 @@ eTqovixErrorCode CTqovixAudioDataControlMac::OpenEncoderAAC(
     m_pEncoderStream->buffer = m_pStreamBuffer.get();
     m_pEncoderStream->bufferSize = kStreamBufferSize;
     m_pEncoderStream->userData = m_pBinding.get();
-    ConvertOVIXResult(m_pEncoder->Initialize(*m_pPCMFormat, *m_pAACFormat, bitRate, m_pEncoderStream.get()));
-    return eTqovixSuccess;
+    const eTqovixErrorCode opened =
+        ConvertOVIXResult(m_pEncoder->Initialize(*m_pPCMFormat, *m_pAACFormat, bitRate, m_pEncoderStream.get()));
+    if (TqovixFailed(opened)) {
+        CloseEncoderAAC();
+    }
+    return opened;
 }
 
 void CTqovixAudioDataControlMac::CloseDecoderAAC() { m_pDecoder.reset(); }

@@ -46,9 +46,9 @@ public:
     const ACFormat* GetAACFormat() const { return m_pAACFormat.get(); }
     const ACFormat* GetPCMFormat() const { return m_pPCMFormat.get(); }
 
-    // Codec failures are not reported upward: a broken decoder shows as missing PCM,
-    // which the control notices at the chunk's end.
-    static eTqovixErrorCode ConvertOVIXResult(eConverterErrorCode) { return eTqovixSuccess; }
+    // Converter results are internal codes already: they go up as they are, so that a codec
+    // that cannot open, decode or encode ends the job with its reason.
+    static eTqovixErrorCode ConvertOVIXResult(eConverterErrorCode code) { return static_cast<eTqovixErrorCode>(code); }
 
 private:
     std::unique_ptr<AACDecoder> m_pDecoder;

@@ -157,6 +157,10 @@ void CTqovixMainFrame::Abort(eTqovixErrorCode code)
 
 void CTqovixMainFrame::CloseSession(eTqovixErrorCode code)
 {
+    // A result, once final, is final: a host answer or a late failure after the end changes nothing.
+    if (m_progressDataControl.GetErrorResult() != eTqovixRunning) {
+        return;
+    }
     // Only a complete movie takes the destination's name; every other ending leaves the path as
     // it was, and the unnamed file goes with the controller.
     if (code == eTqovixFinished) {
@@ -374,7 +378,7 @@ void CTqovixMainFrame::NotifyProgress(unsigned long first, unsigned long second)
         }
     }
 
-    const NotifyProgressFunc callback = engine->m_pfnNotifyProgress;
+    const NotifyProgressFunc callback = engine->m_pfnNotifyProgress.load();
     if (callback == nullptr) {
         return;
     }

@@ -63,7 +63,8 @@ private:
     bool m_bInitialized = false;
     // Set on the host thread, read on the library's: atomic so the hand-over is well defined.
     std::atomic<bool> m_bAbortRequested{false};
-    NotifyProgressFunc m_pfnNotifyProgress = nullptr;
+    // Read by the library's thread after a job has ended, when the host may already set it.
+    std::atomic<NotifyProgressFunc> m_pfnNotifyProgress{nullptr};
     CTqovixProgressDataControl m_progressDataControl;
     CTqovixMovControl m_movControl;
     std::vector<char> m_destinationPath;

@@ -129,8 +129,10 @@ eTqovixErrorCode CTqovixFile::Open(const char* path, int mode)
         if (access(path, R_OK) != 0) {
             return ConvertErrnoToLocalError(errno, m_bReadOnly);
         }
-        // fopen accepts a directory for reading and only the first read would fail.
-        if (chdir(path) == 0) {
+        // fopen accepts a directory for reading and only the first read would fail. stat, not
+        // chdir: the host's working directory is not ours to move.
+        struct stat status {};
+        if (stat(path, &status) == 0 && S_ISDIR(status.st_mode)) {
             return eTqovixErrorIsDirectory;
         }
         streamMode = "re";
@@ -296,21 +298,22 @@ eTqovixErrorCode CTqovixFile::Write(const void* buffer, unsigned int size)
         return eTqovixErrorInternal;
     }
 
-    if (const int fault = InjectedFault(eTqovixFileOperation::Write)) {
+    const int fault = InjectedFault(eTqovixFileOperation::Write);
+    if (fault > 0) {
         return ConvertErrnoToLocalError(fault, m_bReadOnly);
     }
-    if (std::fwrite(buffer, size, 1, m_stream) == 1) {
+    errno = 0;
+    // The seam's -1: the write comes back short with no reason given, as a stream may.
+    if (fault == 0 && std::fwrite(buffer, size, 1, m_stream) == 1) {
         return eTqovixSuccess;
     }
     const int error = errno;
     if (std::feof(m_stream)) {
         return eTqovixErrorEndOfFile;
     }
-    if (std::ferror(m_stream)) {
-        std::clearerr(m_stream);
-        return ConvertErrnoToLocalError(error, m_bReadOnly);
-    }
-    return eTqovixSuccess;
+    std::clearerr(m_stream);
+    // A write that wrote less than asked failed, whether or not the stream says why.
+    return error != 0 ? ConvertErrnoToLocalError(error, m_bReadOnly) : eTqovixErrorDevice;
 }
 
 eTqovixErrorCode CTqovixFile::Flush()
@@ -513,11 +516,13 @@ eTqovixErrorCode CTqovixFile::ComfirmWritable(long long size, const char* path)
     const uint64_t availableBytes = static_cast<uint64_t>(information.blockSize) * information.blocksAvailable;
     const double available = static_cast<double>(availableBytes);
     const double required = static_cast<double>(size) * 0.9;
+    // FAT cannot hold the destination if the source's size does not fit it: the estimate
+    // that serves for free space would let 4.0 to 4.44 GiB through to fail half-way.
+    if (information.typeName == "msdos" && static_cast<double>(size) >= kMsdosLargestFile) {
+        return eTqovixErrorFileTooLarge;
+    }
     if (required >= available) {
         return eTqovixErrorDiskFull;
-    }
-    if (information.typeName == "msdos" && required >= kMsdosLargestFile) {
-        return eTqovixErrorFileTooLarge;
     }
     return eTqovixSuccess;
 }
@@ -552,9 +557,10 @@ eTqovixErrorCode CTqovixFile::ConvertErrnoToLocalError(int errorNumber, bool rea
         return eTqovixErrorTooManyFiles;
     case EISDIR:
         return eTqovixErrorIsDirectory;
+    case EFBIG:
+        return eTqovixErrorFileTooLarge;  // the volume cannot hold a file that large
     case E2BIG:
     case EINVAL:
-    case EFBIG:
     case ESPIPE:
     case EROFS:
     case EDOM:

@@ -23,8 +23,9 @@ using TqovixVolumeQuery = bool (*)(const char* directory, TqovixVolumeInformatio
 // The operations a fault seam can fail.
 enum class eTqovixFileOperation { Read, Write, Seek, Position, Truncate, Flush };
 
-// Answers an errno to fail the operation with, or 0 to let it run. Tests use it to fail
-// the Nth call of a whole job and check that nothing is lost or left behind.
+// Answers an errno to fail the operation with, or 0 to let it run (for a write, -1: it comes
+// back short without a reason). Tests use it to fail the Nth call of a whole job and check
+// that nothing is lost or left behind.
 using TqovixFaultHook = int (*)(eTqovixFileOperation operation);
 
 class CTqovixFile {

@@ -15,16 +15,6 @@ namespace {
 
 constexpr int kOpenRead = 1;
 
-eTqovixErrorCode CopyBlock(std::vector<uint8_t>& target, const uint8_t* data, uint64_t size)
-{
-    try {
-        target.assign(data, data + size);
-    } catch (const std::bad_alloc&) {
-        return eTqovixErrorOutOfMemory;
-    }
-    return eTqovixSuccess;
-}
-
 // The sequential reader the processing library pulls the maker blocks through: a null
 // buffer asks for the size, a position past the end rewinds.
 eTqovixErrorCode ReadSequentially(const std::vector<uint8_t>& block, uint64_t& position, void* buffer,
@@ -96,11 +86,7 @@ eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const cha
         Close();
         return Refuse(eTqovixErrorInvalidMovie, "no AF information");
     }
-    result = CopyBlock(m_afInformation, af.GetAFInformation(), af.GetAFInformationSize());
-    if (TqovixFailed(result)) {
-        Close();
-        return result;
-    }
+    m_afInformation = af.TakeAFInformation();
 
     CTqovixAudioLevelInformationVisitor level;
     result = m_atomControl.Analyze(level);
@@ -108,13 +94,8 @@ eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const cha
         Close();
         return result;
     }
-    if (!TqovixFailed(result) && level.GetAudioLevelInformationSize() != 0) {
-        result = CopyBlock(m_audioLevelInformation, level.GetAudioLevelInformation(),
-                           level.GetAudioLevelInformationSize());
-        if (TqovixFailed(result)) {
-            Close();
-            return result;
-        }
+    if (!TqovixFailed(result)) {
+        m_audioLevelInformation = level.TakeAudioLevelInformation();
     }
     result = AnalyzeTracks(destinationPath != nullptr);
     if (TqovixFailed(result)) {

@@ -24,10 +24,13 @@ protected:
     void SetBlock(const void* data, uint64_t size);
     const uint8_t* GetBlock() const { return m_block.empty() ? nullptr : m_block.data(); }
     uint64_t GetBlockSize() const { return m_block.size(); }
+    // Hands the block over without a copy; the visitor is empty afterwards.
+    std::vector<uint8_t> TakeBlock() { return std::move(m_block); }
 
 private:
     eTqovixErrorCode m_emptyAtomCode;
     mutable std::vector<uint8_t> m_block;
+    eTqovixErrorCode m_setFailure = eTqovixSuccess;  // a block that could not be held
 };
 
 class CTqovixAFInformationVisitor : public CTqovixMakerBlockVisitor {
@@ -37,6 +40,7 @@ public:
     void SetAFInformation(const void* data, uint64_t size) { SetBlock(data, size); }
     const uint8_t* GetAFInformation() const { return GetBlock(); }
     uint64_t GetAFInformationSize() const { return GetBlockSize(); }
+    std::vector<uint8_t> TakeAFInformation() { return TakeBlock(); }
 };
 
 class CTqovixAudioLevelInformationVisitor : public CTqovixMakerBlockVisitor {
@@ -47,4 +51,5 @@ public:
     void SetAudioLevelInformation(const void* data, uint64_t size) { SetBlock(data, size); }
     const uint8_t* GetAudioLevelInformation() const { return GetBlock(); }
     uint64_t GetAudioLevelInformationSize() const { return GetBlockSize(); }
+    std::vector<uint8_t> TakeAudioLevelInformation() { return TakeBlock(); }
 };

@@ -9,6 +9,10 @@
 
 #define OVIX_API __attribute__((visibility("default")))
 
+// The largest AF or audio level block (atom header included) the library reads; hosts refuse
+// larger ones before loading them.
+inline constexpr unsigned long kOvixMaxBlockSize = 16ul << 20;
+
 // Library-form records: a size field first, so a host built against another layout is refused.
 struct TqovixAudioInformation {
     unsigned long size;  // 48
