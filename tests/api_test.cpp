@@ -202,3 +202,44 @@ TEST_F(ApiTest, PropertyVerdictsLeaveFileAndEngineAlone)
 }
 
 }  // namespace
+
+namespace {
+
+// What a host may rely on around its own process: its working directory stays where it is,
+// a movie whose AF block is far too large is refused before it is loaded, and setting the
+// progress callback while jobs end is safe (ThreadSanitizer watches this one).
+TEST_F(ApiTest, TheHostsProcessIsLeftAlone)
+{
+    const std::filesystem::path before = std::filesystem::current_path();
+    const std::string movie = Write(Recipe{}, "movie.mov");
+    for (const std::string& path : {m_dir.Path(), std::string("/usr/share"), movie, m_dir.File("absent.mov")}) {
+        TqGetPropertyOVIX(path.c_str());
+        EXPECT_EQ(std::filesystem::current_path(), before) << "after asking about " << path;
+    }
+
+    Recipe huge;
+    huge.maker.afPayload = moviekit::Bytes(20u << 20, 0x41);  // past the processing library's 16 MiB
+    const std::string hugeMovie = Write(huge, "huge.mov");
+    EXPECT_EQ(TqGetPropertyOVIX(hugeMovie.c_str()), 8);
+    EXPECT_EQ(TqExecuteOVIX(hugeMovie.c_str(), m_dir.File("huge-out.mov").c_str()), 8);
+    EXPECT_FALSE(Exists(m_dir.File("huge-out.mov")));
+
+    Recipe shortMovie;
+    shortMovie.video.frameCount = 10;
+    const std::string source = Write(shortMovie, "short.mov");
+    std::atomic<bool> stop{false};
+    std::thread setter([&] {
+        while (!stop) {
+            TqSetCallBackNotifyProgressOVIX(HostCallback);
+            TqSetCallBackNotifyProgressOVIX(nullptr);
+        }
+    });
+    for (int job = 0; job < 10; ++job) {
+        ASSERT_EQ(TqExecuteOVIX(source.c_str(), m_dir.File("out.mov").c_str()), 0);
+        jobtest::WaitForJob();
+    }
+    stop = true;
+    setter.join();
+}
+
+}  // namespace

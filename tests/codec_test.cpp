@@ -13,7 +13,9 @@
 
 #include "Movie.h"
 #include "codec/AACDecoder.h"
+#include "bridge/TqovixInterfaceConvert.h"
 #include "codec/AACEncoder.h"
+#include "codec/CTqovixAudioDataControlMac.h"
 #include "support/TestSupport.h"
 
 namespace {
@@ -295,6 +297,29 @@ TEST(CodecBadInputTest, BadPacketsMissingConvertersAndNullArgumentsAreStatuses)
     EXPECT_EQ(rig.Push(4096), eConverterInternal) << "fed after close";
     EXPECT_EQ(rig.Push(kFlush), eConverterInternal);
     EXPECT_TRUE(rig.packets.empty());
+}
+
+}  // namespace
+
+namespace {
+
+// A codec that cannot open ends the job's start with the converter's reason, for the decoder
+// as for the encoder; one that opens serves.
+TEST(CodecAdapterTest, CodecsThatCannotOpenFailTheStart)
+{
+    const moviekit::Bytes config = moviekit::MakeAudioSpecificConfig(48000, 2);
+    const auto open = [&](uint64_t rate, uint64_t channels) {
+        CTqovixAudioDataControlMac control;
+        TqovixInterfaceConvert::TqovixAudioInformation record;
+        record.sampleRate = rate;
+        record.channels = channels;
+        record.bitsPerSample = 16;
+        return control.SetAACInformation(nullptr, config.data(), static_cast<unsigned int>(config.size()), record,
+                                         128000);
+    };
+    EXPECT_EQ(open(48000, 2), eTqovixSuccess);
+    EXPECT_TRUE(TqovixFailed(open(48000, 0))) << "no channels";
+    EXPECT_TRUE(TqovixFailed(open(0, 2))) << "no rate";
 }
 
 }  // namespace

@@ -440,6 +440,9 @@ const Ending kEndings[] = {
     // Requested from the notification that reports the end: the job is already complete.
     {"PcmAbortAfterCompletion", SoundCodec::Twos, false, 0, 2, 0, kDone},
     {"AacAbortAfterCompletion", SoundCodec::Aac, false, 0, 2, 0, kDone},
+    // Answered to the notification that reports the end: a final result stays final.
+    {"PcmHostAnswers200AfterCompletion", SoundCodec::Sowt, false, 0, 2, 200, kDone},
+    {"AacHostAnswers120AfterCompletion", SoundCodec::Aac, false, 0, 2, 120, kDone},
     {"PcmHostAnswers200", SoundCodec::Twos, false, 1, 0, 200, 200},
     {"PcmHostAnswers120", SoundCodec::Sowt, false, 2, 0, 120, 120},
     {"AacHostAnswers120", SoundCodec::Aac, false, 4, 0, 120, 120},

@@ -136,14 +136,22 @@ TEST_F(TagTreeTest, MakerBlocksCopyOutWithAnEightByteHeaderAndMustBeInPlace)
     ASSERT_EQ(m_tree.Analyze(af), eTqovixSuccess);
     EXPECT_EQ(block(), (Bytes{0, 0, 0, 8, 'O', 'P', '0', '1'}));
 
-    // Going back only the payload is kept; a size field of zero marks a 16-byte header.
+    // Going back only the payload is kept; a size field of 1 marks a 16-byte header (the
+    // 64-bit size follows), any other an 8-byte one.
     Bytes wide(24, 0);
+    wide[3] = 1;
     wide[20] = 0x5A;
     CTqovixAFInformationVisitor writer;
     writer.SetAFInformation(wide.data(), wide.size());
     EXPECT_EQ(m_tree.Update(writer), eTqovixSuccess);
     ASSERT_EQ(m_tree.Analyze(af), eTqovixSuccess);
     EXPECT_EQ(block(), (Bytes{0, 0, 0, 16, 'O', 'P', '0', '1', 0, 0, 0, 0, 0x5A, 0, 0, 0}));
+    Bytes zeroSized(16, 0);
+    zeroSized[12] = 0x5A;
+    writer.SetAFInformation(zeroSized.data(), zeroSized.size());
+    EXPECT_EQ(m_tree.Update(writer), eTqovixSuccess);
+    ASSERT_EQ(m_tree.Analyze(af), eTqovixSuccess);
+    EXPECT_EQ(block(), (Bytes{0, 0, 0, 16, 'O', 'P', '0', '1', 0, 0, 0, 0, 0x5A, 0, 0, 0})) << "size 0: 8-byte header";
     writer.SetAFInformation(wide.data(), 16);
     EXPECT_EQ(writer.GetAFInformation(), nullptr) << "a block no longer than its header is emptied";
     EXPECT_EQ(m_tree.Update(writer), eTqovixErrorInternal);
