@@ -4,6 +4,7 @@
 
 #include <new>
 
+#include "bridge/TqovixCodeTable.h"
 #include "engine/CTqovixMainFrame.h"
 
 // Defined here, not beside the engine, so that a program holding the internals for other
@@ -12,29 +13,7 @@ __attribute__((visibility("default"))) CTqovixMainFrame* g_pMainFrame = nullptr;
 
 namespace {
 
-int ConvertToUtilityError(eTqovixErrorCode code)
-{
-    switch (code) {
-    case eTqovixSuccess:
-    case eTqovixRunning:
-    case eTqovixEnable: return 0;
-    case eTqovixFinished: return 1;
-    case eTqovixVerdict7: return 7;
-    case eTqovixVerdict8: return 8;
-    case eTqovixVerdict9: return 9;
-    case eTqovixVerdict20: return 20;
-    case eTqovixErrorOutOfMemory: return 100;
-    case eTqovixErrorSourceNotFound: return 110;
-    case eTqovixErrorDestinationNotFound: return 111;
-    case eTqovixErrorSourceAccessDenied: return 120;
-    case eTqovixErrorDestinationAccessDenied: return 121;
-    case eTqovixErrorDiskFull: return 130;
-    case eTqovixErrorFileTooLarge: return 131;
-    case eTqovixErrorInvalidMovie: return 8;
-    case eTqovixErrorAborted: return 200;
-    default: return 190;
-    }
-}
+int ConvertToUtilityError(eTqovixErrorCode code) { return TqovixCodes::Exported(code); }
 
 // Nothing thrown inside may reach the host through a C function: out of memory answers 100,
 // anything else 190.

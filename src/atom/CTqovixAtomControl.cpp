@@ -5,6 +5,7 @@
 #include "atom/CTqovixContainerAtom.h"
 #include "atom/CTqovixLeafAtom.h"
 #include "atom/TqovixEndian.h"
+#include "bridge/TqovixCodeTable.h"
 #include "file/CTqovixFile.h"
 
 namespace {
@@ -100,7 +101,7 @@ eTqovixErrorCode CreateAtomList(ParseState& state, std::shared_ptr<CTqovixAtom>&
 // to report a verdict.
 eTqovixErrorCode TopLevelResult(eTqovixErrorCode result)
 {
-    if ((result >= 17 && result <= 153) || TqovixFailed(result)) {
+    if (TqovixCodes::IsVerdict(result) || TqovixFailed(result)) {
         return result;
     }
     return eTqovixSuccess;

@@ -1,5 +1,7 @@
 #include "bridge/TqovixInterfaceConvert.h"
 
+#include "bridge/TqovixCodeTable.h"
+
 #include <new>
 
 namespace TqovixInterfaceConvert {
@@ -11,19 +13,6 @@ OutputFunc g_pfnOutputAudioFunc = nullptr;
 NotifyFunc g_pfnNotifyProgressFunc = nullptr;
 
 namespace {
-
-// Library code to internal code for the results that carry a state or a verdict; the rest
-// are ordinary result codes.
-eTqovixErrorCode ConvertVerdict(unsigned long code)
-{
-    switch (code) {
-    case ovix::kVerdictNoAfInformation: return eTqovixVerdict7;
-    case ovix::kVerdictNotAfBlock: return eTqovixVerdict8;
-    case ovix::kVerdictMalformed: return eTqovixVerdict9;
-    case ovix::kVerdictAlreadyProcessed: return eTqovixVerdict20;
-    default: return ConvertToLocalError(code);
-    }
-}
 
 // The processing library's thread runs our callbacks: nothing thrown may unwind into it.
 template <typename Call>
@@ -62,7 +51,7 @@ void TqovixLibraryClose()
 eTqovixErrorCode TqovixIsEnable(void* block, unsigned long size)
 {
     const unsigned long code = ::TqovixIsEnable(block, size);
-    return code == ovix::kSuccess ? eTqovixEnable : ConvertVerdict(code);
+    return code == ovix::kSuccess ? eTqovixEnable : TqovixCodes::FromLibrary(code, true);
 }
 
 eTqovixErrorCode TqovixOpenSession(const TqovixAudioInformation& audio, const TqovixTrimInformation& trim)
@@ -75,7 +64,7 @@ eTqovixErrorCode TqovixIsSessionFinished()
     switch (const unsigned long code = ::TqovixIsSessionFinished()) {
     case 0: return eTqovixRunning;
     case ovix::kSessionFinished: return eTqovixFinished;
-    default: return ConvertVerdict(code);
+    default: return TqovixCodes::FromLibrary(code, true);
     }
 }
 
@@ -185,39 +174,8 @@ void NotifyProgressFunc(unsigned long first, unsigned long second)
     return record;
 }
 
-unsigned long ConvertToLibraryError(eTqovixErrorCode code)
-{
-    switch (code) {
-    case eTqovixSuccess:
-    case eTqovixFinished: return 0;
-    case eTqovixNoAudioLevel: return 30;
-    case eTqovixErrorOutOfMemory: return 100;
-    case eTqovixErrorSourceNotFound: return 110;
-    case eTqovixErrorDestinationNotFound: return 111;
-    case eTqovixErrorSourceAccessDenied: return 120;
-    case eTqovixErrorDestinationAccessDenied: return 121;
-    case eTqovixErrorDiskFull: return 130;
-    case eTqovixErrorFileTooLarge: return 131;
-    case eTqovixErrorAborted: return 200;
-    default: return 190;
-    }
-}
+unsigned long ConvertToLibraryError(eTqovixErrorCode code) { return TqovixCodes::Library(code); }
 
-eTqovixErrorCode ConvertToLocalError(unsigned long code)
-{
-    switch (code) {
-    case 0: return eTqovixSuccess;
-    case 30: return eTqovixNoAudioLevel;
-    case 100: return eTqovixErrorOutOfMemory;
-    case 110: return eTqovixErrorSourceNotFound;
-    case 111: return eTqovixErrorDestinationNotFound;
-    case 120: return eTqovixErrorSourceAccessDenied;
-    case 121: return eTqovixErrorDestinationAccessDenied;
-    case 130: return eTqovixErrorDiskFull;
-    case 131: return eTqovixErrorFileTooLarge;
-    case 200: return eTqovixErrorAborted;
-    default: return eTqovixErrorGeneral;
-    }
-}
+eTqovixErrorCode ConvertToLocalError(unsigned long code) { return TqovixCodes::FromLibrary(code, false); }
 
 }  // namespace TqovixInterfaceConvert

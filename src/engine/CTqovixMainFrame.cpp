@@ -1,5 +1,7 @@
 #include "engine/CTqovixMainFrame.h"
 
+#include "bridge/TqovixCodeTable.h"
+
 #include <cstdint>
 #include <cstring>
 #include <new>
@@ -15,20 +17,6 @@ constexpr unsigned long kAFInformationPiece = 1024;
 // Far beyond any camera's AF information: a library that never says "last piece" stops here.
 constexpr size_t kMaxProcessedAFInformation = 16u << 20;
 
-eTqovixErrorCode MapHostAnswer(int answer)
-{
-    switch (answer) {
-    case 100: return eTqovixErrorOutOfMemory;
-    case 110: return eTqovixErrorSourceNotFound;
-    case 111: return eTqovixErrorDestinationNotFound;
-    case 120: return eTqovixErrorSourceAccessDenied;
-    case 121: return eTqovixErrorDestinationAccessDenied;
-    case 130: return eTqovixErrorDiskFull;
-    case 131: return eTqovixErrorFileTooLarge;
-    case 200: return eTqovixErrorAborted;
-    default: return eTqovixErrorGeneral;
-    }
-}
 
 }  // namespace
 
@@ -387,7 +375,7 @@ void CTqovixMainFrame::NotifyProgress(unsigned long first, unsigned long second)
     if (answer == 0 || endedByError) {
         return;
     }
-    engine->Abort(MapHostAnswer(answer));
+    engine->Abort(TqovixCodes::FromHostAnswer(answer));
 }
 
 void CTqovixMainFrame::FinishAACJob()

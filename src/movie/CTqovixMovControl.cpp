@@ -4,6 +4,7 @@
 #include <cstring>
 #include <new>
 
+#include "bridge/TqovixCodeTable.h"
 #include "file/CTqovixUtil.h"
 #include "visitor/CTqovixAudioDataVisitor.h"
 #include "visitor/CTqovixAudioInformationVisitor.h"
@@ -78,7 +79,7 @@ eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const cha
     }
     CTqovixAFInformationVisitor af;
     result = m_atomControl.Analyze(af);
-    if (TqovixFailed(result) || (result >= eTqovixEnable && result <= eTqovixVerdict20)) {
+    if (TqovixFailed(result) || TqovixCodes::IsVerdict(result)) {
         Close();
         return result == eTqovixErrorInvalidMovie ? Refuse(result, "no AF information") : result;
     }
