@@ -145,6 +145,12 @@ eTqovixErrorCode CTqovixFile::Open(const char* path, int mode)
     if (stream == nullptr) {
         return ConvertErrnoToLocalError(errno, m_bReadOnly);
     }
+    Adopt(stream);
+    return eTqovixSuccess;
+}
+
+void CTqovixFile::Adopt(FILE* stream)
+{
     // The default buffer of one block makes a syscall per 4 KiB of sound.
     m_buffer.reset(new (std::nothrow) char[kStreamBuffer]);
     if (m_buffer != nullptr) {
@@ -152,7 +158,6 @@ eTqovixErrorCode CTqovixFile::Open(const char* path, int mode)
     }
     m_stream = stream;
     m_bOpened = true;
-    return eTqovixSuccess;
 }
 
 void CTqovixFile::Close()
@@ -207,12 +212,7 @@ eTqovixErrorCode CTqovixFile::OpenDestination(const char* path)
         }
         return ConvertErrnoToLocalError(error, false);
     }
-    m_buffer.reset(new (std::nothrow) char[kStreamBuffer]);
-    if (m_buffer != nullptr) {
-        setvbuf(stream, m_buffer.get(), _IOFBF, kStreamBuffer);
-    }
-    m_stream = stream;
-    m_bOpened = true;
+    Adopt(stream);
     m_bReadOnly = false;
     m_finalPath = finalPath;
     m_partialPath = partial;

@@ -98,6 +98,8 @@ public:
 private:
     // fflush alone: the kernel copy must not count as a flush for the fault seam.
     eTqovixErrorCode FlushStream();
+    // Takes an opened stream over, with our buffer.
+    void Adopt(FILE* stream);
 
     bool m_bOpened = false;
     bool m_bReadOnly = true;
