@@ -97,7 +97,10 @@ struct RecordingVisitor : CTqovixAtomVisitor {
     {
         std::string text;
         for (eTqovixAtomType type : path) {
-            text += (text.empty() ? "" : "/") + TqovixAtomTypeName(type);
+            if (!text.empty()) {
+                text += '/';
+            }
+            text += TqovixAtomTypeName(type);
         }
         seen.push_back(text);
         return answer(text, isLeaf);

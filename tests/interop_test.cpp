@@ -9,6 +9,7 @@
 #include <algorithm>
 #include <cmath>
 #include <filesystem>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -47,13 +48,14 @@ std::string Shell(const std::string& command)
 // A sweep under a slow swell: no two stretches alike, so a cross-correlation has one peak.
 std::string SoundSource(uint32_t rate, uint32_t channels)
 {
-    std::string expression;
+    std::ostringstream expression;
     for (uint32_t c = 0; c < channels; ++c) {
-        expression += (c ? "|" : "") + std::string("(0.3+0.1*sin(2*PI*1.3*t+") + std::to_string(c) +
-                      "))*sin(2*PI*(180*t+260*t*t))+0.08*sin(2*PI*(2100+" + std::to_string(150 * c) + ")*t)";
+        expression << (c ? "|" : "") << "(0.3+0.1*sin(2*PI*1.3*t+" << c
+                   << "))*sin(2*PI*(180*t+260*t*t))+0.08*sin(2*PI*(2100+" << 150 * c << ")*t)";
     }
-    return "-f lavfi -i \"aevalsrc='" + expression + "':s=" + std::to_string(rate) + ":d=" +
-           std::to_string(kSeconds) + "\"";
+    std::ostringstream source;
+    source << "-f lavfi -i \"aevalsrc='" << expression.str() << "':s=" << rate << ":d=" << kSeconds << "\"";
+    return source.str();
 }
 
 std::vector<std::string> StreamList(const std::string& path)

@@ -115,9 +115,10 @@ bool ReadTrack(const Bytes& b, const Box& trak, TrackChunks& track, bool& inFile
     }
     const uint64_t common = Be(b, stsz->begin + 4, 4);
     const uint64_t sampleCount = Be(b, stsz->begin + 8, 4);
-    const std::optional<Box> offsets = stco ? stco : co64;
+    // Exactly one of the two is there (checked above).
+    const uint64_t offsetsBegin = stco ? stco->begin : co64.value().begin;
     const int width = stco ? 4 : 8;
-    const uint64_t chunkCount = Be(b, offsets->begin + 4, 4);
+    const uint64_t chunkCount = Be(b, offsetsBegin + 4, 4);
     const uint64_t runCount = Be(b, stsc->begin + 4, 4);
     uint64_t sample = 0;
     for (uint64_t run = 0; run < runCount; ++run) {
@@ -134,7 +135,7 @@ bool ReadTrack(const Bytes& b, const Box& trak, TrackChunks& track, bool& inFile
                 }
             }
             sample += perChunk;
-            track.chunks.emplace_back(Be(b, offsets->begin + 8 + width * (chunk - 1), width), size);
+            track.chunks.emplace_back(Be(b, offsetsBegin + 8 + width * (chunk - 1), width), size);
         }
     }
     if (track.chunks.size() != chunkCount || (common == 0 && sample != sampleCount)) {
