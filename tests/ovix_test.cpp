@@ -261,7 +261,8 @@ class SuppressorWarmUp : public ::testing::TestWithParam<SuppressorRow> {};
 
 TEST_P(SuppressorWarmUp, SkippingMatchesTheFilterThatRanThroughout)
 {
-    const auto [name, rate, channels] = GetParam();
+    const uint64_t rate = GetParam().rate;
+    const unsigned channels = GetParam().channels;
     const uint64_t frames = 3 * rate;
     std::vector<int16_t> input(frames * channels);
     uint32_t seed = 7;

@@ -42,4 +42,4 @@ enum eTqovixErrorCode : int32_t {
     eTqovixErrorInternal = 36864,
 };
 
-inline bool TqovixFailed(int32_t code) { return code >= eTqovixErrorFirst; }
+constexpr bool TqovixFailed(int32_t code) { return code >= eTqovixErrorFirst; }
