@@ -157,6 +157,9 @@ void CTqovixFile::Adopt(FILE* stream)
         setvbuf(stream, m_buffer.get(), _IOFBF, kStreamBuffer);
     }
     m_stream = stream;
+    // Kept apart from the stream: the kernel copy and positioned reads use it from other
+    // threads, where the stream's own fields are not theirs to read.
+    m_descriptor = fileno(stream);
     m_bOpened = true;
 }
 
@@ -166,6 +169,7 @@ void CTqovixFile::Close()
         std::fclose(m_stream);
         m_stream = nullptr;
     }
+    m_descriptor = -1;
     // An unnamed destination vanishes with its descriptor; a hidden one is removed.
     if (m_bUnpublished && !m_partialPath.empty()) {
         unlink(m_partialPath.c_str());
@@ -395,7 +399,7 @@ eTqovixErrorCode CTqovixFile::CopyRange(CTqovixFile& source, unsigned long long 
             return eTqovixErrorAborted;
         }
         const ssize_t done =
-            copy_file_range(fileno(source.m_stream), &in, fileno(m_stream), &out, std::min(left, kPiece), 0);
+            copy_file_range(source.m_descriptor, &in, m_descriptor, &out, std::min(left, kPiece), 0);
         if (done < 0) {
             const int error = errno;
             if (error == EINTR) {
@@ -625,7 +629,7 @@ eTqovixErrorCode CTqovixFile::ReadAt(unsigned long long offset, void* buffer, un
     }
     auto* bytes = static_cast<uint8_t*>(buffer);
     while (*readSize < size) {
-        const ssize_t got = pread(fileno(m_stream), bytes + *readSize, size - *readSize,
+        const ssize_t got = pread(m_descriptor, bytes + *readSize, size - *readSize,
                                   static_cast<off_t>(offset + *readSize));
         if (got < 0 && errno == EINTR) {
             continue;

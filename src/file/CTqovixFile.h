@@ -108,5 +108,6 @@ private:
     std::string m_partialPath;    // its hidden name meanwhile, when it has one
     bool m_bUnpublished = false;  // a destination not published yet
     FILE* m_stream = nullptr;
+    int m_descriptor = -1;
     std::unique_ptr<char[]> m_buffer;  // the stream's; outlives it
 };
