@@ -195,7 +195,8 @@ eTqovixErrorCode CTqovixFile::OpenDestination(const char* path)
         return eTqovixErrorIsDirectory;
     }
     int descriptor = -1;
-    if (g_bUnnamedDestinations.load()) {
+    // Unnamed files are named through /proc, which a container may lack.
+    if (g_bUnnamedDestinations.load() && access("/proc/self/fd", X_OK) == 0) {
         descriptor = open(DirectoryOf(finalPath).c_str(), O_TMPFILE | O_RDWR | O_CLOEXEC, 0666);
     }
     std::string partial;
@@ -237,16 +238,24 @@ eTqovixErrorCode CTqovixFile::Publish(bool durable)
     if (durable && fsync(descriptor) != 0) {
         return ConvertErrnoToLocalError(errno, false);
     }
+    bool named = false;
     if (m_partialPath.empty()) {
-        // An unnamed file gets a hidden name first: a name can only replace another by rename.
-        const std::string hidden = PartialNameFor(m_finalPath);
         const std::string self = "/proc/self/fd/" + std::to_string(descriptor);
-        if (linkat(AT_FDCWD, self.c_str(), AT_FDCWD, hidden.c_str(), AT_SYMLINK_FOLLOW) != 0) {
+        // A free name is given in one step; a name taken can only be replaced by rename, so the
+        // file gets a hidden name first (a complete movie, left only if killed between the two).
+        named = linkat(AT_FDCWD, self.c_str(), AT_FDCWD, m_finalPath.c_str(), AT_SYMLINK_FOLLOW) == 0;
+        if (!named && errno != EEXIST) {
             return ConvertErrnoToLocalError(errno, false);
         }
-        m_partialPath = hidden;
+        if (!named) {
+            const std::string hidden = PartialNameFor(m_finalPath);
+            if (linkat(AT_FDCWD, self.c_str(), AT_FDCWD, hidden.c_str(), AT_SYMLINK_FOLLOW) != 0) {
+                return ConvertErrnoToLocalError(errno, false);
+            }
+            m_partialPath = hidden;
+        }
     }
-    if (rename(m_partialPath.c_str(), m_finalPath.c_str()) != 0) {
+    if (!named && rename(m_partialPath.c_str(), m_finalPath.c_str()) != 0) {
         return ConvertErrnoToLocalError(errno, false);
     }
     m_partialPath.clear();
