@@ -3,11 +3,13 @@
 #include "host/JobHarness.h"
 
 #include <grp.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
+#include <csignal>
 #include <filesystem>
 #include <iterator>
 #include <set>
@@ -155,6 +157,99 @@ TEST_F(ApiTest, SameFileUnderAnySpellingIsRefused)
         EXPECT_TRUE(std::filesystem::is_symlink(link));
     }
 }
+
+// ---- A failed job costs no file ----
+
+enum class Failure { MissingSource, DirectorySource, NotAMovie, ProcessedMovie, SameFile, SameFileRelative,
+                     SameFileDotted, AbortHalfway, FullVolume };
+struct FailedJob {
+    const char* name;
+    Failure failure;
+    int expected;  // what the start answers, or else how the job ends
+};
+void PrintTo(const FailedJob& row, std::ostream* out) { *out << row.name; }
+
+class FailedJobTest : public ApiTest, public ::testing::WithParamInterface<FailedJob> {};
+
+std::atomic<bool> g_abortHalfway{false};
+int AbortAtHalf(int done, int total)
+{
+    if (g_abortHalfway && total > 0 && done >= total / 2) {
+        TqAbortOVIX();
+    }
+    return 0;
+}
+
+// The job in a child whose file size limit stands in for a full volume; its final state.
+int RunWithFileSizeLimit(const std::string& source, const std::string& destination)
+{
+    const pid_t child = fork();
+    if (child == 0) {
+        signal(SIGXFSZ, SIG_IGN);
+        const rlimit limit{64 * 1024, 64 * 1024};
+        if (setrlimit(RLIMIT_FSIZE, &limit) != 0 || TqExecuteOVIX(source.c_str(), destination.c_str()) != 0) {
+            _exit(250);
+        }
+        const int state = jobtest::WaitForJob();
+        TqCloseOVIX();
+        _exit(state < 0 ? 252 : state);
+    }
+    int status = 0;
+    return child > 0 && waitpid(child, &status, 0) == child && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+TEST_P(FailedJobTest, TheDestinationKeepsItsOldBytes)
+{
+    const FailedJob& row = GetParam();
+    Recipe recipe = row.failure == Failure::AbortHalfway ? LongRecipe() : Recipe{};
+    recipe.maker.afProcessed = row.failure == Failure::ProcessedMovie;
+    std::string source = Write(recipe, "src.mov");
+    std::string destination = m_dir.File("dst.mov");
+    const std::vector<uint8_t> old = {'s', 'o', 'm', 'e', 'o', 'n', 'e', '\'', 's'};
+    ASSERT_TRUE(testsupport::WriteFile(destination, old));
+    switch (row.failure) {
+    case Failure::MissingSource: source = m_dir.File("absent.mov"); break;
+    case Failure::DirectorySource: source = m_dir.Path(); break;
+    case Failure::NotAMovie: ASSERT_TRUE(testsupport::WriteFile(source, {'t', 'e', 'x', 't', '\n'})); break;
+    case Failure::SameFile: destination = source; break;
+    case Failure::SameFileRelative: destination = std::filesystem::relative(source).string(); break;
+    case Failure::SameFileDotted: destination = m_dir.Path() + "/./src.mov"; break;
+    default: break;
+    }
+    const bool sourceIsFile = std::filesystem::is_regular_file(source);
+    const auto sourceBefore = sourceIsFile ? StampFile(source) : jobtest::FileStamp{};
+    const auto destinationBefore = StampFile(destination);
+    int ended = 0;
+    if (row.failure == Failure::FullVolume) {
+        ended = RunWithFileSizeLimit(source, destination);
+    } else {
+        g_abortHalfway = row.failure == Failure::AbortHalfway;
+        ASSERT_EQ(TqSetCallBackNotifyProgressOVIX(AbortAtHalf), 0);
+        const int started = TqExecuteOVIX(source.c_str(), destination.c_str());
+        ended = started != 0 ? started : jobtest::WaitForJob();
+        g_abortHalfway = false;
+    }
+    EXPECT_EQ(ended, row.expected);
+    EXPECT_EQ(StampFile(destination), destinationBefore);  // bytes and time
+    EXPECT_EQ(sourceIsFile ? StampFile(source) : jobtest::FileStamp{}, sourceBefore);
+    // Nothing else new beside them.
+    for (const auto& entry : std::filesystem::directory_iterator(m_dir.Path())) {
+        const std::string name = entry.path().filename().string();
+        EXPECT_TRUE(name == "src.mov" || name == "dst.mov") << name;
+    }
+}
+
+INSTANTIATE_TEST_SUITE_P(Failures, FailedJobTest,
+                         ::testing::Values(FailedJob{"MissingSource", Failure::MissingSource, 110},
+                                           FailedJob{"DirectorySource", Failure::DirectorySource, 190},
+                                           FailedJob{"NotAMovie", Failure::NotAMovie, 8},
+                                           FailedJob{"ProcessedMovie", Failure::ProcessedMovie, 20},
+                                           FailedJob{"SameFile", Failure::SameFile, 190},
+                                           FailedJob{"SameFileRelative", Failure::SameFileRelative, 190},
+                                           FailedJob{"SameFileDotted", Failure::SameFileDotted, 190},
+                                           FailedJob{"AbortHalfway", Failure::AbortHalfway, 200},
+                                           FailedJob{"FullVolume", Failure::FullVolume, 131}),
+                         [](const ::testing::TestParamInfo<FailedJob>& info) { return std::string(info.param.name); });
 
 // Runs the query in a child process that has given up root, so that file modes apply.
 int PropertyAsNobody(const std::string& path)

@@ -53,90 +53,238 @@ void ForeignBrand(Recipe& recipe) { recipe.majorBrand = "isom"; recipe.compatibl
 
 TEST(CliTest, HelpVersionAndUsageErrors)
 {
-    for (const char* command : {"check", "process", "batch", "inspect", "make-sample"}) {
+    for (const char* command : {"check", "process", "batch", "inspect", "make-sample", "compare"}) {
         SCOPED_TRACE(command);
-        const Outcome help = Tool(std::string(command) + " --help");
-        EXPECT_EQ(help.status, 0);
-        EXPECT_NE(help.output.find(std::string("usage: tqovix ") + command), std::string::npos) << help.output;
+        for (const char* help : {" --help", " -h"}) {
+            const Outcome outcome = Tool(std::string(command) + help);
+            EXPECT_EQ(outcome.status, 0);
+            EXPECT_NE(outcome.output.find(std::string("usage: tqovix ") + command), std::string::npos) << outcome.output;
+        }
         EXPECT_EQ(Tool(command).status, 2);  // every command needs at least one argument
     }
-    EXPECT_EQ(Tool("--version").status, 0);
+    const Outcome version = Tool("--version");
+    EXPECT_EQ(version.status, 0);
+    for (const char* part : {"tqovix ", "libTqOVIXUtility ", "libavcodec "}) {
+        EXPECT_NE(version.output.find(part), std::string::npos) << version.output;
+    }
     EXPECT_EQ(Tool("process only-one-path").status, 2);
-    EXPECT_EQ(Tool("batch -o /nonexistent-directory x.mov").status, 2);
     EXPECT_EQ(Tool("no-such-command").status, 2);
     EXPECT_EQ(Tool("make-sample x.mov --aac --little-endian").status, 2);
 }
 
-// Each refusal with its reason and status, and the keys of every JSON report.
-TEST(CliTest, ReportsAndRefusals)
+// Every spelling people use for options, and the ones refused as usage errors.
+TEST(CliTest, ArgumentForms)
+{
+    TempDir dir;
+    const std::string source = Movie(dir, "-dash.mov");  // a name only "--" can pass
+    const std::string out = dir.File("out");
+    struct Form {
+        std::string arguments;
+        int status;
+    };
+    const Form forms[] = {
+        {"check -- " + Q(source), 0},
+        {"check -qv -- " + Q(source), 0},
+        {"batch -j2 -o " + Q(out) + " -- " + Q(source), 0},
+        {"batch -j 2 --output=" + Q(out + "2") + " -r -- " + Q(source), 0},
+        {"batch --jobs=2 --output " + Q(out + "3") + " -- " + Q(source), 0},
+        {"process -q -- " + Q(source) + " " + Q(dir.File("p.mov")), 0},
+        {"process -fq -- " + Q(source) + " " + Q(dir.File("p.mov")), 0},
+        {"inspect --json -- " + Q(source), 0},
+        {"check -dash.mov", 2},  // a leading dash is an option
+        {"check --json=yes -- " + Q(source), 2},
+        {"batch -o " + Q(out) + " -j 0 -- " + Q(source), 2},
+        {"batch -o " + Q(out) + " -j", 2},
+        {"process -z -- " + Q(source) + " x.mov", 2},
+        {"compare --png", 2},
+    };
+    for (const Form& form : forms) {
+        const Outcome outcome = Tool(form.arguments);
+        EXPECT_EQ(outcome.status, form.status) << form.arguments << "\n" << outcome.output;
+    }
+    EXPECT_TRUE(Exists(out + "/-dash.mov") && Exists(out + "2/-dash.mov") && Exists(out + "3/-dash.mov"));
+    // Existing files are refused with status 1 (not a usage error), and left alone.
+    const std::string kept = dir.File("kept.mov");
+    std::ofstream(kept) << "someone's file\n";
+    EXPECT_EQ(Tool("process -- " + Q(source) + " " + Q(kept)).status, 1);
+    EXPECT_EQ(Tool("process -n -- " + Q(source) + " " + Q(kept)).status, 1);
+    EXPECT_EQ(Tool("make-sample " + Q(kept)).status, 1);
+    EXPECT_EQ(std::filesystem::file_size(kept), 15u);
+    const Outcome uncreatable = Tool("make-sample " + Q(dir.File("absent/x.mov")));
+    EXPECT_EQ(uncreatable.status, 1);
+    EXPECT_NE(uncreatable.output.find("No such file or directory"), std::string::npos) << uncreatable.output;
+}
+
+// One reason per refusal, worded the same by check, process --json and inspect.
+struct ReasonCase {
+    const char* name;
+    void (*make)(const TempDir& dir, const std::string& path);
+    std::string text;
+    const char* key;
+};
+void PrintTo(const ReasonCase& row, std::ostream* out) { *out << row.name; }
+
+void WriteText(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
+void MakeMovie(const std::string& path, void (*edit)(Recipe&))
+{
+    Recipe recipe;
+    recipe.video.frameCount = 60;
+    edit(recipe);
+    std::string error;
+    ASSERT_TRUE(moviekit::WriteMovie(path, recipe, nullptr, &error)) << error;
+}
+
+const ReasonCase kReasons[] = {
+    {"SourceMissing", [](const TempDir&, const std::string&) {}, "file not found", "source-missing"},
+    {"SourceIsDirectory", [](const TempDir&, const std::string& path) { std::filesystem::create_directory(path); },
+     "the source is a directory", "source-is-directory"},
+    {"EmptyFile", [](const TempDir&, const std::string& path) { WriteText(path, ""); }, "empty file", "empty-file"},
+    {"NotAMovie", [](const TempDir&, const std::string& path) { WriteText(path, "not a movie at all\n"); },
+     "not a QuickTime/ISO movie", "not-a-movie"},
+    {"WrongBrand", [](const TempDir&, const std::string& path) { MakeMovie(path, ForeignBrand); },
+     "not a camera movie (brand 'isom')", "wrong-brand"},
+    {"MalformedAtom",
+     [](const TempDir&, const std::string& path) {
+         MakeMovie(path, [](Recipe&) {});
+         std::filesystem::resize_file(path, std::filesystem::file_size(path) - 10);  // the moov is cut short
+     },
+     "malformed atom: 'moov' at offset ", "malformed-atom"},
+    {"NoSoundTrack", [](const TempDir&, const std::string& path) { MakeMovie(path, [](Recipe& r) { r.sound.present = false; }); },
+     "no sound track", "no-sound-track"},
+    {"UnsupportedSound",
+     [](const TempDir&, const std::string& path) { MakeMovie(path, [](Recipe& r) { r.sound.channels = 10; }); },
+     "unsupported sound: sound has 10 channels; 1 to 8 are processed", "unsupported-sound"},
+    {"NoAFInformation",
+     [](const TempDir&, const std::string& path) { MakeMovie(path, [](Recipe& r) { r.maker.afInformation = false; }); },
+     "no AF information", "no-af-information"},
+    {"AlreadyProcessed",
+     [](const TempDir&, const std::string& path) { MakeMovie(path, [](Recipe& r) { r.maker.afProcessed = true; }); },
+     "already processed", "already-processed"},
+};
+
+class CliReasonTest : public ::testing::TestWithParam<ReasonCase> {};
+
+TEST_P(CliReasonTest, EveryCommandGivesTheSameReason)
+{
+    const ReasonCase& row = GetParam();
+    TempDir dir;
+    const std::string source = dir.File("in.mov");
+    row.make(dir, source);
+    const Outcome check = Tool("check " + Q(source));
+    EXPECT_EQ(check.status, 1);
+    EXPECT_NE(check.output.find(source + ": not processable: " + row.text), std::string::npos) << check.output;
+    const Outcome process = Tool("process --json " + Q(source) + " " + Q(dir.File("out.mov")));
+    EXPECT_EQ(process.status, 1);
+    EXPECT_NE(process.output.find("\"message\":\"" + row.text), std::string::npos) << process.output;
+    EXPECT_NE(process.output.find(std::string("\"reason\":\"") + row.key + "\""), std::string::npos) << process.output;
+    EXPECT_FALSE(Exists(dir.File("out.mov")));
+    const Outcome inspect = Tool("inspect " + Q(source));
+    if (row.text == "already processed") {
+        EXPECT_NE(inspect.output.find("AF information processed: yes"), std::string::npos) << inspect.output;
+    } else {
+        const bool refusedWhole = row.text == "file not found" || row.text == "the source is a directory";
+        EXPECT_EQ(inspect.status, refusedWhole ? 1 : 0) << inspect.output;
+        const std::string said = refusedWhole ? source + ": " + row.text : "the library would refuse it: " + row.text;
+        EXPECT_NE(inspect.output.find(said), std::string::npos) << inspect.output;
+    }
+}
+
+INSTANTIATE_TEST_SUITE_P(Reasons, CliReasonTest, ::testing::ValuesIn(kReasons),
+                         [](const ::testing::TestParamInfo<ReasonCase>& info) { return std::string(info.param.name); });
+
+// What stands at the destination is the destination's reason, named with its path.
+TEST(CliTest, DestinationReasons)
 {
     TempDir dir;
     const std::string source = Movie(dir, "in.mov");
-    const std::string done = Movie(dir, "done.mov", [](Recipe& r) { r.maker.afProcessed = true; });
-    const std::string foreign = Movie(dir, "isom.mp4", ForeignBrand);
-    const std::string noAf = Movie(dir, "noaf.mov", [](Recipe& r) { r.maker.afInformation = false; });
-    const std::string tenChannels = Movie(dir, "ten.mov", [](Recipe& r) { r.sound.channels = 10; });
-    const std::string text = dir.File("notes.txt");
-    std::ofstream(text) << "not a movie\n";
-    const std::string kept = dir.File("kept.mov");
-    std::ofstream(kept) << "someone's file\n";
-    const std::string json = dir.File("json.mov");
-    const std::string check = "check " + Q(source) + " ";  // beside a processable file: the worst verdict counts
-    struct Row {
-        std::string arguments;
-        int status;
-        std::vector<std::string> fragments;
+    std::filesystem::create_directory(dir.File("folder"));
+    const std::pair<std::string, std::string> rows[] = {
+        {"process " + Q(source) + " " + Q(source), source + ": source and destination are the same file"},
+        {"process --force " + Q(source) + " " + Q(dir.Path() + "/./in.mov"), "source and destination are the same file"},
+        {"process " + Q(source) + " " + Q(dir.File("folder")), dir.File("folder") + ": the destination is a directory"},
+        {"process " + Q(source) + " " + Q(dir.File("absent/x.mov")), "the destination's directory does not exist"},
     };
-    const Row rows[] = {
-        {"check " + Q(source), 0, {source + ": processable\n"}},
-        {check + Q(done), 1, {done + ": not processable: already processed\n"}},
-        {check + Q(foreign), 1, {foreign + ": not processable: not a camera movie (brand 'isom')\n"}},
-        {check + Q(noAf), 1, {noAf + ": not processable: no AF information"}},
-        // The parser words what the exported code cannot tell apart.
-        {check + Q(tenChannels), 1, {tenChannels + ": not processable: sound has 10 channels; 1 to 8 are processed\n"}},
-        {check + Q(text), 1, {text + ": not processable: no AF information, or not a camera movie"}},
-        {check + Q(dir.File("missing.mov")), 1, {"missing.mov: not processable: file not found\n"}},
-        {"process " + Q(source) + " " + Q(json) + " --json", 0,
-         {"{\"source\":\"" + source + "\"", "\"destination\":", "\"result\":0,", "\"message\":\"done\"",
-          "\"seconds\":"}},
-        {"process " + Q(source) + " " + Q(kept) + " --json", 2,
-         {"\"source\":", "\"destination\":", "\"result\":null", "\"message\":\"destination exists", "\"seconds\":"}},
-        {"process " + Q(foreign) + " " + Q(dir.File("x.mov")) + " --json", 1,
-         {"\"source\":", "\"destination\":", "\"result\":8,", "\"message\":\"no AF information", "\"seconds\":"}},
-        {"inspect " + Q(source) + " --json", 0,
-         {"\"atoms\":[{\"offset\":0,", "\"handler\":\"soun\",\"codec\":\"twos\"", "\"handler\":\"vide\"",
-          "\"trim\":{\"removedFrameForward\":0", "\"afInformationBytes\":", "\"processed\":false"}},
-        {"inspect " + Q(json) + " --json", 0, {"\"processed\":true", "\"libraryAnswer\":20"}},
-    };
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.arguments);
-        const Outcome outcome = Tool(row.arguments);
-        EXPECT_EQ(outcome.status, row.status) << outcome.output;
-        for (const std::string& fragment : row.fragments) {
-            EXPECT_NE(outcome.output.find(fragment), std::string::npos) << fragment << " in " << outcome.output;
-        }
-        if (row.arguments.ends_with("--json")) {  // one object on one line
-            EXPECT_TRUE(outcome.output.starts_with("{") && outcome.output.ends_with("}\n")) << outcome.output;
-            EXPECT_EQ(std::count(outcome.output.begin(), outcome.output.end(), '\n'), 1) << outcome.output;
-        }
+    for (const auto& [arguments, said] : rows) {
+        const Outcome outcome = Tool(arguments);
+        EXPECT_EQ(outcome.status, 1) << arguments;
+        EXPECT_NE(outcome.output.find(said), std::string::npos) << arguments << "\n" << outcome.output;
     }
-    EXPECT_EQ(std::filesystem::file_size(kept), 15u);  // untouched by the refusal
-    EXPECT_FALSE(Exists(dir.File("x.mov")));
 }
 
-TEST(CliTest, BatchGoesOnPastAFailingFile)
+// The keys of every JSON report; each is one valid UTF-8 object even for a name that is not.
+TEST(CliTest, JsonReports)
 {
     TempDir dir;
-    std::filesystem::create_directory(dir.File("out"));
-    const std::string good1 = Movie(dir, "one.mov");
-    const std::string bad = Movie(dir, "bad.mp4", ForeignBrand);
-    const std::string good2 = Movie(dir, "two.mov");
-    const Outcome outcome =
-        Tool("batch -o " + Q(dir.File("out")) + " -j 2 " + Q(good1) + " " + Q(bad) + " " + Q(good2));
-    EXPECT_EQ(outcome.status, 1) << outcome.output;
-    EXPECT_TRUE(Exists(dir.File("out/one.mov")) && Exists(dir.File("out/two.mov")));
-    EXPECT_FALSE(Exists(dir.File("out/bad.mp4")));
-    EXPECT_TRUE(outcome.output.ends_with("\n3 files: 2 done, 1 failed\n")) << outcome.output;
+    const std::string source = Movie(dir, "in\xff\xfe.mov");
+    const std::string destination = dir.File("out\xc3.mov");
+    const std::string strict = "python3 -c 'import json,sys; d=json.loads(sys.stdin.buffer.read().decode(\"utf-8\")); "
+                               "assert d[\"version\"] == 1' 2>&1";
+    const std::pair<std::string, std::vector<std::string>> rows[] = {
+        {"check --json " + Q(source), {"\"processable\":true", "\"reason\":\"none\""}},
+        {"process --json " + Q(source) + " " + Q(destination),
+         {"\"result\":0,", "\"reason\":\"none\"", "\"message\":\"done\"", "\"seconds\":"}},
+        {"process --json " + Q(source) + " " + Q(destination),
+         {"\"result\":null", "\"reason\":\"destination-exists\""}},
+        {"inspect --json " + Q(destination),
+         {"\"atoms\":[{\"offset\":0,", "\"handler\":\"soun\",\"codec\":\"twos\"", "\"trim\":{\"removedFrameForward\":0",
+          "\"processed\":true", "\"reason\":\"already-processed\""}},
+        {"inspect --json " + Q(dir.File("absent\xff")), {"\"reason\":\"source-missing\""}},
+        {"batch --json -o " + Q(dir.File("o\xff")) + " " + Q(source) + " " + Q(destination),
+         {"\"status\":\"done\"", "\"status\":\"skipped\"", "\"done\":1,\"skipped\":1,\"failed\":0"}},
+        {"compare --json " + Q(source) + " " + Q(destination), {"\"intervals\":[{"}},
+    };
+    for (const auto& [arguments, fragments] : rows) {
+        SCOPED_TRACE(arguments);
+        const Outcome outcome = Tool(arguments + " 2>/dev/null");
+        for (const std::string& fragment : fragments) {
+            EXPECT_NE(outcome.output.find(fragment), std::string::npos) << fragment << " in " << outcome.output;
+        }
+        EXPECT_TRUE(outcome.output.starts_with("{") && outcome.output.ends_with("}\n")) << outcome.output;
+        std::string parsed;
+        EXPECT_EQ(testsupport::RunCommand("printf '%s' " + Q(outcome.output) + " | " + strict, &parsed), 0) << parsed;
+    }
+}
+
+// A card: movies beside stills and notes, in folders; the layout is kept, the rest passed over.
+TEST(CliTest, BatchOverACardsFolders)
+{
+    TempDir dir;
+    const std::string card = dir.File("card");
+    std::filesystem::create_directories(card + "/DCIM/100CAM");
+    std::filesystem::create_directories(card + "/MISC");
+    Movie(dir, "card/DCIM/100CAM/PCM.MOV");
+    Movie(dir, "card/DCIM/100CAM/AAC.MOV", [](Recipe& r) { r.sound.codec = moviekit::SoundCodec::Aac; });
+    Movie(dir, "card/DCIM/DONE.MOV", [](Recipe& r) { r.maker.afProcessed = true; });
+    Movie(dir, "card/FOREIGN.MP4", ForeignBrand);
+    WriteText(card + "/DCIM/100CAM/STILL.JPG", "\xff\xd8\xff\xe0 a still");
+    WriteText(card + "/MISC/notes.txt", "a sidecar\n");
+    const std::string out = dir.File("out/nested");  // created, parents too
+
+    const Outcome plan = Tool("batch --dry-run -r -o " + Q(out) + " " + Q(card));
+    EXPECT_EQ(plan.status, 0);
+    EXPECT_NE(plan.output.find("would process " + card + "/DCIM/100CAM/AAC.MOV -> " + out + "/DCIM/100CAM/AAC.MOV"),
+              std::string::npos) << plan.output;
+    EXPECT_FALSE(Exists(out));
+
+    const Outcome flat = Tool("batch -o " + Q(out) + " " + Q(card));  // without -r: the top folder only
+    EXPECT_EQ(flat.status, 0) << flat.output;
+    EXPECT_NE(flat.output.find("1 movie: 0 done, 1 skipped"), std::string::npos) << flat.output;
+
+    const Outcome outcome = Tool("batch -r -j 2 -o " + Q(out) + " " + Q(card));
+    EXPECT_EQ(outcome.status, 0) << outcome.output;
+    EXPECT_TRUE(Exists(out + "/DCIM/100CAM/PCM.MOV") && Exists(out + "/DCIM/100CAM/AAC.MOV")) << outcome.output;
+    for (const char* passed : {"/DCIM/DONE.MOV", "/FOREIGN.MP4", "/DCIM/100CAM/STILL.JPG", "/MISC/notes.txt", "/MISC"}) {
+        EXPECT_FALSE(Exists(out + passed)) << passed;
+    }
+    EXPECT_NE(outcome.output.find("skipped: already processed"), std::string::npos) << outcome.output;
+    EXPECT_NE(outcome.output.find("skipped: not a camera movie (brand 'isom')"), std::string::npos) << outcome.output;
+    EXPECT_EQ(outcome.output.find("STILL.JPG"), std::string::npos) << outcome.output;
+    EXPECT_NE(outcome.output.find("4 movies: 2 done, 2 skipped, 0 failed"), std::string::npos) << outcome.output;
+
+    // Run again: the destinations exist now, which fails those two without --force.
+    const Outcome again = Tool("batch -r -o " + Q(out) + " " + Q(card));
+    EXPECT_EQ(again.status, 1) << again.output;
+    EXPECT_NE(again.output.find("the destination exists"), std::string::npos) << again.output;
 }
 
 // Waits (up to `seconds`) until `ready` holds.

@@ -279,9 +279,9 @@ INSTANTIATE_TEST_SUITE_P(
                       Writer{"TimecodeTrack", "pcm_s16le", 48000, 2, ".mov", kTimecode, 0},
                       Writer{"TwoSoundTracks", "pcm_s16be", 48000, 2, ".mov", kSecondSound, 0},
                       Writer{"Pcm24Bit", "pcm_s24le", 48000, 2, ".mov", "", kRefused, Sound::Pcm,
-                             "sound is 24-bit PCM; only 16-bit is processed"},
+                             "unsupported sound: sound is 24-bit PCM; only 16-bit is processed"},
                       Writer{"PcmFloat", "pcm_f32le", 48000, 2, ".mov", "", kRefused, Sound::Pcm,
-                             "sound is floating-point PCM"},
+                             "unsupported sound: sound is floating-point PCM"},
                       Writer{"Fragmented", "aac", 48000, 2, ".mov", "-movflags frag_keyframe+empty_moov",
                              kRefused, Sound::Aac, "fragmented movie"}),
     [](const ::testing::TestParamInfo<Writer>& info) { return std::string(info.param.name); });

@@ -52,6 +52,7 @@ eTqovixErrorCode ReadSequentially(const std::vector<uint8_t>& block, uint64_t& p
 eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const char* destinationPath)
 {
     m_refusal.clear();
+    m_refusalKind = eTqovixRefusal::None;
     if (sourcePath == nullptr || sourcePath[0] == '\0') {
         return eTqovixErrorSourceNotFound;
     }
@@ -68,7 +69,7 @@ eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const cha
     }
     if (TqovixFailed(m_atomControl.Initialize(m_sourceFile))) {
         Close();
-        return Refuse(eTqovixErrorInvalidMovie, "not a QuickTime movie with brand 'qt  ' or 'mp42', or its atoms "
+        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::NotAMovie, "not a QuickTime movie with brand 'qt  ' or 'mp42', or its atoms "
                                                 "do not account for every byte of the file");
     }
 
@@ -81,11 +82,11 @@ eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const cha
     result = m_atomControl.Analyze(af);
     if (TqovixFailed(result) || TqovixCodes::IsVerdict(result)) {
         Close();
-        return result == eTqovixErrorInvalidMovie ? Refuse(result, "no AF information") : result;
+        return result == eTqovixErrorInvalidMovie ? Refuse(result, eTqovixRefusal::NoAFInformation, "no AF information") : result;
     }
     if (af.GetAFInformationSize() == 0) {
         Close();
-        return Refuse(eTqovixErrorInvalidMovie, "no AF information");
+        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::NoAFInformation, "no AF information");
     }
     m_afInformation = af.TakeAFInformation();
 

@@ -18,6 +18,18 @@
 class CTqovixMainFrame;
 class CTqovixAudioInformationVisitor;
 
+// What kind of refusal the words of GetRefusal describe, for hosts that sort them.
+enum class eTqovixRefusal {
+    None,
+    NotAMovie,          // not a QuickTime/ISO movie of an accepted brand, or atoms that do not add up
+    Fragmented,
+    NoSoundTrack,
+    UnsupportedSound,   // a sound format, depth or channel count not processed
+    UnsupportedLayout,  // media elsewhere, or chunk sizes that cannot be known
+    NoAFInformation,
+    Malformed,          // tables that contradict each other or point past the end
+};
+
 class CTqovixMovControl {
 public:
     CTqovixMovControl() = default;
@@ -29,6 +41,7 @@ public:
     eTqovixErrorCode Initialize(const char* sourcePath, const char* destinationPath);
     // Why the last Initialize refused the movie, in words for people; empty when it did not.
     const std::string& GetRefusal() const { return m_refusal; }
+    eTqovixRefusal GetRefusalKind() const { return m_refusalKind; }
     void Close();
 
     eTqovixErrorCode GetAFInformation(void* buffer, unsigned long* delivered, unsigned long size,
@@ -77,7 +90,7 @@ private:
     eTqovixErrorCode RefuseFragmented();
     eTqovixErrorCode AnalyzeSoundFormat(const CTqovixAudioInformationVisitor& information);
     eTqovixErrorCode GatherCarriedTracks(uint32_t soundTrack, uint32_t soundFrameBytes, uint64_t fileSize);
-    eTqovixErrorCode Refuse(eTqovixErrorCode code, std::string reason);
+    eTqovixErrorCode Refuse(eTqovixErrorCode code, eTqovixRefusal kind, std::string reason);
     // Planning the destination: the mdat header's form from what will go in.
     bool NeedsLargeMediaDataHeader(bool largeSource) const;
     // Whether the destination the general writer would give is the source with new sound
@@ -123,6 +136,7 @@ private:
     uint32_t m_soundTrackIndex = 0;
     uint32_t m_frameBytes = 0;  // PCM: bytes per frame of the sound track
     std::string m_refusal;
+    eTqovixRefusal m_refusalKind = eTqovixRefusal::None;
     std::vector<TqovixChunkInformation> m_outputAudioChunks;
     std::vector<TqovixChunkInformation> m_outputMovieDataChunks;
     bool m_bBigEndian = true;

@@ -52,8 +52,9 @@ bool IsFragmented(const TqovixAtomList& atoms)
 
 }  // namespace
 
-eTqovixErrorCode CTqovixMovControl::Refuse(eTqovixErrorCode code, std::string reason)
+eTqovixErrorCode CTqovixMovControl::Refuse(eTqovixErrorCode code, eTqovixRefusal kind, std::string reason)
 {
+    m_refusalKind = kind;
     m_refusal = std::move(reason);
     return code;
 }
@@ -65,7 +66,7 @@ eTqovixErrorCode CTqovixMovControl::RefuseFragmented()
     if (TqovixFailed(result)) {
         return result;
     }
-    return IsFragmented(atoms) ? Refuse(eTqovixErrorInvalidMovie, "fragmented movie") : eTqovixSuccess;
+    return IsFragmented(atoms) ? Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::Fragmented, "fragmented movie") : eTqovixSuccess;
 }
 
 eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
@@ -79,7 +80,7 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
     result = m_atomControl.Analyze(information);
     if (TqovixFailed(result)) {
         return result != eTqovixErrorInvalidMovie ? result
-                                                  : Refuse(result, "no sound track, or its description cannot be read");
+                                                  : Refuse(result, eTqovixRefusal::NoSoundTrack, "no sound track, or its description cannot be read");
     }
     result = AnalyzeSoundFormat(information);
     if (TqovixFailed(result)) {
@@ -102,7 +103,7 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
         chunkSamples += chunk.sampleCount;
     }
     if (m_audioChunks.empty() || information.GetCount() > chunkSamples) {
-        return Refuse(eTqovixErrorInvalidMovie, "the sound track's tables promise more sound than its chunks hold");
+        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::Malformed, "the sound track's tables promise more sound than its chunks hold");
     }
     if (!forJob) {
         return eTqovixSuccess;
@@ -124,16 +125,16 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeSoundFormat(const CTqovixAudioInforma
     const TqovixSoundEntry::Entry& entry = information.GetEntry();
     const uint32_t channels = information.GetChannel();
     if (information.GetRate() == 0) {
-        return Refuse(eTqovixErrorInvalidMovie, "sound has no sample rate");
+        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound, "sound has no sample rate");
     }
     if (TqovixSoundEntry::IsAac(entry)) {
         const uint8_t objectType = information.GetAudioSpecificConfigData()[0] >> 3;
         if (objectType != kAacLowComplexity) {
-            return Refuse(eTqovixErrorInvalidMovie,
+            return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound,
                           Words({"sound is AAC of object type ", std::to_string(objectType), "; only AAC-LC is processed"}));
         }
         if (channels == 0 || channels > kMaxAacChannels) {
-            return Refuse(eTqovixErrorInvalidMovie, Words({"sound is AAC with ", std::to_string(channels),
+            return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound, Words({"sound is AAC with ", std::to_string(channels),
                                                            " channels; only mono and stereo AAC are processed"}));
         }
         m_bPCM = false;
@@ -142,23 +143,23 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeSoundFormat(const CTqovixAudioInforma
         return eTqovixSuccess;
     }
     if (!TqovixSoundEntry::IsPcmFormat(entry)) {
-        return Refuse(eTqovixErrorInvalidMovie, Words({"sound format ", FourCC(entry.format), " is not processed"}));
+        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound, Words({"sound format ", FourCC(entry.format), " is not processed"}));
     }
     const bool floating = (entry.version == 2 && (entry.formatFlags & 1) != 0) ||
                           entry.format == TqovixMakeAtomType("fl32") || entry.format == TqovixMakeAtomType("fl64");
     if (floating) {
-        return Refuse(eTqovixErrorInvalidMovie, "sound is floating-point PCM; only 16-bit is processed");
+        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound, "sound is floating-point PCM; only 16-bit is processed");
     }
     if (entry.bitsPerChannel != 16) {
-        return Refuse(eTqovixErrorInvalidMovie,
+        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound,
                       Words({"sound is ", std::to_string(entry.bitsPerChannel), "-bit PCM; only 16-bit is processed"}));
     }
     if (channels == 0 || channels > kMaxPcmChannels) {
-        return Refuse(eTqovixErrorInvalidMovie,
+        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound,
                       Words({"sound has ", std::to_string(channels), " channels; 1 to 8 are processed"}));
     }
     if (TqovixSoundEntry::FrameBytes(entry) != 2 * channels) {
-        return Refuse(eTqovixErrorInvalidMovie, "the sound description's frame size does not match 16-bit samples");
+        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound, "the sound description's frame size does not match 16-bit samples");
     }
     m_bPCM = true;
     m_bBigEndian = information.IsBigEndianFormat();
@@ -172,7 +173,7 @@ eTqovixErrorCode CTqovixMovControl::GatherCarriedTracks(uint32_t soundTrack, uin
     CTqovixTrackListVisitor list;
     eTqovixErrorCode result = m_atomControl.Analyze(list);
     if (TqovixFailed(result)) {
-        return result == eTqovixErrorInvalidMovie ? Refuse(result, "the movie's tracks cannot be read") : result;
+        return result == eTqovixErrorInvalidMovie ? Refuse(result, eTqovixRefusal::Malformed, "the movie's tracks cannot be read") : result;
     }
     std::vector<TqovixChunkInformation> carried;
     std::vector<uint32_t> owners;
@@ -180,12 +181,12 @@ eTqovixErrorCode CTqovixMovControl::GatherCarriedTracks(uint32_t soundTrack, uin
         for (const TqovixTrackTables& track : list.GetTracks()) {
             if (track.index == soundTrack) {
                 if (!track.dataInFile) {
-                    return Refuse(eTqovixErrorInvalidMovie, "the sound track's media lies in another file");
+                    return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedLayout, "the sound track's media lies in another file");
                 }
                 result = TqovixBuildChunkList(track, soundFrameBytes, m_audioChunks);
                 if (TqovixFailed(result)) {
                     return result == eTqovixErrorInvalidMovie
-                               ? Refuse(result, "the sound track's sample tables contradict each other")
+                               ? Refuse(result, eTqovixRefusal::Malformed, "the sound track's sample tables contradict each other")
                                : result;
                 }
                 continue;
@@ -199,25 +200,25 @@ eTqovixErrorCode CTqovixMovControl::GatherCarriedTracks(uint32_t soundTrack, uin
                 frameBytes = TqovixSoundEntry::FrameBytes(*track.soundEntry);
             } else if (track.IsHandler("soun") && track.sizes && track.sizes->common == 1) {
                 // Compressed sound counted in bytes: its chunk sizes cannot be known for sure.
-                return Refuse(eTqovixErrorInvalidMovie, Words({TrackName(track), ": chunk sizes of format ",
+                return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedLayout, Words({TrackName(track), ": chunk sizes of format ",
                                                                FourCC(track.format), " cannot be determined"}));
             }
             std::vector<TqovixChunkInformation> chunks;
             result = TqovixBuildChunkList(track, frameBytes, chunks);
             if (TqovixFailed(result)) {
                 return result == eTqovixErrorInvalidMovie
-                           ? Refuse(result, Words({TrackName(track), ": sample tables contradict each other"}))
+                           ? Refuse(result, eTqovixRefusal::Malformed, Words({TrackName(track), ": sample tables contradict each other"}))
                            : result;
             }
             if (TqovixFailed(TqovixCheckChunksInFile(chunks, fileSize))) {
-                return Refuse(eTqovixErrorInvalidMovie, Words({TrackName(track), ": chunks lie past the end of the file"}));
+                return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::Malformed, Words({TrackName(track), ": chunks lie past the end of the file"}));
             }
             m_carriedTracks.emplace_back(track.index, chunks.size());
             carried.insert(carried.end(), chunks.begin(), chunks.end());
             owners.insert(owners.end(), chunks.size(), track.index);
         }
         if (TqovixFailed(TqovixCheckChunksInFile(m_audioChunks, fileSize))) {
-            return Refuse(eTqovixErrorInvalidMovie, "the sound track's chunks lie past the end of the file");
+            return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::Malformed, "the sound track's chunks lie past the end of the file");
         }
         // Carried chunks go out in source order, whatever track they belong to.
         std::vector<size_t> order(carried.size());

@@ -2,7 +2,9 @@
 
 #include "MovieWriter.h"
 
+#include <cerrno>
 #include <cstdio>
+#include <cstring>
 #include <memory>
 
 namespace moviekit {
@@ -49,14 +51,14 @@ bool WriteMovie(const std::string& path, const MovieRecipe& recipe, MovieLayout*
     FileSink sink(path);
     if (!sink.IsOpen()) {
         if (error != nullptr) {
-            *error = "cannot create " + path;
+            *error = "cannot create " + path + ": " + std::strerror(errno);
         }
         return false;
     }
     const bool written = WriteMovieTo(sink, recipe, layout, error);
     if (!sink.Close() && written) {
         if (error != nullptr) {
-            *error = "cannot write " + path;
+            *error = "cannot write " + path + ": " + std::strerror(errno);
         }
         return false;
     }

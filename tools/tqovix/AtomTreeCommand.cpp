@@ -1,43 +1,53 @@
-// tqovix inspect: the atom tree as the parser sees it, the tracks, the trim tags and the
-// maker blocks as the library's visitors read them, and whether the AF information has
-// been processed already.
+// tqovix inspect: the atom tree of any QuickTime or ISO file, and for a movie the tracks, the
+// trim tags and the maker blocks as the library's visitors read them; whether the AF
+// information has been processed already, or why the library would refuse the file.
 #include <cstdio>
+#include <sys/stat.h>
 
-#include "Commands.h"
+#include "CommandLine.h"
 #include "Inspection.h"
-#include "atom/CTqovixAtomControl.h"
-#include "file/CTqovixFile.h"
+#include "Json.h"
 
 namespace {
 
 constexpr const char* kUsage =
-    "usage: tqovix inspect FILE [--json]\n"
-    "  prints the atom tree (offset, size, type), the tracks, the trim tags, the sizes of\n"
-    "  the AF and audio level information and whether the AF information is processed\n";
+    "usage: tqovix inspect [--json] FILE\n"
+    "  prints the atom tree (offset, size, type) of any QuickTime or ISO file, and for a\n"
+    "  movie the tracks, the trim tags, the sizes of the AF and audio level information and\n"
+    "  whether the AF information is processed, or why the library would refuse the file\n"
+    "  --json    one JSON object instead of text\n"
+    "  exit status: 0 inspected (even a file the library refuses), 1 unreadable, 2 usage\n";
 
 }  // namespace
 
-int InspectCommand(Arguments arguments)
+int InspectCommand(const Arguments& arguments)
 {
-    const bool json = std::erase(arguments, std::string("--json")) > 0;
-    if (arguments.size() != 1 || arguments[0].starts_with("-")) {
-        const bool help = arguments.size() == 1 && arguments[0] == "--help";
-        std::fputs(kUsage, help ? stdout : stderr);
-        return help ? 0 : 2;
+    CommandLine line("inspect", kUsage, {{"json", 0, false}});
+    if (const int status = line.Parse(arguments); status >= 0) {
+        return status;
     }
-    const std::string path = arguments[0];
-    CTqovixFile file;
-    CTqovixAtomControl tree;
-    eTqovixErrorCode result = file.Open(path.c_str(), 1);
-    if (!TqovixFailed(result)) {
-        result = tree.Initialize(file);
+    if (line.Operands().size() != 1) {
+        return line.Misuse("one FILE is needed");
     }
-    if (TqovixFailed(result)) {
-        std::fprintf(stderr, "tqovix: %s: %s (code %d)\n", path.c_str(), DescribeInternalCode(result).c_str(), result);
+    const std::string path = line.Operands()[0];
+    struct stat status {};
+    const bool file = stat(path.c_str(), &status) == 0 && !S_ISDIR(status.st_mode);
+    const Inspection inspection = file ? Inspect(path) : Inspection{};
+    if (!file || !inspection.structure.readable) {
+        const Verdict verdict = Explain(190, path);
+        if (line.Has("json")) {
+            std::printf("%s\n", JsonObject::Report()
+                                    .Add("file", path)
+                                    .Add("reason", verdict.Key())
+                                    .Add("message", verdict.text)
+                                    .Text()
+                                    .c_str());
+        } else {
+            std::fprintf(stderr, "tqovix: %s: %s\n", path.c_str(), verdict.text.c_str());
+        }
         return 1;
     }
-    const Inspection inspection = Inspect(path, tree);
-    if (json) {
+    if (line.Has("json")) {
         PrintInspectionJson(inspection);
     } else {
         PrintInspectionText(inspection);

@@ -1,45 +1,73 @@
-// tqovix batch: many movies, one job per child process (the library runs one job per
-// process), a few at a time, then a summary table.
+// tqovix batch: many movies, or folders of them (a memory card), one job per child process
+// (the library runs one job per process), a few at a time, then a summary.
 #include <algorithm>
 #include <cerrno>
+#include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
+#include <filesystem>
 #include <set>
 #include <string>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <utility>
 #include <vector>
 
-#include "Commands.h"
+#include "CommandLine.h"
+#include "Json.h"
+#include "Reasons.h"
+#include "Structure.h"
+#include "api/TqOVIXUtility.h"
 
 namespace {
 
+namespace fs = std::filesystem;
+
 constexpr const char* kUsage =
-    "usage: tqovix batch -o OUTDIR [-j N] [--force] FILE...\n"
-    "  processes every FILE into OUTDIR under its own name, N jobs at a time (default: one\n"
-    "  per core), each in a child process, and prints a summary table\n"
-    "  --force   overwrite existing files in OUTDIR\n"
-    "  exit status: 0 all done, 1 any file failed, 2 usage error, 130 interrupted\n";
+    "usage: tqovix batch -o OUTDIR [OPTIONS] PATH...\n"
+    "  processes every movie among PATHs into OUTDIR, N jobs at a time, each in a child\n"
+    "  process, and prints a summary. A folder PATH is searched for movies (by their content,\n"
+    "  not their names; other files are passed over) and its layout is kept under OUTDIR.\n"
+    "  -o, --output DIR   where the processed movies go (created when missing)\n"
+    "  -j, --jobs N       jobs at a time (default: one per core)\n"
+    "  -r, --recursive    search folders and their subfolders\n"
+    "  -f, --force        replace existing files in OUTDIR\n"
+    "  --dry-run          list what would be done, and do nothing\n"
+    "  --json             one JSON object with a row per movie and the totals\n"
+    "  Movies already processed, and files that are not camera movies, are listed as skipped.\n"
+    "  exit status: 0 nothing failed, 1 any movie failed, 2 usage error, 130 interrupted\n";
 
 volatile std::sig_atomic_t g_signal = 0;
 
 void OnSignal(int number) { g_signal = number; }
 
+enum class Outcome { Pending, Done, Skipped, Failed };
+
 struct Job {
     std::string source;
     std::string destination;
+    uint64_t bytes = 0;
     pid_t pid = -1;
     int output = -1;  // read end of the child's standard output
-    bool finished = false;
-    bool ok = false;
-    std::string message = "not started";
+    Outcome outcome = Outcome::Pending;
+    std::string reason = "none";
+    std::string message;
     double seconds = 0;
 };
+
+const char* OutcomeName(Outcome outcome)
+{
+    switch (outcome) {
+    case Outcome::Done: return "done";
+    case Outcome::Skipped: return "skipped";
+    case Outcome::Failed: return "failed";
+    case Outcome::Pending: break;
+    }
+    return "not started";
+}
 
 // The value after "key": in the flat JSON object a child prints; empty when missing.
 std::string JsonValue(const std::string& json, const std::string& key)
@@ -64,129 +92,301 @@ std::string JsonValue(const std::string& json, const std::string& key)
     return text;
 }
 
-bool Start(Job& job, bool force)
-{
-    int ends[2];
-    if (pipe2(ends, O_CLOEXEC) != 0) {
-        return false;
-    }
-    job.pid = fork();
-    if (job.pid == 0) {
-        dup2(ends[1], STDOUT_FILENO);
-        const char* argv[] = {"tqovix",  "process", job.source.c_str(), job.destination.c_str(), "--quiet",
-                              "--json", force ? "--force" : nullptr, nullptr};
-        execv("/proc/self/exe", const_cast<char* const*>(argv));
-        _exit(127);
-    }
-    close(ends[1]);
-    if (job.pid < 0) {
-        close(ends[0]);
-        return false;
-    }
-    job.output = ends[0];
-    return true;
-}
+class Batch {
+public:
+    explicit Batch(const CommandLine& line) : m_line(line) {}
 
-void Collect(Job& job, int status)
-{
-    std::string json;
-    char buffer[4096];
-    ssize_t count = 0;
-    while ((count = read(job.output, buffer, sizeof buffer)) > 0 || (count < 0 && errno == EINTR)) {
-        json.append(buffer, static_cast<size_t>(std::max<ssize_t>(count, 0)));
-    }
-    close(job.output);
-    job.finished = true;
-    job.seconds = std::atof(JsonValue(json, "seconds").c_str());
-    const std::string result = JsonValue(json, "result");
-    job.ok = WIFEXITED(status) && WEXITSTATUS(status) == 0 && result == "0";
-    if (!JsonValue(json, "message").empty()) {
-        job.message = JsonValue(json, "message");
-        if (!job.ok && !result.empty() && result != "null") {
-            job.message += " (" + result + ")";
+    // The movies under the PATHs, each with its destination.
+    void Gather()
+    {
+        std::error_code error;
+        const fs::path output = fs::weakly_canonical(m_line.Value("output"), error);
+        for (const std::string& operand : m_line.Operands()) {
+            if (fs::is_directory(operand, error)) {
+                GatherFolder(operand, output);
+            } else {
+                Add(operand, fs::path(operand).filename());
+            }
         }
-    } else if (WIFSIGNALED(status)) {
-        job.message = "killed by signal " + std::to_string(WTERMSIG(status));
-    } else {
-        job.message = "exit status " + std::to_string(WIFEXITED(status) ? WEXITSTATUS(status) : -1);
+        if (m_jobs.empty()) {
+            std::fprintf(stderr, "tqovix batch: no movies found%s\n", m_line.Has("recursive") ? "" : " (-r searches subfolders)");
+        }
     }
-}
 
-void PrintSummary(const std::vector<Job>& jobs)
-{
-    size_t nameWidth = 4;
-    size_t resultWidth = 6;
-    for (const Job& job : jobs) {
-        nameWidth = std::max(nameWidth, job.source.size());
-        resultWidth = std::max(resultWidth, job.message.size() + (job.ok ? 0 : 8));
+    // Movies the library would not take anyway are skipped with their reason.
+    void Classify()
+    {
+        const bool library = TqInitializeOVIX() == 0;
+        for (Job& job : m_jobs) {
+            if (job.outcome != Outcome::Pending) {
+                continue;
+            }
+            const int code = library ? TqGetPropertyOVIX(job.source.c_str()) : 0;
+            if (code == 0) {
+                continue;
+            }
+            const Verdict verdict = Explain(code, job.source);
+            const bool skipped = verdict.code == 8 || verdict.code == 20;
+            Finish(job, skipped ? Outcome::Skipped : Outcome::Failed, verdict.Key(), verdict.text);
+        }
+        if (library) {
+            TqCloseOVIX();
+        }
     }
-    std::printf("\n%-*s  %-*s  %8s\n", static_cast<int>(nameWidth), "file", static_cast<int>(resultWidth),
-                "result", "seconds");
-    size_t failed = 0;
-    for (const Job& job : jobs) {
-        const std::string result = job.ok ? job.message : "failed: " + job.message;
-        std::printf("%-*s  %-*s  %8.2f\n", static_cast<int>(nameWidth), job.source.c_str(),
-                    static_cast<int>(resultWidth), result.c_str(), job.seconds);
-        failed += job.ok ? 0 : 1;
+
+    void Run(long parallel)
+    {
+        size_t next = 0;
+        size_t running = 0;
+        bool forwarded = false;
+        for (;;) {
+            while (g_signal == 0 && running < static_cast<size_t>(parallel) && next < m_jobs.size()) {
+                Job& job = m_jobs[next++];
+                if (job.outcome != Outcome::Pending) {
+                    continue;
+                }
+                if (Start(job)) {
+                    ++running;
+                } else {
+                    Finish(job, Outcome::Failed, "internal", std::string("could not start a job: ") + std::strerror(errno));
+                }
+            }
+            if (running == 0) {
+                break;
+            }
+            if (g_signal != 0 && !forwarded) {
+                for (const Job& job : m_jobs) {
+                    if (job.pid > 0 && job.outcome == Outcome::Pending) {
+                        kill(job.pid, g_signal);  // each child aborts its job and removes its output
+                    }
+                }
+                forwarded = true;
+            }
+            int status = 0;
+            const pid_t pid = waitpid(-1, &status, 0);
+            if (pid < 0) {
+                if (errno == EINTR) {
+                    continue;  // a signal: forwarded above
+                }
+                break;
+            }
+            for (Job& job : m_jobs) {
+                if (job.pid == pid && job.outcome == Outcome::Pending) {
+                    Collect(job, status);
+                    --running;
+                }
+            }
+        }
     }
-    std::printf("%zu files: %zu done, %zu failed\n", jobs.size(), jobs.size() - failed, failed);
-}
+
+    void ListPlan() const
+    {
+        for (const Job& job : m_jobs) {
+            if (job.outcome == Outcome::Pending) {
+                std::printf("would process %s -> %s\n", job.source.c_str(), job.destination.c_str());
+            } else {
+                std::printf("would skip %s: %s\n", job.source.c_str(), job.message.c_str());
+            }
+        }
+    }
+
+    void PrintSummary(double seconds) const
+    {
+        size_t counts[4] = {};
+        uint64_t bytes = 0;
+        for (const Job& job : m_jobs) {
+            ++counts[static_cast<int>(job.outcome)];
+            bytes += job.outcome == Outcome::Done ? job.bytes : 0;
+        }
+        if (m_line.Has("json")) {
+            std::vector<std::string> rows;
+            for (const Job& job : m_jobs) {
+                rows.push_back(JsonObject()
+                                   .Add("source", job.source)
+                                   .Add("destination", job.destination)
+                                   .Add("status", OutcomeName(job.outcome))
+                                   .Add("reason", job.reason)
+                                   .Add("message", job.message)
+                                   .Add("seconds", job.seconds)
+                                   .Text());
+            }
+            std::printf("%s\n", JsonObject::Report()
+                                    .AddJson("files", JsonArray(rows))
+                                    .Add("done", static_cast<uint64_t>(counts[1]))
+                                    .Add("skipped", static_cast<uint64_t>(counts[2]))
+                                    .Add("failed", static_cast<uint64_t>(counts[3] + counts[0]))
+                                    .Add("bytes", bytes)
+                                    .Add("seconds", seconds)
+                                    .Text()
+                                    .c_str());
+            return;
+        }
+        size_t nameWidth = 4;
+        for (const Job& job : m_jobs) {
+            nameWidth = std::max(nameWidth, job.source.size());
+        }
+        std::printf("\n%-*s  %-7s  %8s  %s\n", static_cast<int>(nameWidth), "file", "result", "seconds", "reason");
+        for (const Job& job : m_jobs) {
+            std::printf("%-*s  %-7s  %8.2f  %s\n", static_cast<int>(nameWidth), job.source.c_str(),
+                        OutcomeName(job.outcome), job.seconds, job.outcome == Outcome::Done ? "" : job.message.c_str());
+        }
+        std::printf("%zu %s: %zu done, %zu skipped, %zu failed; %.1f MB in %.1f s\n", m_jobs.size(),
+                    m_jobs.size() == 1 ? "movie" : "movies", counts[1],
+                    counts[2], counts[3] + counts[0], static_cast<double>(bytes) / 1e6, seconds);
+    }
+
+    bool AnyFailed() const
+    {
+        return std::any_of(m_jobs.begin(), m_jobs.end(),
+                           [](const Job& job) { return job.outcome == Outcome::Failed || job.outcome == Outcome::Pending; });
+    }
+
+private:
+    void GatherFolder(const fs::path& root, const fs::path& output)
+    {
+        std::error_code error;
+        std::vector<fs::path> files;
+        const auto options = fs::directory_options::skip_permission_denied;
+        auto keep = [&](const fs::directory_entry& entry) {
+            std::error_code ignored;
+            if (entry.is_regular_file(ignored) && StartsLikeMovie(entry.path().string())) {
+                files.push_back(entry.path());
+            }
+        };
+        if (m_line.Has("recursive")) {
+            for (fs::recursive_directory_iterator it(root, options, error), end; !error && it != end; it.increment(error)) {
+                std::error_code ignored;
+                // The output folder may lie inside the card's tree: never take our own results.
+                if (it->is_directory(ignored) && fs::weakly_canonical(it->path(), ignored) == output) {
+                    it.disable_recursion_pending();
+                    continue;
+                }
+                keep(*it);
+            }
+        } else {
+            for (fs::directory_iterator it(root, options, error), end; !error && it != end; it.increment(error)) {
+                keep(*it);
+            }
+        }
+        if (error) {
+            std::fprintf(stderr, "tqovix batch: %s: %s\n", root.c_str(), error.message().c_str());
+        }
+        std::sort(files.begin(), files.end());
+        for (const fs::path& file : files) {
+            Add(file.string(), file.lexically_relative(root));
+        }
+    }
+
+    void Add(const std::string& source, const fs::path& relative)
+    {
+        Job job;
+        job.source = source;
+        job.destination = (fs::path(m_line.Value("output")) / relative).string();
+        std::error_code error;
+        job.bytes = fs::is_regular_file(source, error) ? fs::file_size(source, error) : 0;
+        if (relative.empty() || !m_destinations.insert(job.destination).second) {
+            // Two jobs must never write one destination.
+            job.outcome = Outcome::Failed;
+            job.reason = "same-destination";
+            job.message = "another movie in this batch goes to the same destination";
+        }
+        m_jobs.push_back(std::move(job));
+    }
+
+    bool Start(Job& job)
+    {
+        std::error_code error;
+        fs::create_directories(fs::path(job.destination).parent_path(), error);
+        int ends[2];
+        if (pipe2(ends, O_CLOEXEC) != 0) {
+            return false;
+        }
+        job.pid = fork();
+        if (job.pid == 0) {
+            dup2(ends[1], STDOUT_FILENO);
+            const char* argv[] = {"tqovix", "process", "--quiet", "--json", m_line.Has("force") ? "--force" : "--no-overwrite",
+                                  "--", job.source.c_str(), job.destination.c_str(), nullptr};
+            execv("/proc/self/exe", const_cast<char* const*>(argv));
+            _exit(127);
+        }
+        close(ends[1]);
+        if (job.pid < 0) {
+            close(ends[0]);
+            return false;
+        }
+        job.output = ends[0];
+        return true;
+    }
+
+    void Collect(Job& job, int status)
+    {
+        std::string json;
+        char buffer[4096];
+        ssize_t count = 0;
+        while ((count = read(job.output, buffer, sizeof buffer)) > 0 || (count < 0 && errno == EINTR)) {
+            json.append(buffer, static_cast<size_t>(std::max<ssize_t>(count, 0)));
+        }
+        close(job.output);
+        job.seconds = std::atof(JsonValue(json, "seconds").c_str());
+        const bool ok = WIFEXITED(status) && WEXITSTATUS(status) == 0 && JsonValue(json, "result") == "0";
+        std::string message = JsonValue(json, "message");
+        if (message.empty()) {
+            message = WIFSIGNALED(status) ? "killed by signal " + std::to_string(WTERMSIG(status))
+                                          : "exit status " + std::to_string(WIFEXITED(status) ? WEXITSTATUS(status) : -1);
+        }
+        const std::string reason = JsonValue(json, "reason");
+        Finish(job, ok ? Outcome::Done : Outcome::Failed, reason.empty() ? "internal" : reason, message);
+    }
+
+    void Finish(Job& job, Outcome outcome, const std::string& reason, const std::string& message)
+    {
+        job.outcome = outcome;
+        job.reason = reason;
+        job.message = message;
+        if (!m_line.Quiet() && !m_line.Has("json") && !m_line.Has("dry-run")) {
+            std::fprintf(stderr, "[%zu/%zu] %s: %s\n", ++m_finished, m_jobs.size(), job.source.c_str(),
+                         outcome == Outcome::Done ? "done" : (std::string(OutcomeName(outcome)) + ": " + message).c_str());
+        }
+    }
+
+    const CommandLine& m_line;
+    std::vector<Job> m_jobs;
+    std::set<std::string> m_destinations;
+    size_t m_finished = 0;
+};
 
 }  // namespace
 
 int BatchCommand(const Arguments& arguments)
 {
-    std::string outputDirectory;
+    CommandLine line("batch", kUsage,
+                     {{"output", 'o', true}, {"jobs", 'j', true}, {"recursive", 'r', false}, {"force", 'f', false},
+                      {"dry-run", 0, false}, {"json", 0, false}});
+    if (const int status = line.Parse(arguments); status >= 0) {
+        return status;
+    }
     long parallel = std::max(1L, sysconf(_SC_NPROCESSORS_ONLN));
-    bool force = false;
-    std::vector<Job> jobs;
-    for (size_t i = 0; i < arguments.size(); ++i) {
-        const std::string& argument = arguments[i];
-        if (argument == "--help") {
-            std::fputs(kUsage, stdout);
-            return 0;
-        }
-        if ((argument == "-o" || argument == "-j") && i + 1 < arguments.size()) {
-            const std::string& value = arguments[++i];
-            if (argument == "-o") {
-                outputDirectory = value;
-                continue;
-            }
-            char* end = nullptr;
-            parallel = std::strtol(value.c_str(), &end, 10);
-            if (*end != '\0' || parallel < 1 || parallel > 256) {
-                std::fprintf(stderr, "tqovix batch: -j takes a number from 1 to 256\n");
-                return 2;
-            }
-        } else if (argument == "--force") {
-            force = true;
-        } else if (argument.size() > 1 && argument[0] == '-') {
-            std::fprintf(stderr, "tqovix batch: unknown or incomplete option '%s'\n%s", argument.c_str(), kUsage);
-            return 2;
-        } else {
-            Job job;
-            job.source = argument;
-            jobs.push_back(std::move(job));
-        }
+    int status = 2;
+    if (!line.Number("jobs", 1, 256, parallel, status)) {
+        return status;
     }
-    struct stat info{};
-    if (outputDirectory.empty() || jobs.empty()) {
-        std::fputs(kUsage, stderr);
-        return 2;
+    if (line.Value("output").empty() || line.Operands().empty()) {
+        return line.Misuse(line.Operands().empty() ? "no PATH given" : "-o OUTDIR is needed");
     }
-    if (stat(outputDirectory.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
-        std::fprintf(stderr, "tqovix batch: %s: not a directory\n", outputDirectory.c_str());
-        return 2;
+    const auto begun = std::chrono::steady_clock::now();
+    Batch batch(line);
+    batch.Gather();
+    batch.Classify();
+    if (line.Has("dry-run")) {
+        batch.ListPlan();
+        return 0;
     }
-    std::set<std::string> names;
-    for (Job& job : jobs) {
-        const size_t slash = job.source.find_last_of('/');
-        const std::string name = slash == std::string::npos ? job.source : job.source.substr(slash + 1);
-        job.destination = outputDirectory + "/" + name;
-        if (name.empty() || !names.insert(name).second) {
-            job.finished = true;  // two jobs must never write one destination
-            job.message = name.empty() ? "no file name" : "another file in this batch has the same name";
-        }
+    std::error_code error;
+    fs::create_directories(line.Value("output"), error);
+    if (!fs::is_directory(line.Value("output"))) {
+        std::fprintf(stderr, "tqovix batch: %s: cannot create the folder: %s\n", line.Value("output").c_str(),
+                     error ? error.message().c_str() : "a file stands there");
+        return 1;
     }
 
     struct sigaction action{};
@@ -194,55 +394,10 @@ int BatchCommand(const Arguments& arguments)
     sigemptyset(&action.sa_mask);
     sigaction(SIGINT, &action, nullptr);
     sigaction(SIGTERM, &action, nullptr);
-
-    size_t next = 0;
-    size_t running = 0;
-    size_t completed = 0;
-    bool forwarded = false;
-    for (;;) {
-        while (g_signal == 0 && running < static_cast<size_t>(parallel) && next < jobs.size()) {
-            Job& job = jobs[next++];
-            if (job.finished) {
-                continue;
-            }
-            if (Start(job, force)) {
-                ++running;
-            } else {
-                job.finished = true;
-                job.message = std::string("could not start a job: ") + std::strerror(errno);
-            }
-        }
-        if (running == 0) {
-            break;
-        }
-        if (g_signal != 0 && !forwarded) {
-            for (const Job& job : jobs) {
-                if (job.pid > 0 && !job.finished) {
-                    kill(job.pid, g_signal);  // each child aborts its job and removes its output
-                }
-            }
-            forwarded = true;
-        }
-        int status = 0;
-        const pid_t pid = waitpid(-1, &status, 0);
-        if (pid < 0) {
-            if (errno == EINTR) {
-                continue;  // a signal: forwarded above
-            }
-            break;
-        }
-        for (Job& job : jobs) {
-            if (job.pid == pid && !job.finished) {
-                Collect(job, status);
-                --running;
-                std::fprintf(stderr, "[%zu/%zu] %s: %s\n", ++completed, jobs.size(), job.source.c_str(),
-                             job.message.c_str());
-            }
-        }
-    }
-    PrintSummary(jobs);
+    batch.Run(parallel);
+    batch.PrintSummary(std::chrono::duration<double>(std::chrono::steady_clock::now() - begun).count());
     if (g_signal != 0) {
-        return 128 + g_signal;
+        return 130;
     }
-    return std::all_of(jobs.begin(), jobs.end(), [](const Job& job) { return job.ok; }) ? 0 : 1;
+    return batch.AnyFailed() ? 1 : 0;
 }

@@ -4,14 +4,15 @@
 #include <cstdio>
 #include <string>
 
-#include "Commands.h"
+#include "CommandLine.h"
+#include "Json.h"
 #include "SoundComparison.h"
 #include "Spectrogram.h"
 
 namespace {
 
 constexpr const char* kUsage =
-    "usage: tqovix compare SRC DST [--png FILE] [--json]\n"
+    "usage: tqovix compare [--png FILE] [--json] SRC DST\n"
     "  measures what processing did to SRC's sound in DST: per AF interval the level before\n"
     "  and after and the reduction, elsewhere how many frames differ (PCM: none should) or\n"
     "  the largest difference (AAC), and DST's offset against SRC in frames; --png draws both\n"
@@ -67,34 +68,18 @@ void PrintText(const std::string& source, const std::string& destination, const 
 
 }  // namespace
 
-int CompareCommand(Arguments arguments)
+int CompareCommand(const Arguments& arguments)
 {
-    bool json = false;
-    std::string png;
-    Arguments paths;
-    for (size_t i = 0; i < arguments.size(); ++i) {
-        const std::string& a = arguments[i];
-        if (a == "--help" || a == "-h") {
-            std::fputs(kUsage, stdout);
-            return 0;
-        }
-        if (a == "--json") {
-            json = true;
-        } else if (a == "--png" && i + 1 < arguments.size()) {
-            png = arguments[++i];
-        } else if (a.starts_with("--png=")) {
-            png = a.substr(6);
-        } else if (a.starts_with("-")) {
-            std::fprintf(stderr, "tqovix compare: unknown option '%s'\n%s", a.c_str(), kUsage);
-            return 2;
-        } else {
-            paths.push_back(a);
-        }
+    CommandLine line("compare", kUsage, {{"json", 0, false}, {"png", 0, true}});
+    if (const int status = line.Parse(arguments); status >= 0) {
+        return status;
     }
-    if (paths.size() != 2) {
-        std::fputs(kUsage, stderr);
-        return 2;
+    if (line.Operands().size() != 2) {
+        return line.Misuse("SRC and DST are needed");
     }
+    const bool json = line.Has("json");
+    const std::string png = line.Value("png");
+    const Arguments& paths = line.Operands();
     // The picture needs the sound's shape before the first block: open it once to learn it.
     Spectrogram picture;
     bool drawing = false;

@@ -3,31 +3,16 @@
 #include "api/TqOVIXUtility.h"
 #include "atom/CTqovixAtomControl.h"
 #include "atom/CTqovixContainerAtom.h"
+#include "atom/TqovixAtomType.h"
 #include "atom/TqovixEndian.h"
 #include "atom/TqovixTrackAtoms.h"
-#include "movie/CTqovixMovControl.h"
+#include "file/CTqovixFile.h"
 #include "visitor/CTqovixAudioInformationVisitor.h"
 #include "visitor/CTqovixMakerBlockVisitor.h"
 #include "visitor/CTqovixMovieDataVisitor.h"
 #include "visitor/CTqovixTrimInformationVisitor.h"
 
 namespace {
-
-void CollectAtoms(const TqovixAtomList& atoms, uint64_t offset, int depth, std::vector<InspectedAtom>& rows)
-{
-    for (const auto& atom : atoms) {
-        const uint64_t size = atom->GetSize();
-        rows.push_back({offset, size, TqovixAtomTypeName(atom->GetType()), depth});
-        if (const auto* container = dynamic_cast<const CTqovixContainerAtom*>(atom.get())) {
-            uint64_t childBytes = 0;
-            for (const auto& child : container->GetChildren()) {
-                childBytes += child->GetSize();
-            }
-            CollectAtoms(container->GetChildren(), offset + size - childBytes, depth + 1, rows);
-        }
-        offset += size;
-    }
-}
 
 // The leaf at `types` (concatenated four-character codes) below `parent`, as a payload.
 TqovixPayload Payload(const CTqovixAtom* parent, const std::string& types)
@@ -102,13 +87,25 @@ std::vector<InspectedTrack> CollectTracks(const CTqovixAtomControl& tree, const 
 
 }  // namespace
 
-Inspection Inspect(const std::string& path, const CTqovixAtomControl& tree)
+Inspection Inspect(const std::string& path)
 {
     Inspection inspection;
     inspection.path = path;
+    inspection.structure = ScanStructure(path);
+    int answer = TqInitializeOVIX();
+    if (answer == 0) {
+        answer = TqGetPropertyOVIX(path.c_str());
+        TqCloseOVIX();
+    }
+    inspection.verdict = answer == 0 ? Verdict{} : Explain(answer, path);
+    CTqovixFile file;
+    CTqovixAtomControl tree;
+    if (TqovixFailed(file.Open(path.c_str(), 1)) || TqovixFailed(tree.Initialize(file))) {
+        return inspection;
+    }
+    inspection.parsed = true;
     TqovixAtomList atoms;
     tree.GetAtoms(atoms);
-    CollectAtoms(atoms, 0, 0, inspection.atoms);
     inspection.tracks = CollectTracks(tree, atoms);
     CTqovixTrimInformationVisitor trim;
     if (tree.Analyze(trim) == eTqovixSuccess) {
@@ -119,16 +116,5 @@ Inspection Inspect(const std::string& path, const CTqovixAtomControl& tree)
     inspection.afBytes = TqovixFailed(tree.Analyze(af)) ? 0 : af.GetAFInformationSize();
     CTqovixAudioLevelInformationVisitor level;
     inspection.levelBytes = TqovixFailed(tree.Analyze(level)) ? 0 : level.GetAudioLevelInformationSize();
-    inspection.libraryAnswer = TqInitializeOVIX();
-    if (inspection.libraryAnswer == 0) {
-        inspection.libraryAnswer = TqGetPropertyOVIX(path.c_str());
-        TqCloseOVIX();
-    }
-    if (inspection.libraryAnswer == 8) {
-        CTqovixMovControl control;
-        control.Initialize(path.c_str(), nullptr);
-        inspection.refusal = control.GetRefusal();
-        control.Close();
-    }
     return inspection;
 }

@@ -1,4 +1,5 @@
-// What tqovix inspect reports about a movie, gathered once and printed as text or JSON.
+// What tqovix inspect reports about a file, gathered once and printed as text or JSON. Any
+// file with atoms can be inspected: what the library refuses is shown with its reason.
 #pragma once
 
 #include <cstdint>
@@ -6,14 +7,8 @@
 #include <string>
 #include <vector>
 
-class CTqovixAtomControl;
-
-struct InspectedAtom {
-    uint64_t offset = 0;
-    uint64_t size = 0;
-    std::string type;
-    int depth = 0;
-};
+#include "Reasons.h"
+#include "Structure.h"
 
 struct InspectedTrack {
     std::string handler;
@@ -37,16 +32,15 @@ struct InspectedTrim {
 
 struct Inspection {
     std::string path;
-    std::vector<InspectedAtom> atoms;
+    Structure structure;
+    bool parsed = false;  // the library's parser read the tree: tracks and tags below
     std::vector<InspectedTrack> tracks;
     std::optional<InspectedTrim> trim;
     uint64_t afBytes = 0;
     uint64_t levelBytes = 0;
-    int libraryAnswer = 0;  // the property query's: 0, 20 (processed) or why not
-    std::string refusal;    // the parser's words for a refusal, when it has them
+    Verdict verdict;  // the library's answer (0, 20 processed, or why not) and its reason
 };
 
-// Everything the report says, from a parsed tree and the library's own answers.
-Inspection Inspect(const std::string& path, const CTqovixAtomControl& tree);
+Inspection Inspect(const std::string& path);
 void PrintInspectionText(const Inspection& inspection);
 void PrintInspectionJson(const Inspection& inspection);

@@ -2,80 +2,113 @@
 #include <cinttypes>
 #include <cstdio>
 
-#include "Commands.h"
 #include "Inspection.h"
+#include "Json.h"
 
 namespace {
 
-const char* Processed(int answer) { return answer == 20 ? "true" : answer == 0 ? "false" : "null"; }
+// Whether the AF information is processed already: unknown when the library refuses the
+// file for another reason.
+const char* Processed(const Verdict& verdict)
+{
+    return verdict.reason == Reason::AlreadyProcessed ? "yes" : verdict.reason == Reason::None ? "no" : nullptr;
+}
+
+std::string TrackJson(const InspectedTrack& t)
+{
+    JsonObject track;
+    track.Add("handler", t.handler).Add("codec", t.codec).Add("timeScale", t.timeScale).Add("rate", t.rate);
+    track.Add("samples", t.samples).Add("chunks", static_cast<uint64_t>(t.chunks));
+    if (t.handler == "soun") {
+        track.Add("channels", t.channels).Add("bits", t.bits).Add("aac", t.aac);
+    }
+    return track.Text();
+}
 
 }  // namespace
 
 void PrintInspectionJson(const Inspection& in)
 {
-    std::printf("{\"file\":%s,\"atoms\":[", JsonString(in.path).c_str());
-    for (size_t i = 0; i < in.atoms.size(); ++i) {
-        const InspectedAtom& a = in.atoms[i];
-        std::printf("%s{\"offset\":%" PRIu64 ",\"size\":%" PRIu64 ",\"type\":%s,\"depth\":%d}", i ? "," : "", a.offset,
-                    a.size, JsonString(a.type).c_str(), a.depth);
+    JsonObject report = JsonObject::Report();
+    report.Add("file", in.path);
+    std::vector<std::string> atoms;
+    for (const ScannedAtom& a : in.structure.atoms) {
+        atoms.push_back(JsonObject().Add("offset", a.offset).Add("size", a.size).Add("type", a.type).Add("depth", a.depth).Text());
     }
-    std::printf("],\"tracks\":[");
-    for (size_t i = 0; i < in.tracks.size(); ++i) {
-        const InspectedTrack& t = in.tracks[i];
-        std::printf("%s{\"handler\":%s,\"codec\":%s,\"timeScale\":%u,\"rate\":%.3f", i ? "," : "",
-                    JsonString(t.handler).c_str(), JsonString(t.codec).c_str(), t.timeScale, t.rate);
-        std::printf(",\"samples\":%" PRIu64 ",\"chunks\":%zu", t.samples, t.chunks);
-        if (t.handler == "soun") {
-            std::printf(",\"channels\":%u,\"bits\":%u,\"aac\":%s", t.channels, t.bits, t.aac ? "true" : "false");
-        }
-        std::printf("}");
-    }
-    std::printf("],\"trim\":");
-    if (in.trim) {
-        std::printf("{\"removedFrameForward\":%u,\"removedFrameBackward\":%u,\"frameRate\":[%u,%u]}",
-                    in.trim->removedForward, in.trim->removedBackward, in.trim->rateNumerator, in.trim->rateDenominator);
+    report.AddJson("atoms", JsonArray(atoms));
+    if (in.structure.fault.empty()) {
+        report.AddNull("malformed");
     } else {
-        std::printf("null");
+        report.Add("malformed", in.structure.fault);
     }
-    std::printf(",\"afInformationBytes\":%" PRIu64 ",\"audioLevelBytes\":%" PRIu64
-                ",\"processed\":%s,\"libraryAnswer\":%d,\"libraryMessage\":%s,\"refusal\":%s}\n",
-                in.afBytes, in.levelBytes, Processed(in.libraryAnswer), in.libraryAnswer,
-                JsonString(DescribeResult(in.libraryAnswer)).c_str(),
-                in.refusal.empty() ? "null" : JsonString(in.refusal).c_str());
+    std::vector<std::string> tracks;
+    for (const InspectedTrack& t : in.tracks) {
+        tracks.push_back(TrackJson(t));
+    }
+    report.AddJson("tracks", JsonArray(tracks));
+    if (in.trim) {
+        report.AddJson("trim", JsonObject()
+                                   .Add("removedFrameForward", in.trim->removedForward)
+                                   .Add("removedFrameBackward", in.trim->removedBackward)
+                                   .AddJson("frameRate", JsonArray({std::to_string(in.trim->rateNumerator),
+                                                                    std::to_string(in.trim->rateDenominator)}))
+                                   .Text());
+    } else {
+        report.AddNull("trim");
+    }
+    report.Add("afInformationBytes", in.afBytes).Add("audioLevelBytes", in.levelBytes);
+    const char* processed = Processed(in.verdict);
+    if (processed == nullptr) {
+        report.AddNull("processed");
+    } else {
+        report.Add("processed", processed[0] == 'y');
+    }
+    report.Add("libraryAnswer", in.verdict.code).Add("reason", in.verdict.Key());
+    if (in.verdict.text.empty()) {
+        report.AddNull("message");
+    } else {
+        report.Add("message", in.verdict.text);
+    }
+    std::printf("%s\n", report.Text().c_str());
 }
 
 void PrintInspectionText(const Inspection& in)
 {
     std::printf("%s\n%12s %12s  %s\n", in.path.c_str(), "offset", "size", "type");
-    for (const InspectedAtom& a : in.atoms) {
+    for (const ScannedAtom& a : in.structure.atoms) {
         std::printf("%12" PRIu64 " %12" PRIu64 "  %*s%s\n", a.offset, a.size, a.depth * 2, "", a.type.c_str());
     }
-    std::printf("\ntracks\n");
-    for (const InspectedTrack& t : in.tracks) {
-        const bool sound = t.handler == "soun";
-        std::printf("  %-4s  %-4s  %.*f %s", t.handler.c_str(), t.codec.c_str(), sound ? 0 : 3, t.rate,
-                    sound ? "Hz" : "fps");
-        if (sound) {
-            std::printf("  %u ch  %s", t.channels, t.aac ? "AAC" : (std::to_string(t.bits) + " bit").c_str());
-        }
-        if (t.known) {
-            std::printf("  %" PRIu64 " %s  %zu chunks", t.samples, t.aac ? "packets" : "samples", t.chunks);
-        }
-        std::printf("\n");
+    if (!in.structure.fault.empty()) {
+        std::printf("  malformed: %s\n", in.structure.fault.c_str());
     }
-    if (in.trim) {
-        std::printf("trim tags: %u frames removed forward, %u backward, frame rate %u/%u\n", in.trim->removedForward,
-                    in.trim->removedBackward, in.trim->rateNumerator, in.trim->rateDenominator);
-    } else {
-        std::printf("trim tags: none\n");
+    if (in.parsed) {
+        std::printf("\ntracks\n");
+        for (const InspectedTrack& t : in.tracks) {
+            const bool sound = t.handler == "soun";
+            std::printf("  %-4s  %-4s  %.*f %s", t.handler.c_str(), t.codec.c_str(), sound ? 0 : 3, t.rate,
+                        sound ? "Hz" : "fps");
+            if (sound) {
+                std::printf("  %u ch  %s", t.channels, t.aac ? "AAC" : (std::to_string(t.bits) + " bit").c_str());
+            }
+            if (t.known) {
+                std::printf("  %" PRIu64 " %s  %zu chunks", t.samples, t.aac ? "packets" : "samples", t.chunks);
+            }
+            std::printf("\n");
+        }
+        if (in.trim) {
+            std::printf("trim tags: %u frames removed forward, %u backward, frame rate %u/%u\n",
+                        in.trim->removedForward, in.trim->removedBackward, in.trim->rateNumerator,
+                        in.trim->rateDenominator);
+        } else {
+            std::printf("trim tags: none\n");
+        }
+        std::printf("AF information: %s\n", in.afBytes ? (std::to_string(in.afBytes) + " bytes").c_str() : "none");
+        std::printf("audio level information: %s\n",
+                    in.levelBytes ? (std::to_string(in.levelBytes) + " bytes").c_str() : "none");
     }
-    std::printf("AF information: %s\n", in.afBytes ? (std::to_string(in.afBytes) + " bytes").c_str() : "none");
-    std::printf("audio level information: %s\n",
-                in.levelBytes ? (std::to_string(in.levelBytes) + " bytes").c_str() : "none");
-    std::printf("AF information processed: %s\n", in.libraryAnswer == 20  ? "yes"
-                                                  : in.libraryAnswer == 0 ? "no"
-                                                                          : ("unknown: " + DescribeResult(in.libraryAnswer)).c_str());
-    if (!in.refusal.empty()) {
-        std::printf("the library would refuse it: %s\n", in.refusal.c_str());
+    const char* processed = Processed(in.verdict);
+    std::printf("AF information processed: %s\n", processed != nullptr ? processed : "unknown");
+    if (in.verdict.reason != Reason::None && in.verdict.reason != Reason::AlreadyProcessed) {
+        std::printf("the library would refuse it: %s\n", in.verdict.text.c_str());
     }
 }

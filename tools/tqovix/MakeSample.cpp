@@ -7,7 +7,8 @@
 #include <string>
 #include <vector>
 
-#include "Commands.h"
+#include "CommandLine.h"
+#include <sys/stat.h>
 #include "Movie.h"
 #include "MoviePlan.h"
 #include "Pattern.h"
@@ -15,7 +16,7 @@
 namespace {
 
 constexpr const char* kUsage =
-    "usage: tqovix make-sample DST [--pcm|--aac] [--seconds N] [--size-gib N] [--little-endian]\n"
+    "usage: tqovix make-sample [--pcm|--aac] [--seconds N] [--size-gib N] [--little-endian] [-f] DST\n"
     "  writes a 30 fps camera-style movie with 48 kHz stereo sound, AF information, audio\n"
     "  level information and trim tags\n"
     "  --pcm             16-bit PCM sound: a tone, with noise bursts while the AF motor runs\n"
@@ -23,7 +24,9 @@ constexpr const char* kUsage =
     "  --aac             an AAC sound track (silent packets)\n"
     "  --seconds N       length of the movie (default 10)\n"
     "  --size-gib N      pad the video frames so that the file reaches about N GiB\n"
-    "  --little-endian   store PCM sound as \"sowt\" instead of \"twos\"\n";
+    "  --little-endian   store PCM sound as \"sowt\" instead of \"twos\"\n"
+    "  -f, --force       replace an existing DST\n"
+    "  exit status: 0 written, 1 DST exists or cannot be written, 2 usage error\n";
 
 constexpr uint32_t kSampleRate = 48000;
 constexpr uint16_t kChannels = 2;
@@ -63,51 +66,45 @@ std::vector<int16_t> ToneWithMotorNoise(uint64_t frames, const std::vector<movie
 
 int MakeSampleCommand(const Arguments& arguments)
 {
-    std::string destination;
-    unsigned long seconds = 10;
+    CommandLine line("make-sample", kUsage,
+                     {{"pcm", 0, false}, {"aac", 0, false}, {"seconds", 0, true}, {"size-gib", 0, true},
+                      {"little-endian", 0, false}, {"force", 'f', false}});
+    if (const int status = line.Parse(arguments); status >= 0) {
+        return status;
+    }
+    if (line.Operands().size() != 1) {
+        return line.Misuse("one DST is needed");
+    }
+    const std::string destination = line.Operands()[0];
+    long seconds = 10;
+    int status = 2;
+    if (!line.Number("seconds", 1, 24 * 3600, seconds, status)) {
+        return status;
+    }
     double sizeGib = 0;
-    bool aac = false;
-    bool littleEndian = false;
-    for (size_t i = 0; i < arguments.size(); ++i) {
-        const std::string& argument = arguments[i];
-        if (argument == "--help") {
-            std::fputs(kUsage, stdout);
-            return 0;
-        }
-        if (argument == "--seconds" && i + 1 < arguments.size()) {
-            char* end = nullptr;
-            seconds = std::strtoul(arguments[++i].c_str(), &end, 10);
-            if (*end != '\0' || seconds == 0 || seconds > 24 * 3600) {
-                std::fprintf(stderr, "tqovix: --seconds takes a whole number from 1 to 86400\n");
-                return 2;
-            }
-        } else if (argument == "--size-gib" && i + 1 < arguments.size()) {
-            char* end = nullptr;
-            sizeGib = std::strtod(arguments[++i].c_str(), &end);
-            if (*end != '\0' || !(sizeGib > 0 && sizeGib <= 1024)) {
-                std::fprintf(stderr, "tqovix: --size-gib takes a number above 0 and up to 1024\n");
-                return 2;
-            }
-        } else if (argument == "--aac" || argument == "--pcm") {
-            aac = argument == "--aac";
-        } else if (argument == "--little-endian") {
-            littleEndian = true;
-        } else if (destination.empty() && !argument.starts_with("-")) {
-            destination = argument;
-        } else {
-            std::fputs(kUsage, stderr);
-            return 2;
+    if (line.Has("size-gib")) {
+        const std::string text = line.Value("size-gib");
+        char* end = nullptr;
+        sizeGib = std::strtod(text.c_str(), &end);
+        if (text.empty() || *end != '\0' || !(sizeGib > 0 && sizeGib <= 1024)) {
+            return line.Misuse("--size-gib takes a number above 0 and up to 1024");
         }
     }
-    if (destination.empty() || (aac && littleEndian)) {
-        std::fputs(aac ? "tqovix: --little-endian is for PCM sound\n" : kUsage, stderr);
-        return 2;
+    const bool aac = line.Has("aac");
+    const bool littleEndian = line.Has("little-endian");
+    if (aac && (littleEndian || line.Has("pcm"))) {
+        return line.Misuse(littleEndian ? "--little-endian is for PCM sound" : "--pcm and --aac exclude each other");
+    }
+    struct stat existing {};
+    if (!line.Has("force") && lstat(destination.c_str(), &existing) == 0) {
+        std::fprintf(stderr, "tqovix: %s: the file exists (use --force to replace it)\n", destination.c_str());
+        return 1;
     }
 
     moviekit::MovieRecipe recipe;
     recipe.video.width = 320;
     recipe.video.height = 180;
-    recipe.video.frameCount = static_cast<uint32_t>(seconds * 30000 / 1001);
+    recipe.video.frameCount = static_cast<uint32_t>(seconds * 30000L / 1001);
     recipe.sound.sampleRate = kSampleRate;
     recipe.sound.channels = kChannels;
     recipe.sound.codec = aac ? moviekit::SoundCodec::Aac
@@ -117,7 +114,7 @@ int MakeSampleCommand(const Arguments& arguments)
     const uint64_t n = aac ? moviekit::DivCeil(frames, 1024) * 1024 : frames;
     const std::vector<moviekit::AfInterval> intervals = {{n / 4, n / 4 + n / 10, 800}, {n / 2, n / 2 + n / 8, 500}};
     recipe.maker.afIntervals = intervals;
-    if (!aac && seconds <= kMaxExplicitSoundSeconds) {
+    if (!aac && static_cast<unsigned long>(seconds) <= kMaxExplicitSoundSeconds) {
         recipe.sound.pcm = ToneWithMotorNoise(frames, intervals);
     }
     if (sizeGib > 0) {
@@ -135,7 +132,7 @@ int MakeSampleCommand(const Arguments& arguments)
     moviekit::MovieLayout layout;
     std::string error;
     if (!moviekit::WriteMovie(destination, recipe, &layout, &error)) {
-        std::fprintf(stderr, "tqovix: %s: %s\n", destination.c_str(), error.c_str());
+        std::fprintf(stderr, "tqovix: %s\n", error.c_str());
         std::remove(destination.c_str());
         return 1;
     }

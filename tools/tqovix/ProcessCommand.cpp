@@ -14,20 +14,23 @@
 #include <thread>
 #include <unistd.h>
 
-#include "Commands.h"
+#include "CommandLine.h"
+#include "Json.h"
+#include "Reasons.h"
 #include "api/TqOVIXUtility.h"
 
 namespace {
 
 constexpr const char* kUsage =
-    "usage: tqovix process SRC DST [--force] [--quiet] [--json] [--sync]\n"
+    "usage: tqovix process [OPTIONS] SRC DST\n"
     "  removes the AF noise from the sound of SRC and writes the result to DST\n"
-    "  --force   overwrite an existing DST (it is replaced only by a complete movie)\n"
-    "  --quiet   no progress and no \"done\" line\n"
-    "  --json    print one JSON object with the outcome instead of text\n"
-    "  --sync    make DST durable (on the device, not only in the page cache) before exiting\n"
+    "  -f, --force         replace an existing DST (only by a complete movie)\n"
+    "  -n, --no-overwrite  refuse an existing DST (the default)\n"
+    "  -q, --quiet         no progress and no \"done\" line\n"
+    "  --json              print one JSON object with the outcome instead of text\n"
+    "  --sync              make DST durable (on the device, not only in the page cache)\n"
     "  DST appears only when complete; a failed or aborted job (Ctrl-C) leaves it as it was.\n"
-    "  Exit status: 0 done, 1 failed, 2 usage error or DST exists, 130 aborted\n";
+    "  exit status: 0 done, 1 failed or refused (DST exists too), 2 usage error, 130 interrupted\n";
 
 // Short, so that a job of a tenth of a second is not reported up to 50 ms late; the view
 // is redrawn less often.
@@ -133,40 +136,6 @@ struct Options {
     bool sync = false;
 };
 
-// 0 when the arguments are complete, otherwise the exit status (0 too for --help, via `done`).
-int Parse(const Arguments& arguments, Options& options, bool& done)
-{
-    Arguments paths;
-    for (const std::string& argument : arguments) {
-        if (argument == "--help") {
-            std::fputs(kUsage, stdout);
-            done = true;
-            return 0;
-        }
-        if (argument == "--force") {
-            options.force = true;
-        } else if (argument == "--quiet") {
-            options.quiet = true;
-        } else if (argument == "--json") {
-            options.json = true;
-        } else if (argument == "--sync") {
-            options.sync = true;
-        } else if (argument.size() > 1 && argument[0] == '-') {
-            std::fprintf(stderr, "tqovix process: unknown option '%s'\n%s", argument.c_str(), kUsage);
-            return 2;
-        } else {
-            paths.push_back(argument);
-        }
-    }
-    if (paths.size() != 2) {
-        std::fputs(kUsage, stderr);
-        return 2;
-    }
-    options.source = paths[0];
-    options.destination = paths[1];
-    return 0;
-}
-
 // fsync of the file, then of its directory: the name and the bytes both reach the device.
 bool SyncFile(const std::string& path)
 {
@@ -188,33 +157,45 @@ bool SyncFile(const std::string& path)
     return synced;
 }
 
-void Report(const Options& options, const char* result, const std::string& message, double seconds)
+void Report(const Options& options, const Verdict& verdict, bool ran, double seconds)
 {
-    std::printf("{\"source\":%s,\"destination\":%s,\"result\":%s,\"message\":%s,\"seconds\":%.3f}\n",
-                JsonString(options.source).c_str(), JsonString(options.destination).c_str(), result,
-                JsonString(message).c_str(), seconds);
+    JsonObject report = JsonObject::Report();
+    report.Add("source", options.source).Add("destination", options.destination);
+    if (ran) {
+        report.Add("result", verdict.code);
+    } else {
+        report.AddNull("result");  // refused before the library was asked
+    }
+    report.Add("reason", verdict.Key()).Add("message", verdict.reason == Reason::None ? "done" : verdict.text);
+    report.Add("seconds", seconds);
+    std::printf("%s\n", report.Text().c_str());
 }
 
 }  // namespace
 
 int ProcessCommand(const Arguments& arguments)
 {
-    Options options;
-    bool done = false;
-    if (const int status = Parse(arguments, options, done); status != 0 || done) {
+    CommandLine line("process", kUsage,
+                     {{"force", 'f', false}, {"no-overwrite", 'n', false}, {"json", 0, false}, {"sync", 0, false}});
+    if (const int status = line.Parse(arguments); status >= 0) {
         return status;
     }
-    RemoveStalePartials(options.destination);
-    struct stat info{};
-    if (!options.force && lstat(options.destination.c_str(), &info) == 0) {
-        const std::string message = "destination exists (use --force to overwrite it)";
-        if (options.json) {
-            Report(options, "null", message, 0);
-        } else {
-            std::fprintf(stderr, "tqovix: %s: %s\n", options.destination.c_str(), message.c_str());
-        }
-        return 2;
+    if (line.Operands().size() != 2) {
+        return line.Misuse("SRC and DST are needed");
     }
+    Options options{line.Operands()[0], line.Operands()[1], line.Has("force") && !line.Has("no-overwrite"),
+                    line.Quiet(), line.Has("json"), line.Has("sync")};
+    RemoveStalePartials(options.destination);
+    if (const Verdict refusal = CheckDestination(options.source, options.destination, options.force);
+        refusal.reason != Reason::None) {
+        if (options.json) {
+            Report(options, refusal, false, 0);
+        } else {
+            std::fprintf(stderr, "tqovix: %s: %s\n", options.destination.c_str(), refusal.text.c_str());
+        }
+        return 1;
+    }
+    struct stat info{};
     const double sourceBytes = stat(options.source.c_str(), &info) == 0 ? static_cast<double>(info.st_size) : 0;
 
     struct sigaction action{};
@@ -264,27 +245,24 @@ int ProcessCommand(const Arguments& arguments)
     }
     view.Close();
     TqCloseOVIX();
+    Verdict verdict = Explain(code, options.source, options.destination);
     if (code == 0 && options.sync && !SyncFile(options.destination)) {
-        std::fprintf(stderr, "tqovix: %s: cannot be made durable: %s\n", options.destination.c_str(),
-                     std::strerror(errno));
         code = 190;
+        verdict = MakeVerdict(code, Reason::WriteFailed, std::string("cannot make it durable: ") + std::strerror(errno));
     }
-
-    const std::string message = code == 0 ? "done" : DescribeResult(code);
     if (options.json) {
-        Report(options, std::to_string(code).c_str(), message, seconds);
+        Report(options, verdict, true, seconds);
     } else if (code == 0) {
         if (!options.quiet) {
             std::printf("%s: done\n", options.destination.c_str());
         }
     } else {
-        const bool aboutDestination = code == 111 || code == 121 || code == 130 || code == 131;
-        std::fprintf(stderr, "tqovix: %s: %s\n", (aboutDestination ? options.destination : options.source).c_str(),
-                     message.c_str());
+        const std::string& named = AboutDestination(verdict.reason) ? options.destination : options.source;
+        std::fprintf(stderr, "tqovix: %s: %s\n", named.c_str(), verdict.text.c_str());
     }
     std::fflush(stdout);
     if (code == 200 && g_signal != 0) {
-        return 128 + g_signal;
+        return 130;
     }
     return code == 0 ? 0 : 1;
 }

@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <cmath>
 #include <cstdio>
+#include <cstdlib>
+#include <memory>
 #include <numbers>
 
 #include "Glyphs.h"
@@ -43,11 +45,28 @@ std::string Seconds(double s)
 
 }  // namespace
 
+namespace {
+
+// The transform's SIMD code loads its buffers whole: they must be aligned as its own
+// allocator would align them, which a vector's are not.
+struct AlignedFree {
+    void operator()(AVComplexFloat* buffer) const { std::free(buffer); }
+};
+using AlignedBuffer = std::unique_ptr<AVComplexFloat[], AlignedFree>;
+constexpr size_t kSimdAlignment = 64;
+
+AlignedBuffer AlignedComplex(size_t count)
+{
+    return AlignedBuffer(static_cast<AVComplexFloat*>(std::aligned_alloc(kSimdAlignment, count * sizeof(AVComplexFloat))));
+}
+
+}  // namespace
+
 struct Spectrogram::Transform {
     AVTXContext* context = nullptr;
     av_tx_fn function = nullptr;
-    std::vector<AVComplexFloat> in = std::vector<AVComplexFloat>(kFftSize);
-    std::vector<AVComplexFloat> out = std::vector<AVComplexFloat>(kFftSize);
+    AlignedBuffer in = AlignedComplex(kFftSize);
+    AlignedBuffer out = AlignedComplex(kFftSize);
     std::vector<float> window = std::vector<float>(kFftSize);
 };
 
@@ -69,6 +88,9 @@ std::string Spectrogram::Begin(uint32_t rate, uint32_t channels, uint64_t frames
         return "the codec libraries cannot be loaded";
     }
     m_pTransform = new Transform;
+    if (m_pTransform->in == nullptr || m_pTransform->out == nullptr) {
+        return "out of memory";
+    }
     const float scale = 1.0f;
     if (atcompat::Libav().av_tx_init(&m_pTransform->context, &m_pTransform->function, AV_TX_FLOAT_FFT, 0, kFftSize,
                                      &scale, 0) < 0) {
@@ -137,7 +159,7 @@ void Spectrogram::DrawColumn(int column, const std::vector<float>& ring, int top
     for (int k = 0; k < kFftSize; ++k) {
         t.in[k] = {ring[(m_ringAt + k) % kFftSize] * t.window[k], 0.0f};
     }
-    t.function(t.context, t.out.data(), t.in.data(), sizeof(AVComplexFloat));
+    t.function(t.context, t.out.get(), t.in.get(), sizeof(AVComplexFloat));
     const double nyquist = m_rate / 2.0;
     const double fullScale = 32768.0 * kFftSize / 4;  // a full-scale sine through the Hann window
     for (int row = 0; row < kPanelHeight; ++row) {

@@ -46,6 +46,7 @@ struct LibavApi {
     decltype(&::swr_convert) swr_convert;
     decltype(&::swr_free) swr_free;
     decltype(&::swr_init) swr_init;
+    decltype(&::avcodec_version) avcodec_version;
 };
 
 // Loads the libraries of the major versions we were compiled against, once per process,

@@ -41,6 +41,7 @@ bool Load(LibavApi* api)
            ATCOMPAT_RESOLVE(util, av_tx_uninit) && ATCOMPAT_RESOLVE(codec, av_new_packet) &&
            ATCOMPAT_RESOLVE(codec, av_packet_alloc) && ATCOMPAT_RESOLVE(codec, av_packet_free) &&
            ATCOMPAT_RESOLVE(codec, av_packet_unref) && ATCOMPAT_RESOLVE(codec, avcodec_alloc_context3) &&
+           ATCOMPAT_RESOLVE(codec, avcodec_version) &&
            ATCOMPAT_RESOLVE(codec, avcodec_find_decoder) && ATCOMPAT_RESOLVE(codec, avcodec_find_encoder) &&
            ATCOMPAT_RESOLVE(codec, avcodec_free_context) && ATCOMPAT_RESOLVE(codec, avcodec_open2) &&
            ATCOMPAT_RESOLVE(codec, avcodec_receive_frame) && ATCOMPAT_RESOLVE(codec, avcodec_receive_packet) &&

@@ -1,0 +1,61 @@
+// Why a movie is refused or a job failed: one table of reasons, each worded once, used by
+// every command and by the JSON reports. The exported code says little (8 covers a text
+// file and a 24-bit movie alike); the reason is found from the paths and the file itself.
+#pragma once
+
+#include <string>
+#include <vector>
+
+enum class Reason {
+    None,
+    Aborted,
+    SourceMissing,
+    SourceIsDirectory,
+    SourceAccessDenied,
+    SameFile,
+    DestinationIsDirectory,
+    DestinationDirectoryMissing,
+    DestinationAccessDenied,
+    DestinationExists,
+    EmptyFile,
+    NotAMovie,
+    WrongBrand,
+    MalformedAtom,
+    Fragmented,
+    NoSoundTrack,
+    UnsupportedSound,
+    UnsupportedLayout,
+    NoAFInformation,
+    AlreadyProcessed,
+    NoSpace,
+    FileTooLarge,
+    OutOfMemory,
+    LibraryRefusedAF,
+    WriteFailed,
+    Internal,
+};
+
+struct ReasonRow {
+    Reason reason;
+    const char* key;    // stable, for JSON
+    int code;           // the exported code that comes with it; -1 when the tool refuses itself
+    const char* words;  // "{}" stands for the detail; without it the detail follows a colon
+};
+const std::vector<ReasonRow>& ReasonTable();
+
+struct Verdict {
+    int code = 0;  // exported code
+    Reason reason = Reason::None;
+    std::string text;  // for people; empty when nothing is wrong
+    const char* Key() const;
+};
+
+Verdict MakeVerdict(int code, Reason reason, const std::string& detail = {});
+// The reason behind exported code `code` (0: none) for a job from `source` to
+// `destination` (empty: a property query).
+Verdict Explain(int code, const std::string& source, const std::string& destination = {});
+// Whether the reason is about the destination rather than the source.
+bool AboutDestination(Reason reason);
+// Whether a job may write `destination`: not the source itself, not a directory, and not a
+// file that stands there unless `replace`.
+Verdict CheckDestination(const std::string& source, const std::string& destination, bool replace);
