@@ -1,0 +1,148 @@
+"""Jobs through the Python module, judged by ffprobe and by the command-line tool.
+
+Run by ctest with TQOVIX_UTILITY_LIBRARY and TQOVIX_TOOL naming the built library and tool;
+exits 77 (skipped) when the library is built with a sanitizer.
+"""
+
+import os
+import shutil
+import subprocess
+import sys
+import tempfile
+import unittest
+
+sys.path.insert(0, os.path.dirname(os.path.abspath(__file__)))
+import tqovix_utility  # noqa: E402
+
+TOOL = os.environ.get("TQOVIX_TOOL", "tqovix")
+
+
+def make_sample(path, *options):
+    subprocess.run([TOOL, "make-sample", path, "--seconds", "3", *options], check=True, stdout=subprocess.DEVNULL)
+
+
+def ffprobe_streams(path):
+    probe = subprocess.run(["ffprobe", "-v", "error", "-show_entries", "stream=codec_type", "-of", "csv=p=0", path],
+                           capture_output=True, text=True)
+    return probe.returncode, probe.stdout.split(), probe.stderr
+
+
+class ModuleTest(unittest.TestCase):
+    @classmethod
+    def setUpClass(cls):
+        cls.samples = tempfile.mkdtemp(prefix="tqovix-python-")
+        cls.pcm = os.path.join(cls.samples, "pcm.mov")
+        cls.aac = os.path.join(cls.samples, "aac.mov")
+        make_sample(cls.pcm)
+        make_sample(cls.aac, "--aac")
+
+    @classmethod
+    def tearDownClass(cls):
+        shutil.rmtree(cls.samples)
+
+    def setUp(self):
+        self.folder = tempfile.mkdtemp(prefix="tqovix-python-job-")
+        self.addCleanup(shutil.rmtree, self.folder)
+
+    def path(self, name):
+        return os.path.join(self.folder, name)
+
+    def test_job_writes_a_movie_ffprobe_reads_and_reports_rising_progress(self):
+        for source in (self.pcm, self.aac):
+            with self.subTest(source=os.path.basename(source)):
+                destination = self.path("out-" + os.path.basename(source))
+                seen = []
+                tqovix_utility.process(source, destination, progress=seen.append)
+                code, streams, errors = ffprobe_streams(destination)
+                self.assertEqual((code, streams, errors), (0, ["video", "audio"], ""))
+                self.assertEqual(seen, sorted(set(seen)))
+                self.assertEqual(seen[-1], 100)
+                self.assertEqual(tqovix_utility.check(destination), (20, "already processed"))
+
+    def test_check_answers_as_the_tool_does(self):
+        # The tool's words for a refusal are DescribeResult's; the module must say the same.
+        processed = self.path("processed.mov")
+        tqovix_utility.process(self.pcm, processed)
+        missing = self.path("missing.mov")
+        self.assertEqual(tqovix_utility.check(self.pcm), (0, "success"))
+        self.assertTrue(tqovix_utility.check(self.pcm).processable)
+        for path, code in ((processed, 20), (missing, 110)):
+            with self.subTest(code=code):
+                verdict = tqovix_utility.check(path)
+                self.assertEqual(verdict.code, code)
+                told = subprocess.run([TOOL, "check", path], capture_output=True, text=True).stdout
+                self.assertEqual(told.strip(), "%s: not processable: %s" % (path, verdict.message))
+
+    def test_refusals_raise_with_the_exported_code_and_leave_no_destination(self):
+        processed = self.path("processed.mov")
+        tqovix_utility.process(self.pcm, processed)
+        text = self.path("notes.txt")
+        with open(text, "w") as notes:
+            notes.write("not a movie\n")
+        rows = (
+            ("already processed", processed, self.path("again.mov"), 20),
+            ("source missing", self.path("missing.mov"), self.path("a.mov"), 110),
+            ("destination folder missing", self.pcm, self.path("no/such/folder.mov"), 111),
+            ("not a movie", text, self.path("b.mov"), 8),
+        )
+        for name, source, destination, code in rows:
+            with self.subTest(name):
+                with self.assertRaises(tqovix_utility.Error) as raised:
+                    tqovix_utility.process(source, destination)
+                self.assertEqual(raised.exception.code, code)
+                self.assertEqual(raised.exception.message, tqovix_utility.describe(code))
+                self.assertFalse(os.path.exists(destination))
+
+    def test_callback_answering_false_aborts_with_200(self):
+        destination = self.path("aborted.mov")
+        calls = []
+
+        def stop_at_first(percent):
+            calls.append(percent)
+            return False
+
+        with self.assertRaises(tqovix_utility.Error) as raised:
+            tqovix_utility.process(self.pcm, destination, progress=stop_at_first)
+        self.assertEqual((raised.exception.code, raised.exception.message), (200, "aborted"))
+        self.assertEqual(len(calls), 1)
+        self.assertFalse(os.path.exists(destination))
+        self.assertEqual(os.listdir(self.folder), [])
+
+    def test_abort_keeps_what_stood_at_the_destination(self):
+        destination = self.path("kept.mov")
+        with open(destination, "wb") as kept:
+            kept.write(b"earlier")
+        calls = []
+
+        def stop_at_thirty(percent):
+            calls.append(percent)
+            return percent < 30
+
+        with self.assertRaises(tqovix_utility.Error) as raised:
+            tqovix_utility.process(self.aac, destination, progress=stop_at_thirty)
+        self.assertEqual(raised.exception.code, 200)
+        # Stopped mid-job, at the first answer of False: no call after it.
+        self.assertGreater(len(calls), 1)
+        self.assertEqual([percent >= 30 for percent in calls].index(True), len(calls) - 1)
+        with open(destination, "rb") as kept:
+            self.assertEqual(kept.read(), b"earlier")
+
+    def test_exception_in_callback_aborts_and_reaches_the_caller(self):
+        destination = self.path("raised.mov")
+
+        def broken(percent):
+            raise KeyError("from the callback")
+
+        with self.assertRaises(KeyError):
+            tqovix_utility.process(self.pcm, destination, progress=broken)
+        self.assertFalse(os.path.exists(destination))
+        # The engine was closed: the next job runs.
+        tqovix_utility.process(self.pcm, destination)
+        self.assertEqual(tqovix_utility.check(destination).code, 20)
+
+
+if __name__ == "__main__":
+    if os.environ.get("TQOVIX_SANITIZE"):
+        print("SKIPPED: python3 cannot load a library built with -fsanitize=" + os.environ["TQOVIX_SANITIZE"])
+        sys.exit(77)
+    unittest.main()
