@@ -4,6 +4,8 @@
 #include "MoovBuilder.h"
 #include "MoviePlan.h"
 
+#include <cerrno>
+#include <cstring>
 #include <algorithm>
 
 namespace moviekit {
@@ -194,11 +196,11 @@ bool MovieWriter::Write(MovieLayout* layout, std::string* error)
         }
         }
         if (!written) {
-            return fail("cannot write the movie");
+            return fail(std::string("cannot write the movie: ") + std::strerror(errno));
         }
     }
     if (!m_sink.Write(m_recipe.trailingBytes)) {
-        return fail("cannot write the movie");
+        return fail(std::string("cannot write the movie: ") + std::strerror(errno));
     }
     if (m_sink.Written() != m_fileSize) {
         return fail("internal error: the movie came out " + std::to_string(m_sink.Written()) + " bytes instead of " +

@@ -1,5 +1,8 @@
 #include "SoundStream.h"
 
+#include <cerrno>
+#include <cstring>
+
 #include <algorithm>
 
 #include "atom/CTqovixAtomControl.h"
@@ -62,7 +65,7 @@ SoundStream::~SoundStream()
 std::string SoundStream::Open(const std::string& path)
 {
     if (TqovixFailed(m_file->Open(path.c_str(), 1))) {
-        return "cannot be opened";
+        return std::string("cannot be opened: ") + std::strerror(errno);
     }
     if (TqovixFailed(m_tree->Initialize(*m_file))) {
         return "not a movie the parser accepts";

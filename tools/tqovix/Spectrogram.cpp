@@ -1,9 +1,11 @@
 #include "Spectrogram.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <cmath>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <memory>
 #include <numbers>
 
@@ -301,9 +303,10 @@ std::string Spectrogram::Save(const std::string& path)
     }
     FILE* file = std::fopen(path.c_str(), "wb");
     if (file == nullptr) {
-        return "cannot create " + path;
+        return "cannot create " + path + ": " + std::strerror(errno);
     }
     const bool written = std::fwrite(packet->data, 1, static_cast<size_t>(packet->size), file) ==
                          static_cast<size_t>(packet->size);
-    return std::fclose(file) == 0 && written ? "" : "cannot write " + path;
+    const bool closed = std::fclose(file) == 0;
+    return closed && written ? "" : "cannot write " + path + ": " + std::strerror(errno);
 }
