@@ -7,6 +7,8 @@
 #include "support/OvixHarness.h"
 
 #include <cstring>
+#include <ostream>
+#include <string>
 #include <tuple>
 
 namespace TC = TqovixInterfaceConvert;
@@ -93,9 +95,8 @@ protected:
     void TearDown() override { TC::TqovixLibraryClose(); }
 };
 
-// Refusals and calls without a session are general failures; verdicts, states and processed pieces
-// are mapped to internal codes.
-TEST_F(BridgeSession, RefusalsVerdictsStatesAndProcessedPiecesAreMapped)
+// Refusals and calls without a session are general failures.
+TEST_F(BridgeSession, CallsOutOfTurnAreGeneralFailures)
 {
     EXPECT_EQ(TC::TqovixLibraryInitialize(), eTqovixErrorGeneral) << "already initialised";
     EXPECT_EQ(TC::TqovixOpenSession(Audio{48, 2, 24, 100}, {}), eTqovixErrorGeneral);
@@ -103,33 +104,47 @@ TEST_F(BridgeSession, RefusalsVerdictsStatesAndProcessedPiecesAreMapped)
     uint8_t out[16];
     UL count = 0;
     EXPECT_EQ(TC::TqovixGetProcessedAFInfo(out, sizeof out, &count), eTqovixErrorGeneral);
-
-    // name, block, IsEnable and end of the session
-    const std::tuple<const char*, Bytes, eTqovixErrorCode> rows[] = {
-        {"Accepted", AfBlock({{10, 20, 500}}), eTqovixEnable},
-        {"NoAfInformation", moviekit::Atom("OP01", {1, 2}), eTqovixVerdict7},
-        {"NotAnAfBlock", AfBlock({}, false, "OP02"), eTqovixVerdict8},
-        {"Malformed", AfBlock({{5, 6, 1}, {1, 2, 1}}), eTqovixVerdict9},
-        {"AlreadyProcessed", AfBlock({}, true), eTqovixVerdict20},
-    };
-    for (const auto& [name, block, isEnable] : rows) {
-        const bool enabled = isEnable == eTqovixEnable;
-        g_af = block;
-        EXPECT_EQ(TC::TqovixIsEnable(g_af.data(), g_af.size()), isEnable) << name;
-        ASSERT_EQ(TC::TqovixOpenSession(Audio{48, 3, 16, 1500}, {}), eTqovixSuccess) << name;
-        eTqovixErrorCode state = eTqovixRunning;
-        EXPECT_TRUE(ovixtest::WaitFor([&] { return (state = TC::TqovixIsSessionFinished()) != eTqovixRunning; }));
-        EXPECT_EQ(state, enabled ? eTqovixFinished : isEnable) << name;
-        // 44 bytes: two full pieces, then the last, marked processed; none after a refusal.
-        Bytes read;
-        for (eTqovixErrorCode piece : {eTqovixRunning, eTqovixRunning, eTqovixFinished}) {
-            count = 0;
-            EXPECT_EQ(TC::TqovixGetProcessedAFInfo(out, sizeof out, &count), enabled ? piece : eTqovixErrorGeneral);
-            read.insert(read.end(), out, out + count);
-        }
-        EXPECT_EQ(read, enabled ? AfBlock({{10, 20, 500}}, true) : Bytes{}) << name;
-        TC::TqovixCloseSession(eTqovixFinished);
-    }
 }
+
+struct SessionRow {
+    const char* name;
+    Bytes (*block)();
+    eTqovixErrorCode isEnable;  // and the end of the session when it is a verdict
+};
+void PrintTo(const SessionRow& row, std::ostream* os) { *os << row.name; }
+
+class BridgeSessionRow : public BridgeSession, public testing::WithParamInterface<SessionRow> {};
+
+TEST_P(BridgeSessionRow, VerdictEndsTheSessionAndProcessedPiecesFollowAcceptance)
+{
+    const eTqovixErrorCode isEnable = GetParam().isEnable;
+    const bool enabled = isEnable == eTqovixEnable;
+    g_af = GetParam().block();
+    EXPECT_EQ(TC::TqovixIsEnable(g_af.data(), g_af.size()), isEnable);
+    ASSERT_EQ(TC::TqovixOpenSession(Audio{48, 3, 16, 1500}, {}), eTqovixSuccess);
+    eTqovixErrorCode state = eTqovixRunning;
+    EXPECT_TRUE(ovixtest::WaitFor([&] { return (state = TC::TqovixIsSessionFinished()) != eTqovixRunning; }));
+    EXPECT_EQ(state, enabled ? eTqovixFinished : isEnable);
+    // 44 bytes: two full pieces, then the last, marked processed; none after a refusal.
+    uint8_t out[16];
+    UL count = 0;
+    Bytes read;
+    for (eTqovixErrorCode piece : {eTqovixRunning, eTqovixRunning, eTqovixFinished}) {
+        count = 0;
+        EXPECT_EQ(TC::TqovixGetProcessedAFInfo(out, sizeof out, &count), enabled ? piece : eTqovixErrorGeneral);
+        read.insert(read.end(), out, out + count);
+    }
+    EXPECT_EQ(read, enabled ? AfBlock({{10, 20, 500}}, true) : Bytes{});
+    TC::TqovixCloseSession(eTqovixFinished);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Blocks, BridgeSessionRow,
+    testing::Values(SessionRow{"Accepted", [] { return AfBlock({{10, 20, 500}}); }, eTqovixEnable},
+                    SessionRow{"NoAfInformation", [] { return moviekit::Atom("OP01", {1, 2}); }, eTqovixVerdict7},
+                    SessionRow{"NotAnAfBlock", [] { return AfBlock({}, false, "OP02"); }, eTqovixVerdict8},
+                    SessionRow{"Malformed", [] { return AfBlock({{5, 6, 1}, {1, 2, 1}}); }, eTqovixVerdict9},
+                    SessionRow{"AlreadyProcessed", [] { return AfBlock({}, true); }, eTqovixVerdict20}),
+    [](const testing::TestParamInfo<SessionRow>& info) { return std::string(info.param.name); });
 
 }  // namespace

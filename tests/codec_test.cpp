@@ -7,8 +7,8 @@
 #include <algorithm>
 #include <array>
 #include <cmath>
+#include <ostream>
 #include <string>
-#include <tuple>
 #include <vector>
 
 #include "Movie.h"
@@ -154,70 +154,101 @@ TEST(AacDecoderTest, DelayDropsExactlyTheFirstPackets)
     }
 }
 
-TEST(AacDecoderTest, PrimingQueriedFromAMovieSetsTheDelay)
+struct PrimingRow {
+    const char* name;
+    void (*edit)(moviekit::MovieRecipe&);  // of a camera's AAC movie, priming 1024
+    eConverterErrorCode status;
+    unsigned int delay;  // after a delay of 5 was set
+};
+void PrintTo(const PrimingRow& row, std::ostream* os) { *os << row.name; }
+
+class PrimingTest : public testing::TestWithParam<PrimingRow> {};
+
+TEST_P(PrimingTest, QueriedFromAMovieSetsTheDelay)
 {
     const Packets packets = SilentPackets(6);
     moviekit::MovieRecipe recipe;
     recipe.sound.codec = moviekit::SoundCodec::Aac;
     recipe.sound.aacPackets = packets;
-    const moviekit::Bytes camera = moviekit::BuildMovie(recipe, nullptr);  // priming 1024
-    recipe.sound.mediaTime = 2112;
-    const moviekit::Bytes platform = moviekit::BuildMovie(recipe, nullptr);
-    recipe.sound.present = false;
-    // name, movie, status, delay after a delay of 5 was set
-    const std::tuple<const char*, moviekit::Bytes, eConverterErrorCode, unsigned int> rows[] = {
-        {"PlatformPrimingMeansOnePacket", platform, eConverterSuccess, 1},
-        {"OtherPrimingKeepsTheDelay", camera, eConverterSuccess, 5},
-        {"NoSoundTrack", moviekit::BuildMovie(recipe, nullptr), static_cast<eConverterErrorCode>(eTqovixErrorInvalidMovie), 5},
-    };
+    GetParam().edit(recipe);
+    testsupport::TempDir dir;
+    const std::string path = dir.File("movie.mov");
+    ASSERT_TRUE(testsupport::WriteFile(path, moviekit::BuildMovie(recipe, nullptr)));
+    AACDecoder decoder;
+    ASSERT_NO_FATAL_FAILURE(OpenDecoder(decoder, kChannels, 5));
+    EXPECT_EQ(decoder.SetDecoderDelay(path.c_str()), GetParam().status);
+    for (unsigned int i = 0; i <= GetParam().delay; ++i) {
+        EXPECT_EQ(Decoded(decoder, packets[i]), i < GetParam().delay ? 0U : 4096U) << "packet " << i;
+    }
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    AacDecoder, PrimingTest,
+    testing::Values(
+        PrimingRow{"PlatformPrimingMeansOnePacket", [](moviekit::MovieRecipe& r) { r.sound.mediaTime = 2112; },
+                   eConverterSuccess, 1},
+        PrimingRow{"OtherPrimingKeepsTheDelay", [](moviekit::MovieRecipe&) {}, eConverterSuccess, 5},
+        PrimingRow{"NoSoundTrack", [](moviekit::MovieRecipe& r) { r.sound.present = false; },
+                   static_cast<eConverterErrorCode>(eTqovixErrorInvalidMovie), 5}),
+    [](const testing::TestParamInfo<PrimingRow>& info) { return std::string(info.param.name); });
+
+TEST(AacDecoderTest, PrimingQueryWithoutAMovieIsRefused)
+{
     testsupport::TempDir dir;
     AACDecoder decoder;
-    for (const auto& [name, bytes, status, delay] : rows) {
-        const std::string path = dir.File(std::string(name) + ".mov");
-        ASSERT_TRUE(testsupport::WriteFile(path, bytes));
-        ASSERT_NO_FATAL_FAILURE(OpenDecoder(decoder, kChannels, 5));
-        EXPECT_EQ(decoder.SetDecoderDelay(path.c_str()), status) << name;
-        for (unsigned int i = 0; i <= delay; ++i) {
-            EXPECT_EQ(Decoded(decoder, packets[i]), i < delay ? 0U : 4096U) << name << ", packet " << i;
-        }
-    }
+    ASSERT_NO_FATAL_FAILURE(OpenDecoder(decoder, kChannels, 5));
     EXPECT_EQ(decoder.SetDecoderDelay(nullptr), eConverterInternal);
     EXPECT_EQ(decoder.SetDecoderDelay(""), eTqovixErrorSourceNotFound);
     EXPECT_EQ(decoder.SetDecoderDelay(dir.File("missing.mov").c_str()), eTqovixErrorSourceNotFound);
 }
 
-TEST(AacEncoderTest, PushesOfAnySizeAreCutIntoBlocksAfterTheDropAndFlushedWithSilence)
+struct Step {  // bytes pushed or kFlush, packets by then, status
+    unsigned int bytes, packetsBy;
+    eConverterErrorCode status = eConverterSuccess;
+};
+struct PushRow {
+    const char* name;
+    bool lend;
+    size_t refuseAt;
+    uint32_t channels;
+    std::vector<Step> steps;
+};
+void PrintTo(const PushRow& row, std::ostream* os) { *os << row.name; }
+
+class EncoderPushTest : public testing::TestWithParam<PushRow> {};
+
+TEST_P(EncoderPushTest, PushesAreCutIntoBlocksAfterTheDrop)
 {
-    struct Step {  // bytes pushed or kFlush, packets by then, status
-        unsigned int bytes, packetsBy;
-        eConverterErrorCode status = eConverterSuccess;
-    };
-    // name, lend, refuseAt, channels
-    const std::vector<std::tuple<const char*, bool, size_t, uint32_t, std::vector<Step>>> rows = {
+    const auto& [name, lend, refuseAt, channels, steps] = GetParam();
+    EncoderRig rig(lend, channels);
+    rig.refuseAt = refuseAt;
+    for (const Step& step : steps) {
+        EXPECT_EQ(rig.Push(step.bytes), step.status);
+        EXPECT_EQ(rig.packets.size(), size_t{step.packetsBy}) << "after pushing " << step.bytes;
+    }
+    EXPECT_EQ(static_cast<size_t>(std::ranges::count(rig.writtenAt, rig.buffer.data())),
+              lend ? rig.packets.size() : 0);
+    // Asked for with the largest packet size, 6144 bits per channel.
+    EXPECT_EQ(rig.requested, std::vector<unsigned int>(lend ? steps.size() : 0, 768U * channels));
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    AacEncoder, EncoderPushTest,
+    testing::Values(
         // 4352 dropped, a block, 1552 held; with the next push exactly one block; the flush
         // sends the 100 held bytes padded with silence, then silence; a second holds nothing.
-        {"RemaindersWait", true, SIZE_MAX, 2, {{10000, 1}, {2544, 2}, {100, 2}, {kFlush, 4}, {kFlush, 5}}},
+        PushRow{"RemaindersWait", true, SIZE_MAX, 2, {{10000, 1}, {2544, 2}, {100, 2}, {kFlush, 4}, {kFlush, 5}}},
         // The drop is 1088 frames however the pushes fall: 4200 bytes, then 152 of the next.
-        {"DropSpansPushes", true, SIZE_MAX, 2, {{4200, 0}, {4096, 0}, {4248, 2}, {kFlush, 3}}},
+        PushRow{"DropSpansPushes", true, SIZE_MAX, 2, {{4200, 0}, {4096, 0}, {4248, 2}, {kFlush, 3}}},
         // Mono: 2176 bytes dropped, blocks of 2048 bytes, silence of 2048.
-        {"MonoBlocksFollowTheFrame", true, SIZE_MAX, 1, {{2176 + 2048, 1}, {2047, 1}, {1, 2}, {kFlush, 3}}},
-        {"OwnBufferWhenNoneIsLent", false, SIZE_MAX, 2, {{kDropBytes + 2 * 4096, 2}}},
-        {"RefusedPacketEndsThePushAndItsRest", true, 1, 2,
-         {{kDropBytes, 0}, {4 * 4096 + 10, 2, kAborted}, {kFlush, 3}}},
-    };
-    for (const auto& [name, lend, refuseAt, channels, steps] : rows) {
-        EncoderRig rig(lend, channels);
-        rig.refuseAt = refuseAt;
-        for (const Step& step : steps) {
-            EXPECT_EQ(rig.Push(step.bytes), step.status) << name;
-            EXPECT_EQ(rig.packets.size(), size_t{step.packetsBy}) << name << " after pushing " << step.bytes;
-        }
-        EXPECT_EQ(static_cast<size_t>(std::ranges::count(rig.writtenAt, rig.buffer.data())),
-                  lend ? rig.packets.size() : 0) << name;
-        // Asked for with the largest packet size, 6144 bits per channel.
-        EXPECT_EQ(rig.requested, std::vector<unsigned int>(lend ? steps.size() : 0, 768U * channels)) << name;
-    }
+        PushRow{"MonoBlocksFollowTheFrame", true, SIZE_MAX, 1, {{2176 + 2048, 1}, {2047, 1}, {1, 2}, {kFlush, 3}}},
+        PushRow{"OwnBufferWhenNoneIsLent", false, SIZE_MAX, 2, {{kDropBytes + 2 * 4096, 2}}},
+        PushRow{"RefusedPacketEndsThePushAndItsRest", true, 1, 2,
+                {{kDropBytes, 0}, {4 * 4096 + 10, 2, kAborted}, {kFlush, 3}}}),
+    [](const testing::TestParamInfo<PushRow>& info) { return std::string(info.param.name); });
 
+TEST(AacEncoderTest, BlocksAreThePcmAfterTheDropAndTheFlushPadsWithSilence)
+{
     // Byte for byte, the blocks of the PCM after its first 4352 bytes; the flush adds the
     // remainder padded with silence, then silence.
     EncoderRig rig;
@@ -237,37 +268,47 @@ TEST(AacEncoderTest, PushesOfAnySizeAreCutIntoBlocksAfterTheDropAndFlushedWithSi
     EXPECT_TRUE(std::equal(expected.begin(), expected.end(), rig.packets.begin()));
 }
 
-TEST(CodecFormatTest, OnlyAacLcAndPcm16AtOneRateAreAccepted)
+ACFormat WithFlags(ACFormat format, uint32_t formatFlags) { return format.formatFlags = formatFlags, format; }
+
+struct FormatRow {
+    const char* name;
+    bool encoding;
+    ACFormat aac, pcm;
+    eConverterErrorCode status;
+};
+void PrintTo(const FormatRow& row, std::ostream* os) { *os << row.name; }
+
+class CodecFormatTest : public testing::TestWithParam<FormatRow> {};
+
+TEST_P(CodecFormatTest, OnlyAacLcAndPcm16AtOneRateAreAccepted)
 {
-    const auto flags = [](ACFormat format, uint32_t formatFlags) { return format.formatFlags = formatFlags, format; };
-    constexpr eConverterErrorCode kRefused = eConverterRefused;
-    const std::tuple<const char*, bool, ACFormat, ACFormat, eConverterErrorCode> rows[] = {
-        // name, encoding, AAC side, PCM side
-        {"PcmToPcm", false, PcmFormat(), PcmFormat(), kRefused},
-        {"FloatPcm", false, AacFormat(), flags(PcmFormat(), 1 | 8), kRefused},
-        {"BigEndianPcm", true, AacFormat(), flags(PcmFormat(), 2 | 12), kRefused},
-        {"NonInterleavedPcm", false, AacFormat(), flags(PcmFormat(), 32 | 12), kRefused},
-        {"HighEfficiency", true, flags(AacFormat(), 5), PcmFormat(), kRefused},
-        {"ChannelMismatch", true, AacFormat(kRate, 1), PcmFormat(), kRefused},
-        {"SevenChannels", true, AacFormat(kRate, 7), PcmFormat(kRate, 7), kRefused},
-        {"NoAacRate", false, AacFormat(44500), PcmFormat(44500), kRefused},
-        {"WouldResample", true, AacFormat(), PcmFormat(44100), kRefused},
-        // Whole-kilohertz labels, on either side, stand for the AAC rates near them.
-        {"LabelOnPcm", true, AacFormat(44100), PcmFormat(44000), eConverterSuccess},
-        {"LabelOnAac", false, AacFormat(22000), PcmFormat(22050), eConverterSuccess},
-    };
-    for (const auto& [name, encoding, aac, pcm, status] : rows) {
-        AACEncoder encoder;
-        AACDecoder decoder;
-        AudioConverterBase& codec = encoding ? static_cast<AudioConverterBase&>(encoder) : decoder;
-        EXPECT_EQ(encoding ? encoder.Initialize(pcm, aac) : decoder.Initialize(aac, pcm), status) << name;
-        UInt32 value = 0;  // a refusal leaves no converter behind
-        unsigned int size = sizeof value;
-        EXPECT_EQ(codec.GetACProperty(kAudioConverterPropertyMaximumOutputPacketSize, &size, &value),
-                  status == eConverterSuccess ? eConverterSuccess : eConverterInternal)
-            << name;
-    }
+    const auto& [name, encoding, aac, pcm, status] = GetParam();
+    AACEncoder encoder;
+    AACDecoder decoder;
+    AudioConverterBase& codec = encoding ? static_cast<AudioConverterBase&>(encoder) : decoder;
+    EXPECT_EQ(encoding ? encoder.Initialize(pcm, aac) : decoder.Initialize(aac, pcm), status);
+    UInt32 value = 0;  // a refusal leaves no converter behind
+    unsigned int size = sizeof value;
+    EXPECT_EQ(codec.GetACProperty(kAudioConverterPropertyMaximumOutputPacketSize, &size, &value),
+              status == eConverterSuccess ? eConverterSuccess : eConverterInternal);
 }
+
+constexpr eConverterErrorCode kRefused = eConverterRefused;
+INSTANTIATE_TEST_SUITE_P(
+    Formats, CodecFormatTest,
+    testing::Values(FormatRow{"PcmToPcm", false, PcmFormat(), PcmFormat(), kRefused},
+                    FormatRow{"FloatPcm", false, AacFormat(), WithFlags(PcmFormat(), 1 | 8), kRefused},
+                    FormatRow{"BigEndianPcm", true, AacFormat(), WithFlags(PcmFormat(), 2 | 12), kRefused},
+                    FormatRow{"NonInterleavedPcm", false, AacFormat(), WithFlags(PcmFormat(), 32 | 12), kRefused},
+                    FormatRow{"HighEfficiency", true, WithFlags(AacFormat(), 5), PcmFormat(), kRefused},
+                    FormatRow{"ChannelMismatch", true, AacFormat(kRate, 1), PcmFormat(), kRefused},
+                    FormatRow{"SevenChannels", true, AacFormat(kRate, 7), PcmFormat(kRate, 7), kRefused},
+                    FormatRow{"NoAacRate", false, AacFormat(44500), PcmFormat(44500), kRefused},
+                    FormatRow{"WouldResample", true, AacFormat(), PcmFormat(44100), kRefused},
+                    // Whole-kilohertz labels, on either side, stand for the AAC rates near them.
+                    FormatRow{"LabelOnPcm", true, AacFormat(44100), PcmFormat(44000), eConverterSuccess},
+                    FormatRow{"LabelOnAac", false, AacFormat(22000), PcmFormat(22050), eConverterSuccess}),
+    [](const testing::TestParamInfo<FormatRow>& info) { return std::string(info.param.name); });
 
 TEST(CodecBadInputTest, BadPacketsMissingConvertersAndNullArgumentsAreStatuses)
 {

@@ -5,6 +5,8 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <ostream>
+#include <string>
 
 namespace {
 
@@ -93,26 +95,37 @@ TEST(MovieKitTest, PcmInTheTrackByteOrderAndMakerAtoms)
     EXPECT_TRUE(Contains(file, moviekit::Atom("TCTG", moviekit::SerializeTags(tags))));
 }
 
-TEST(MovieKitTest, InvalidDescriptionsAreRefused)
+struct InvalidRecipe {
+    const char* name;
+    void (*apply)(Recipe&);
+};
+void PrintTo(const InvalidRecipe& row, std::ostream* os) { *os << row.name; }
+
+class InvalidRecipeTest : public testing::TestWithParam<InvalidRecipe> {};
+
+TEST_P(InvalidRecipeTest, IsRefusedWithAReason)
 {
-    const std::vector<std::pair<const char*, void (*)(Recipe&)>> rows = {
-        {"no channels", [](Recipe& r) { r.sound.channels = 0; }},
-        {"rate beyond 16.16", [](Recipe& r) { r.sound.sampleRate = 96000; }},
-        {"ragged PCM", [](Recipe& r) { r.sound.pcm = {1, 2, 3}; }},
-        {"PCM and count disagree", [](Recipe& r) { r.sound.pcm = {1, 2}; r.sound.sampleCount = 5; }},
-        {"empty chunk", [](Recipe& r) { r.sound.chunkSampleCounts = {5, 0}; }},
-        {"chunks short of count", [](Recipe& r) { r.sound.sampleCount = 9; r.sound.chunkSampleCounts = {1, 2}; }},
-        {"generated 6-channel AAC", [](Recipe& r) { r.sound.codec = SoundCodec::Aac; r.sound.channels = 6; }},
-        {"no frames", [](Recipe& r) { r.video.frameCount = 0; }},
-        {"movie time scale 0", [](Recipe& r) { r.movieTimeScale = 0; }},
-    };
-    for (const auto& [name, apply] : rows) {
-        Recipe recipe;
-        apply(recipe);
-        std::string error;
-        EXPECT_TRUE(moviekit::BuildMovie(recipe, nullptr, &error).empty()) << name;
-        EXPECT_FALSE(error.empty()) << name;
-    }
+    Recipe recipe;
+    GetParam().apply(recipe);
+    std::string error;
+    EXPECT_TRUE(moviekit::BuildMovie(recipe, nullptr, &error).empty());
+    EXPECT_FALSE(error.empty());
 }
+
+INSTANTIATE_TEST_SUITE_P(
+    MovieKit, InvalidRecipeTest,
+    testing::Values(
+        InvalidRecipe{"NoChannels", [](Recipe& r) { r.sound.channels = 0; }},
+        InvalidRecipe{"RateBeyond16_16", [](Recipe& r) { r.sound.sampleRate = 96000; }},
+        InvalidRecipe{"RaggedPcm", [](Recipe& r) { r.sound.pcm = {1, 2, 3}; }},
+        InvalidRecipe{"PcmAndCountDisagree", [](Recipe& r) { r.sound.pcm = {1, 2}; r.sound.sampleCount = 5; }},
+        InvalidRecipe{"EmptyChunk", [](Recipe& r) { r.sound.chunkSampleCounts = {5, 0}; }},
+        InvalidRecipe{"ChunksShortOfCount",
+                      [](Recipe& r) { r.sound.sampleCount = 9; r.sound.chunkSampleCounts = {1, 2}; }},
+        InvalidRecipe{"GeneratedSixChannelAac",
+                      [](Recipe& r) { r.sound.codec = SoundCodec::Aac; r.sound.channels = 6; }},
+        InvalidRecipe{"NoFrames", [](Recipe& r) { r.video.frameCount = 0; }},
+        InvalidRecipe{"MovieTimeScale0", [](Recipe& r) { r.movieTimeScale = 0; }}),
+    [](const testing::TestParamInfo<InvalidRecipe>& info) { return std::string(info.param.name); });
 
 }  // namespace
