@@ -143,25 +143,10 @@ TEST_F(ApiTest, SecondJobAndCallbackAreRefusedWhileOneRuns)
     EXPECT_EQ(testsupport::ReadFile(other), (std::vector<uint8_t>{1, 2, 3}));
 }
 
-TEST_F(ApiTest, SameFileUnderAnySpellingIsRefused)
-{
-    const std::string source = Write(Recipe{}, "src.mov");
-    const auto before = StampFile(source);
-    const std::string link = m_dir.File("link.mov");
-    ASSERT_EQ(symlink(source.c_str(), link.c_str()), 0);
-    for (const std::string& destination :
-         {source, std::filesystem::relative(source).string(), m_dir.Path() + "/./src.mov", link}) {
-        SCOPED_TRACE(destination);
-        EXPECT_EQ(TqExecuteOVIX(source.c_str(), destination.c_str()), 190);
-        EXPECT_EQ(StampFile(source), before);
-        EXPECT_TRUE(std::filesystem::is_symlink(link));
-    }
-}
-
 // ---- A failed job costs no file ----
 
 enum class Failure { MissingSource, DirectorySource, NotAMovie, ProcessedMovie, SameFile, SameFileRelative,
-                     SameFileDotted, AbortHalfway, FullVolume };
+                     SameFileDotted, SameFileLinked, AbortHalfway, FullVolume };
 struct FailedJob {
     const char* name;
     Failure failure;
@@ -214,6 +199,10 @@ TEST_P(FailedJobTest, TheDestinationKeepsItsOldBytes)
     case Failure::SameFile: destination = source; break;
     case Failure::SameFileRelative: destination = std::filesystem::relative(source).string(); break;
     case Failure::SameFileDotted: destination = m_dir.Path() + "/./src.mov"; break;
+    case Failure::SameFileLinked:
+        ASSERT_TRUE(std::filesystem::remove(destination));
+        std::filesystem::create_symlink(source, destination);
+        break;
     default: break;
     }
     const bool sourceIsFile = std::filesystem::is_regular_file(source);
@@ -232,6 +221,7 @@ TEST_P(FailedJobTest, TheDestinationKeepsItsOldBytes)
     EXPECT_EQ(ended, row.expected);
     EXPECT_EQ(StampFile(destination), destinationBefore);  // bytes and time
     EXPECT_EQ(sourceIsFile ? StampFile(source) : jobtest::FileStamp{}, sourceBefore);
+    EXPECT_EQ(std::filesystem::is_symlink(destination), row.failure == Failure::SameFileLinked);
     // Nothing else new beside them.
     for (const auto& entry : std::filesystem::directory_iterator(m_dir.Path())) {
         const std::string name = entry.path().filename().string();
@@ -247,6 +237,7 @@ INSTANTIATE_TEST_SUITE_P(Failures, FailedJobTest,
                                            FailedJob{"SameFile", Failure::SameFile, 190},
                                            FailedJob{"SameFileRelative", Failure::SameFileRelative, 190},
                                            FailedJob{"SameFileDotted", Failure::SameFileDotted, 190},
+                                           FailedJob{"SameFileLinked", Failure::SameFileLinked, 190},
                                            FailedJob{"AbortHalfway", Failure::AbortHalfway, 200},
                                            FailedJob{"FullVolume", Failure::FullVolume, 131}),
                          [](const ::testing::TestParamInfo<FailedJob>& info) { return std::string(info.param.name); });
@@ -266,28 +257,41 @@ int PropertyAsNobody(const std::string& path)
     return child > 0 && waitpid(child, &status, 0) == child && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
-TEST_F(ApiTest, PropertyVerdictsLeaveFileAndEngineAlone)
+struct PropertyRow {
+    const char* name;
+    void (*edit)(Recipe&);
+    int expected;
+};
+void PrintTo(const PropertyRow& row, std::ostream* out) { *out << row.name; }
+
+class PropertyVerdictTest : public ApiTest, public ::testing::WithParamInterface<PropertyRow> {};
+
+TEST_P(PropertyVerdictTest, LeavesFileAndEngineAlone)
 {
-    const std::pair<void (*)(Recipe&), int> movies[] = {
-        {[](Recipe&) {}, 0},
-        {[](Recipe& r) { r.maker.afProcessed = true; }, 20},
-        {[](Recipe& r) { r.maker.afIntervals = std::vector<moviekit::AfInterval>{{100, 400, 500}, {200, 300, 500}}; },
-         9},  // overlapping intervals
-        {[](Recipe& r) { r.maker.afPayload = moviekit::Bytes{'A', 'F'}; }, 7},
-        {[](Recipe& r) { r.maker.afInformation = false; }, 8},
-        {[](Recipe& r) { r.majorBrand = "isom"; }, 8},
-    };
-    int row = 0;
-    for (const auto& [edit, expected] : movies) {
-        SCOPED_TRACE(row);
-        Recipe recipe;
-        edit(recipe);
-        const std::string path = Write(recipe, "movie" + std::to_string(row++) + ".mov");
-        const auto before = StampFile(path);
-        EXPECT_EQ(TqGetPropertyOVIX(path.c_str()), expected);
-        EXPECT_EQ(StampFile(path), before);
-        EXPECT_EQ(TqIsFinishedOVIX(), 1);
-    }
+    Recipe recipe;
+    GetParam().edit(recipe);
+    const std::string path = Write(recipe, "movie.mov");
+    const auto before = StampFile(path);
+    EXPECT_EQ(TqGetPropertyOVIX(path.c_str()), GetParam().expected);
+    EXPECT_EQ(StampFile(path), before);
+    EXPECT_EQ(TqIsFinishedOVIX(), 1);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Verdicts, PropertyVerdictTest,
+    ::testing::Values(
+        PropertyRow{"Camera", [](Recipe&) {}, 0},
+        PropertyRow{"Processed", [](Recipe& r) { r.maker.afProcessed = true; }, 20},
+        PropertyRow{"OverlappingIntervals",
+                    [](Recipe& r) { r.maker.afIntervals = std::vector<moviekit::AfInterval>{{100, 400, 500}, {200, 300, 500}}; },
+                    9},
+        PropertyRow{"ShortAfBlock", [](Recipe& r) { r.maker.afPayload = moviekit::Bytes{'A', 'F'}; }, 7},
+        PropertyRow{"NoAfBlock", [](Recipe& r) { r.maker.afInformation = false; }, 8},
+        PropertyRow{"OtherBrand", [](Recipe& r) { r.majorBrand = "isom"; }, 8}),
+    [](const ::testing::TestParamInfo<PropertyRow>& info) { return std::string(info.param.name); });
+
+TEST_F(ApiTest, PropertyQueryNamesMissingDirectoryAndUnreadable)
+{
     EXPECT_EQ(TqGetPropertyOVIX(m_dir.File("absent.mov").c_str()), 110);
     EXPECT_EQ(TqGetPropertyOVIX(m_dir.Path().c_str()), 190);
 

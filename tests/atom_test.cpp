@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <functional>
+#include <ostream>
 #include <string>
 #include <vector>
 
@@ -11,6 +12,7 @@
 #include "atom/CTqovixLeafAtom.h"
 #include "file/CTqovixFile.h"
 #include "support/TestSupport.h"
+#include "support/TreeTest.h"
 
 using moviekit::Atom;
 using moviekit::AtomOptions;
@@ -41,42 +43,7 @@ Bytes SampleMovie()
                                       Container("udta", {Container("TCDT", {Atom("TCTG", Bytes(27, 8))})})})});
 }
 
-class AtomFileTest : public ::testing::Test {
-protected:
-    // A new name each time: a tree may still point into an earlier file.
-    std::string Open(CTqovixFile& file, int mode, const Bytes& bytes = {})
-    {
-        const std::string path = m_dir.File(std::to_string(m_files++) + ".mov");
-        file.Close();
-        EXPECT_TRUE(mode == 2 || testsupport::WriteFile(path, bytes));
-        EXPECT_EQ(file.Open(path.c_str(), mode), eTqovixSuccess);
-        return path;
-    }
-
-    eTqovixErrorCode Parse(const Bytes& bytes)
-    {
-        Open(m_source, 1, bytes);
-        return m_control.Initialize(m_source);
-    }
-
-    Bytes WriteBack()
-    {
-        TqovixAtomList atoms;
-        m_control.GetAtoms(atoms);
-        CTqovixFile out;
-        const std::string path = Open(out, 2);
-        for (const auto& atom : atoms) {
-            EXPECT_EQ(atom->Write(out), eTqovixSuccess);
-        }
-        out.Close();
-        return testsupport::ReadFile(path);
-    }
-
-    testsupport::TempDir m_dir;
-    CTqovixFile m_source;
-    CTqovixAtomControl m_control;
-    int m_files = 0;
-};
+using AtomFileTest = testsupport::TreeTest;
 
 // Records what a walk shows it and answers from a script keyed by path text.
 struct RecordingVisitor : CTqovixAtomVisitor {
@@ -120,73 +87,90 @@ TEST_F(AtomFileTest, LeavesReadTheirPayloadOnceAndPickTheirHeaderAtTheThirtyTwoB
     EXPECT_EQ(CTqovixContainerAtom(TqovixAtom::kMoov, children).GetSize(), 4294967304ULL);
 
     const Bytes payload = {1, 2, 3, 4, 5, 6, 7, 8, 9};
-    const std::string path = Open(m_source, 1, Concat({Bytes(8, 0xEE), payload}));
-    CTqovixLeafAtom leaf(TqovixAtom::kOP01, &m_source, 8, payload.size());
+    const std::string path = Open(m_file, 1, Concat({Bytes(8, 0xEE), payload}));
+    CTqovixLeafAtom leaf(TqovixAtom::kOP01, &m_file, 8, payload.size());
     const uint8_t* data = leaf.GetData();
     ASSERT_NE(data, nullptr);
     EXPECT_EQ(Bytes(data, data + payload.size()), payload);
-    m_source.Close();
+    m_file.Close();
     ASSERT_EQ(leaf.GetData(), data) << "a second read comes from memory";
 
     // A payload claimed far beyond the file neither allocates nor reads.
-    ASSERT_EQ(m_source.Open(path.c_str(), 1), eTqovixSuccess);
-    CTqovixLeafAtom huge(TqovixAtom::kOP01, &m_source, 8, 4ULL << 30);
+    ASSERT_EQ(m_file.Open(path.c_str(), 1), eTqovixSuccess);
+    CTqovixLeafAtom huge(TqovixAtom::kOP01, &m_file, 8, 4ULL << 30);
     EXPECT_EQ(huge.GetData(), nullptr);
     EXPECT_EQ(huge.LoadData(), eTqovixErrorInvalidMovie);
 }
 
-TEST_F(AtomFileTest, RefusesBrokenFilesAndWritesAcceptedOnesBackIdentical)
+Bytes Qt(const Bytes& rest) { return Concat({Ftyp("qt  "), rest}); }
+Bytes Sized(const char* type, uint32_t size, size_t payload)
 {
-    const auto qt = [](const Bytes& rest) { return Concat({Ftyp("qt  "), rest}); };
-    const auto sized = [](const char* type, uint32_t size, size_t payload) {
-        return Atom(type, Bytes(payload, 0), AtomOptions{.overrideSize = true, .sizeOverride = size});
-    };
-    const Bytes moov = Container("moov", {Atom("mvhd", Bytes(20, 0))});
-    const std::vector<Bytes> frees(CTqovixAtomControl::kMaxAtoms, Atom("free", {}));  // with ftyp, one too many
-    const eTqovixErrorCode ok = eTqovixSuccess, bad = eTqovixErrorInvalidMovie;
-    const struct {
-        const char* name;
-        Bytes bytes;
-        eTqovixErrorCode expected;
-    } cases[] = {
-        {"mp42 after moov", Concat({moov, Ftyp("mp42"), Atom("mdat", {})}), ok},
-        {"moov with a 64-bit size", qt(Container("moov", {Atom("mvhd", Bytes(20, 0))}, {.largeHeader = true})), ok},
-        {"deepest nesting", qt(Nested(CTqovixAtomControl::kMaxDepth + 1)), ok},
-        {"one level deeper", qt(Nested(CTqovixAtomControl::kMaxDepth + 2)), bad},
-        {"other brand", Concat({Ftyp("isom"), moov}), bad},
-        {"no ftyp", moov, bad},
-        {"ftyp payload of three bytes", Concat({Atom("ftyp", {'q', 't', ' '}), moov}), bad},
-        {"ftyp one byte over 1 MiB", Concat({Ftyp("qt  " + std::string((1 << 20) - 3, ' ')), moov}), bad},
-        {"empty file", {}, bad},
-        {"truncated extended header", qt({0, 0, 0, 1, 'm', 'd', 'a', 't', 0}), bad},
-        {"last atom claims eight more", qt(sized("mdat", 24, 8)), bad},
-        {"size zero", qt(sized("mdat", 0, 8)), bad},
-        {"extended size fifteen", qt({0, 0, 0, 1, 'm', 'd', 'a', 't', 0, 0, 0, 0, 0, 0, 0, 15, 0, 0, 0, 0}), bad},
-        {"child runs past its parent", qt(Concat({Container("moov", {sized("mvhd", 32, 20)}), Atom("free", {})})), bad},
-        {"child smaller than its header", qt(Container("moov", {sized("mvhd", 4, 20)})), bad},
-        {"more atoms than the bound", qt(Concat(frees)), bad},
-    };
-    CTqovixFile closed;
-    EXPECT_EQ(m_control.Initialize(closed), eTqovixErrorInternal);
+    return Atom(type, Bytes(payload, 0), AtomOptions{.overrideSize = true, .sizeOverride = size});
+}
+Bytes SmallMoov() { return Container("moov", {Atom("mvhd", Bytes(20, 0))}); }
+
+struct FileRow {
+    const char* name;
+    Bytes (*bytes)();
+    bool accepted;
+};
+void PrintTo(const FileRow& row, std::ostream* os) { *os << row.name; }
+
+class AtomFileRowTest : public AtomFileTest, public ::testing::WithParamInterface<FileRow> {};
+
+TEST_P(AtomFileRowTest, RefusedOrWrittenBackIdentical)
+{
+    ASSERT_EQ(Load(SampleMovie()), eTqovixSuccess);
     TqovixAtomList before, after;
-    for (const auto& c : cases) {
-        SCOPED_TRACE(c.name);
-        m_control.GetAtoms(before);
-        EXPECT_EQ(Parse(c.bytes), c.expected);
-        m_control.GetAtoms(after);
-        // A refused file leaves the previous tree as it was.
-        EXPECT_EQ(after == before, c.expected != ok);
-        if (c.expected == ok) {
-            EXPECT_EQ(WriteBack(), c.bytes);
-        }
+    m_tree.GetAtoms(before);
+    const Bytes bytes = GetParam().bytes();
+    EXPECT_EQ(Load(bytes), GetParam().accepted ? eTqovixSuccess : eTqovixErrorInvalidMovie);
+    m_tree.GetAtoms(after);
+    // A refused file leaves the previous tree as it was.
+    EXPECT_EQ(after == before, !GetParam().accepted);
+    if (GetParam().accepted) {
+        EXPECT_EQ(WriteTree(), bytes);
     }
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Files, AtomFileRowTest,
+    ::testing::Values(
+        FileRow{"Mp42AfterMoov", [] { return Concat({SmallMoov(), Ftyp("mp42"), Atom("mdat", {})}); }, true},
+        FileRow{"MoovWithA64BitSize",
+                [] { return Qt(Container("moov", {Atom("mvhd", Bytes(20, 0))}, {.largeHeader = true})); }, true},
+        FileRow{"DeepestNesting", [] { return Qt(Nested(CTqovixAtomControl::kMaxDepth + 1)); }, true},
+        FileRow{"OneLevelDeeper", [] { return Qt(Nested(CTqovixAtomControl::kMaxDepth + 2)); }, false},
+        FileRow{"OtherBrand", [] { return Concat({Ftyp("isom"), SmallMoov()}); }, false},
+        FileRow{"NoFtyp", [] { return SmallMoov(); }, false},
+        FileRow{"FtypPayloadOfThreeBytes", [] { return Concat({Atom("ftyp", {'q', 't', ' '}), SmallMoov()}); }, false},
+        FileRow{"FtypOneByteOver1MiB",
+                [] { return Concat({Ftyp("qt  " + std::string((1 << 20) - 3, ' ')), SmallMoov()}); }, false},
+        FileRow{"EmptyFile", [] { return Bytes{}; }, false},
+        FileRow{"TruncatedExtendedHeader", [] { return Qt({0, 0, 0, 1, 'm', 'd', 'a', 't', 0}); }, false},
+        FileRow{"LastAtomClaimsEightMore", [] { return Qt(Sized("mdat", 24, 8)); }, false},
+        FileRow{"SizeZero", [] { return Qt(Sized("mdat", 0, 8)); }, false},
+        FileRow{"ExtendedSizeFifteen",
+                [] { return Qt({0, 0, 0, 1, 'm', 'd', 'a', 't', 0, 0, 0, 0, 0, 0, 0, 15, 0, 0, 0, 0}); }, false},
+        FileRow{"ChildRunsPastItsParent",
+                [] { return Qt(Concat({Container("moov", {Sized("mvhd", 32, 20)}), Atom("free", {})})); }, false},
+        FileRow{"ChildSmallerThanItsHeader", [] { return Qt(Container("moov", {Sized("mvhd", 4, 20)})); }, false},
+        // With ftyp, one too many.
+        FileRow{"MoreAtomsThanTheBound",
+                [] { return Qt(Concat(std::vector<Bytes>(CTqovixAtomControl::kMaxAtoms, Atom("free", {})))); }, false}),
+    [](const ::testing::TestParamInfo<FileRow>& info) { return std::string(info.param.name); });
+
+TEST_F(AtomFileTest, AClosedFileIsNotParsed)
+{
+    CTqovixFile closed;
+    EXPECT_EQ(m_tree.Initialize(closed), eTqovixErrorInternal);
 }
 
 TEST_F(AtomFileTest, WalksFollowTrackRulesAndTheVisitorsAnswers)
 {
-    ASSERT_EQ(Parse(SampleMovie()), eTqovixSuccess);
+    ASSERT_EQ(Load(SampleMovie()), eTqovixSuccess);
     RecordingVisitor visitor;
-    EXPECT_EQ(m_control.Analyze(visitor), eTqovixErrorInvalidMovie) << "a walk nothing stopped found nothing";
+    EXPECT_EQ(m_tree.Analyze(visitor), eTqovixErrorInvalidMovie) << "a walk nothing stopped found nothing";
     // Each track's media comes before its header and edits; the short user data is not entered.
     const std::string t = "moov/trak", stbl = t + "/mdia/minf/stbl";
     const std::vector<std::string> media = {t + "/mdia", t + "/mdia/mdhd", t + "/mdia/minf", stbl, stbl + "/stsd",
@@ -227,9 +211,9 @@ TEST_F(AtomFileTest, WalksFollowTrackRulesAndTheVisitorsAnswers)
     };
     for (const auto& c : cases) {
         V analyze(c.answer), steered(c.answer);
-        EXPECT_EQ(m_control.Analyze(analyze), c.analyzeResult);
+        EXPECT_EQ(m_tree.Analyze(analyze), c.analyzeResult);
         EXPECT_EQ(analyze.seen.back(), c.lastSeen);
-        EXPECT_EQ(m_control.Update(steered), c.updateResult);
+        EXPECT_EQ(m_tree.Update(steered), c.updateResult);
     }
 
     CTqovixAtomControl empty;

@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <ostream>
 #include <string>
 #include <vector>
 
@@ -9,6 +10,7 @@
 #include "atom/CTqovixContainerAtom.h"
 #include "file/CTqovixFile.h"
 #include "support/TestSupport.h"
+#include "support/TreeTest.h"
 #include "visitor/CTqovixMakerBlockVisitor.h"
 #include "visitor/CTqovixTCTGAtomVisitor.h"
 #include "visitor/CTqovixTrimInformationVisitor.h"
@@ -45,18 +47,8 @@ Bytes MovieWith(const Bytes& tags, const std::vector<Bytes>& makerBlocks = {})
 
 Bytes Copy(const uint8_t* data, uint64_t size) { return data == nullptr ? Bytes{} : Bytes(data, data + size); }
 
-class TagTreeTest : public ::testing::Test {
+class TagTreeTest : public testsupport::TreeTest {
 protected:
-    eTqovixErrorCode Load(const Bytes& movie)
-    {
-        m_tree.Close();
-        m_file.Close();
-        const std::string path = m_dir.File("movie" + std::to_string(m_loads++) + ".mov");
-        EXPECT_TRUE(testsupport::WriteFile(path, movie));
-        EXPECT_EQ(m_file.Open(path.c_str(), 1), eTqovixSuccess);
-        return m_tree.Initialize(m_file);
-    }
-
     // The payload of moov/udta/TCDT/TCTG as MovieWith lays it out.
     Bytes TagPayload()
     {
@@ -69,41 +61,46 @@ protected:
         EXPECT_EQ(atom->GetType(), TqovixAtom::kTCTG);
         return Copy(atom->GetData(), atom->GetDataSize());
     }
-
-    testsupport::TempDir m_dir;
-    CTqovixFile m_file;
-    CTqovixAtomControl m_tree;
-    int m_loads = 0;
 };
 
-TEST_F(TagTreeTest, ReadsTheThreeTrimTags)
+struct TrimRow {
+    const char* name;
+    Bytes (*tags)();
+    std::vector<uint32_t> read;  // forward, backward, rate; none when refused
+};
+void PrintTo(const TrimRow& row, std::ostream* os) { *os << row.name; }
+
+class TrimTagTest : public TagTreeTest, public ::testing::WithParamInterface<TrimRow> {};
+
+TEST_P(TrimTagTest, ReadsTheThreeTrimTagsOrRefuses)
 {
-    const struct {
-        const char* name;
-        Bytes tags;
-        std::vector<uint32_t> read;  // forward, backward, rate; none when refused
-    } cases[] = {
-        {"forward with one value", Concat({Tag(0, 20, 4, 1, {12}), kBackward, kRate}), {}},
-        {"signed rational", Concat({kForward, kBackward, Tag(0, 22, 10, 1, {30000, 1001})}), {}},
-        {"group one", Concat({Tag(1, 20, 4, 2, {1, 0}), Tag(1, 21, 4, 2, {1, 0}), Tag(1, 22, 5, 1, {1, 1})}), {}},
-        {"forward twice, no backward", Concat({kForward, Tag(0, 20, 4, 2, {3, 0}), kRate}), {3, 0, 30000, 1001}},
-        {"count past the payload", Concat({kForward, Tag(0, 21, 4, 65535, {1, 2})}), {}},
-        // Tags behind the third acceptance are never read, even a broken one.
-        {"stops after the third", Concat({kForward, kBackward, kRate, Tag(0, 20, 4, 65535, {})}), {12, 7, 30000, 1001}},
-    };
-    for (const auto& c : cases) {
-        SCOPED_TRACE(c.name);
-        ASSERT_EQ(Load(MovieWith(c.tags)), eTqovixSuccess);
-        CTqovixTrimInformationVisitor v;
-        EXPECT_EQ(m_tree.Analyze(v), c.read.empty() ? eTqovixErrorInvalidMovie : eTqovixSuccess);
-        if (!c.read.empty()) {
-            EXPECT_EQ((std::vector<uint32_t>{v.GetRemovedFrameForward(), v.GetRemovedFrameBackward(),
-                                             v.GetFrameRateNumerator(), v.GetFrameRateDenominator()}),
-                      c.read);
-        }
-        EXPECT_EQ(m_tree.Update(v), eTqovixErrorInternal) << "the trim visitor reads only";
+    const std::vector<uint32_t>& read = GetParam().read;
+    ASSERT_EQ(Load(MovieWith(GetParam().tags())), eTqovixSuccess);
+    CTqovixTrimInformationVisitor v;
+    EXPECT_EQ(m_tree.Analyze(v), read.empty() ? eTqovixErrorInvalidMovie : eTqovixSuccess);
+    if (!read.empty()) {
+        EXPECT_EQ((std::vector<uint32_t>{v.GetRemovedFrameForward(), v.GetRemovedFrameBackward(),
+                                         v.GetFrameRateNumerator(), v.GetFrameRateDenominator()}),
+                  read);
     }
+    EXPECT_EQ(m_tree.Update(v), eTqovixErrorInternal) << "the trim visitor reads only";
 }
+
+INSTANTIATE_TEST_SUITE_P(
+    Trim, TrimTagTest,
+    ::testing::Values(
+        TrimRow{"ForwardWithOneValue", [] { return Concat({Tag(0, 20, 4, 1, {12}), kBackward, kRate}); }, {}},
+        TrimRow{"SignedRational", [] { return Concat({kForward, kBackward, Tag(0, 22, 10, 1, {30000, 1001})}); }, {}},
+        TrimRow{"GroupOne",
+                [] { return Concat({Tag(1, 20, 4, 2, {1, 0}), Tag(1, 21, 4, 2, {1, 0}), Tag(1, 22, 5, 1, {1, 1})}); },
+                {}},
+        TrimRow{"ForwardTwiceNoBackward", [] { return Concat({kForward, Tag(0, 20, 4, 2, {3, 0}), kRate}); },
+                {3, 0, 30000, 1001}},
+        TrimRow{"CountPastThePayload", [] { return Concat({kForward, Tag(0, 21, 4, 65535, {1, 2})}); }, {}},
+        // Tags behind the third acceptance are never read, even a broken one.
+        TrimRow{"StopsAfterTheThird", [] { return Concat({kForward, kBackward, kRate, Tag(0, 20, 4, 65535, {})}); },
+                {12, 7, 30000, 1001}}),
+    [](const ::testing::TestParamInfo<TrimRow>& info) { return std::string(info.param.name); });
 
 TEST_F(TagTreeTest, SoftwareNameReplacesTheFirstOldOneAndKeepsEverythingElse)
 {

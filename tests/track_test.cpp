@@ -16,6 +16,7 @@
 #include "file/CTqovixFile.h"
 #include "support/ChunkTables.h"
 #include "support/TestSupport.h"
+#include "support/TreeTest.h"
 #include "visitor/CTqovixAudioDataVisitor.h"
 #include "visitor/CTqovixAudioInformationVisitor.h"
 #include "visitor/CTqovixMovieDataVisitor.h"
@@ -258,37 +259,7 @@ TEST(ChunkBoundsTest, ChunksMayEndAtTheFileEndButNotBeyondOrWrapAround)
 
 // ---- Visitors over whole trees ----
 
-class TrackTest : public ::testing::Test {
-protected:
-    eTqovixErrorCode Load(const Bytes& movie)
-    {
-        m_tree.Close();
-        m_file.Close();
-        const std::string path = m_dir.File("movie" + std::to_string(m_files++) + ".mov");
-        EXPECT_TRUE(testsupport::WriteFile(path, movie));
-        EXPECT_EQ(m_file.Open(path.c_str(), 1), eTqovixSuccess);
-        return m_tree.Initialize(m_file);
-    }
-
-    Bytes WriteTree()
-    {
-        TqovixAtomList atoms;
-        m_tree.GetAtoms(atoms);
-        CTqovixFile out;
-        const std::string path = m_dir.File("written" + std::to_string(m_files++) + ".mov");
-        EXPECT_EQ(out.Open(path.c_str(), 2), eTqovixSuccess);
-        for (const auto& atom : atoms) {
-            EXPECT_EQ(atom->Write(out), eTqovixSuccess);
-        }
-        out.Close();
-        return testsupport::ReadFile(path);
-    }
-
-    testsupport::TempDir m_dir;
-    CTqovixFile m_file;
-    CTqovixAtomControl m_tree;
-    int m_files = 0;
-};
+using TrackTest = testsupport::TreeTest;
 
 struct DescriptionRow {
     const char* name;
@@ -400,6 +371,44 @@ TEST_F(TrackTest, EachTrackIsDecidedWhenItEnds)
     EXPECT_EQ(m_tree.Analyze(none), eTqovixErrorInvalidMovie);
 }
 
+struct MismatchRow {
+    const char* name;
+    void (*change)(Chunks& sound, Chunks& video);
+};
+void PrintTo(const MismatchRow& row, std::ostream* os) { *os << row.name; }
+
+class RecordMismatchTest : public TrackTest, public ::testing::WithParamInterface<MismatchRow> {};
+
+// Records that do not match the table's entries change nothing.
+TEST_P(RecordMismatchTest, ChangesNothing)
+{
+    Recipe recipe;
+    recipe.sound.codec = SoundCodec::Aac;
+    moviekit::MovieLayout layout;
+    const Bytes movie = moviekit::BuildMovie(recipe, &layout);
+    const Chunks sound = testsupport::ChunkTableOf(layout.soundChunks, true);
+    const Chunks video = testsupport::ChunkTableOf(layout.videoChunks, false);
+    ASSERT_EQ(Load(movie), eTqovixSuccess);
+    Chunks s = sound;
+    Chunks v = video;
+    GetParam().change(s, v);
+    CTqovixAudioDataVisitor soundUpdate;
+    soundUpdate.SetAudioChunkInformation(s);
+    CTqovixMovieDataVisitor videoUpdate;
+    videoUpdate.SetOffset(v);
+    const bool soundChanged = s != sound;
+    EXPECT_EQ(soundChanged ? m_tree.Update(soundUpdate) : m_tree.Update(videoUpdate), eTqovixErrorInternal);
+    EXPECT_EQ(WriteTree(), movie);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Records, RecordMismatchTest,
+    ::testing::Values(MismatchRow{"FewerSoundRecords", [](Chunks& s, Chunks&) { s.pop_back(); }},
+                      MismatchRow{"MoreSampleSizes", [](Chunks& s, Chunks&) { s.front().sampleSizes.push_back(9); }},
+                      MismatchRow{"FewerVideoRecords", [](Chunks&, Chunks& v) { v.pop_back(); }},
+                      MismatchRow{"MoreVideoRecords", [](Chunks&, Chunks& v) { v.push_back(v.back()); }}),
+    [](const ::testing::TestParamInfo<MismatchRow>& info) { return std::string(info.param.name); });
+
 TEST_F(TrackTest, RewritesKeepEachTableOrGrowItIntoCo64)
 {
     Recipe recipe;
@@ -408,28 +417,6 @@ TEST_F(TrackTest, RewritesKeepEachTableOrGrowItIntoCo64)
     const Bytes movie = moviekit::BuildMovie(recipe, &layout);
     const Chunks sound = testsupport::ChunkTableOf(layout.soundChunks, true);
     const Chunks video = testsupport::ChunkTableOf(layout.videoChunks, false);
-
-    // Records that do not match the table's entries change nothing.
-    const std::pair<const char*, std::function<void(Chunks&, Chunks&)>> refused[] = {
-        {"fewer sound records", [](Chunks& s, Chunks&) { s.pop_back(); }},
-        {"more sample sizes", [](Chunks& s, Chunks&) { s.front().sampleSizes.push_back(9); }},
-        {"fewer video records", [](Chunks&, Chunks& v) { v.pop_back(); }},
-        {"more video records", [](Chunks&, Chunks& v) { v.push_back(v.back()); }},
-    };
-    for (const auto& [name, change] : refused) {
-        SCOPED_TRACE(name);
-        ASSERT_EQ(Load(movie), eTqovixSuccess);
-        Chunks s = sound;
-        Chunks v = video;
-        change(s, v);
-        CTqovixAudioDataVisitor soundUpdate;
-        soundUpdate.SetAudioChunkInformation(s);
-        CTqovixMovieDataVisitor videoUpdate;
-        videoUpdate.SetOffset(v);
-        const bool soundChanged = s != sound;
-        EXPECT_EQ(soundChanged ? m_tree.Update(soundUpdate) : m_tree.Update(videoUpdate), eTqovixErrorInternal);
-        EXPECT_EQ(WriteTree(), movie);
-    }
 
     // An offset past 4 GiB turns the sound track's "stco" into a "co64"; the video keeps its "stco".
     ASSERT_EQ(Load(movie), eTqovixSuccess);
