@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cstring>
+#include <ostream>
 #include <string>
 #include <tuple>
 #include <vector>
@@ -92,30 +93,47 @@ public:
     unsigned long encoded = 0, announceAfter = ~0UL, chunkCount = 0;
 };
 
-// Chunk tables that disagree with the file or with themselves fail rather than lose bytes silently.
-TEST_F(AudioFileTest, ByteOrderAndBadChunks)
-{
-    const Bytes words = {0x12, 0x34, 0x56, 0x78, 0xAB, 0xCD, 0xEF};
-    const Table oddWords = {{0, 4, {}}, {4, 0, {}}, {4, 3, {}}};  // an empty chunk in the middle, an odd byte last
-    constexpr eTqovixErrorCode kFail = eTqovixErrorInternal;
-    // name, file, table, AAC, request, result, delivered
-    const std::tuple<const char*, Bytes, Table, bool, unsigned long, eTqovixErrorCode, Bytes> rows[] = {
-        {"BigEndian", words, oddWords, false, 64, eTqovixSuccess, {0x34, 0x12, 0x78, 0x56, 0xCD, 0xAB, 0xEF}},
-        {"ChunkEndsPastTheFile", Bytes(100, 7), {{0, 60, {}}, {80, 40, {}}}, false, 20, kFail, Bytes(80, 7)},
-        {"AacPacketsShortOfTheChunk", Bytes(64, 9), {{0, 8, {3, 3}}}, true, 16, kFail, {}},
-        {"AacPacketsPastTheChunk", Bytes(64, 9), {{0, 8, {10, 10}}}, true, 16, kFail, {}},
-    };
-    for (const auto& [name, file, table, aac, request, result, delivered] : rows) {
-        SCOPED_TRACE(name);
-        Open(file);
-        FakeAacControl control;
-        control.aac = aac;
-        ASSERT_EQ(control.Initialize(m_file, table, true), eTqovixSuccess);
-        const Drained drained = Drain(control, request);
-        EXPECT_EQ(drained.result, result);
-        EXPECT_EQ(drained.data, delivered);
-    }
+struct DrainRow {
+    const char* name;
+    Bytes file;
+    Table table;
+    bool aac;
+    unsigned long request;
+    eTqovixErrorCode result;
+    Bytes delivered;
+};
+void PrintTo(const DrainRow& row, std::ostream* os) { *os << row.name; }
 
+class AudioDrainTest : public AudioFileTest, public ::testing::WithParamInterface<DrainRow> {};
+
+// Chunk tables that disagree with the file or with themselves fail rather than lose bytes silently.
+TEST_P(AudioDrainTest, DeliversInTheTrackByteOrderOrFails)
+{
+    const DrainRow& row = GetParam();
+    Open(row.file);
+    FakeAacControl control;
+    control.aac = row.aac;
+    ASSERT_EQ(control.Initialize(m_file, row.table, true), eTqovixSuccess);
+    const Drained drained = Drain(control, row.request);
+    EXPECT_EQ(drained.result, row.result);
+    EXPECT_EQ(drained.data, row.delivered);
+}
+
+constexpr eTqovixErrorCode kFail = eTqovixErrorInternal;
+INSTANTIATE_TEST_SUITE_P(
+    Chunks, AudioDrainTest,
+    ::testing::Values(
+        // An empty chunk in the middle, an odd byte last.
+        DrainRow{"BigEndian", {0x12, 0x34, 0x56, 0x78, 0xAB, 0xCD, 0xEF}, {{0, 4, {}}, {4, 0, {}}, {4, 3, {}}}, false,
+                 64, eTqovixSuccess, {0x34, 0x12, 0x78, 0x56, 0xCD, 0xAB, 0xEF}},
+        DrainRow{"ChunkEndsPastTheFile", Bytes(100, 7), {{0, 60, {}}, {80, 40, {}}}, false, 20, kFail, Bytes(80, 7)},
+        DrainRow{"AacPacketsShortOfTheChunk", Bytes(64, 9), {{0, 8, {3, 3}}}, true, 16, kFail, {}},
+        DrainRow{"AacPacketsPastTheChunk", Bytes(64, 9), {{0, 8, {10, 10}}}, true, 16, kFail, {}}),
+    [](const ::testing::TestParamInfo<DrainRow>& info) { return std::string(info.param.name); });
+
+TEST_F(AudioFileTest, ControlsWithoutChunksOrForPcmTakeNoSound)
+{
+    Open(Bytes(8, 0));
     CTqovixAudioDataControl empty;
     unsigned long size = 0;
     uint8_t buffer[4];

@@ -51,17 +51,29 @@ std::string Movie(const TempDir& dir, const std::string& name, void (*edit)(Reci
 
 void ForeignBrand(Recipe& recipe) { recipe.majorBrand = "isom"; recipe.compatibleBrands = {"isom"}; }
 
-TEST(CliTest, HelpVersionAndUsageErrors)
+class CliCommandTest : public ::testing::TestWithParam<const char*> {};
+
+TEST_P(CliCommandTest, HelpAndUsage)
 {
-    for (const char* command : {"check", "process", "batch", "inspect", "make-sample", "compare"}) {
-        SCOPED_TRACE(command);
-        for (const char* help : {" --help", " -h"}) {
-            const Outcome outcome = Tool(std::string(command) + help);
-            EXPECT_EQ(outcome.status, 0);
-            EXPECT_NE(outcome.output.find(std::string("usage: tqovix ") + command), std::string::npos) << outcome.output;
-        }
-        EXPECT_EQ(Tool(command).status, 2);  // every command needs at least one argument
+    const std::string command = GetParam();
+    for (const char* help : {" --help", " -h"}) {
+        const Outcome outcome = Tool(command + help);
+        EXPECT_EQ(outcome.status, 0);
+        EXPECT_NE(outcome.output.find("usage: tqovix " + command), std::string::npos) << outcome.output;
     }
+    EXPECT_EQ(Tool(command).status, 2);  // every command needs at least one argument
+}
+
+INSTANTIATE_TEST_SUITE_P(Commands, CliCommandTest,
+                         ::testing::Values("check", "process", "batch", "inspect", "make-sample", "compare"),
+                         [](const ::testing::TestParamInfo<const char*>& info) {
+                             std::string name = info.param;
+                             std::ranges::replace(name, '-', '_');
+                             return name;
+                         });
+
+TEST(CliTest, VersionAndUsageErrors)
+{
     const Outcome version = Tool("--version");
     EXPECT_EQ(version.status, 0);
     for (const char* part : {"tqovix ", "libTqOVIXUtility ", "libavcodec "}) {
@@ -215,7 +227,7 @@ TEST(CliTest, DestinationReasons)
 TEST(CliTest, JsonReports)
 {
     TempDir dir;
-    const std::string source = Movie(dir, "in\xff\xfe.mov");
+    const std::string source = Movie(dir, "in\xff\xfe\xc0\xaf\xed\xa0\x80.mov");  // stray, overlong, surrogate
     const std::string destination = dir.File("out\xc3.mov");
     const std::string strict = "python3 -c 'import json,sys; d=json.loads(sys.stdin.buffer.read().decode(\"utf-8\")); "
                                "assert d[\"version\"] == 1' 2>&1";

@@ -111,50 +111,54 @@ TEST_F(EngineTest, LibraryRefusalsAtStart)
     EXPECT_EQ(Current().audio.sampleCount, m_layout.soundSampleCount);
 }
 
-// The library's session ends with a verdict, a failure, or nothing to give back.
-TEST_F(EngineTest, SessionEndsReportedByTheLibrary)
+struct SessionEndRow {
+    const char* name;
+    unsigned long sessionState, processedResult;
+    std::vector<uint8_t> processed;
+    eTqovixErrorCode expected;
+    int hostAnswer;  // heard only while the library reports no end of its own
+};
+void PrintTo(const SessionEndRow& row, std::ostream* os) { *os << row.name; }
+
+class SessionEndTest : public EngineTest, public ::testing::WithParamInterface<SessionEndRow> {};
+
+// The library's session ends with a verdict, a failure, or nothing to give back; none publishes.
+TEST_P(SessionEndTest, EndsTheJobWithoutADestination)
 {
-    struct Row {
-        const char* name;
-        unsigned long sessionState, processedResult;
-        std::vector<uint8_t> processed;
-        eTqovixErrorCode expected;
-        bool destinationKept;
-        int hostAnswer;  // heard only while the library reports no end of its own
-    };
-    const std::vector<Row> rows = {
-        {"verdict 8 publishes nothing", ovix::kVerdictNotAfBlock, kOk, {1}, eTqovixVerdict8, false, 131},
-        {"library failure", ovix::kFailure, kOk, {1}, eTqovixErrorGeneral, false, 131},
-        {"empty processed AF information", 1, kOk, {}, eTqovixErrorInternal, false, 131},
-        {"processed AF information unreadable", 1, ovix::kOutOfMemory, {1}, eTqovixErrorOutOfMemory, false, 131},
-        {"unknown host answer", 0, kOk, {1}, eTqovixErrorGeneral, false, 5},
-    };
+    const SessionEndRow& row = GetParam();
     ASSERT_EQ(m_engine.SetCallback(HostCallback), eTqovixSuccess);
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.name);
-        Current().sessionState = 0;
-        Current().processedResult = row.processedResult;
-        Current().processed = row.processed;
-        g_hostCalls = 0;
-        g_hostAnswer = row.hostAnswer;
-        Start();
-        std::vector<uint8_t> block(4096);  // what the library does with its first block
-        unsigned long delivered = 0;
-        ASSERT_EQ(Current().inputAudio(block.data(), &delivered, 4096, 0), kOk);
-        ASSERT_EQ(Current().outputAudio(block.data(), delivered), kOk);
-        Current().sessionState = row.sessionState;
-        Current().notify(1024, 2048);
-        EXPECT_EQ(m_engine.GetProcessingState(), row.expected);
-        EXPECT_EQ(DestinationExists(), row.destinationKept);
-        if (row.sessionState != 1) {
-            EXPECT_EQ(g_hostCalls, 1) << "the host still hears of the notification";
-        }
-        // Once ended, callbacks answer with the end and change nothing.
-        EXPECT_EQ(Current().inputAudio(block.data(), &delivered, 1, 0),
-                  TqovixInterfaceConvert::ConvertToLibraryError(row.expected));
-        EXPECT_EQ(m_engine.GetProcessingState(), row.expected);
+    Current().sessionState = 0;
+    Current().processedResult = row.processedResult;
+    Current().processed = row.processed;
+    g_hostCalls = 0;
+    g_hostAnswer = row.hostAnswer;
+    Start();
+    std::vector<uint8_t> block(4096);  // what the library does with its first block
+    unsigned long delivered = 0;
+    ASSERT_EQ(Current().inputAudio(block.data(), &delivered, 4096, 0), kOk);
+    ASSERT_EQ(Current().outputAudio(block.data(), delivered), kOk);
+    Current().sessionState = row.sessionState;
+    Current().notify(1024, 2048);
+    EXPECT_EQ(m_engine.GetProcessingState(), row.expected);
+    EXPECT_FALSE(DestinationExists());
+    if (row.sessionState != 1) {
+        EXPECT_EQ(g_hostCalls, 1) << "the host still hears of the notification";
     }
+    // Once ended, callbacks answer with the end and change nothing.
+    EXPECT_EQ(Current().inputAudio(block.data(), &delivered, 1, 0),
+              TqovixInterfaceConvert::ConvertToLibraryError(row.expected));
+    EXPECT_EQ(m_engine.GetProcessingState(), row.expected);
 }
+
+INSTANTIATE_TEST_SUITE_P(
+    Ends, SessionEndTest,
+    ::testing::Values(SessionEndRow{"Verdict8", ovix::kVerdictNotAfBlock, kOk, {1}, eTqovixVerdict8, 131},
+                      SessionEndRow{"LibraryFailure", ovix::kFailure, kOk, {1}, eTqovixErrorGeneral, 131},
+                      SessionEndRow{"EmptyProcessedAfInformation", 1, kOk, {}, eTqovixErrorInternal, 131},
+                      SessionEndRow{"ProcessedAfInformationUnreadable", 1, ovix::kOutOfMemory, {1},
+                                    eTqovixErrorOutOfMemory, 131},
+                      SessionEndRow{"UnknownHostAnswer", 0, kOk, {1}, eTqovixErrorGeneral, 5}),
+    [](const ::testing::TestParamInfo<SessionEndRow>& info) { return std::string(info.param.name); });
 
 // A close ends a running job at once.
 TEST_F(EngineTest, CloseMidJob)

@@ -13,7 +13,8 @@
 #include <functional>
 #include <numbers>
 #include <optional>
-#include <tuple>
+#include <ostream>
+#include <string>
 
 using moviekit::Atom;
 using namespace ovixtest;
@@ -89,65 +90,105 @@ protected:
     std::optional<Harness> m_harness;
 };
 
-TEST(OvixIsEnable, VerdictsOnAfBlocks)
+Bytes Good() { return AfBlock({{100, 200}, {200, 300}}); }
+Bytes GoodPayload()
 {
-    using ovix::kSuccess, ovix::kVerdictNotAfBlock, ovix::kVerdictNoAfInformation, ovix::kVerdictMalformed;
-    const Bytes good = AfBlock({{100, 200}, {200, 300}});
-    const Bytes goodPayload(good.begin() + 8, good.end());
-    const std::tuple<const char*, Bytes, unsigned long> rows[] = {
-        {"ShorterThanHeader", {0, 0, 0, 6, 'O', 'P'}, kVerdictNotAfBlock},
-        {"SizeFieldDiffers", Bytes(good.begin(), good.end() - 1), kVerdictNotAfBlock},
-        {"WrongType", Atom("OP02", goodPayload), kVerdictNotAfBlock},
-        {"ThreeBytePayload", Atom("OP01", {'A', 'F', 'R'}), kVerdictNoAfInformation},
-        {"UnknownVersion", Patched(AfBlock({}), 13, {2}), kVerdictMalformed},
-        {"TruncatedHeader", Atom("OP01", Bytes(goodPayload.begin(), goodPayload.begin() + 10)), kVerdictMalformed},
-        {"TableRunsPastEnd", Patched(AfBlock({{1, 2}, {3, 4}}), 23, {3}), kVerdictMalformed},
-        {"CountNearFourGiga", Patched(AfBlock({{1, 2}}), 20, {0xFF, 0xFF, 0xFF, 0xFF}), kVerdictMalformed},
-        {"Overlapping", AfBlock({{100, 300}, {200, 400}}), kVerdictMalformed},
-        {"EndBeforeStart", AfBlock({{300, 100}}), kVerdictMalformed},
-        {"AlreadyProcessed", AfBlock({{100, 200}, {200, 300}}, kRate, true), ovix::kVerdictAlreadyProcessed},
-        {"TouchingIntervals", good, kSuccess},
-        {"EmptyInterval", AfBlock({{100, 100}}), kSuccess},
-        {"OtherFlagBitsIgnored", Patched(AfBlock({}), 15, {6}), kSuccess},
-        {"TrailingBytes", Atom("OP01", moviekit::Concat({goodPayload, Bytes(5, 9)})), kSuccess},
-        {"ForeignFourBytes", Atom("OP01", {'A', 'B', 'C', 'D'}), kSuccess},
-    };
-    EXPECT_EQ(TqovixIsEnable(nullptr, 100), kVerdictNotAfBlock);
-    for (auto [name, block, verdict] : rows) {
-        EXPECT_EQ(TqovixIsEnable(block.data(), block.size()), verdict) << name;
-    }
+    const Bytes good = Good();
+    return Bytes(good.begin() + 8, good.end());
 }
+
+struct EnableRow {
+    const char* name;
+    Bytes (*block)();
+    unsigned long verdict;
+};
+void PrintTo(const EnableRow& row, std::ostream* os) { *os << row.name; }
+
+class OvixIsEnable : public ::testing::TestWithParam<EnableRow> {};
+
+TEST_P(OvixIsEnable, VerdictOnTheAfBlock)
+{
+    Bytes block = GetParam().block();
+    EXPECT_EQ(TqovixIsEnable(block.data(), block.size()), GetParam().verdict);
+}
+
+TEST(OvixIsEnableNull, IsNotAnAfBlock) { EXPECT_EQ(TqovixIsEnable(nullptr, 100), ovix::kVerdictNotAfBlock); }
+
+INSTANTIATE_TEST_SUITE_P(
+    Blocks, OvixIsEnable,
+    ::testing::Values(
+        EnableRow{"ShorterThanHeader", [] { return Bytes({0, 0, 0, 6, 'O', 'P'}); }, ovix::kVerdictNotAfBlock},
+        EnableRow{"SizeFieldDiffers", [] { Bytes block = Good(); block.pop_back(); return block; },
+                  ovix::kVerdictNotAfBlock},
+        EnableRow{"WrongType", [] { return Atom("OP02", GoodPayload()); }, ovix::kVerdictNotAfBlock},
+        EnableRow{"ThreeBytePayload", [] { return Atom("OP01", {'A', 'F', 'R'}); },
+                  ovix::kVerdictNoAfInformation},
+        EnableRow{"UnknownVersion", [] { return Patched(AfBlock({}), 13, {2}); }, ovix::kVerdictMalformed},
+        EnableRow{"TruncatedHeader",
+                  [] {
+                      const Bytes payload = GoodPayload();
+                      return Atom("OP01", Bytes(payload.begin(), payload.begin() + 10));
+                  },
+                  ovix::kVerdictMalformed},
+        EnableRow{"TableRunsPastEnd", [] { return Patched(AfBlock({{1, 2}, {3, 4}}), 23, {3}); },
+                  ovix::kVerdictMalformed},
+        EnableRow{"CountNearFourGiga", [] { return Patched(AfBlock({{1, 2}}), 20, {0xFF, 0xFF, 0xFF, 0xFF}); },
+                  ovix::kVerdictMalformed},
+        EnableRow{"Overlapping", [] { return AfBlock({{100, 300}, {200, 400}}); }, ovix::kVerdictMalformed},
+        EnableRow{"EndBeforeStart", [] { return AfBlock({{300, 100}}); }, ovix::kVerdictMalformed},
+        EnableRow{"AlreadyProcessed", [] { return AfBlock({{100, 200}, {200, 300}}, kRate, true); },
+                  ovix::kVerdictAlreadyProcessed},
+        EnableRow{"TouchingIntervals", Good, ovix::kSuccess},
+        EnableRow{"EmptyInterval", [] { return AfBlock({{100, 100}}); }, ovix::kSuccess},
+        EnableRow{"OtherFlagBitsIgnored", [] { return Patched(AfBlock({}), 15, {6}); }, ovix::kSuccess},
+        EnableRow{"TrailingBytes", [] { return Atom("OP01", moviekit::Concat({GoodPayload(), Bytes(5, 9)})); },
+                  ovix::kSuccess},
+        EnableRow{"ForeignFourBytes", [] { return Atom("OP01", {'A', 'B', 'C', 'D'}); }, ovix::kSuccess}),
+    [](const ::testing::TestParamInfo<EnableRow>& info) { return std::string(info.param.name); });
+
+struct FaultRow {
+    const char* name;
+    void (*fault)(Script&);
+    unsigned long end;
+    std::string events;
+};
+void PrintTo(const FaultRow& row, std::ostream* os) { *os << row.name; }
+
+class OvixFaultTest : public OvixTest, public ::testing::WithParamInterface<FaultRow> {};
 
 // A refused AF block or a failing callback ends the session with one notification repeating the
 // last progress; an abort inside a callback stops the worker before its next callback, silently.
-TEST_F(OvixTest, FailuresAndAbortsInsideCallbacks)
+TEST_P(OvixFaultTest, EndsWithOneNotificationOrSilentlyOnAbort)
 {
-    using S = Script&;
-    const std::tuple<const char*, std::function<void(S)>, unsigned long, std::string> rows[] = {
-        {"AfReadFails", [](S s) { s.failAt = {'A', 1}; }, ovix::kFailure, "aAAN"},
-        {"AfLargerThanAccepted", [](S s) { s.afSize = (16ul << 20) + 1; }, ovix::kFailure, "aN"},
-        {"AfShorterThanAnnounced", [](S s) { s.afSize = 40; }, ovix::kFailure, "aAAAAN"},
-        {"AudioPullFails", [](S s) { s.failAt = {'I', 3}; }, ovix::kFailure, "aAAAlLLLIONIONIONIN"},
-        {"AudioOverDelivers", [](S s) { s.overDeliver = true; }, ovix::kFailure, "aAAAlLLLIN"},
-        {"MalformedAfBlock", [](S s) { s.afBlock = Patched(AfBlock({}), 13, {2}); }, ovix::kVerdictMalformed, "aAAAN"},
-        {"AbortInThirdPush", [](S s) { s.abortAt = {'O', 2}; }, ovix::kAborted, "aAAAlLLLIONIONIO"},
-        {"AbortInFourthNotification", [](S s) { s.abortAt = {'N', 3}; }, ovix::kAborted, "aAAAlLLLIONIONIONION"},
-    };
-    for (const auto& [name, fault, end, events] : rows) {
-        SCOPED_TRACE(name);
-        Script script{.afBlock = AfBlock({}), .levelBlock = Atom("OP02", moviekit::MakeAudioLevel(0)),
-                      .pcm = std::vector<int16_t>(12000, 7), .infoPieceLimit = 8};
-        fault(script);
-        EXPECT_EQ(Run(script, Audio(2, 6000)), end);
-        EXPECT_EQ(m_harness->events, events);
-        // Progress block by block; a notification inside which the end happened repeats it, with the end.
-        const auto n = static_cast<unsigned long>(std::ranges::count(events, 'N'));
-        const bool noted = events.back() == 'N';
-        ASSERT_EQ(m_harness->notes.size(), n);
-        EXPECT_EQ(m_harness->notes.back(),
-                  (Note{(n - (noted && end != ovix::kAborted)) * kBlockFrames, 6000, noted ? end : 0}));
-    }
+    const auto& [name, fault, end, events] = GetParam();
+    Script script{.afBlock = AfBlock({}), .levelBlock = Atom("OP02", moviekit::MakeAudioLevel(0)),
+                  .pcm = std::vector<int16_t>(12000, 7), .infoPieceLimit = 8};
+    fault(script);
+    EXPECT_EQ(Run(script, Audio(2, 6000)), end);
+    EXPECT_EQ(m_harness->events, events);
+    // Progress block by block; a notification inside which the end happened repeats it, with the end.
+    const auto n = static_cast<unsigned long>(std::ranges::count(events, 'N'));
+    const bool noted = events.back() == 'N';
+    ASSERT_EQ(m_harness->notes.size(), n);
+    EXPECT_EQ(m_harness->notes.back(),
+              (Note{(n - (noted && end != ovix::kAborted)) * kBlockFrames, 6000, noted ? end : 0}));
 }
+
+using S = Script&;
+INSTANTIATE_TEST_SUITE_P(
+    Callbacks, OvixFaultTest,
+    ::testing::Values(
+        FaultRow{"AfReadFails", [](S s) { s.failAt = {'A', 1}; }, ovix::kFailure, "aAAN"},
+        FaultRow{"AfLargerThanAccepted", [](S s) { s.afSize = (16ul << 20) + 1; }, ovix::kFailure, "aN"},
+        FaultRow{"AfShorterThanAnnounced", [](S s) { s.afSize = 40; }, ovix::kFailure, "aAAAAN"},
+        FaultRow{"AudioPullFails", [](S s) { s.failAt = {'I', 3}; }, ovix::kFailure, "aAAAlLLLIONIONIONIN"},
+        FaultRow{"AudioOverDelivers", [](S s) { s.overDeliver = true; }, ovix::kFailure, "aAAAlLLLIN"},
+        FaultRow{"MalformedAfBlock", [](S s) { s.afBlock = Patched(AfBlock({}), 13, {2}); }, ovix::kVerdictMalformed,
+                 "aAAAN"},
+        FaultRow{"AbortInThirdPush", [](S s) { s.abortAt = {'O', 2}; }, ovix::kAborted, "aAAAlLLLIONIONIO"},
+        FaultRow{"AbortInFourthNotification", [](S s) { s.abortAt = {'N', 3}; }, ovix::kAborted,
+                 "aAAAlLLLIONIONIONION"}),
+    [](const ::testing::TestParamInfo<FaultRow>& info) { return std::string(info.param.name); });
 
 // Refused records and arguments start nothing; one session runs at a time. With its worker held in a callback,
 // an abort from another thread shows at once, and of two simultaneous closes only one joins the worker.
@@ -209,8 +250,17 @@ TEST_F(OvixTest, ClosingTheLibraryEndsASession)
     EXPECT_EQ(TqovixLibraryInitialize(), ovix::kSuccess);
 }
 
+struct StrengthRow {
+    const char* name;
+    uint16_t strength;
+    double least, most;  // noise change inside the intervals, dB
+};
+void PrintTo(const StrengthRow& row, std::ostream* os) { *os << row.name; }
+
+class OvixStrengthTest : public OvixTest, public ::testing::WithParamInterface<StrengthRow> {};
+
 // The filters are linear, so noise and tone are measured apart over the intervals.
-TEST_F(OvixTest, NoiseDropsInsideIntervalsToneStaysAndEdgesSaturate)
+TEST_P(OvixStrengthTest, NoiseDropsInsideIntervalsAndToneStays)
 {
     const auto inside = [](uint64_t t) { return (t >= 30000 && t < 60000) || (t >= 90000 && t < 120000); };
     const std::vector<int16_t> noise = Sound(3 * kRate, 2, 0.0, 250.0);
@@ -223,19 +273,24 @@ TEST_F(OvixTest, NoiseDropsInsideIntervalsToneStaysAndEdgesSaturate)
         }
         return 10.0 * std::log10(after / before);
     };
-    const std::tuple<uint16_t, double, double> rows[] = {{1000, -99.0, -12.0}, {500, -9.0, -3.0}, {4000, -99.0, -12.0}};
-    for (const auto& [strength, least, most] : rows) {
-        SCOPED_TRACE(strength);
-        const Bytes af = AfBlock({{30000, 60000, strength}, {90000, 120000, strength}});
-        const std::vector<int16_t> out = Process({.afBlock = af, .pcm = noise});
-        EXPECT_GE(decibels(noise, out), least);
-        EXPECT_LE(decibels(noise, out), most);
-        EXPECT_NEAR(decibels(tone, Process({.afBlock = af, .pcm = tone})), 0.0, 1.0);
-        // The filters' state carries from block to block, wherever the blocks begin.
-        EXPECT_EQ(Process({.afBlock = af, .pcm = noise, .audioFrameLimit = 700}), out);
-    }
+    const uint16_t strength = GetParam().strength;
+    const Bytes af = AfBlock({{30000, 60000, strength}, {90000, 120000, strength}});
+    const std::vector<int16_t> out = Process({.afBlock = af, .pcm = noise});
+    EXPECT_GE(decibels(noise, out), GetParam().least);
+    EXPECT_LE(decibels(noise, out), GetParam().most);
+    EXPECT_NEAR(decibels(tone, Process({.afBlock = af, .pcm = tone})), 0.0, 1.0);
+    // The filters' state carries from block to block, wherever the blocks begin.
+    EXPECT_EQ(Process({.afBlock = af, .pcm = noise, .audioFrameLimit = 700}), out);
+}
 
-    // A full-scale 50 Hz square wave: the high-pass doubles every edge, which must clip, not wrap.
+INSTANTIATE_TEST_SUITE_P(Strengths, OvixStrengthTest,
+                         ::testing::Values(StrengthRow{"Full", 1000, -99.0, -12.0}, StrengthRow{"Half", 500, -9.0, -3.0},
+                                           StrengthRow{"BeyondFull", 4000, -99.0, -12.0}),
+                         [](const ::testing::TestParamInfo<StrengthRow>& info) { return std::string(info.param.name); });
+
+// A full-scale 50 Hz square wave: the high-pass doubles every edge, which must clip, not wrap.
+TEST_F(OvixTest, EdgesSaturate)
+{
     std::vector<int16_t> square(24000);
     for (size_t t = 0; t < square.size(); ++t) {
         square[t] = (t / 480) % 2 == 0 ? -32000 : 32000;
