@@ -377,17 +377,27 @@ struct MismatchRow {
 };
 void PrintTo(const MismatchRow& row, std::ostream* os) { *os << row.name; }
 
+// A camera's AAC movie and the chunk records of its sound and video.
+struct MovieTables {
+    Bytes movie;
+    Chunks sound, video;
+};
+MovieTables AacMovie()
+{
+    Recipe recipe;
+    recipe.sound.codec = SoundCodec::Aac;
+    moviekit::MovieLayout layout;
+    Bytes movie = moviekit::BuildMovie(recipe, &layout);
+    return {std::move(movie), testsupport::ChunkTableOf(layout.soundChunks, true),
+            testsupport::ChunkTableOf(layout.videoChunks, false)};
+}
+
 class RecordMismatchTest : public TrackTest, public ::testing::WithParamInterface<MismatchRow> {};
 
 // Records that do not match the table's entries change nothing.
 TEST_P(RecordMismatchTest, ChangesNothing)
 {
-    Recipe recipe;
-    recipe.sound.codec = SoundCodec::Aac;
-    moviekit::MovieLayout layout;
-    const Bytes movie = moviekit::BuildMovie(recipe, &layout);
-    const Chunks sound = testsupport::ChunkTableOf(layout.soundChunks, true);
-    const Chunks video = testsupport::ChunkTableOf(layout.videoChunks, false);
+    const auto [movie, sound, video] = AacMovie();
     ASSERT_EQ(Load(movie), eTqovixSuccess);
     Chunks s = sound;
     Chunks v = video;
@@ -411,12 +421,7 @@ INSTANTIATE_TEST_SUITE_P(
 
 TEST_F(TrackTest, RewritesKeepEachTableOrGrowItIntoCo64)
 {
-    Recipe recipe;
-    recipe.sound.codec = SoundCodec::Aac;
-    moviekit::MovieLayout layout;
-    const Bytes movie = moviekit::BuildMovie(recipe, &layout);
-    const Chunks sound = testsupport::ChunkTableOf(layout.soundChunks, true);
-    const Chunks video = testsupport::ChunkTableOf(layout.videoChunks, false);
+    const auto [movie, sound, video] = AacMovie();
 
     // An offset past 4 GiB turns the sound track's "stco" into a "co64"; the video keeps its "stco".
     ASSERT_EQ(Load(movie), eTqovixSuccess);
