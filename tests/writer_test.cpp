@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <filesystem>
 #include <string>
 #include <thread>
 
@@ -149,7 +150,7 @@ namespace {
 TEST(BackgroundCopyTest, ClaimedRangesAreNeverCopiedOver)
 {
     testsupport::TempDir dir;
-    constexpr uint64_t kSize = 40ULL << 20;  // pieces of 16 MiB: claims fall inside and across them
+    constexpr uint64_t kSize = 40ULL << 20;  // pieces of 8 MiB: claims fall inside and across them
     std::vector<uint8_t> bytes(kSize);
     for (uint64_t k = 0; k < kSize; ++k) {
         bytes[k] = static_cast<uint8_t>(k * 2654435761u >> 13);
@@ -177,13 +178,77 @@ TEST(BackgroundCopyTest, ClaimedRangesAreNeverCopiedOver)
     destination.Close();
     EXPECT_TRUE(testsupport::ReadFile(dir.File("copy.bin")) == bytes);
 
-    // A copy asked to stop ends with the abort code and leaves no thread behind.
-    CTqovixFile again;
-    ASSERT_EQ(again.Open(dir.File("again.bin").c_str(), 2), eTqovixSuccess);
-    copy.Start(again, source, 0, kSize);
-    copy.Stop();
-    const eTqovixErrorCode stopped = copy.Join();
-    EXPECT_TRUE(stopped == eTqovixSuccess || stopped == eTqovixErrorAborted);
+}
+
+// The copy's thread, held at its first piece until the one waiting for it has asked to stop.
+std::atomic<bool> g_copyHeld{false};
+std::atomic<bool> g_copyReleased{false};
+std::thread::id g_testThread;
+
+int HoldTheCopy(eTqovixFileOperation operation)
+{
+    if (operation == eTqovixFileOperation::Read && std::this_thread::get_id() != g_testThread) {
+        g_copyHeld = true;
+        for (int k = 0; k < 30000 && !g_copyReleased; ++k) {
+            std::this_thread::sleep_for(std::chrono::milliseconds(1));
+        }
+    }
+    return 0;
+}
+
+size_t CountThreads()
+{
+    return static_cast<size_t>(std::distance(std::filesystem::directory_iterator("/proc/self/task"), {}));
+}
+
+// Whoever waits for the copy can stop it: the wait ends with the answer given, the copy's
+// thread is gone, and the copy went no further than the piece it was in.
+TEST(BackgroundCopyTest, AStopAskedWhileWaitingEndsTheCopy)
+{
+    testsupport::TempDir dir;
+    constexpr uint64_t kSize = 64ULL << 20;
+    const std::string sourcePath = dir.File("source.bin");
+    {
+        std::vector<uint8_t> bytes(kSize, 0x5A);
+        ASSERT_TRUE(testsupport::WriteFile(sourcePath, bytes));
+    }
+    std::thread([] {}).join();  // sanitizer runtimes start their helpers with the first thread
+    const size_t threadsBefore = CountThreads();
+    CTqovixFile source;
+    CTqovixFile destination;
+    ASSERT_EQ(source.Open(sourcePath.c_str(), 1), eTqovixSuccess);
+    ASSERT_EQ(destination.Open(dir.File("copy.bin").c_str(), 2), eTqovixSuccess);
+    g_testThread = std::this_thread::get_id();
+    g_copyHeld = false;
+    g_copyReleased = false;
+    CTqovixFile::SetFaultHook(HoldTheCopy);
+    CTqovixBackgroundCopy copy;
+    copy.Start(destination, source, 0, kSize);
+    int asked = 0;
+    uint64_t total = 0;
+    const eTqovixErrorCode result = copy.Join([&](uint64_t, uint64_t all) {
+        ++asked;
+        total = all;
+        if (!g_copyHeld) {
+            return eTqovixSuccess;
+        }
+        g_copyReleased = true;
+        return eTqovixErrorAborted;
+    });
+    CTqovixFile::SetFaultHook(nullptr);
+    EXPECT_EQ(result, eTqovixErrorAborted);
+    EXPECT_GE(asked, 1);
+    EXPECT_EQ(total, kSize);
+    uint64_t done = 0;
+    copy.GetProgress(done, total);
+    EXPECT_LT(done, kSize) << "the copy ran on after it was stopped";
+    destination.Close();
+    EXPECT_LT(std::filesystem::file_size(dir.File("copy.bin")), kSize);
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+    while (CountThreads() > threadsBefore && std::chrono::steady_clock::now() < deadline) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(2));
+    }
+    EXPECT_EQ(CountThreads(), threadsBefore);
 }
 
 }  // namespace

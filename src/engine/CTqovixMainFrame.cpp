@@ -2,6 +2,7 @@
 
 #include "bridge/TqovixCodeTable.h"
 
+#include <algorithm>
 #include <cstdint>
 #include <cstring>
 #include <new>
@@ -84,6 +85,10 @@ eTqovixErrorCode CTqovixMainFrame::Execute(const char* sourcePath, const char* d
     m_progressDataControl.Reset();
     m_movControl.Close();
     m_destinationPath.clear();
+    m_soundProgressFirst = 0;
+    m_soundProgressSecond = 0;
+    m_shownProgressFirst = 0;
+    m_movControl.SetKeepGoing([this](uint64_t, uint64_t) { return KeepGoing(); });
 
     eTqovixErrorCode result = m_movControl.Initialize(sourcePath, destinationPath);
     if (TqovixFailed(result)) {
@@ -345,7 +350,12 @@ void CTqovixMainFrame::NotifyProgress(unsigned long first, unsigned long second)
         engine->Abort(eTqovixErrorAborted);
         return;
     }
-    engine->m_progressDataControl.SetProgress(first, second);
+    engine->m_soundProgressFirst = first;
+    engine->m_soundProgressSecond = second;
+    auto shown = running ? engine->RecordProgress() : std::make_pair(first, second);
+    if (!running) {
+        engine->m_progressDataControl.SetProgress(first, second);
+    }
 
     bool endedByError = false;
     const eTqovixErrorCode finished = ovixbridge::TqovixIsSessionFinished();
@@ -370,12 +380,53 @@ void CTqovixMainFrame::NotifyProgress(unsigned long first, unsigned long second)
     if (callback == nullptr) {
         return;
     }
-    const int answer = callback(static_cast<int>(static_cast<uint32_t>(first)),
-                                static_cast<int>(static_cast<uint32_t>(second)));
+    if (engine->m_progressDataControl.GetErrorResult() == eTqovixFinished) {
+        shown = {first, second};  // the movie is complete
+    }
+    const int answer = callback(static_cast<int>(static_cast<uint32_t>(shown.first)),
+                                static_cast<int>(static_cast<uint32_t>(shown.second)));
     if (answer == 0 || endedByError) {
         return;
     }
     engine->Abort(TqovixCodes::FromHostAnswer(answer));
+}
+
+std::pair<unsigned long, unsigned long> CTqovixMainFrame::RecordProgress()
+{
+    const unsigned long second = m_soundProgressSecond;
+    unsigned long first = m_soundProgressFirst;
+    const double copied = m_movControl.GetCopyFraction();
+    if (copied < 1.0) {
+        first = std::min(first, static_cast<unsigned long>(static_cast<double>(second) * copied));
+        // The last frame's worth waits for the copy's end.
+        first = std::min(first, second > 0 ? second - 1 : 0);
+    }
+    if (m_movControl.IsPatching()) {
+        // Never backwards, whichever of the sound and the copy holds it back.
+        first = std::max(first, std::min(m_shownProgressFirst, second));
+        m_shownProgressFirst = first;
+    }
+    m_progressDataControl.SetProgress(first, second);
+    return {first, second};
+}
+
+eTqovixErrorCode CTqovixMainFrame::KeepGoing()
+{
+    if (m_bAbortRequested) {
+        return eTqovixErrorAborted;
+    }
+    const auto [first, second] = RecordProgress();
+    const NotifyProgressFunc callback = m_pfnNotifyProgress.load();
+    if (callback == nullptr) {
+        return eTqovixSuccess;
+    }
+    const int answer =
+        callback(static_cast<int>(static_cast<uint32_t>(first)), static_cast<int>(static_cast<uint32_t>(second)));
+    if (answer != 0) {
+        return TqovixCodes::FromHostAnswer(answer);
+    }
+    // The host may have asked to stop from its callback or meanwhile.
+    return m_bAbortRequested ? eTqovixErrorAborted : eTqovixSuccess;
 }
 
 void CTqovixMainFrame::FinishAACJob()

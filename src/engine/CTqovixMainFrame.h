@@ -4,6 +4,7 @@
 
 #include <atomic>
 #include <pthread.h>
+#include <utility>
 #include <vector>
 
 #include "engine/CTqovixProgressDataControl.h"
@@ -56,6 +57,12 @@ private:
     bool BeginCallback(eTqovixErrorCode& answer);
     eTqovixErrorCode EndCallback(eTqovixErrorCode result);
     void FinishAACJob();
+    // Between the pieces of a long copy, where the library has nothing to report: an abort or
+    // the host's answer stops the copy, and the progress moves with it.
+    eTqovixErrorCode KeepGoing();
+    // The progress shown: the library's, held back by a copy still running beside it, so that
+    // it reaches its end only with the movie. Recorded, and returned for the host's callback.
+    std::pair<unsigned long, unsigned long> RecordProgress();
     void FailStart(eTqovixErrorCode code, const char* sourcePath, const char* destinationPath);
     void StartCloseThread(eTqovixErrorCode code);
     void JoinCloseThreads();
@@ -66,6 +73,10 @@ private:
     // Read by the library's thread after a job has ended, when the host may already set it.
     std::atomic<NotifyProgressFunc> m_pfnNotifyProgress{nullptr};
     CTqovixProgressDataControl m_progressDataControl;
+    // The library's last progress notification (its thread only).
+    unsigned long m_soundProgressFirst = 0;
+    unsigned long m_soundProgressSecond = 0;
+    unsigned long m_shownProgressFirst = 0;
     CTqovixMovControl m_movControl;
     std::vector<char> m_destinationPath;
 

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <chrono>
 #include <system_error>
 #include <vector>
 
@@ -9,8 +10,11 @@
 
 namespace {
 
-// Small enough that a writer at the copy's very place waits only a few milliseconds.
-constexpr uint64_t kPiece = 16ULL << 20;
+// Small enough that a writer at the copy's very place waits only a few milliseconds, and
+// that a stop is seen within a piece's time even from a slow source.
+constexpr uint64_t kPiece = 8ULL << 20;
+// How often a waiting join asks whether to go on when pieces are slow to come.
+constexpr auto kJoinPoll = std::chrono::milliseconds(40);
 
 }  // namespace
 
@@ -22,6 +26,8 @@ void CTqovixBackgroundCopy::Start(CTqovixFile& destination, CTqovixFile& source,
     m_claims.clear();
     m_claimedEnd = from;
     m_reached = from;
+    m_from = from;
+    m_end = std::max(from, end);
     m_bDone = from >= end;
     m_bCancel = false;
     m_result = eTqovixSuccess;
@@ -117,13 +123,38 @@ eTqovixErrorCode CTqovixBackgroundCopy::Claim(uint64_t offset, uint64_t size)
     }
 }
 
-eTqovixErrorCode CTqovixBackgroundCopy::Join()
+eTqovixErrorCode CTqovixBackgroundCopy::Join(const KeepGoing& keepGoing)
 {
+    if (keepGoing) {
+        std::unique_lock lock(m_mutex);
+        while (!m_bDone) {
+            m_progress.wait_for(lock, kJoinPoll);
+            if (m_bDone) {
+                break;
+            }
+            const uint64_t done = m_reached - m_from;
+            const uint64_t total = m_end - m_from;
+            lock.unlock();
+            const eTqovixErrorCode answer = keepGoing(done, total);
+            if (TqovixFailed(answer)) {
+                Stop();
+                return answer;
+            }
+            lock.lock();
+        }
+    }
     if (m_thread.joinable()) {
         m_thread.join();
     }
     std::lock_guard lock(m_mutex);
     return m_result;
+}
+
+void CTqovixBackgroundCopy::GetProgress(uint64_t& done, uint64_t& total)
+{
+    std::lock_guard lock(m_mutex);
+    done = m_reached - m_from;
+    total = m_end - m_from;
 }
 
 void CTqovixBackgroundCopy::Stop()

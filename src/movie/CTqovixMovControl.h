@@ -82,6 +82,12 @@ public:
     // byte for byte what the general writer gives. Tests turn it off to compare the two.
     static void SetPatchWriting(bool enabled);
     bool IsPatching() const { return m_bPatching; }
+    // Asked between the pieces of long copies (the patching copy, large carried chunks) with
+    // the bytes copied and in all: a failure code stops the job with it. The engine answers
+    // with aborts and the host's progress callback, which the library cannot ask meanwhile.
+    void SetKeepGoing(CTqovixBackgroundCopy::KeepGoing keepGoing) { m_keepGoing = std::move(keepGoing); }
+    // How much of the patching copy is done, 0 to 1; 1 when there is none.
+    double GetCopyFraction();
 
 private:
     eTqovixErrorCode InitializeDestination(const char* sourcePath, const char* destinationPath);
@@ -166,4 +172,5 @@ private:
     // Patching: the kernel copy of the source runs beside the sound processing. Declared
     // after the files it copies between, so that it stops before they close.
     CTqovixBackgroundCopy m_copy;
+    CTqovixBackgroundCopy::KeepGoing m_keepGoing;
 };

@@ -146,7 +146,7 @@ eTqovixErrorCode CTqovixMovControl::WriteMovieAtom()
     }
     if (m_bPatching) {
         // Over the copy's moov, and the file ends where the new one does.
-        result = m_copy.Join();
+        result = m_copy.Join(m_keepGoing);
         if (TqovixFailed(result)) {
             return result;
         }

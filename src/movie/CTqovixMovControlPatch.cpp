@@ -117,6 +117,16 @@ eTqovixErrorCode CTqovixMovControl::BeginPatching(bool& started)
     return eTqovixSuccess;
 }
 
+double CTqovixMovControl::GetCopyFraction()
+{
+    uint64_t done = 0;
+    uint64_t total = 0;
+    if (m_bPatching) {
+        m_copy.GetProgress(done, total);
+    }
+    return total == 0 ? 1.0 : static_cast<double>(done) / static_cast<double>(total);
+}
+
 void CTqovixMovControl::KeepServedSound(eTqovixErrorCode served, const void* buffer,
                                         const unsigned long* delivered) const
 {

@@ -13,6 +13,8 @@ namespace {
 // Video chunks and swapped PCM move through one reused buffer of at most this size,
 // so memory stays flat whatever the chunk sizes.
 constexpr uint64_t kCopyPiece = 1 << 20;
+// Carried chunks larger than this are copied in pieces with a look at whether to go on between.
+constexpr uint64_t kStopPiece = 64 << 20;
 constexpr uint64_t kMax32 = CTqovixAtom::kMaxCompactAtomSize;
 
 void SwapPairs(uint8_t* bytes, uint64_t size)
@@ -231,8 +233,15 @@ eTqovixErrorCode CTqovixMovControl::CopyPrecedingVideo()
 
 eTqovixErrorCode CTqovixMovControl::CopyRemainingVideo()
 {
+    // Media after the last sound chunk may be most of a movie: a stop is looked for on the way.
+    uint64_t sinceAsked = 0;
     while (m_outputMovieDataChunkIndex < m_movieDataChunks.size()) {
-        const eTqovixErrorCode result = WriteMovieMetaData();
+        sinceAsked += m_movieDataChunks[m_outputMovieDataChunkIndex].size;
+        eTqovixErrorCode result = WriteMovieMetaData();
+        if (!TqovixFailed(result) && sinceAsked >= kStopPiece && m_keepGoing) {
+            sinceAsked = 0;
+            result = m_keepGoing(m_outputMovieDataChunkIndex, m_movieDataChunks.size());
+        }
         if (TqovixFailed(result)) {
             return result;
         }
@@ -256,13 +265,21 @@ eTqovixErrorCode CTqovixMovControl::WriteMovieMetaData()
     if (TqovixFailed(result)) {
         return result;
     }
-    bool copied = false;
-    result = m_destinationFile.CopyFrom(m_sourceFile, chunk.size, &copied);
-    if (!TqovixFailed(result) && !copied) {
-        result = CopyThroughBuffer(chunk.size);
-    }
-    if (TqovixFailed(result)) {
-        return result;
+    // A large chunk goes in pieces, so that a stop is seen while it is copied.
+    for (uint32_t done = 0; done < chunk.size;) {
+        const auto piece = static_cast<uint32_t>(std::min<uint64_t>(chunk.size - done, kStopPiece));
+        bool copied = false;
+        result = m_destinationFile.CopyFrom(m_sourceFile, piece, &copied);
+        if (!TqovixFailed(result) && !copied) {
+            result = CopyThroughBuffer(piece);
+        }
+        done += piece;
+        if (!TqovixFailed(result) && done < chunk.size && m_keepGoing) {
+            result = m_keepGoing(done, chunk.size);
+        }
+        if (TqovixFailed(result)) {
+            return result;
+        }
     }
     m_outputMovieDataChunks[v].offset = static_cast<uint64_t>(position);
     m_mediaDataSize += chunk.size;

@@ -36,7 +36,8 @@ constexpr const char* kUsage =
 // is redrawn less often.
 constexpr auto kPollInterval = std::chrono::milliseconds(2);
 constexpr double kRedrawSeconds = 0.05;
-// How long an abort may take before the library is closed under the job.
+// How long an abort may take before the library is closed under the job. A stop lands within
+// a piece of any copy, so this is for a library that hangs.
 constexpr double kAbortGraceSeconds = 30;
 
 volatile std::sig_atomic_t g_signal = 0;
@@ -157,6 +158,33 @@ bool SyncFile(const std::string& path)
     return synced;
 }
 
+// What stands under a name: nothing, or one file at one moment of its life.
+struct DirectoryEntry {
+    bool exists = false;
+    dev_t device = 0;
+    ino_t inode = 0;
+    timespec changed{};
+};
+
+DirectoryEntry DestinationEntry(const std::string& path)
+{
+    struct stat info{};
+    if (lstat(path.c_str(), &info) != 0) {
+        return {};
+    }
+    return {true, info.st_dev, info.st_ino, info.st_ctim};
+}
+
+bool SameEntry(const DirectoryEntry& a, const DirectoryEntry& b)
+{
+    return a.exists == b.exists && (!a.exists || (a.device == b.device && a.inode == b.inode &&
+                                                  a.changed.tv_sec == b.changed.tv_sec &&
+                                                  a.changed.tv_nsec == b.changed.tv_nsec));
+}
+
+// Not a code the library gives: the job was closed under before it ended.
+constexpr int kClosedUnderJob = -1;
+
 void Report(const Options& options, const Verdict& verdict, bool ran, double seconds)
 {
     JsonObject report = JsonObject::Report();
@@ -204,6 +232,7 @@ int ProcessCommand(const Arguments& arguments)
     sigaction(SIGINT, &action, nullptr);
     sigaction(SIGTERM, &action, nullptr);
 
+    const DirectoryEntry before = DestinationEntry(options.destination);
     const auto start = std::chrono::steady_clock::now();
     ProgressView view(options.quiet || options.json, sourceBytes);
     int code = TqInitializeOVIX();
@@ -224,7 +253,7 @@ int ProcessCommand(const Arguments& arguments)
             abortedAt = elapsed;
         }
         if (abortedAt >= 0 && elapsed - abortedAt > kAbortGraceSeconds) {
-            code = 200;  // closing the library below stops the job and removes DST
+            code = kClosedUnderJob;  // what DST holds after the close says how the job ended
             break;
         }
         if (elapsed - drawnAt >= kRedrawSeconds) {
@@ -245,6 +274,10 @@ int ProcessCommand(const Arguments& arguments)
     }
     view.Close();
     TqCloseOVIX();
+    if (code == kClosedUnderJob) {
+        // Only a complete movie ever takes DST's name: a changed DST is the job's result.
+        code = SameEntry(before, DestinationEntry(options.destination)) ? 200 : 0;
+    }
     Verdict verdict = Explain(code, options.source, options.destination);
     if (code == 0 && options.sync && !SyncFile(options.destination)) {
         code = 190;
