@@ -409,9 +409,9 @@ TEST_F(CliLateFileTest, KilledJobLeavesOnlyAPartialFileThatIsClearedLater)
     std::atomic<bool> ended{false};
     std::thread job([&] {
         std::string output;
-        status = testsupport::RunCommand("sh -c 'echo $$ > " + Q(pidFile) + "; exec " + Q(TQOVIX_TOOL) + " process -q " +
-                                             Q(s_samples->File("long.mov")) + " " + Q(out + "/long.mov") + "' 2>&1",
-                                         &output);
+        const std::string inner = "echo $$ > " + Q(pidFile) + "; exec " + Q(TQOVIX_TOOL) + " process -q " +
+                                  Q(s_samples->File("long.mov")) + " " + Q(out + "/long.mov");
+        status = testsupport::RunCommand("sh -c " + Q(inner) + " 2>&1", &output);
         ended = true;
     });
     while (!ended && HiddenFiles(out).empty()) {
