@@ -52,6 +52,9 @@ ABORTED = 200
 # Codes about the destination rather than the source: the error names the destination.
 _DESTINATION_CODES = (111, 121, 130, 131)
 _PARTIAL_SUFFIX = b".tqovix-partial"
+# Of a long destination name, what the hidden name keeps: room is left for its own suffix and
+# for the one the library adds where it writes under a hidden name itself (255 bytes in all).
+_KEPT_NAME_BYTES = 160
 _AT_FDCWD = -100
 _RENAME_NOREPLACE = 1
 
@@ -193,6 +196,11 @@ def _reserve_partial(destination: bytes) -> bytes:
     It has the form of the library's own partial files (".NAME.PID-N.tqovix-partial"), so
     that one left by a killed process is recognised and cleared like theirs."""
     folder, name = os.path.split(destination)
+    if len(name) > _KEPT_NAME_BYTES:
+        cut = _KEPT_NAME_BYTES
+        while cut > 0 and name[cut] & 0xC0 == 0x80:
+            cut -= 1  # not inside a UTF-8 character: FAT and exFAT refuse such names
+        name = name[:cut]
     while True:
         hidden = os.path.join(folder, b".%s.%d-%d%s" % (name, os.getpid(), next(_partials), _PARTIAL_SUFFIX))
         try:

@@ -180,6 +180,7 @@ class ModuleTest(unittest.TestCase):
     def test_paths_as_str_bytes_and_path_like_and_never_with_a_nul(self):
         accepted = (
             ("str", self.path("str.mov")),
+            ("longest name", self.path("\u00e9" * 123 + ".mov")),
             ("bytes", os.fsencode(self.path("bytes\xff.mov"))),
             ("PathLike", pathlib.Path(self.path("path.mov"))),
         )

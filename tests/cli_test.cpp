@@ -132,6 +132,19 @@ TEST(CliTest, ArgumentForms)
     EXPECT_NE(uncreatable.output.find("No such file or directory"), std::string::npos) << uncreatable.output;
 }
 
+// Hidden names in `folder`: what a job writes under before its movie is complete.
+std::vector<std::string> HiddenFiles(const std::string& folder)
+{
+    std::vector<std::string> names;
+    std::error_code error;
+    for (std::filesystem::directory_iterator it(folder, error), end; !error && it != end; it.increment(error)) {
+        if (it->path().filename().string().starts_with(".")) {
+            names.push_back(it->path().filename().string());
+        }
+    }
+    return names;
+}
+
 // One reason per refusal, worded the same by check, process --json and inspect.
 struct ReasonCase {
     const char* name;
@@ -226,6 +239,16 @@ TEST(CliTest, DestinationReasons)
         EXPECT_EQ(outcome.status, 1) << arguments;
         EXPECT_NE(outcome.output.find(said), std::string::npos) << arguments << "\n" << outcome.output;
     }
+    // A name as long as a file system allows still leaves room for the hidden name beside it.
+    std::string longest;
+    while (longest.size() + 2 <= 251) {
+        longest += "\xc3\xa9";
+    }
+    longest += ".mov";
+    const Outcome outcome = Tool("process -n -q " + Q(source) + " " + Q(dir.File(longest)));
+    EXPECT_EQ(outcome.status, 0) << outcome.output;
+    EXPECT_TRUE(Exists(dir.File(longest)));
+    EXPECT_EQ(HiddenFiles(dir.Path()), std::vector<std::string>{});
 }
 
 // The keys of every JSON report; each is one valid UTF-8 object even for a name that is not.
@@ -302,19 +325,6 @@ TEST(CliTest, BatchOverACardsFolders)
     const Outcome again = Tool("batch -r -o " + Q(out) + " " + Q(card));
     EXPECT_EQ(again.status, 1) << again.output;
     EXPECT_NE(again.output.find("the destination exists"), std::string::npos) << again.output;
-}
-
-// Hidden names in `folder`: what a job writes under before its movie is complete.
-std::vector<std::string> HiddenFiles(const std::string& folder)
-{
-    std::vector<std::string> names;
-    std::error_code error;
-    for (std::filesystem::directory_iterator it(folder, error), end; !error && it != end; it.increment(error)) {
-        if (it->path().filename().string().starts_with(".")) {
-            names.push_back(it->path().filename().string());
-        }
-    }
-    return names;
 }
 
 // A file that someone else makes at the destination while a job runs (a second run, another

@@ -18,6 +18,9 @@ constexpr const char* kPartialSuffix = ".tqovix-partial";  // what the library's
 constexpr auto kStaleAfter = std::chrono::hours(24);
 // Tries past names left by an earlier process with our process id.
 constexpr int kReserveAttempts = 1000;
+// Of a long destination name, what the hidden name keeps: room is left for its own suffix and
+// for the one the library adds where it writes under a hidden name itself (255 bytes in all).
+constexpr size_t kKeptNameBytes = 160;
 
 }  // namespace
 
@@ -43,7 +46,14 @@ std::string ReservePartial(const std::string& destination)
 {
     const size_t slash = destination.rfind('/');
     const std::string directory = slash == std::string::npos ? "." : destination.substr(0, slash + (slash == 0));
-    const std::string name = slash == std::string::npos ? destination : destination.substr(slash + 1);
+    std::string name = slash == std::string::npos ? destination : destination.substr(slash + 1);
+    if (name.size() > kKeptNameBytes) {
+        size_t cut = kKeptNameBytes;
+        while (cut > 0 && (static_cast<unsigned char>(name[cut]) & 0xC0) == 0x80) {
+            --cut;  // not inside a UTF-8 character: FAT and exFAT refuse such names
+        }
+        name.resize(cut);
+    }
     std::string partial;
     for (int attempt = 1; attempt <= kReserveAttempts; ++attempt) {
         partial = directory + (directory.ends_with('/') ? "." : "/.") + name + "." + std::to_string(getpid()) + "-" +
