@@ -6,7 +6,10 @@
 
 process() raises tqovix_utility.Error (with .code, the library's exported result code, and
 .message) when a job is refused, fails or is aborted; the destination's path is then left as
-it was. The library runs one job per process, so calls from several threads take turns.
+it was. It never replaces a file at the destination, not even one that appears while the job
+runs (DestinationExists), unless called with overwrite=True. Paths are str, bytes or
+os.PathLike; one with a NUL character raises ValueError. The library runs one job per
+process, so calls from several threads take turns.
 
 The library is looked for, in this order: the file named by $TQOVIX_UTILITY_LIBRARY; beside
 this module and in the library folder of the prefix it is installed in; the newest
@@ -15,13 +18,15 @@ unsanitized build under the source tree's build folder; the system's loader.
 
 import ctypes
 import ctypes.util
+import errno
 import glob
+import itertools
 import os
 import threading
 import time
 from typing import Callable, NamedTuple, Optional
 
-__all__ = ["Error", "Verdict", "check", "process", "describe", "library_path"]
+__all__ = ["Error", "DestinationExists", "Verdict", "check", "process", "describe", "library_path"]
 
 _SONAME = "libTqOVIXUtility.so.0"
 _POLL_SECONDS = 0.005
@@ -44,6 +49,14 @@ _MESSAGES = {
 }
 
 ABORTED = 200
+# Codes about the destination rather than the source: the error names the destination.
+_DESTINATION_CODES = (111, 121, 130, 131)
+_PARTIAL_SUFFIX = b".tqovix-partial"
+# Of a long destination name, what the hidden name keeps: room is left for its own suffix and
+# for the one the library adds where it writes under a hidden name itself (255 bytes in all).
+_KEPT_NAME_BYTES = 160
+_AT_FDCWD = -100
+_RENAME_NOREPLACE = 1
 
 
 def describe(code: int) -> str:
@@ -52,13 +65,23 @@ def describe(code: int) -> str:
 
 
 class Error(Exception):
-    """A job or query that did not succeed: .code is the exported result code."""
+    """A job or query that did not succeed: .code is the exported result code, .path the
+    file it is about (the source, or the destination for the destination's problems)."""
 
-    def __init__(self, code: int, path: str = ""):
+    def __init__(self, code: Optional[int], path: str = "", message: Optional[str] = None):
         self.code = code
-        self.message = describe(code)
+        self.message = describe(code) if message is None else message
         self.path = path
-        super().__init__("%s: %s (%d)" % (path, self.message, code) if path else "%s (%d)" % (self.message, code))
+        told = self.message if code is None else "%s (%d)" % (self.message, code)
+        super().__init__("%s: %s" % (path, told) if path else told)
+
+
+class DestinationExists(Error, FileExistsError):
+    """process() without overwrite=True found a file at the destination, before or after the
+    job; it is left as it was. .code is None: the library was not asked or said success."""
+
+    def __init__(self, path: str):
+        super().__init__(None, path, "the destination exists (use overwrite=True to replace it)")
 
 
 class Verdict(NamedTuple):
@@ -152,7 +175,80 @@ def library_path() -> str:
 
 
 def _encode(path) -> bytes:
-    return os.fsencode(path)
+    encoded = os.fsencode(path)
+    # C would read only up to the NUL: another file than the one named.
+    if b"\0" in encoded:
+        raise ValueError("embedded null byte")
+    return encoded
+
+
+_libc = ctypes.CDLL(None, use_errno=True)
+_renameat2 = getattr(_libc, "renameat2", None)
+if _renameat2 is not None:
+    _renameat2.restype = ctypes.c_int
+    _renameat2.argtypes = [ctypes.c_int, ctypes.c_char_p, ctypes.c_int, ctypes.c_char_p, ctypes.c_uint]
+_partials = itertools.count(1)
+
+
+def _reserve_partial(destination: bytes) -> bytes:
+    """A hidden name beside destination for the job to write, taken so no one else uses it.
+
+    It has the form of the library's own partial files (".NAME.PID-N.tqovix-partial"), so
+    that one left by a killed process is recognised and cleared like theirs."""
+    folder, name = os.path.split(destination)
+    if len(name) > _KEPT_NAME_BYTES:
+        cut = _KEPT_NAME_BYTES
+        while cut > 0 and name[cut] & 0xC0 == 0x80:
+            cut -= 1  # not inside a UTF-8 character: FAT and exFAT refuse such names
+        name = name[:cut]
+    while True:
+        hidden = os.path.join(folder, b".%s.%d-%d%s" % (name, os.getpid(), next(_partials), _PARTIAL_SUFFIX))
+        try:
+            os.close(os.open(hidden, os.O_CREAT | os.O_EXCL | os.O_WRONLY | os.O_CLOEXEC, 0o666))
+            return hidden
+        except FileExistsError:
+            continue
+        except OSError:
+            return hidden  # the job fails on the folder too, and the library says why
+
+
+def _publish_without_replacing(hidden: bytes, destination: bytes) -> None:
+    """Gives the finished movie its name unless the name is taken (FileExistsError)."""
+    if _renameat2 is not None:
+        if _renameat2(_AT_FDCWD, hidden, _AT_FDCWD, destination, _RENAME_NOREPLACE) == 0:
+            return
+        number = ctypes.get_errno()
+        if number not in (errno.EINVAL, errno.ENOSYS):
+            raise OSError(number, os.strerror(number), destination)
+    # No such rename on this file system: a hard link is refused on a taken name too.
+    try:
+        os.link(hidden, destination)
+    except OSError as error:
+        if error.errno not in (errno.EPERM, errno.EOPNOTSUPP, errno.ENOSYS):
+            raise
+        # Neither: the narrowest window left is a look just before the rename.
+        if os.path.lexists(destination):
+            raise FileExistsError(errno.EEXIST, os.strerror(errno.EEXIST), destination) from None
+        os.rename(hidden, destination)
+        return
+    os.unlink(hidden)
+
+
+def _about_destination(code: int, source: bytes, destination: bytes) -> Optional[str]:
+    """For a failure the library reports with a general code: the destination's words when
+    the fault is its folder's, else None."""
+    if not os.path.isfile(source) or not os.access(source, os.R_OK):
+        return None
+    if os.path.exists(destination) and os.path.samefile(source, destination):
+        return "source and destination are the same file"
+    if os.path.isdir(destination):
+        return "the destination is a directory"
+    folder = os.path.dirname(destination) or b"."
+    if not os.path.isdir(folder):
+        return describe(111)
+    if not os.access(folder, os.W_OK | os.X_OK):
+        return describe(121)
+    return None
 
 
 class _Session:
@@ -179,13 +275,20 @@ def check(path) -> Verdict:
     return Verdict(code, describe(code))
 
 
-def process(source, destination, progress: Optional[Callable[[int], object]] = None) -> None:
-    """Run one job to its end, writing destination (replacing a file there).
+def process(source, destination, progress: Optional[Callable[[int], object]] = None, *,
+            overwrite: bool = False) -> None:
+    """Run one job to its end, writing destination.
 
+    A file at destination, or one that appears there while the job runs, is left as it was
+    and raises DestinationExists, unless overwrite=True: then the finished movie replaces it.
     progress(percent) is called on the library's thread whenever the whole percentage
     grows; returning False aborts the job (Error with code 200). An exception raised by
     progress aborts the job too and is raised again here.
     """
+    source_path, destination_path = _encode(source), _encode(destination)
+    named = os.fsdecode(destination_path)
+    if not overwrite and os.path.lexists(destination_path) and not os.path.isdir(destination_path):
+        raise DestinationExists(named)
     state = {"last": -1, "raised": None}
 
     def notify(done: int, total: int) -> int:
@@ -203,23 +306,46 @@ def process(source, destination, progress: Optional[Callable[[int], object]] = N
             return ABORTED
 
     callback = _PROGRESS(notify)  # kept alive until the engine is closed
-    with _lock, _Session() as api:
-        if progress is not None:
-            api.TqSetCallBackNotifyProgressOVIX(callback)
-        code = api.TqExecuteOVIX(_encode(source), _encode(destination))
-        try:
-            while code == 0:
-                code = api.TqIsFinishedOVIX()
-                if code == 0:
-                    time.sleep(_POLL_SECONDS)
-        except BaseException:
-            # Ctrl-C while waiting: closing the session below stops the job and drops its file.
-            api.TqAbortOVIX()
-            raise
-    if state["raised"] is not None:
-        raise state["raised"]
-    if code != 1:
-        path = destination if code in (111, 121, 130, 131) else source
-        raise Error(code, os.fsdecode(path))
+    hidden = None
+    try:
+        with _lock:
+            # The library's own publishing replaces a file that appeared meanwhile: when that
+            # is not wanted, the job writes a hidden name, given its own name below only if free.
+            if not overwrite and not os.path.isdir(destination_path):
+                hidden = _reserve_partial(destination_path)
+            with _Session() as api:
+                if progress is not None:
+                    api.TqSetCallBackNotifyProgressOVIX(callback)
+                code = api.TqExecuteOVIX(source_path, destination_path if hidden is None else hidden)
+                try:
+                    while code == 0:
+                        code = api.TqIsFinishedOVIX()
+                        if code == 0:
+                            time.sleep(_POLL_SECONDS)
+                except BaseException:
+                    # Ctrl-C while waiting: closing the session below stops the job and drops its file.
+                    api.TqAbortOVIX()
+                    raise
+            if state["raised"] is not None:
+                raise state["raised"]
+            if code != 1:
+                if code in _DESTINATION_CODES:
+                    raise Error(code, named)
+                words = _about_destination(code, source_path, destination_path)
+                raise Error(code, os.fsdecode(source_path) if words is None else named, words)
+            if hidden is not None:
+                try:
+                    _publish_without_replacing(hidden, destination_path)
+                except FileExistsError:
+                    raise DestinationExists(named) from None
+                except OSError as error:
+                    raise Error(190, named, "the destination could not be written: " + error.strerror) from None
+                hidden = None
+    finally:
+        if hidden is not None:
+            try:
+                os.unlink(hidden)
+            except OSError:
+                pass
     if progress is not None and state["last"] < 100:
         progress(100)

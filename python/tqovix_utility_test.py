@@ -5,6 +5,7 @@ exits 77 (skipped) when the library is built with a sanitizer.
 """
 
 import os
+import pathlib
 import shutil
 import subprocess
 import sys
@@ -119,7 +120,7 @@ class ModuleTest(unittest.TestCase):
             return percent < 30
 
         with self.assertRaises(tqovix_utility.Error) as raised:
-            tqovix_utility.process(self.aac, destination, progress=stop_at_thirty)
+            tqovix_utility.process(self.aac, destination, progress=stop_at_thirty, overwrite=True)
         self.assertEqual(raised.exception.code, 200)
         # Stopped mid-job, at the first answer of False: no call after it.
         self.assertGreater(len(calls), 1)
@@ -139,6 +140,98 @@ class ModuleTest(unittest.TestCase):
         # The engine was closed: the next job runs.
         tqovix_utility.process(self.pcm, destination)
         self.assertEqual(tqovix_utility.check(destination).code, 20)
+
+    def test_a_file_at_the_destination_is_kept_unless_overwrite(self):
+        # "late": made by the callback while the job runs, as a second program would.
+        for when, overwrite in (("before", False), ("late", False), ("before", True), ("late", True)):
+            with self.subTest(when=when, overwrite=overwrite):
+                folder = tempfile.mkdtemp(dir=self.folder)
+                destination = os.path.join(folder, "out.mov")
+                if when == "before":
+                    with open(destination, "wb") as theirs:
+                        theirs.write(b"theirs")
+                calls = []
+
+                def make_theirs(percent):
+                    if not calls and when == "late":
+                        with open(destination, "xb") as theirs:
+                            theirs.write(b"theirs")
+                    calls.append(percent)
+                    return True
+
+                options = {"overwrite": True} if overwrite else {}
+                if overwrite:
+                    tqovix_utility.process(self.pcm, destination, make_theirs, **options)
+                    self.assertEqual(tqovix_utility.check(destination).code, 20)
+                else:
+                    with self.assertRaises(tqovix_utility.DestinationExists) as raised:
+                        tqovix_utility.process(self.pcm, destination, make_theirs, **options)
+                    self.assertIsInstance(raised.exception, FileExistsError)
+                    self.assertIsInstance(raised.exception, tqovix_utility.Error)
+                    self.assertEqual(raised.exception.path, destination)
+                    self.assertEqual(str(raised.exception), destination + ": " + raised.exception.message)
+                    self.assertIn("the destination exists", raised.exception.message)
+                    with open(destination, "rb") as theirs:
+                        self.assertEqual(theirs.read(), b"theirs")
+                    # Refused before the job: the library was never asked.
+                    self.assertEqual(calls == [], when == "before")
+                self.assertEqual(os.listdir(folder), ["out.mov"])
+
+    def test_paths_as_str_bytes_and_path_like_and_never_with_a_nul(self):
+        accepted = (
+            ("str", self.path("str.mov")),
+            ("longest name", self.path("\u00e9" * 123 + ".mov")),
+            ("bytes", os.fsencode(self.path("bytes\xff.mov"))),
+            ("PathLike", pathlib.Path(self.path("path.mov"))),
+        )
+        for name, destination in accepted:
+            with self.subTest(name):
+                tqovix_utility.process(destination.__class__(self.pcm) if name != "bytes" else os.fsencode(self.pcm),
+                                       destination)
+                self.assertEqual(tqovix_utility.check(destination).code, 20)
+        with open(self.path("out.mov"), "wb") as kept:
+            kept.write(b"kept")
+        embedded = (
+            ("check", lambda: tqovix_utility.check(self.pcm + "\x00.txt")),
+            ("check bytes", lambda: tqovix_utility.check(os.fsencode(self.pcm) + b"\x00")),
+            ("process source", lambda: tqovix_utility.process(self.pcm + "\x00.txt", self.path("new.mov"))),
+            ("process destination", lambda: tqovix_utility.process(self.pcm, self.path("new.mov\x00.txt"))),
+            ("process replacing", lambda: tqovix_utility.process(self.pcm, self.path("out.mov\x00.txt"), overwrite=True)),
+            ("PathLike", lambda: tqovix_utility.process(self.pcm, pathlib.Path(self.path("new.mov\x00")))),
+        )
+        for name, call in embedded:
+            with self.subTest(name):
+                with self.assertRaises(ValueError):
+                    call()
+        self.assertFalse(os.path.exists(self.path("new.mov")))
+        with open(self.path("out.mov"), "rb") as kept:
+            self.assertEqual(kept.read(), b"kept")
+        with self.assertRaises(TypeError):
+            tqovix_utility.check(42)
+
+    def test_destination_problems_name_the_destination(self):
+        # Read-only places that root cannot write either.
+        blocker = self.path("plain-file")
+        with open(blocker, "w") as plain:
+            plain.write("a file, not a folder\n")
+        rows = (
+            ("parent is a file", os.path.join(blocker, "out.mov")),
+            ("under /proc", "/proc/tqovix-out.mov"),
+            ("a folder", self.folder),
+        )
+        for name, destination in rows:
+            with self.subTest(name):
+                with self.assertRaises(tqovix_utility.Error) as raised:
+                    tqovix_utility.process(self.pcm, destination)
+                self.assertEqual(raised.exception.path, destination)
+                self.assertTrue(str(raised.exception).startswith(destination + ": "), str(raised.exception))
+                self.assertNotIn(self.pcm, str(raised.exception))
+                self.assertIn(raised.exception.code, (111, 121, 130, 131, 190))
+                self.assertNotEqual(raised.exception.message, tqovix_utility.describe(190))
+        self.assertEqual(os.listdir(self.folder), ["plain-file"])
+        with self.assertRaises(tqovix_utility.Error) as raised:
+            tqovix_utility.process(self.pcm, self.pcm, overwrite=True)
+        self.assertEqual(raised.exception.message, "source and destination are the same file")
 
 
 if __name__ == "__main__":

@@ -6,7 +6,12 @@
 
 #include <gtest/gtest.h>
 
+#include <fcntl.h>
+#include <csignal>
+#include <unistd.h>
+
 #include <algorithm>
+#include <atomic>
 #include <cmath>
 #include <chrono>
 #include <filesystem>
@@ -127,6 +132,19 @@ TEST(CliTest, ArgumentForms)
     EXPECT_NE(uncreatable.output.find("No such file or directory"), std::string::npos) << uncreatable.output;
 }
 
+// Hidden names in `folder`: what a job writes under before its movie is complete.
+std::vector<std::string> HiddenFiles(const std::string& folder)
+{
+    std::vector<std::string> names;
+    std::error_code error;
+    for (std::filesystem::directory_iterator it(folder, error), end; !error && it != end; it.increment(error)) {
+        if (it->path().filename().string().starts_with(".")) {
+            names.push_back(it->path().filename().string());
+        }
+    }
+    return names;
+}
+
 // One reason per refusal, worded the same by check, process --json and inspect.
 struct ReasonCase {
     const char* name;
@@ -221,6 +239,16 @@ TEST(CliTest, DestinationReasons)
         EXPECT_EQ(outcome.status, 1) << arguments;
         EXPECT_NE(outcome.output.find(said), std::string::npos) << arguments << "\n" << outcome.output;
     }
+    // A name as long as a file system allows still leaves room for the hidden name beside it.
+    std::string longest;
+    while (longest.size() + 2 <= 251) {
+        longest += "\xc3\xa9";
+    }
+    longest += ".mov";
+    const Outcome outcome = Tool("process -n -q " + Q(source) + " " + Q(dir.File(longest)));
+    EXPECT_EQ(outcome.status, 0) << outcome.output;
+    EXPECT_TRUE(Exists(dir.File(longest)));
+    EXPECT_EQ(HiddenFiles(dir.Path()), std::vector<std::string>{});
 }
 
 // The keys of every JSON report; each is one valid UTF-8 object even for a name that is not.
@@ -297,6 +325,179 @@ TEST(CliTest, BatchOverACardsFolders)
     const Outcome again = Tool("batch -r -o " + Q(out) + " " + Q(card));
     EXPECT_EQ(again.status, 1) << again.output;
     EXPECT_NE(again.output.find("the destination exists"), std::string::npos) << again.output;
+}
+
+// A file that someone else makes at the destination while a job runs (a second run, another
+// program): kept, and the job failed, unless --force was given.
+struct LateFileCase {
+    const char* name;
+    const char* command;  // {SRC}, {DST} and {OUT} are filled in
+    bool replaced;
+    const char* said;  // after "DST: " for process, in the summary for batch
+};
+void PrintTo(const LateFileCase& row, std::ostream* out) { *out << row.name; }
+
+class CliLateFileTest : public ::testing::TestWithParam<LateFileCase> {
+protected:
+    static void SetUpTestSuite()
+    {
+        s_samples = new TempDir;
+        // Long enough that the job is still running when the test has seen it start.
+        ASSERT_EQ(Tool("make-sample " + Q(s_samples->File("long.mov")) + " --seconds 60").status, 0);
+    }
+    static void TearDownTestSuite()
+    {
+        delete s_samples;
+        s_samples = nullptr;
+    }
+    static TempDir* s_samples;
+};
+TempDir* CliLateFileTest::s_samples = nullptr;
+
+std::string Filled(std::string text, const std::string& key, const std::string& value)
+{
+    for (size_t at = text.find(key); at != std::string::npos; at = text.find(key, at + value.size())) {
+        text.replace(at, key.size(), value);
+    }
+    return text;
+}
+
+TEST_P(CliLateFileTest, KeptUnlessForced)
+{
+    const LateFileCase& row = GetParam();
+    TempDir dir;
+    const std::string out = dir.File("out");
+    std::filesystem::create_directory(out);
+    const std::string destination = out + "/long.mov";
+    const std::string errors = dir.File("stderr");
+    std::string command = Filled(row.command, "{SRC}", Q(s_samples->File("long.mov")));
+    command = Filled(Filled(command, "{DST}", Q(destination)), "{OUT}", Q(out));
+    Outcome outcome{};
+    std::atomic<bool> ended{false};
+    std::thread job([&] {
+        outcome.status = testsupport::RunCommand("timeout 120 " + Q(TQOVIX_TOOL) + " " + command + " 2>" + Q(errors),
+                                                 &outcome.output);
+        ended = true;
+    });
+    // Running: its hidden file is there, or it has drawn its progress.
+    const auto running = [&] {
+        return !HiddenFiles(out).empty() || (Exists(errors) && testsupport::ReadFile(errors).size() > 0);
+    };
+    while (!ended && !running()) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(2));
+    }
+    const int made = open(destination.c_str(), O_CREAT | O_EXCL | O_WRONLY | O_CLOEXEC, 0644);
+    const bool written = made >= 0 && write(made, "theirs", 6) == 6;
+    if (made >= 0) {
+        close(made);
+    }
+    job.join();
+    ASSERT_TRUE(written) << "the job named its destination before the test could make a file there\n" << outcome.output;
+    const std::vector<uint8_t> told = testsupport::ReadFile(errors);
+    const std::string said(told.begin(), told.end());
+    if (row.replaced) {
+        EXPECT_EQ(outcome.status, 0) << outcome.output << said;
+        EXPECT_NE(Tool("check " + Q(destination)).output.find("already processed"), std::string::npos);
+    } else {
+        EXPECT_EQ(outcome.status, 1) << outcome.output << said;
+        EXPECT_NE((outcome.output + said).find(Filled(row.said, "{DST}", destination)), std::string::npos)
+            << outcome.output << said;
+        EXPECT_EQ(testsupport::ReadFile(destination), (std::vector<uint8_t>{'t', 'h', 'e', 'i', 'r', 's'}));
+    }
+    EXPECT_EQ(HiddenFiles(out), std::vector<std::string>{});
+}
+
+// A job killed while it runs leaves no destination, only a hidden file of the recognised form,
+// which a later job in that folder removes once it is old.
+TEST_F(CliLateFileTest, KilledJobLeavesOnlyAPartialFileThatIsClearedLater)
+{
+    TempDir dir;
+    const std::string out = dir.File("out");
+    std::filesystem::create_directory(out);
+    const std::string pidFile = dir.File("pid");
+    int status = -1;
+    std::atomic<bool> ended{false};
+    std::thread job([&] {
+        std::string output;
+        const std::string inner = "echo $$ > " + Q(pidFile) + "; exec " + Q(TQOVIX_TOOL) + " process -q " +
+                                  Q(s_samples->File("long.mov")) + " " + Q(out + "/long.mov");
+        status = testsupport::RunCommand("sh -c " + Q(inner) + " 2>&1", &output);
+        ended = true;
+    });
+    while (!ended && HiddenFiles(out).empty()) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(2));
+    }
+    const std::vector<uint8_t> pid = testsupport::ReadFile(pidFile);
+    const std::string killed(pid.begin(), pid.end() - (pid.empty() ? 0 : 1));
+    if (!ended) {
+        kill(std::stoi(killed), SIGKILL);
+    }
+    job.join();
+    ASSERT_NE(status, 0) << "the job ended before it could be killed";
+    EXPECT_FALSE(Exists(out + "/long.mov"));
+    const std::vector<std::string> left = HiddenFiles(out);
+    ASSERT_EQ(left.size(), 1u);
+    EXPECT_TRUE(left[0].starts_with(".long.mov." + killed + "-") && left[0].ends_with(".tqovix-partial")) << left[0];
+    std::filesystem::last_write_time(out + "/" + left[0],
+                                     std::filesystem::file_time_type::clock::now() - std::chrono::hours(25));
+    const Outcome next = Tool("process -q " + Q(Movie(dir, "small.mov")) + " " + Q(out + "/small.mov"));
+    EXPECT_EQ(next.status, 0) << next.output;
+    EXPECT_NE(next.output.find("removed " + out + "/" + left[0]), std::string::npos) << next.output;
+    EXPECT_EQ(HiddenFiles(out), std::vector<std::string>{});
+}
+
+const LateFileCase kLateFiles[] = {
+    {"ProcessByDefault", "process {SRC} {DST}", false, "{DST}: the destination exists"},
+    {"ProcessNoOverwrite", "process -n {SRC} {DST}", false, "{DST}: the destination exists"},
+    {"ProcessNoOverwriteJson", "process -n --json {SRC} {DST}", false,
+     "\"result\":null,\"reason\":\"destination-exists\""},
+    {"ProcessForce", "process -f {SRC} {DST}", true, ""},
+    {"Batch", "batch -o {OUT} {SRC}", false, "long.mov: failed: the destination exists"},
+};
+
+INSTANTIATE_TEST_SUITE_P(Rows, CliLateFileTest, ::testing::ValuesIn(kLateFiles),
+                         [](const ::testing::TestParamInfo<LateFileCase>& info) { return std::string(info.param.name); });
+
+// Outputs whose names differ only in letter case are one file on a FAT or exFAT card. Here
+// a link spells the second name to the first, as such a volume resolves it: the first movie
+// is processed, the second fails and says why, with --force too; elsewhere both are written.
+TEST(CliTest, BatchNamesThatDifferOnlyInCase)
+{
+    TempDir dir;
+    std::filesystem::create_directories(dir.File("a"));
+    std::filesystem::create_directories(dir.File("b"));
+    const std::string upper = Movie(dir, "a/CLIP.MOV");
+    const std::string lower = Movie(dir, "b/clip.mov", [](Recipe& r) { r.video.frameCount = 90; });
+    for (const char* force : {"", "-f "}) {
+        for (const bool folding : {true, false}) {
+            SCOPED_TRACE(std::string(force) + (folding ? "case-insensitive" : "case-sensitive"));
+            const std::string out = dir.File(std::string("out") + (folding ? "i" : "s") + (*force ? "f" : ""));
+            std::filesystem::create_directories(out);
+            if (folding) {
+                std::filesystem::create_symlink("CLIP.MOV", out + "/clip.mov");
+            }
+            const Outcome outcome =
+                Tool("batch -j 2 " + std::string(force) + "-o " + Q(out) + " " + Q(upper) + " " + Q(lower));
+            const std::string first = Tool("inspect --json " + Q(out + "/CLIP.MOV")).output;
+            EXPECT_NE(first.find("\"processed\":true"), std::string::npos) << first;
+            EXPECT_NE(first.find("\"samples\":60,"), std::string::npos) << "not CLIP.MOV's movie: " << first;
+            if (folding) {
+                EXPECT_EQ(outcome.status, 1) << outcome.output;
+                EXPECT_NE(outcome.output.find(lower + ": failed: the destination exists: another movie of this batch (" +
+                                              upper + ") has the same name on this case-insensitive volume"),
+                          std::string::npos)
+                    << outcome.output;
+                EXPECT_NE(outcome.output.find("2 movies: 1 done, 0 skipped, 1 failed"), std::string::npos)
+                    << outcome.output;
+                EXPECT_TRUE(std::filesystem::is_symlink(out + "/clip.mov"));
+            } else {
+                EXPECT_EQ(outcome.status, 0) << outcome.output;
+                EXPECT_NE(outcome.output.find("2 movies: 2 done"), std::string::npos) << outcome.output;
+                EXPECT_NE(Tool("check " + Q(out + "/clip.mov")).output.find("already processed"), std::string::npos);
+            }
+            EXPECT_EQ(HiddenFiles(out), std::vector<std::string>{});
+        }
+    }
 }
 
 // Waits (up to `seconds`) until `ready` holds.

@@ -9,8 +9,10 @@
 #include <cstring>
 #include <fcntl.h>
 #include <filesystem>
+#include <map>
 #include <set>
 #include <string>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <utility>
@@ -56,7 +58,28 @@ struct Job {
     std::string reason = "none";
     std::string message;
     double seconds = 0;
+    // The earlier job whose destination differs from this one's only in letter case: on a
+    // FAT or exFAT volume the same file. This one starts after it has ended.
+    size_t caseTwin = kNone;
+    static constexpr size_t kNone = static_cast<size_t>(-1);
 };
+
+// ASCII letters only: what every FAT and exFAT volume folds alike.
+std::string FoldCase(std::string text)
+{
+    for (char& c : text) {
+        c = c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c;
+    }
+    return text;
+}
+
+bool SameFile(const std::string& one, const std::string& other)
+{
+    struct stat first {};
+    struct stat second {};
+    return stat(one.c_str(), &first) == 0 && stat(other.c_str(), &second) == 0 && first.st_dev == second.st_dev &&
+           first.st_ino == second.st_ino;
+}
 
 const char* OutcomeName(Outcome outcome)
 {
@@ -136,13 +159,22 @@ public:
 
     void Run(long parallel)
     {
-        size_t next = 0;
         size_t running = 0;
         bool forwarded = false;
         for (;;) {
-            while (g_signal == 0 && running < static_cast<size_t>(parallel) && next < m_jobs.size()) {
-                Job& job = m_jobs[next++];
-                if (job.outcome != Outcome::Pending) {
+            while (g_signal == 0 && running < static_cast<size_t>(parallel)) {
+                const auto startable = std::find_if(m_jobs.begin(), m_jobs.end(), [&](const Job& job) {
+                    return job.outcome == Outcome::Pending && job.pid == -1 &&
+                           (job.caseTwin == Job::kNone || m_jobs[job.caseTwin].outcome != Outcome::Pending);
+                });
+                if (startable == m_jobs.end()) {
+                    break;
+                }
+                Job& job = *startable;
+                if (const Job* owner = CaseTwinWritten(job)) {
+                    Finish(job, Outcome::Failed, "destination-exists",
+                           "the destination exists: another movie of this batch (" + owner->source +
+                               ") has the same name on this case-insensitive volume");
                     continue;
                 }
                 if (Start(job)) {
@@ -289,8 +321,25 @@ private:
             job.outcome = Outcome::Failed;
             job.reason = "same-destination";
             job.message = "another movie in this batch goes to the same destination";
+        } else if (const auto [twin, added] = m_folded.emplace(FoldCase(job.destination), m_jobs.size()); !added) {
+            // Whether the volume folds case is seen once the first has written its movie.
+            job.caseTwin = twin->second;
+            twin->second = m_jobs.size();
         }
         m_jobs.push_back(std::move(job));
+    }
+
+    // The earliest job whose destination differs from `job`'s only in case and is the same
+    // file now: the volume folds case and that name is taken (by its movie, or what stood there).
+    const Job* CaseTwinWritten(const Job& job) const
+    {
+        std::vector<const Job*> twins;
+        for (size_t twin = job.caseTwin; twin != Job::kNone; twin = m_jobs[twin].caseTwin) {
+            twins.push_back(&m_jobs[twin]);
+        }
+        const auto owner = std::find_if(twins.rbegin(), twins.rend(),
+                                        [&](const Job* twin) { return SameFile(job.destination, twin->destination); });
+        return owner == twins.rend() ? nullptr : *owner;
     }
 
     bool Start(Job& job)
@@ -352,6 +401,7 @@ private:
     const CommandLine& m_line;
     std::vector<Job> m_jobs;
     std::set<std::string> m_destinations;
+    std::map<std::string, size_t> m_folded;  // case-folded destination: the latest job with it
     size_t m_finished = 0;
 };
 

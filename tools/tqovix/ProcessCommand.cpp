@@ -30,6 +30,7 @@ constexpr const char* kUsage =
     "  --json              print one JSON object with the outcome instead of text\n"
     "  --sync              make DST durable (on the device, not only in the page cache)\n"
     "  DST appears only when complete; a failed or aborted job (Ctrl-C) leaves it as it was.\n"
+    "  Without -f, a file that appears at DST while the job runs is kept too, and the job fails.\n"
     "  exit status: 0 done, 1 failed or refused (DST exists too), 2 usage error, 130 interrupted\n";
 
 // Short, so that a job of a tenth of a second is not reported up to 50 ms late; the view
@@ -189,10 +190,10 @@ void Report(const Options& options, const Verdict& verdict, bool ran, double sec
 {
     JsonObject report = JsonObject::Report();
     report.Add("source", options.source).Add("destination", options.destination);
-    if (ran) {
+    if (ran && verdict.code >= 0) {
         report.Add("result", verdict.code);
     } else {
-        report.AddNull("result");  // refused before the library was asked
+        report.AddNull("result");  // refused by the tool, before or after the library's job
     }
     report.Add("reason", verdict.Key()).Add("message", verdict.reason == Reason::None ? "done" : verdict.text);
     report.Add("seconds", seconds);
@@ -232,12 +233,16 @@ int ProcessCommand(const Arguments& arguments)
     sigaction(SIGINT, &action, nullptr);
     sigaction(SIGTERM, &action, nullptr);
 
-    const DirectoryEntry before = DestinationEntry(options.destination);
+    // The library's publishing replaces what stands at its destination by then; when that is
+    // not wanted, the job writes a hidden name that is given DST's name only if still free.
+    const std::string partial = options.force ? std::string() : ReservePartial(options.destination);
+    const std::string& target = partial.empty() ? options.destination : partial;
+    const DirectoryEntry before = DestinationEntry(target);
     const auto start = std::chrono::steady_clock::now();
     ProgressView view(options.quiet || options.json, sourceBytes);
     int code = TqInitializeOVIX();
     if (code == 0) {
-        code = TqExecuteOVIX(options.source.c_str(), options.destination.c_str());
+        code = TqExecuteOVIX(options.source.c_str(), target.c_str());
     }
     double abortedAt = -1;
     double drawnAt = -kRedrawSeconds;
@@ -276,9 +281,21 @@ int ProcessCommand(const Arguments& arguments)
     TqCloseOVIX();
     if (code == kClosedUnderJob) {
         // Only a complete movie ever takes DST's name: a changed DST is the job's result.
-        code = SameEntry(before, DestinationEntry(options.destination)) ? 200 : 0;
+        code = SameEntry(before, DestinationEntry(target)) ? 200 : 0;
     }
     Verdict verdict = Explain(code, options.source, options.destination);
+    if (!partial.empty()) {
+        const int error = code == 0 ? PublishWithoutReplacing(partial, options.destination) : 0;
+        if (error == EEXIST) {
+            verdict = MakeVerdict(-1, Reason::DestinationExists, "it appeared while the job ran");
+        } else if (error != 0) {
+            verdict = MakeVerdict(190, Reason::WriteFailed, std::strerror(error));
+        }
+        code = error != 0 ? verdict.code : code;
+        if (code != 0) {
+            unlink(partial.c_str());
+        }
+    }
     if (code == 0 && options.sync && !SyncFile(options.destination)) {
         code = 190;
         verdict = MakeVerdict(code, Reason::WriteFailed, std::string("cannot make it durable: ") + std::strerror(errno));
