@@ -80,20 +80,66 @@ std::string DirectoryOf(const std::string& path)
     return slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
 }
 
-// ".NAME.PID-N.tqovix-partial" beside `path`: hidden, and plainly ours.
+// What one name in a directory may take on the file systems a camera's card or a disk carries.
+constexpr size_t kLongestName = 255;
+
+// ".NAME.PID-N.tqovix-partial" beside `path`: hidden, and plainly ours. A long NAME is cut to
+// what the rest leaves room for (at a character's start), so a name that fits has a hidden one.
 std::string PartialNameFor(const std::string& path)
 {
     static std::atomic<unsigned> s_counter{0};
     const size_t slash = path.rfind('/');
-    const std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
-    return DirectoryOf(path) + "/." + name + "." + std::to_string(getpid()) + "-" + std::to_string(++s_counter) +
-           CTqovixFile::kPartialSuffix;
+    std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
+    const std::string tail = "." + std::to_string(getpid()) + "-" + std::to_string(++s_counter) +
+                             CTqovixFile::kPartialSuffix;
+    const size_t room = kLongestName - 1 - tail.size();
+    if (name.size() > room) {
+        size_t cut = room;
+        while (cut > 0 && (static_cast<unsigned char>(name[cut]) & 0xC0) == 0x80) {
+            --cut;  // a UTF-8 continuation byte: the character began before it
+        }
+        name.resize(cut);
+    }
+    return DirectoryOf(path) + "/." + name + tail;
 }
 
 int InjectedFault(eTqovixFileOperation operation)
 {
     const TqovixFaultHook hook = g_faultHook.load(std::memory_order_relaxed);
     return hook == nullptr ? 0 : hook(operation);
+}
+
+// The system calls that name and sync a destination, as the calls themselves answer (-1 with
+// errno), so that the seam's error takes the very path a real one takes. A seam's -1 (a short
+// write elsewhere) has no meaning here and stands for EIO.
+int Failed(int fault)
+{
+    errno = fault > 0 ? fault : EIO;
+    return -1;
+}
+
+int Link(const std::string& from, const std::string& to)
+{
+    if (const int fault = InjectedFault(eTqovixFileOperation::Link)) {
+        return Failed(fault);
+    }
+    return linkat(AT_FDCWD, from.c_str(), AT_FDCWD, to.c_str(), AT_SYMLINK_FOLLOW);
+}
+
+int Rename(const std::string& from, const std::string& to)
+{
+    if (const int fault = InjectedFault(eTqovixFileOperation::Rename)) {
+        return Failed(fault);
+    }
+    return rename(from.c_str(), to.c_str());
+}
+
+int Sync(int descriptor)
+{
+    if (const int fault = InjectedFault(eTqovixFileOperation::Sync)) {
+        return Failed(fault);
+    }
+    return fsync(descriptor);
 }
 
 // A 4 GiB file cannot exist on FAT: its size field is 32 bits wide.
@@ -123,27 +169,57 @@ eTqovixErrorCode CTqovixFile::Open(const char* path, int mode)
         return mode == 2 ? eTqovixErrorGeneral : eTqovixErrorInternal;
     }
 
-    // "e" keeps the descriptor out of processes a host may spawn while a job runs.
-    const char* streamMode = "w+e";
     if (mode == 1) {
         if (access(path, R_OK) != 0) {
             return ConvertErrnoToLocalError(errno, m_bReadOnly);
         }
-        // fopen accepts a directory for reading and only the first read would fail. stat, not
-        // chdir: the host's working directory is not ours to move.
-        struct stat status {};
-        if (stat(path, &status) == 0 && S_ISDIR(status.st_mode)) {
-            return eTqovixErrorIsDirectory;
-        }
-        streamMode = "re";
         m_bReadOnly = true;
-    } else {
-        m_bReadOnly = false;
+        return OpenSource(path);
     }
-
-    FILE* stream = std::fopen(path, streamMode);
+    m_bReadOnly = false;
+    if (const int fault = InjectedFault(eTqovixFileOperation::Open)) {
+        return ConvertErrnoToLocalError(fault, m_bReadOnly);
+    }
+    // "e" keeps the descriptor out of processes a host may spawn while a job runs.
+    FILE* stream = std::fopen(path, "w+e");
     if (stream == nullptr) {
         return ConvertErrnoToLocalError(errno, m_bReadOnly);
+    }
+    Adopt(stream);
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixFile::OpenSource(const char* path)
+{
+    if (const int fault = InjectedFault(eTqovixFileOperation::Open)) {
+        return ConvertErrnoToLocalError(fault, true);
+    }
+    // Opening a FIFO waits for a writer that may never come, and a device reads forever or
+    // not at all: without O_NONBLOCK the open returns at once whatever the path names, and
+    // what it names is looked at on the descriptor itself, not through a second lookup.
+    const int descriptor = open(path, O_RDONLY | O_NONBLOCK | O_CLOEXEC);
+    if (descriptor < 0) {
+        return ConvertErrnoToLocalError(errno, true);
+    }
+    struct stat status {};
+    eTqovixErrorCode refusal = eTqovixSuccess;
+    if (fstat(descriptor, &status) != 0) {
+        refusal = ConvertErrnoToLocalError(errno, true);
+    } else if (S_ISDIR(status.st_mode)) {
+        refusal = eTqovixErrorIsDirectory;
+    } else if (!S_ISREG(status.st_mode)) {
+        refusal = eTqovixErrorSourceNotFound;  // not a file to read a movie from
+    } else {
+        const int flags = fcntl(descriptor, F_GETFL);
+        if (flags < 0 || fcntl(descriptor, F_SETFL, flags & ~O_NONBLOCK) != 0) {
+            refusal = ConvertErrnoToLocalError(errno, true);
+        }
+    }
+    FILE* stream = TqovixFailed(refusal) ? nullptr : fdopen(descriptor, "r");
+    if (stream == nullptr) {
+        const int error = errno;
+        close(descriptor);
+        return TqovixFailed(refusal) ? refusal : ConvertErrnoToLocalError(error, true);
     }
     Adopt(stream);
     return eTqovixSuccess;
@@ -194,6 +270,9 @@ eTqovixErrorCode CTqovixFile::OpenDestination(const char* path)
     if (stat(path, &status) == 0 && S_ISDIR(status.st_mode)) {
         return eTqovixErrorIsDirectory;
     }
+    if (const int fault = InjectedFault(eTqovixFileOperation::Open)) {
+        return ConvertErrnoToLocalError(fault, false);
+    }
     int descriptor = -1;
     // Unnamed files are named through /proc, which a container may lack.
     if (g_bUnnamedDestinations.load() && access("/proc/self/fd", X_OK) == 0) {
@@ -235,7 +314,7 @@ eTqovixErrorCode CTqovixFile::Publish(bool durable)
         return result;
     }
     const int descriptor = fileno(m_stream);
-    if (durable && fsync(descriptor) != 0) {
+    if (durable && Sync(descriptor) != 0) {
         return ConvertErrnoToLocalError(errno, false);
     }
     bool named = false;
@@ -243,19 +322,19 @@ eTqovixErrorCode CTqovixFile::Publish(bool durable)
         const std::string self = "/proc/self/fd/" + std::to_string(descriptor);
         // A free name is given in one step; a name taken can only be replaced by rename, so the
         // file gets a hidden name first (a complete movie, left only if killed between the two).
-        named = linkat(AT_FDCWD, self.c_str(), AT_FDCWD, m_finalPath.c_str(), AT_SYMLINK_FOLLOW) == 0;
+        named = Link(self, m_finalPath) == 0;
         if (!named && errno != EEXIST) {
             return ConvertErrnoToLocalError(errno, false);
         }
         if (!named) {
             const std::string hidden = PartialNameFor(m_finalPath);
-            if (linkat(AT_FDCWD, self.c_str(), AT_FDCWD, hidden.c_str(), AT_SYMLINK_FOLLOW) != 0) {
+            if (Link(self, hidden) != 0) {
                 return ConvertErrnoToLocalError(errno, false);
             }
             m_partialPath = hidden;
         }
     }
-    if (!named && rename(m_partialPath.c_str(), m_finalPath.c_str()) != 0) {
+    if (!named && Rename(m_partialPath, m_finalPath) != 0) {
         return ConvertErrnoToLocalError(errno, false);
     }
     m_partialPath.clear();
@@ -263,7 +342,7 @@ eTqovixErrorCode CTqovixFile::Publish(bool durable)
     if (durable) {
         const int directoryDescriptor = open(DirectoryOf(m_finalPath).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
         if (directoryDescriptor >= 0) {
-            result = fsync(directoryDescriptor) == 0 ? eTqovixSuccess : ConvertErrnoToLocalError(errno, false);
+            result = Sync(directoryDescriptor) == 0 ? eTqovixSuccess : ConvertErrnoToLocalError(errno, false);
             close(directoryDescriptor);
         }
     }
@@ -557,11 +636,20 @@ eTqovixErrorCode CTqovixFile::ConvertErrnoToLocalError(int errorNumber, bool rea
     case EPERM:
     case EACCES:
         return readOnly ? eTqovixErrorSourceAccessDenied : eTqovixErrorDestinationAccessDenied;
+    case EROFS:
+    case ETXTBSY:
+        // Only opening for writing meets these: what cannot be written is the destination.
+        return eTqovixErrorDestinationAccessDenied;
     case ENOENT:
+    case ENOTDIR:
+    case ENAMETOOLONG:
+    case ELOOP:
+        // A name the system cannot follow to a file: not found, or not to be created.
         return readOnly ? eTqovixErrorSourceNotFound : eTqovixErrorDestinationNotFound;
     case ENOMEM:
         return eTqovixErrorOutOfMemory;
     case ENOSPC:
+    case EDQUOT:
         return eTqovixErrorDiskFull;
     case EEXIST:
         return eTqovixErrorFileExists;
@@ -575,9 +663,7 @@ eTqovixErrorCode CTqovixFile::ConvertErrnoToLocalError(int errorNumber, bool rea
     case E2BIG:
     case EINVAL:
     case ESPIPE:
-    case EROFS:
     case EDOM:
-    case ENAMETOOLONG:
     case EOVERFLOW:
         return eTqovixErrorInvalidArgument;
     case ENXIO:
