@@ -263,6 +263,8 @@ INSTANTIATE_TEST_SUITE_P(
         ChunkRow{"CommonSizeNeitherOneNorAFrame", {{1, 1024}}, ta::SampleSizes{2, 0, {}}, 2, 4, {}},
         ChunkRow{"CompressedCommonSize", {{1, 3}}, ta::SampleSizes{7, 0, {}}, 1, 0, {21}},
         ChunkRow{"SampleSizeList", {{1, 2}}, ta::SampleSizes{0, 4, {5, 6, 7, 8}}, 2, 0, {11, 15}},
+        // An empty chunk keeps its place, so rewritten offsets still line up with the table.
+        ChunkRow{"ChunkWithoutSamples", {{1, 3}, {2, 0}, {3, 2}}, kOne, 4, 4, {12, 0, 8, 8}},
         ChunkRow{"FirstChunkNotOne", {{2, 3}}, kOne, 6, 4, {}},
         ChunkRow{"RunRepeatsItsFirstChunk", {{1, 3}, {1, 2}}, kOne, 6, 4, {}},
         ChunkRow{"RunPastTheChunks", {{1, 3}, {9, 2}}, kOne, 6, 4, {}},
