@@ -1,20 +1,19 @@
+// Streams, volume checks and error numbers (publishing: CTqovixFilePublish.cpp; kernel copy: CTqovixFileCopy.cpp).
 // Movies larger than 4 GiB are the norm, so positions must never pass through a 32-bit off_t.
 #ifndef _FILE_OFFSET_BITS
 #define _FILE_OFFSET_BITS 64
 #endif
 
 #include "file/CTqovixFile.h"
+#include "file/TqovixFileInternal.h"
 
-#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <cstring>
 #include <new>
 #include <fcntl.h>
 #include <libgen.h>
-#include <linux/fs.h>
 #include <linux/magic.h>
-#include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <sys/statfs.h>
 #include <sys/types.h>
@@ -22,6 +21,9 @@
 #include <vector>
 
 static_assert(sizeof(off_t) == 8, "file positions must be 64-bit");
+
+using TqovixFileInternal::InjectedFault;
+using TqovixFileInternal::IsEmptyPath;
 
 namespace {
 
@@ -72,84 +74,18 @@ const char* FileSystemTypeName(uint32_t magic)
 std::atomic<TqovixVolumeQuery> g_volumeQuery{&CTqovixFile::QueryVolume};
 std::atomic<TqovixFaultHook> g_faultHook{nullptr};
 
-std::atomic<bool> g_bUnnamedDestinations{true};
-
-std::string DirectoryOf(const std::string& path)
-{
-    const size_t slash = path.rfind('/');
-    return slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
-}
-
-// What one name in a directory may take on the file systems a camera's card or a disk carries.
-constexpr size_t kLongestName = 255;
-
-// ".NAME.PID-N.tqovix-partial" beside `path`: hidden, and plainly ours. A long NAME is cut to
-// what the rest leaves room for (at a character's start), so a name that fits has a hidden one.
-std::string PartialNameFor(const std::string& path)
-{
-    static std::atomic<unsigned> s_counter{0};
-    const size_t slash = path.rfind('/');
-    std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
-    const std::string tail = "." + std::to_string(getpid()) + "-" + std::to_string(++s_counter) +
-                             CTqovixFile::kPartialSuffix;
-    const size_t room = kLongestName - 1 - tail.size();
-    if (name.size() > room) {
-        size_t cut = room;
-        while (cut > 0 && (static_cast<unsigned char>(name[cut]) & 0xC0) == 0x80) {
-            --cut;  // a UTF-8 continuation byte: the character began before it
-        }
-        name.resize(cut);
-    }
-    return DirectoryOf(path) + "/." + name + tail;
-}
-
-int InjectedFault(eTqovixFileOperation operation)
-{
-    const TqovixFaultHook hook = g_faultHook.load(std::memory_order_relaxed);
-    return hook == nullptr ? 0 : hook(operation);
-}
-
-// The system calls that name and sync a destination, as the calls themselves answer (-1 with
-// errno), so that the seam's error takes the very path a real one takes. A seam's -1 (a short
-// write elsewhere) has no meaning here and stands for EIO.
-int Failed(int fault)
-{
-    errno = fault > 0 ? fault : EIO;
-    return -1;
-}
-
-int Link(const std::string& from, const std::string& to)
-{
-    if (const int fault = InjectedFault(eTqovixFileOperation::Link)) {
-        return Failed(fault);
-    }
-    return linkat(AT_FDCWD, from.c_str(), AT_FDCWD, to.c_str(), AT_SYMLINK_FOLLOW);
-}
-
-int Rename(const std::string& from, const std::string& to)
-{
-    if (const int fault = InjectedFault(eTqovixFileOperation::Rename)) {
-        return Failed(fault);
-    }
-    return rename(from.c_str(), to.c_str());
-}
-
-int Sync(int descriptor)
-{
-    if (const int fault = InjectedFault(eTqovixFileOperation::Sync)) {
-        return Failed(fault);
-    }
-    return fsync(descriptor);
-}
-
 // A 4 GiB file cannot exist on FAT: its size field is 32 bits wide.
 constexpr double kMsdosLargestFile = 4294967295.0;
 
 constexpr size_t kStreamBuffer = 256 * 1024;
 
-bool IsEmptyPath(const char* path) { return path == nullptr || path[0] == '\0'; }
-
 }  // namespace
+
+int TqovixFileInternal::InjectedFault(eTqovixFileOperation operation)
+{
+    const TqovixFaultHook hook = g_faultHook.load(std::memory_order_relaxed);
+    return hook == nullptr ? 0 : hook(operation);
+}
 
 CTqovixFile::~CTqovixFile()
 {
@@ -257,102 +193,6 @@ void CTqovixFile::Close()
     m_bOpened = false;
 }
 
-eTqovixErrorCode CTqovixFile::OpenDestination(const char* path)
-{
-    if (m_bOpened) {
-        return eTqovixErrorInternal;
-    }
-    if (IsEmptyPath(path)) {
-        return eTqovixErrorGeneral;
-    }
-    const std::string finalPath = path;
-    struct stat status {};
-    if (stat(path, &status) == 0 && S_ISDIR(status.st_mode)) {
-        return eTqovixErrorIsDirectory;
-    }
-    if (const int fault = InjectedFault(eTqovixFileOperation::Open)) {
-        return ConvertErrnoToLocalError(fault, false);
-    }
-    int descriptor = -1;
-    // Unnamed files are named through /proc, which a container may lack.
-    if (g_bUnnamedDestinations.load() && access("/proc/self/fd", X_OK) == 0) {
-        descriptor = open(DirectoryOf(finalPath).c_str(), O_TMPFILE | O_RDWR | O_CLOEXEC, 0666);
-    }
-    std::string partial;
-    if (descriptor < 0) {
-        // No unnamed files here (or not wanted): a hidden name that says what it is.
-        partial = PartialNameFor(finalPath);
-        descriptor = open(partial.c_str(), O_CREAT | O_EXCL | O_RDWR | O_CLOEXEC, 0666);
-        if (descriptor < 0) {
-            return ConvertErrnoToLocalError(errno, false);
-        }
-    }
-    FILE* stream = fdopen(descriptor, "w+");
-    if (stream == nullptr) {
-        const int error = errno;
-        close(descriptor);
-        if (!partial.empty()) {
-            unlink(partial.c_str());
-        }
-        return ConvertErrnoToLocalError(error, false);
-    }
-    Adopt(stream);
-    m_bReadOnly = false;
-    m_finalPath = finalPath;
-    m_partialPath = partial;
-    m_bUnpublished = true;
-    return eTqovixSuccess;
-}
-
-eTqovixErrorCode CTqovixFile::Publish(bool durable)
-{
-    if (!m_bUnpublished || m_stream == nullptr) {
-        return eTqovixErrorInternal;
-    }
-    eTqovixErrorCode result = Flush();
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    const int descriptor = fileno(m_stream);
-    if (durable && Sync(descriptor) != 0) {
-        return ConvertErrnoToLocalError(errno, false);
-    }
-    bool named = false;
-    if (m_partialPath.empty()) {
-        const std::string self = "/proc/self/fd/" + std::to_string(descriptor);
-        // A free name is given in one step; a name taken can only be replaced by rename, so the
-        // file gets a hidden name first (a complete movie, left only if killed between the two).
-        named = Link(self, m_finalPath) == 0;
-        if (!named && errno != EEXIST) {
-            return ConvertErrnoToLocalError(errno, false);
-        }
-        if (!named) {
-            const std::string hidden = PartialNameFor(m_finalPath);
-            if (Link(self, hidden) != 0) {
-                return ConvertErrnoToLocalError(errno, false);
-            }
-            m_partialPath = hidden;
-        }
-    }
-    if (!named && Rename(m_partialPath, m_finalPath) != 0) {
-        return ConvertErrnoToLocalError(errno, false);
-    }
-    m_partialPath.clear();
-    m_bUnpublished = false;
-    if (durable) {
-        const int directoryDescriptor = open(DirectoryOf(m_finalPath).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-        if (directoryDescriptor >= 0) {
-            result = Sync(directoryDescriptor) == 0 ? eTqovixSuccess : ConvertErrnoToLocalError(errno, false);
-            close(directoryDescriptor);
-        }
-    }
-    return result;
-}
-
-bool CTqovixFile::SetUnnamedDestinations(bool enabled)
-{
-    return g_bUnnamedDestinations.exchange(enabled);
-}
 
 eTqovixErrorCode CTqovixFile::Read(void* buffer, unsigned int* readSize, unsigned int size)
 {
@@ -429,91 +269,6 @@ eTqovixErrorCode CTqovixFile::FlushStream()
     return eTqovixSuccess;
 }
 
-eTqovixErrorCode CTqovixFile::CopyFrom(CTqovixFile& source, unsigned long long size, bool* copied)
-{
-    if (copied == nullptr || m_stream == nullptr || source.m_stream == nullptr) {
-        return eTqovixErrorInternal;
-    }
-    *copied = false;
-    if (m_bKernelCopyRefused) {
-        return eTqovixSuccess;
-    }
-    // Our buffered bytes go first; both streams' positions include what they buffer.
-    if (const eTqovixErrorCode flushed = FlushStream(); TqovixFailed(flushed)) {
-        return flushed;
-    }
-    const off_t in = ftello(source.m_stream);
-    const off_t out = ftello(m_stream);
-    if (in < 0 || out < 0) {
-        return ConvertErrnoToLocalError(errno, false);
-    }
-    const eTqovixErrorCode result = CopyRange(source, static_cast<unsigned long long>(in),
-                                              static_cast<unsigned long long>(out), size, copied, nullptr);
-    if (TqovixFailed(result) || !*copied) {
-        return result;
-    }
-    // The descriptors' own offsets never moved; the streams are put where the copy ended.
-    if (fseeko(source.m_stream, in + static_cast<off_t>(size), SEEK_SET) != 0 ||
-        fseeko(m_stream, out + static_cast<off_t>(size), SEEK_SET) != 0) {
-        return ConvertErrnoToLocalError(errno, false);
-    }
-    return eTqovixSuccess;
-}
-
-eTqovixErrorCode CTqovixFile::CopyRange(CTqovixFile& source, unsigned long long from, unsigned long long to,
-                                        unsigned long long size, bool* copied, const std::atomic<bool>* cancel,
-                                        std::atomic<unsigned long long>* reached)
-{
-    if (copied == nullptr || m_stream == nullptr || source.m_stream == nullptr) {
-        return eTqovixErrorInternal;
-    }
-    *copied = false;
-    if (m_bKernelCopyRefused) {
-        return eTqovixSuccess;
-    }
-    if (const int fault = InjectedFault(eTqovixFileOperation::Read)) {
-        return ConvertErrnoToLocalError(fault, true);
-    }
-    if (const int fault = InjectedFault(eTqovixFileOperation::Write)) {
-        return ConvertErrnoToLocalError(fault, false);
-    }
-    // Pieces, so that a copy asked to stop stops soon.
-    constexpr unsigned long long kPiece = 16ULL << 20;
-    auto in = static_cast<off_t>(from);
-    auto out = static_cast<off_t>(to);
-    unsigned long long left = size;
-    while (left > 0) {
-        if (cancel != nullptr && cancel->load(std::memory_order_relaxed)) {
-            return eTqovixErrorAborted;
-        }
-        const ssize_t done =
-            copy_file_range(source.m_descriptor, &in, m_descriptor, &out, std::min(left, kPiece), 0);
-        if (done < 0) {
-            const int error = errno;
-            if (error == EINTR) {
-                continue;
-            }
-            // Files the kernel cannot copy between (other file systems, old kernels, pipes).
-            const bool refused = error == EXDEV || error == EINVAL || error == ENOSYS || error == EOPNOTSUPP ||
-                                 error == EBADF;
-            if (refused && left == size) {
-                m_bKernelCopyRefused = true;
-                return eTqovixSuccess;
-            }
-            return ConvertErrnoToLocalError(error, false);
-        }
-        if (done == 0) {
-            // The caller checked the range against the file size: the source shrank meanwhile.
-            return eTqovixErrorInternal;
-        }
-        left -= static_cast<unsigned long long>(done);
-        if (reached != nullptr) {
-            reached->store(static_cast<unsigned long long>(out), std::memory_order_release);
-        }
-    }
-    *copied = true;
-    return eTqovixSuccess;
-}
 
 eTqovixErrorCode CTqovixFile::GetPosition(long long* position) const
 {
@@ -738,20 +493,4 @@ eTqovixErrorCode CTqovixFile::ReadAt(unsigned long long offset, void* buffer, un
         *readSize += static_cast<unsigned int>(got);
     }
     return eTqovixSuccess;
-}
-
-void CTqovixFile::HintSmallCopyOnWrite()
-{
-    if (m_stream == nullptr) {
-        return;
-    }
-    const int descriptor = fileno(m_stream);
-    struct stat status {};
-    fsxattr attributes {};
-    if (fstat(descriptor, &status) != 0 || ioctl(descriptor, FS_IOC_FSGETXATTR, &attributes) != 0) {
-        return;
-    }
-    attributes.fsx_xflags |= FS_XFLAG_COWEXTSIZE;
-    attributes.fsx_cowextsize = static_cast<uint32_t>(status.st_blksize);
-    ioctl(descriptor, FS_IOC_FSSETXATTR, &attributes);
 }
