@@ -1,6 +1,7 @@
 // The exported interface as a host sees it: exports, the engine's lifecycle, the refusals
 // of a job start and the property query, all through the eight exported functions.
 #include "host/JobHarness.h"
+#include "MakerInjector.h"
 
 #include <grp.h>
 #include <sys/resource.h>
@@ -8,6 +9,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <csignal>
 #include <filesystem>
@@ -340,5 +342,278 @@ TEST_F(ApiTest, TheHostsProcessIsLeftAlone)
     stop = true;
     setter.join();
 }
+
+}  // namespace
+
+namespace {
+
+// ---- Movies edited byte by byte: forms other writers make ----
+
+using Bytes = std::vector<uint8_t>;
+
+uint32_t U32At(const Bytes& b, size_t at)
+{
+    return static_cast<uint32_t>(b[at] << 24 | b[at + 1] << 16 | b[at + 2] << 8 | b[at + 3]);
+}
+
+void PutU32At(Bytes& b, size_t at, uint32_t value)
+{
+    for (int k = 0; k < 4; ++k) {
+        b[at + k] = static_cast<uint8_t>(value >> (24 - 8 * k));
+    }
+}
+
+struct Node {
+    size_t offset;
+    size_t size;
+    size_t header;
+    std::string type;
+    int parent;
+};
+
+// The atoms of the movie's tree down to the sample entries and what they hold.
+void Walk(const Bytes& b, size_t begin, size_t end, int parent, std::vector<Node>& out)
+{
+    for (size_t at = begin; at + 8 <= end;) {
+        uint64_t size = U32At(b, at);
+        size_t header = 8;
+        if (size == 1) {
+            size = uint64_t{U32At(b, at + 8)} << 32 | U32At(b, at + 12);
+            header = 16;
+        } else if (size == 0) {
+            size = end - at;
+        }
+        if (size < header || size > end - at) {
+            return;
+        }
+        const std::string type(b.begin() + static_cast<std::ptrdiff_t>(at + 4), b.begin() + static_cast<std::ptrdiff_t>(at + 8));
+        const int self = static_cast<int>(out.size());
+        out.push_back({at, static_cast<size_t>(size), header, type, parent});
+        size_t inner = 0;
+        if (type == "moov" || type == "trak" || type == "mdia" || type == "minf" || type == "stbl" || type == "wave") {
+            inner = header;
+        } else if (type == "stsd") {
+            inner = header + 8;
+        } else if (parent >= 0 && out[static_cast<size_t>(parent)].type == "stsd" && size >= header + 28) {
+            const unsigned version = b[at + header + 8] << 8 | b[at + header + 9];
+            inner = header + 28 + (version == 1 ? 16 : version == 2 ? 36 : 0);
+        }
+        if (inner != 0 && inner <= size) {
+            Walk(b, at + inner, at + size, self, out);
+        }
+        at += size;
+    }
+}
+
+std::vector<Node> Tree(const Bytes& b)
+{
+    std::vector<Node> nodes;
+    Walk(b, 0, b.size(), -1, nodes);
+    return nodes;
+}
+
+// The first atom of `type` inside the sound track (the one with an "smhd").
+int SoundAtom(const std::vector<Node>& nodes, const std::string& type)
+{
+    int soundTrack = -1;
+    for (const Node& node : nodes) {
+        if (node.type == "smhd") {
+            for (int up = node.parent; up >= 0 && soundTrack < 0; up = nodes[static_cast<size_t>(up)].parent) {
+                soundTrack = nodes[static_cast<size_t>(up)].type == "trak" ? up : -1;
+            }
+            break;
+        }
+    }
+    for (size_t k = 0; k < nodes.size() && soundTrack >= 0; ++k) {
+        int up = nodes[k].parent;
+        while (up >= 0 && up != soundTrack) {
+            up = nodes[static_cast<size_t>(up)].parent;
+        }
+        if (up == soundTrack && nodes[k].type == type) {
+            return static_cast<int>(k);
+        }
+    }
+    return -1;
+}
+
+// Gives atom `index` a new payload; every atom around it grows or shrinks with it. The movie
+// atom must come after the media, so that no chunk moves.
+void ReplacePayload(Bytes& b, const std::vector<Node>& nodes, int index, const Bytes& payload)
+{
+    const Node& node = nodes[static_cast<size_t>(index)];
+    const auto delta = static_cast<int64_t>(payload.size()) - static_cast<int64_t>(node.size - node.header);
+    const auto begin = b.begin() + static_cast<std::ptrdiff_t>(node.offset + node.header);
+    b.erase(begin, begin + static_cast<std::ptrdiff_t>(node.size - node.header));
+    b.insert(b.begin() + static_cast<std::ptrdiff_t>(node.offset + node.header), payload.begin(), payload.end());
+    for (int up = index; up >= 0; up = nodes[static_cast<size_t>(up)].parent) {
+        const Node& around = nodes[static_cast<size_t>(up)];
+        ASSERT_EQ(around.header, 8u) << around.type;
+        PutU32At(b, around.offset, static_cast<uint32_t>(static_cast<int64_t>(around.size) + delta));
+    }
+}
+
+bool MoovIsLast(const std::vector<Node>& nodes)
+{
+    size_t moov = 0;
+    size_t media = 0;
+    for (const Node& node : nodes) {
+        moov = node.parent < 0 && node.type == "moov" ? node.offset : moov;
+        media = node.parent < 0 && node.type == "mdat" ? std::max(media, node.offset) : media;
+    }
+    return moov > media;
+}
+
+// A descriptor list with every size written in `width` bytes (ES and decoder-configuration
+// descriptors hold more descriptors after their fixed fields).
+Bytes Resized(const Bytes& in, size_t at, size_t end, int width)
+{
+    Bytes out;
+    while (at < end) {
+        const uint8_t tag = in[at++];
+        size_t size = 0;
+        for (int k = 0; k < 4; ++k) {
+            const uint8_t byte = in[at++];
+            size = size << 7 | (byte & 0x7F);
+            if ((byte & 0x80) == 0) {
+                break;
+            }
+        }
+        const size_t fixed = tag == 3 ? 3 : tag == 4 ? 13 : size;
+        EXPECT_TRUE(tag != 3 || in[at + 2] == 0) << "ES flags the edit does not expect";
+        Bytes body(in.begin() + static_cast<std::ptrdiff_t>(at), in.begin() + static_cast<std::ptrdiff_t>(at + fixed));
+        const Bytes inner = Resized(in, at + fixed, at + size, width);
+        body.insert(body.end(), inner.begin(), inner.end());
+        out.push_back(tag);
+        for (int k = width - 1; k >= 0; --k) {
+            out.push_back(static_cast<uint8_t>(((body.size() >> (7 * k)) & 0x7F) | (k > 0 ? 0x80 : 0)));
+        }
+        out.insert(out.end(), body.begin(), body.end());
+        at += size;
+    }
+    return out;
+}
+
+std::string Shell(const std::string& command)
+{
+    std::string output;
+    const int status = testsupport::RunCommand(command + " 2>&1", &output);
+    return status == 0 ? "" : output.empty() ? "exit " + std::to_string(status) : output;
+}
+
+// Another muxer's esds: sizes in the two-byte form 80 NN. ffprobe still reads the movie,
+// and the library takes and processes it.
+TEST_F(ApiTest, AacWithTwoByteDescriptorSizes)
+{
+    const std::string source = m_dir.File("aac.mov");
+    ASSERT_EQ(Shell("ffmpeg -v error -nostdin -y -f lavfi -i testsrc=size=64x36:rate=30:d=2 -f lavfi -i "
+                    "\"sine=frequency=700:sample_rate=48000:d=2\" -map 0:v -map 1:a -c:v mjpeg -c:a aac -ac 2 " +
+                    testsupport::ShellQuote(source)),
+              "");
+    Recipe recipe;
+    std::string error;
+    ASSERT_TRUE(moviekit::AddMakerData(source, recipe, 96000, &error)) << error;
+    Bytes movie = testsupport::ReadFile(source);
+    std::vector<Node> nodes = Tree(movie);
+    ASSERT_TRUE(MoovIsLast(nodes));
+    const int esds = SoundAtom(nodes, "esds");
+    ASSERT_GE(esds, 0);
+    const Node& atom = nodes[static_cast<size_t>(esds)];
+    const size_t payload = atom.offset + atom.header;
+    Bytes rewritten(movie.begin() + static_cast<std::ptrdiff_t>(payload), movie.begin() + static_cast<std::ptrdiff_t>(payload + 4));
+    const Bytes descriptors = Resized(movie, payload + 4, atom.offset + atom.size, 2);
+    rewritten.insert(rewritten.end(), descriptors.begin(), descriptors.end());
+    ASSERT_LT(rewritten.size(), atom.size - atom.header) << "the sizes were not written shorter";
+    ASSERT_EQ(rewritten[5], 0x80) << "the ES descriptor's size in two bytes";
+    ReplacePayload(movie, nodes, esds, rewritten);
+    ASSERT_EQ(SoundAtom(Tree(movie), "esds"), esds) << "the edited tree no longer reads";
+    ASSERT_TRUE(testsupport::WriteFile(source, movie));
+    ASSERT_EQ(jobtest::ProbeErrors(source), "");
+    std::vector<int16_t> sound;
+    ASSERT_TRUE(jobtest::DecodeSound(source, sound)) << "ffmpeg no longer decodes the edited movie";
+    ASSERT_FALSE(sound.empty());
+
+    EXPECT_EQ(TqGetPropertyOVIX(source.c_str()), 0);
+    const std::string destination = m_dir.File("processed.mov");
+    ASSERT_EQ(Run(source, destination), 1);
+    EXPECT_EQ(jobtest::ProbeErrors(destination), "");
+    EXPECT_EQ(jobtest::PacketCount(destination, "a:0"), jobtest::PacketCount(source, "a:0"));
+}
+
+// A sound chunk that holds no samples (a muxer's empty interleave slot): the property query's
+// verdict and the job's outcome agree.
+class EmptyChunkTest : public ApiTest, public ::testing::WithParamInterface<moviekit::SoundCodec> {};
+
+TEST_P(EmptyChunkTest, QueryAndJobAgree)
+{
+    Recipe recipe;
+    recipe.sound.codec = GetParam();
+    recipe.video.frameCount = 90;
+    const std::string source = Write(recipe, "src.mov");
+    Bytes movie = testsupport::ReadFile(source);
+    std::vector<Node> nodes = Tree(movie);
+    ASSERT_TRUE(MoovIsLast(nodes));
+    const int stsc = SoundAtom(nodes, "stsc");
+    const int stco = SoundAtom(nodes, "stco");
+    ASSERT_TRUE(stsc >= 0 && stco >= 0);
+    const auto payloadOf = [&](int index) {
+        const Node& node = nodes[static_cast<size_t>(index)];
+        return Bytes(movie.begin() + static_cast<std::ptrdiff_t>(node.offset + node.header),
+                     movie.begin() + static_cast<std::ptrdiff_t>(node.offset + node.size));
+    };
+    const Bytes runs = payloadOf(stsc);
+    const Bytes offsets = payloadOf(stco);
+    const uint32_t chunks = U32At(offsets, 4);
+    ASSERT_GE(chunks, 3u);
+    std::vector<uint32_t> counts(chunks);
+    for (uint32_t r = 0, entries = U32At(runs, 4); r < entries; ++r) {
+        const uint32_t first = U32At(runs, 8 + 12 * r);
+        const uint32_t next = r + 1 < entries ? U32At(runs, 8 + 12 * (r + 1)) : chunks + 1;
+        for (uint32_t c = first; c < next; ++c) {
+            counts[c - 1] = U32At(runs, 8 + 12 * r + 4);
+        }
+    }
+    // An empty chunk between the first and the second, where the second begins.
+    counts.insert(counts.begin() + 1, 0);
+    Bytes newOffsets(8 + 4 * (chunks + 1));
+    PutU32At(newOffsets, 4, chunks + 1);
+    for (uint32_t c = 0; c <= chunks; ++c) {
+        const uint32_t from = c <= 1 ? c : c - 1;
+        PutU32At(newOffsets, 8 + 4 * c, U32At(offsets, 8 + 4 * from));
+    }
+    Bytes newRuns(8);
+    uint32_t entries = 0;
+    for (uint32_t c = 0; c < counts.size(); ++c) {
+        if (c == 0 || counts[c] != counts[c - 1]) {
+            newRuns.resize(newRuns.size() + 12);
+            PutU32At(newRuns, newRuns.size() - 12, c + 1);
+            PutU32At(newRuns, newRuns.size() - 8, counts[c]);
+            PutU32At(newRuns, newRuns.size() - 4, 1);
+            ++entries;
+        }
+    }
+    PutU32At(newRuns, 4, entries);
+    ReplacePayload(movie, nodes, stco, newOffsets);
+    nodes = Tree(movie);  // the atoms around have new sizes
+    ReplacePayload(movie, nodes, SoundAtom(nodes, "stsc"), newRuns);
+    ASSERT_TRUE(testsupport::WriteFile(source, movie));
+
+    const int promised = TqGetPropertyOVIX(source.c_str());
+    const std::string destination = m_dir.File("dst.mov");
+    const int ended = Run(source, destination);
+    EXPECT_EQ(ended, promised == 0 ? 1 : promised) << "the query promised " << promised;
+    // Uncompressed sound passes an empty chunk by; the AAC writer cannot, and the query says so.
+    const bool aac = GetParam() == moviekit::SoundCodec::Aac;
+    EXPECT_EQ(promised, aac ? 8 : 0);
+    if (ended == 1) {
+        EXPECT_EQ(jobtest::ProbeErrors(destination), "");
+        EXPECT_EQ(jobtest::PacketCount(destination, "a:0"), jobtest::PacketCount(source, "a:0"));
+    } else {
+        EXPECT_FALSE(Exists(destination));
+    }
+}
+
+INSTANTIATE_TEST_SUITE_P(Codecs, EmptyChunkTest,
+                         ::testing::Values(moviekit::SoundCodec::Aac, moviekit::SoundCodec::Sowt),
+                         [](const auto& info) { return std::string(info.param == moviekit::SoundCodec::Aac ? "aac" : "sowt"); });
 
 }  // namespace

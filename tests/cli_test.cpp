@@ -18,6 +18,8 @@
 #include <fstream>
 #include <thread>
 
+#include <sys/stat.h>
+
 namespace {
 
 using testsupport::TempDir;
@@ -249,6 +251,28 @@ TEST(CliTest, DestinationReasons)
     EXPECT_EQ(outcome.status, 0) << outcome.output;
     EXPECT_TRUE(Exists(dir.File(longest)));
     EXPECT_EQ(HiddenFiles(dir.Path()), std::vector<std::string>{});
+}
+
+// A FIFO nobody writes and a device are refused at once by check, process and batch, never
+// waited on: each run is ended by `timeout` (status 124) if it blocks.
+TEST(CliTest, NotRegularFilesAreRefusedAtOnce)
+{
+    TempDir dir;
+    const std::string fifo = dir.File("pipe.mov");
+    ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+    for (const std::string& source : {fifo, std::string("/dev/null")}) {
+        const Outcome check = Tool("check " + Q(source), 30);
+        EXPECT_EQ(check.status, 1) << check.output;
+        EXPECT_NE(check.output.find(source + ": not processable: not a regular file"), std::string::npos) << check.output;
+        const Outcome process = Tool("process --json " + Q(source) + " " + Q(dir.File("out.mov")), 30);
+        EXPECT_EQ(process.status, 1) << process.output;
+        EXPECT_NE(process.output.find("\"reason\":\"not-a-regular-file\""), std::string::npos) << process.output;
+        EXPECT_NE(process.output.find("\"result\":110"), std::string::npos) << process.output;
+        EXPECT_FALSE(Exists(dir.File("out.mov")));
+        const Outcome batch = Tool("batch -o " + Q(dir.File("batch")) + " " + Q(source), 30);
+        EXPECT_EQ(batch.status, 1) << batch.output;
+        EXPECT_NE(batch.output.find("not a regular file"), std::string::npos) << batch.output;
+    }
 }
 
 // The keys of every JSON report; each is one valid UTF-8 object even for a name that is not.

@@ -2,7 +2,9 @@
 // code, leave no destination behind and leave the source as it was.
 #include <gtest/gtest.h>
 
+#include <fcntl.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <cerrno>
@@ -11,6 +13,7 @@
 #include <thread>
 
 #include "Movie.h"
+#include "bridge/TqovixCodeTable.h"
 #include "engine/CTqovixMainFrame.h"
 #include "support/TestSupport.h"
 
@@ -94,6 +97,171 @@ TEST_P(FaultTest, EveryFailedOperationEndsTheJobCleanly)
     EXPECT_EQ(survived, total);
     RecordProperty("injected_faults", static_cast<int>(total));
 }
+
+// One operation of a job failed with one error number: the host hears what the error means.
+std::atomic<int> g_operation{-1};
+std::atomic<long> g_occurrence{0};
+
+int FailOneKind(eTqovixFileOperation operation)
+{
+    if (static_cast<int>(operation) != g_operation.load()) {
+        return 0;
+    }
+    return ++g_calls == g_occurrence.load() ? g_errno.load() : 0;
+}
+
+struct OperationRow {
+    const char* name;
+    eTqovixFileOperation operation;
+    long occurrence;  // which call of that operation in the job, from 1
+    int error;
+    bool replacing;   // a file stands at the destination
+    int exported;
+};
+void PrintTo(const OperationRow& row, std::ostream* out) { *out << row.name; }
+
+class OperationFaultTest : public ::testing::TestWithParam<OperationRow> {
+protected:
+    void TearDown() override { CTqovixFile::SetFaultHook(nullptr); }
+};
+
+TEST_P(OperationFaultTest, TheHostHearsWhatTheErrorMeans)
+{
+    const OperationRow& row = GetParam();
+    testsupport::TempDir dir;
+    moviekit::MovieRecipe recipe;
+    recipe.video.frameCount = 20;
+    const std::string source = dir.File("src.mov");
+    const std::string destination = dir.File("dst.mov");
+    std::string error;
+    ASSERT_TRUE(moviekit::WriteMovie(source, recipe, nullptr, &error)) << error;
+    const std::vector<uint8_t> earlier = {'o', 'l', 'd'};
+    if (row.replacing) {
+        ASSERT_TRUE(testsupport::WriteFile(destination, earlier));
+    }
+    g_operation = static_cast<int>(row.operation);
+    g_occurrence = row.occurrence;
+    g_errno = row.error;
+    CTqovixFile::SetFaultHook(FailOneKind);
+    const Outcome outcome = RunJob(source, destination, 0);  // the count restarts: only this kind counts
+    CTqovixFile::SetFaultHook(nullptr);
+    const eTqovixErrorCode code = TqovixFailed(outcome.started) ? outcome.started : outcome.ended;
+    EXPECT_GE(g_calls.load(), row.occurrence) << "the job never reached the operation";
+    EXPECT_EQ(TqovixCodes::Exported(code), row.exported) << code;
+    EXPECT_EQ(testsupport::ReadFile(destination), row.replacing ? earlier : std::vector<uint8_t>{});
+    EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.Path()), {}), row.replacing ? 2 : 1)
+        << "a file left behind";
+}
+
+using Op = eTqovixFileOperation;
+// The source is opened first, the destination second. A job names its destination by a
+// link where the file system has unnamed files, else by renaming its hidden name; a
+// replacing job on unnamed files links a hidden name (the second link) and renames it.
+INSTANTIATE_TEST_SUITE_P(
+    Operations, OperationFaultTest,
+    ::testing::Values(OperationRow{"SourceOpenDenied", Op::Open, 1, EACCES, false, 120},
+                      OperationRow{"SourceOpenIo", Op::Open, 1, EIO, false, 190},
+                      OperationRow{"DestinationOpenNoSpace", Op::Open, 2, ENOSPC, false, 130},
+                      OperationRow{"DestinationOpenQuota", Op::Open, 2, EDQUOT, true, 130},
+                      OperationRow{"DestinationOpenDenied", Op::Open, 2, EACCES, true, 121},
+                      OperationRow{"DestinationOpenReadOnlyVolume", Op::Open, 2, EROFS, false, 121},
+                      OperationRow{"DestinationOpenIo", Op::Open, 2, EIO, false, 190}),
+    [](const ::testing::TestParamInfo<OperationRow>& info) { return std::string(info.param.name); });
+
+// Naming the destination: which call does it depends on the volume, so each row fails every
+// call of its kind and at least one must have been made.
+struct NamingRow {
+    const char* name;
+    eTqovixFileOperation operation;
+    int error;
+    bool replacing;
+    int exported;
+};
+void PrintTo(const NamingRow& row, std::ostream* out) { *out << row.name; }
+
+// Whether the scratch volume takes unnamed files, and /proc is there to name them through.
+bool UnnamedFilesHere()
+{
+    testsupport::TempDir dir;
+    const int descriptor = open(dir.Path().c_str(), O_TMPFILE | O_RDWR | O_CLOEXEC, 0600);
+    if (descriptor >= 0) {
+        close(descriptor);
+    }
+    return descriptor >= 0 && access("/proc/self/fd", X_OK) == 0;
+}
+
+std::atomic<int> g_namingOperation{-1};
+std::atomic<long> g_namingCalls{0};
+
+int FailEveryOfOneKind(eTqovixFileOperation operation)
+{
+    if (static_cast<int>(operation) != g_namingOperation.load()) {
+        return 0;
+    }
+    ++g_namingCalls;
+    return g_errno.load();
+}
+
+class NamingFaultTest : public ::testing::TestWithParam<NamingRow> {
+protected:
+    void TearDown() override
+    {
+        CTqovixFile::SetFaultHook(nullptr);
+        CTqovixFile::SetUnnamedDestinations(true);
+    }
+};
+
+TEST_P(NamingFaultTest, TheHostHearsWhatTheErrorMeansAndTheNameKeepsItsFile)
+{
+    const NamingRow& row = GetParam();
+    bool reached = false;
+    for (const bool unnamed : {true, false}) {
+        CTqovixFile::SetUnnamedDestinations(unnamed);
+        testsupport::TempDir dir;
+        moviekit::MovieRecipe recipe;
+        recipe.video.frameCount = 20;
+        const std::string source = dir.File("src.mov");
+        const std::string destination = dir.File("dst.mov");
+        std::string error;
+        ASSERT_TRUE(moviekit::WriteMovie(source, recipe, nullptr, &error)) << error;
+        const std::vector<uint8_t> earlier = {'o', 'l', 'd'};
+        if (row.replacing) {
+            ASSERT_TRUE(testsupport::WriteFile(destination, earlier));
+        }
+        g_namingOperation = static_cast<int>(row.operation);
+        g_namingCalls = 0;
+        g_errno = row.error;
+        CTqovixFile::SetFaultHook(FailEveryOfOneKind);
+        const Outcome outcome = RunJob(source, destination, 0);
+        CTqovixFile::SetFaultHook(nullptr);
+        const eTqovixErrorCode code = TqovixFailed(outcome.started) ? outcome.started : outcome.ended;
+        const long calls = g_namingCalls.load();
+        if (calls == 0) {
+            // Only one of the two ways names by this operation (a new name on unnamed files takes no rename).
+            EXPECT_EQ(code, eTqovixFinished) << (unnamed ? "unnamed" : "hidden name");
+            continue;
+        }
+        reached = true;
+        EXPECT_EQ(TqovixCodes::Exported(code), row.exported) << (unnamed ? "unnamed: " : "hidden name: ") << code;
+        EXPECT_EQ(testsupport::ReadFile(destination), row.replacing ? earlier : std::vector<uint8_t>{});
+        EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.Path()), {}), row.replacing ? 2 : 1)
+            << "a file left behind";
+    }
+    if (row.operation == Op::Link && !UnnamedFilesHere()) {
+        GTEST_SKIP() << "no unnamed files on this volume: nothing is named by a link";
+    }
+    EXPECT_TRUE(reached) << "no job named its destination by this operation";
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Naming, NamingFaultTest,
+    ::testing::Values(NamingRow{"LinkNoSpace", Op::Link, ENOSPC, false, 130},
+                      NamingRow{"LinkDenied", Op::Link, EACCES, true, 121},
+                      NamingRow{"LinkIo", Op::Link, EIO, false, 190},
+                      NamingRow{"RenameQuota", Op::Rename, EDQUOT, true, 130},
+                      NamingRow{"RenameDenied", Op::Rename, EACCES, true, 121},
+                      NamingRow{"RenameIo", Op::Rename, EIO, false, 190}),
+    [](const ::testing::TestParamInfo<NamingRow>& info) { return std::string(info.param.name); });
 
 INSTANTIATE_TEST_SUITE_P(Codecs, FaultTest,
                          ::testing::Values(moviekit::SoundCodec::Twos, moviekit::SoundCodec::Sowt,

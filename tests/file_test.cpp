@@ -1,8 +1,11 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <climits>
+#include <cstring>
+#include <fcntl.h>
 #include <filesystem>
 #include <grp.h>
 #include <ostream>
@@ -13,6 +16,7 @@
 #include <unistd.h>
 #include <vector>
 
+#include "bridge/TqovixCodeTable.h"
 #include "file/CTqovixFile.h"
 #include "file/CTqovixUtil.h"
 #include "support/TestSupport.h"
@@ -233,30 +237,298 @@ TEST(FileComfirmWritable, ThroughTheVolumeSeamAndForReal)
     EXPECT_EQ(Check(1, 0, "ext4", 1000, temp.File("missing/out.mov").c_str()), eTqovixErrorDestinationNotFound);
 }
 
-TEST(FileConvertErrno, Table)
+// Each error number as the user meets it: the internal code for the source (opened
+// read-only) and the destination, and what a host is told of each.
+struct ErrnoRow {
+    const char* name;
+    int error;
+    int source;
+    int destination;
+    int sourceExported;
+    int destinationExported;
+};
+void PrintTo(const ErrnoRow& row, std::ostream* os) { *os << row.name; }
+
+class FileConvertErrnoTest : public ::testing::TestWithParam<ErrnoRow> {};
+
+TEST_P(FileConvertErrnoTest, SourceAndDestinationCodes)
 {
-    // Code for the source, for the destination, and the error numbers converted to them.
-    const std::tuple<int, int, std::vector<int>> rows[] = {
-        {eTqovixErrorSourceAccessDenied, eTqovixErrorDestinationAccessDenied, {EPERM, EACCES}},
-        {eTqovixErrorSourceNotFound, eTqovixErrorDestinationNotFound, {ENOENT}},
-        {eTqovixErrorOutOfMemory, eTqovixErrorOutOfMemory, {ENOMEM}},
-        {eTqovixErrorDiskFull, eTqovixErrorDiskFull, {ENOSPC}},
-        {eTqovixErrorFileExists, eTqovixErrorFileExists, {EEXIST}},
-        {eTqovixErrorTooManyFiles, eTqovixErrorTooManyFiles, {ENFILE, EMFILE}},
-        {eTqovixErrorIsDirectory, eTqovixErrorIsDirectory, {EISDIR}},
-        {eTqovixErrorInvalidArgument, eTqovixErrorInvalidArgument, {EINVAL, ESPIPE, EROFS, ENAMETOOLONG}},
-        {eTqovixErrorFileTooLarge, eTqovixErrorFileTooLarge, {EFBIG}},
-        {eTqovixErrorDevice, eTqovixErrorDevice, {ENXIO, EBUSY, EXDEV, ENODEV}},
+    const ErrnoRow& row = GetParam();
+    const eTqovixErrorCode source = CTqovixFile::ConvertErrnoToLocalError(row.error, true);
+    const eTqovixErrorCode destination = CTqovixFile::ConvertErrnoToLocalError(row.error, false);
+    EXPECT_EQ(source, row.source);
+    EXPECT_EQ(destination, row.destination);
+    EXPECT_EQ(TqovixCodes::Exported(source), row.sourceExported);
+    EXPECT_EQ(TqovixCodes::Exported(destination), row.destinationExported);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Errno, FileConvertErrnoTest,
+    ::testing::Values(
+        ErrnoRow{"Eperm", EPERM, eTqovixErrorSourceAccessDenied, eTqovixErrorDestinationAccessDenied, 120, 121},
+        ErrnoRow{"Eacces", EACCES, eTqovixErrorSourceAccessDenied, eTqovixErrorDestinationAccessDenied, 120, 121},
+        // Only opening for writing meets these: whichever side asked, the destination cannot be written.
+        ErrnoRow{"ReadOnlyVolume", EROFS, eTqovixErrorDestinationAccessDenied, eTqovixErrorDestinationAccessDenied, 121, 121},
+        ErrnoRow{"RunningProgram", ETXTBSY, eTqovixErrorDestinationAccessDenied, eTqovixErrorDestinationAccessDenied, 121, 121},
+        ErrnoRow{"Enoent", ENOENT, eTqovixErrorSourceNotFound, eTqovixErrorDestinationNotFound, 110, 111},
+        // A name that cannot be reached is not found as a source and cannot be created as a destination.
+        ErrnoRow{"NotADirectoryOnTheWay", ENOTDIR, eTqovixErrorSourceNotFound, eTqovixErrorDestinationNotFound, 110, 111},
+        ErrnoRow{"NameTooLong", ENAMETOOLONG, eTqovixErrorSourceNotFound, eTqovixErrorDestinationNotFound, 110, 111},
+        ErrnoRow{"LinkLoop", ELOOP, eTqovixErrorSourceNotFound, eTqovixErrorDestinationNotFound, 110, 111},
+        ErrnoRow{"Enomem", ENOMEM, eTqovixErrorOutOfMemory, eTqovixErrorOutOfMemory, 100, 100},
+        ErrnoRow{"Enospc", ENOSPC, eTqovixErrorDiskFull, eTqovixErrorDiskFull, 130, 130},
+        ErrnoRow{"QuotaIsAFullDisk", EDQUOT, eTqovixErrorDiskFull, eTqovixErrorDiskFull, 130, 130},
+        ErrnoRow{"Efbig", EFBIG, eTqovixErrorFileTooLarge, eTqovixErrorFileTooLarge, 131, 131},
+        // The tool names a directory for what it is; hosts hear the general code, as for the
+        // directories the file layer refuses before asking the system.
+        ErrnoRow{"Eisdir", EISDIR, eTqovixErrorIsDirectory, eTqovixErrorIsDirectory, 190, 190},
+        ErrnoRow{"Eexist", EEXIST, eTqovixErrorFileExists, eTqovixErrorFileExists, 190, 190},
+        ErrnoRow{"Enfile", ENFILE, eTqovixErrorTooManyFiles, eTqovixErrorTooManyFiles, 190, 190},
+        ErrnoRow{"Emfile", EMFILE, eTqovixErrorTooManyFiles, eTqovixErrorTooManyFiles, 190, 190},
+        ErrnoRow{"Einval", EINVAL, eTqovixErrorInvalidArgument, eTqovixErrorInvalidArgument, 190, 190},
+        ErrnoRow{"Espipe", ESPIPE, eTqovixErrorInvalidArgument, eTqovixErrorInvalidArgument, 190, 190},
+        ErrnoRow{"Eoverflow", EOVERFLOW, eTqovixErrorInvalidArgument, eTqovixErrorInvalidArgument, 190, 190},
+        ErrnoRow{"Enxio", ENXIO, eTqovixErrorDevice, eTqovixErrorDevice, 190, 190},
+        ErrnoRow{"Ebusy", EBUSY, eTqovixErrorDevice, eTqovixErrorDevice, 190, 190},
+        ErrnoRow{"Exdev", EXDEV, eTqovixErrorDevice, eTqovixErrorDevice, 190, 190},
+        ErrnoRow{"Enodev", ENODEV, eTqovixErrorDevice, eTqovixErrorDevice, 190, 190},
+        ErrnoRow{"Eio", EIO, eTqovixErrorGeneral, eTqovixErrorGeneral, 190, 190},
+        ErrnoRow{"Eagain", EAGAIN, eTqovixErrorGeneral, eTqovixErrorGeneral, 190, 190},
         // EHWPOISON is the highest error number Linux defines.
-        {eTqovixErrorGeneral, eTqovixErrorGeneral, {EIO, EAGAIN, EHWPOISON}},
-        {eTqovixErrorInternal, eTqovixErrorInternal, {ENOTEMPTY, EHWPOISON + 1, 0, -1, INT_MIN}},
-    };
-    for (const auto& [source, destination, errors] : rows) {
-        for (const int error : errors) {
-            EXPECT_EQ(CTqovixFile::ConvertErrnoToLocalError(error, true), source) << error;
-            EXPECT_EQ(CTqovixFile::ConvertErrnoToLocalError(error, false), destination) << error;
-        }
+        ErrnoRow{"HighestErrno", EHWPOISON, eTqovixErrorGeneral, eTqovixErrorGeneral, 190, 190},
+        ErrnoRow{"Enotempty", ENOTEMPTY, eTqovixErrorInternal, eTqovixErrorInternal, 190, 190},
+        ErrnoRow{"PastTheHighest", EHWPOISON + 1, eTqovixErrorInternal, eTqovixErrorInternal, 190, 190},
+        ErrnoRow{"Zero", 0, eTqovixErrorInternal, eTqovixErrorInternal, 190, 190},
+        ErrnoRow{"Negative", -1, eTqovixErrorInternal, eTqovixErrorInternal, 190, 190},
+        ErrnoRow{"IntMin", INT_MIN, eTqovixErrorInternal, eTqovixErrorInternal, 190, 190}),
+    [](const ::testing::TestParamInfo<ErrnoRow>& info) { return std::string(info.param.name); });
+
+// ---- Opening the destination and giving it its name, each step failed through the seam ----
+
+std::atomic<int> g_faultOperation{-1};
+std::atomic<int> g_faultOccurrence{0};
+std::atomic<int> g_faultErrno{0};
+std::atomic<int> g_faultSeen{0};
+
+int FailOneOperation(eTqovixFileOperation operation)
+{
+    if (static_cast<int>(operation) != g_faultOperation.load()) {
+        return 0;
     }
+    return ++g_faultSeen == g_faultOccurrence.load() ? g_faultErrno.load() : 0;
+}
+
+// Whether `directory` takes unnamed files, and /proc is there to name them through.
+bool UnnamedFilesIn(const std::string& directory)
+{
+    const int descriptor = open(directory.c_str(), O_TMPFILE | O_RDWR | O_CLOEXEC, 0600);
+    if (descriptor >= 0) {
+        close(descriptor);
+    }
+    return descriptor >= 0 && access("/proc/self/fd", X_OK) == 0;
+}
+
+std::vector<std::string> Entries(const std::string& directory)
+{
+    std::vector<std::string> names;
+    for (const fs::directory_entry& entry : fs::directory_iterator(directory)) {
+        names.push_back(entry.path().filename().string());
+    }
+    std::sort(names.begin(), names.end());
+    return names;
+}
+
+struct PublishFaultRow {
+    const char* name;
+    eTqovixFileOperation operation;
+    int occurrence;  // which call of that operation fails, from 1
+    int error;
+    bool replacing;  // a file stands at the destination's name
+    bool unnamed;    // unnamed destinations, or the hidden-name fallback
+    bool durable;
+    int exported;    // what a host is told
+    bool named;      // the new file has its name all the same (only past the rename)
+};
+void PrintTo(const PublishFaultRow& row, std::ostream* os) { *os << row.name; }
+
+class PublishFaultTest : public ::testing::TestWithParam<PublishFaultRow> {
+protected:
+    void TearDown() override
+    {
+        CTqovixFile::SetFaultHook(nullptr);
+        CTqovixFile::SetUnnamedDestinations(true);
+    }
+};
+
+TEST_P(PublishFaultTest, TheErrorComesBackAndTheNameKeepsWhatItHeld)
+{
+    const PublishFaultRow& row = GetParam();
+    TempDir temp;
+    if (row.unnamed && !UnnamedFilesIn(temp.Path())) {
+        GTEST_SKIP() << "no unnamed files on this volume";
+    }
+    CTqovixFile::SetUnnamedDestinations(row.unnamed);
+    const std::string destination = temp.File("dst.mov");
+    const std::vector<uint8_t> earlier = Pattern(10, 3);
+    const std::vector<uint8_t> written = Pattern(5000, 8);
+    if (row.replacing) {
+        ASSERT_TRUE(testsupport::WriteFile(destination, earlier));
+    }
+    g_faultOperation = static_cast<int>(row.operation);
+    g_faultOccurrence = row.occurrence;
+    g_faultErrno = row.error;
+    g_faultSeen = 0;
+    CTqovixFile::SetFaultHook(FailOneOperation);
+    CTqovixFile file;
+    eTqovixErrorCode result = file.OpenDestination(destination.c_str());
+    if (!TqovixFailed(result)) {
+        EXPECT_EQ(file.Write(written.data(), static_cast<unsigned int>(written.size())), eTqovixSuccess);
+        result = file.Publish(row.durable);
+    }
+    file.Close();
+    CTqovixFile::SetFaultHook(nullptr);
+    EXPECT_GE(g_faultSeen.load(), row.occurrence) << "the operation was never reached";
+    EXPECT_TRUE(TqovixFailed(result)) << result;
+    EXPECT_EQ(TqovixCodes::Exported(result), row.exported) << result;
+    const bool present = row.named || row.replacing;
+    EXPECT_EQ(Entries(temp.Path()), present ? std::vector<std::string>{"dst.mov"} : std::vector<std::string>{});
+    if (present) {
+        EXPECT_EQ(testsupport::ReadFile(destination), row.named ? written : earlier);
+    }
+}
+
+using Op = eTqovixFileOperation;
+INSTANTIATE_TEST_SUITE_P(
+    Seam, PublishFaultTest,
+    ::testing::Values(
+        PublishFaultRow{"OpenNoSpace", Op::Open, 1, ENOSPC, false, true, false, 130, false},
+        PublishFaultRow{"OpenDenied", Op::Open, 1, EACCES, true, true, false, 121, false},
+        PublishFaultRow{"OpenReadOnlyVolume", Op::Open, 1, EROFS, false, false, false, 121, false},
+        PublishFaultRow{"OpenIo", Op::Open, 1, EIO, true, false, false, 190, false},
+        PublishFaultRow{"LinkNewNameQuota", Op::Link, 1, EDQUOT, false, true, false, 130, false},
+        PublishFaultRow{"LinkNewNameIo", Op::Link, 1, EIO, false, true, false, 190, false},
+        // Replacing: the first link finds the name taken, the second gives the hidden name.
+        PublishFaultRow{"LinkHiddenNameDenied", Op::Link, 2, EACCES, true, true, false, 121, false},
+        PublishFaultRow{"RenameOverTheOldNoSpace", Op::Rename, 1, ENOSPC, true, true, false, 130, false},
+        PublishFaultRow{"RenameFromPartialDenied", Op::Rename, 1, EACCES, false, false, false, 121, false},
+        PublishFaultRow{"RenameFromPartialIo", Op::Rename, 1, EIO, true, false, false, 190, false},
+        PublishFaultRow{"SyncDataIo", Op::Sync, 1, EIO, true, true, true, 190, false},
+        PublishFaultRow{"SyncDataNoSpace", Op::Sync, 1, ENOSPC, false, false, true, 130, false},
+        // The directory is synced once the name is given: the error still reaches the caller.
+        PublishFaultRow{"SyncDirectoryIo", Op::Sync, 2, EIO, true, true, true, 190, true}),
+    [](const ::testing::TestParamInfo<PublishFaultRow>& info) { return std::string(info.param.name); });
+
+// ---- Names near the file system's limit of 255 bytes ----
+
+struct LongNameRow {
+    const char* name;
+    bool unnamed;
+    bool replacing;
+};
+void PrintTo(const LongNameRow& row, std::ostream* os) { *os << row.name; }
+
+class LongNameTest : public ::testing::TestWithParam<LongNameRow> {
+protected:
+    void TearDown() override { CTqovixFile::SetUnnamedDestinations(true); }
+};
+
+// The hidden name a destination is written or swapped under must fit where its own name does,
+// and stay one the stale-partial cleaner recognises.
+TEST_P(LongNameTest, DestinationOf250BytesIsWrittenAndReplaced)
+{
+    const LongNameRow& row = GetParam();
+    TempDir temp;
+    if (row.unnamed && !UnnamedFilesIn(temp.Path())) {
+        GTEST_SKIP() << "no unnamed files on this volume";
+    }
+    CTqovixFile::SetUnnamedDestinations(row.unnamed);
+    // Multi-byte characters across the cut: the hidden name must not end in half of one.
+    std::string name;
+    while (name.size() < 246) {
+        name += "\xc3\xa9";
+    }
+    name.resize(246);
+    name += ".mov";
+    ASSERT_EQ(name.size(), 250u);
+    const std::string destination = temp.File(name);
+    const std::vector<uint8_t> written = Pattern(3000, 4);
+    if (row.replacing) {
+        ASSERT_TRUE(testsupport::WriteFile(destination, Pattern(10, 1)));
+    }
+    CTqovixFile file;
+    ASSERT_EQ(file.OpenDestination(destination.c_str()), eTqovixSuccess);
+    if (!row.unnamed) {
+        const std::vector<std::string> names = Entries(temp.Path());
+        ASSERT_EQ(names.size(), row.replacing ? 2u : 1u);
+        const std::string& hidden = names.front() == name ? names.back() : names.front();
+        EXPECT_LE(hidden.size(), 255u);
+        ASSERT_TRUE(hidden.starts_with(".") && hidden.ends_with(CTqovixFile::kPartialSuffix)) << hidden;
+        // ".PREFIX.PID-N" before the suffix: PREFIX is a whole-character start of the name.
+        const std::string stem = hidden.substr(0, hidden.size() - std::strlen(CTqovixFile::kPartialSuffix));
+        const std::string prefix = stem.substr(1, stem.rfind('.') - 1);
+        EXPECT_GE(prefix.size(), 100u) << hidden;
+        EXPECT_TRUE(name.starts_with(prefix)) << hidden;
+        EXPECT_NE(static_cast<unsigned char>(name[prefix.size()]) & 0xC0, 0x80) << "a character cut in half";
+    }
+    ASSERT_EQ(file.Write(written.data(), static_cast<unsigned int>(written.size())), eTqovixSuccess);
+    EXPECT_EQ(file.Publish(false), eTqovixSuccess);
+    file.Close();
+    EXPECT_EQ(Entries(temp.Path()), std::vector<std::string>{name});
+    EXPECT_EQ(testsupport::ReadFile(destination), written);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Names, LongNameTest,
+    ::testing::Values(LongNameRow{"UnnamedNew", true, false}, LongNameRow{"UnnamedReplacing", true, true},
+                      LongNameRow{"HiddenNew", false, false}, LongNameRow{"HiddenReplacing", false, true}),
+    [](const ::testing::TestParamInfo<LongNameRow>& info) { return std::string(info.param.name); });
+
+// ---- Sources that are not regular files ----
+
+// Opens `path` as a source in a child that an alarm ends if the open blocks; the code, or -1
+// when it blocked.
+int OpenSourceWithWatchdog(const std::string& path)
+{
+    int channel[2] = {-1, -1};
+    if (pipe(channel) != 0) {
+        return -2;
+    }
+    const pid_t child = fork();
+    if (child == 0) {
+        alarm(10);
+        CTqovixFile file;
+        const int code = file.Open(path.c_str(), 1);
+        _exit(write(channel[1], &code, sizeof code) == sizeof code ? 0 : 1);
+    }
+    close(channel[1]);
+    int code = -1;
+    if (read(channel[0], &code, sizeof code) != static_cast<ssize_t>(sizeof code)) {
+        code = -1;
+    }
+    close(channel[0]);
+    int status = 0;
+    waitpid(child, &status, 0);
+    return code;
+}
+
+TEST(FileOpen, SourcesThatAreNotRegularFilesAreRefusedAtOnce)
+{
+    TempDir temp;
+    const std::string fifo = temp.File("pipe.mov");
+    ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+    // No writer ever comes: an open that waits for one is ended by the watchdog.
+    EXPECT_EQ(OpenSourceWithWatchdog(fifo), eTqovixErrorSourceNotFound) << "-1: the open blocked";
+    EXPECT_EQ(OpenSourceWithWatchdog("/dev/null"), eTqovixErrorSourceNotFound);
+    EXPECT_EQ(OpenSourceWithWatchdog("/dev/zero"), eTqovixErrorSourceNotFound);
+    // A regular file still opens, and reads without blocking rules left on it.
+    const std::string movie = temp.File("movie.mov");
+    ASSERT_TRUE(testsupport::WriteFile(movie, Pattern(100, 2)));
+    CTqovixFile file;
+    ASSERT_EQ(file.Open(movie.c_str(), 1), eTqovixSuccess);
+    EXPECT_EQ(ReadSome(file, 200), Pattern(100, 2));
+    // Devices stay usable as destinations opened for writing.
+    CTqovixFile sink;
+    EXPECT_EQ(sink.Open("/dev/null", 2), eTqovixSuccess);
 }
 
 // What the user may not write is the destination's problem, a deletion included. Run as

@@ -145,6 +145,23 @@ std::string Esds(const Bytes& children)
 const Bytes kEsdsPayload = {0, 0, 0, 0, 3, 22, 0, 1, 0, 4, 17, 0x40, 0x15, 0, 0, 0, 0, 0, 0, 1,
                             0, 0, 0, 2, 5, 2, 0x11, 0x90};
 
+// A descriptor whose size takes `width` bytes, seven bits each, the high bit saying "more".
+Bytes Descriptor(uint8_t tag, const Bytes& body, int width)
+{
+    Bytes out = {tag};
+    for (int k = width - 1; k >= 0; --k) {
+        out.push_back(static_cast<uint8_t>(((body.size() >> (7 * k)) & 0x7F) | (k > 0 ? 0x80 : 0)));
+    }
+    return moviekit::Concat({out, body});
+}
+
+// The esds payload above with every size `width` bytes long and `info` as the decoder's information.
+Bytes EsdsSized(int width, const Bytes& info = {0x11, 0x90})
+{
+    const Bytes config = moviekit::Concat({Bytes{0x40, 0x15, 0, 0, 0, 0, 0, 0, 1, 0, 0, 0, 2}, Descriptor(5, info, width)});
+    return moviekit::Concat({Bytes(4, 0), Descriptor(3, moviekit::Concat({Bytes{0, 1, 0}, Descriptor(4, config, width)}), width)});
+}
+
 class TypedReaderTest : public ::testing::TestWithParam<ReaderRow> {};
 
 TEST_P(TypedReaderTest, ReadsWhatThePayloadHoldsOrRefuses)
@@ -182,7 +199,18 @@ INSTANTIATE_TEST_SUITE_P(
         ReaderRow{"EsdsInsideWave", [] { return Esds(Container("wave", {Atom("frma", Text("mp4a")), Atom("esds", kEsdsPayload), Bytes(8, 0)})); }, "rate 2 config 2"},
         // Bytes that spell "esds" inside another child are no decoder configuration.
         ReaderRow{"EsdsSpelledInsideAnotherAtom", [] { return Esds(Atom("btrt", moviekit::Concat({Bytes{0, 0, 0, 20}, Text("esds"), kEsdsPayload}))); }, "none"},
-        ReaderRow{"EsdsTwoByteSize", [] { Bytes p = kEsdsPayload; p[5] = 0x81; return Esds(Atom("esds", p)); }, "refused"},
+        // A size may take one to four bytes; the short forms are as legal as the long one.
+        ReaderRow{"EsdsSizeOneByte", [] { return Esds(Atom("esds", EsdsSized(1))); }, "rate 2 config 2"},
+        ReaderRow{"EsdsSizeTwoBytes", [] { return Esds(Atom("esds", EsdsSized(2))); }, "rate 2 config 2"},
+        ReaderRow{"EsdsSizeThreeBytes", [] { return Esds(Atom("esds", EsdsSized(3))); }, "rate 2 config 2"},
+        ReaderRow{"EsdsSizeFourBytes", [] { return Esds(Atom("esds", EsdsSized(4))); }, "rate 2 config 2"},
+        ReaderRow{"EsdsSizeFiveBytes", [] { return Esds(Atom("esds", EsdsSized(5))); }, "refused"},
+        // Sizes above 127 need the high bits: 200 bytes of information in two-byte sizes.
+        ReaderRow{"EsdsSizeValueInTwoBytes", [] { return Esds(Atom("esds", EsdsSized(2, Bytes(200, 0x11)))); }, "rate 2 config 200"},
+        ReaderRow{"EsdsSizeValueInThreeBytes", [] { return Esds(Atom("esds", EsdsSized(3, Bytes(20000, 0x11)))); }, "rate 2 config 20000"},
+        // A continuation bit on the last byte the payload holds: the size never ends.
+        ReaderRow{"EsdsSizeCutShort", [] { return Esds(Atom("esds", Bytes{0, 0, 0, 0, 3, 0x80, 0x80})); }, "refused"},
+        ReaderRow{"EsdsSizePastThePayload", [] { Bytes p = kEsdsPayload; p[5] = 0x81; return Esds(Atom("esds", p)); }, "refused"},
         ReaderRow{"EsdsProfileAfterConfig", [] { Bytes p = kEsdsPayload; p[5] += 2; p[10] += 2; p.insert(p.end(), {6, 0}); return Esds(Atom("esds", p)); }, "refused"},
         ReaderRow{"EsdsDescriptorPastItsParent", [] { Bytes p = kEsdsPayload; p[10] += 1; return Esds(Atom("esds", p)); }, "refused"}),
     [](const ::testing::TestParamInfo<ReaderRow>& info) { return std::string(info.param.name); });
@@ -235,6 +263,8 @@ INSTANTIATE_TEST_SUITE_P(
         ChunkRow{"CommonSizeNeitherOneNorAFrame", {{1, 1024}}, ta::SampleSizes{2, 0, {}}, 2, 4, {}},
         ChunkRow{"CompressedCommonSize", {{1, 3}}, ta::SampleSizes{7, 0, {}}, 1, 0, {21}},
         ChunkRow{"SampleSizeList", {{1, 2}}, ta::SampleSizes{0, 4, {5, 6, 7, 8}}, 2, 0, {11, 15}},
+        // An empty chunk keeps its place, so rewritten offsets still line up with the table.
+        ChunkRow{"ChunkWithoutSamples", {{1, 3}, {2, 0}, {3, 2}}, kOne, 4, 4, {12, 0, 8, 8}},
         ChunkRow{"FirstChunkNotOne", {{2, 3}}, kOne, 6, 4, {}},
         ChunkRow{"RunRepeatsItsFirstChunk", {{1, 3}, {1, 2}}, kOne, 6, 4, {}},
         ChunkRow{"RunPastTheChunks", {{1, 3}, {9, 2}}, kOne, 6, 4, {}},

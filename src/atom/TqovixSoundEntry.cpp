@@ -16,25 +16,23 @@ constexpr eTqovixAtomType kWave = TqovixMakeAtomType("wave");
 // A "wave" holds a handful of small atoms; nesting deeper than this is not a sound description.
 constexpr int kMaxWaveDepth = 2;
 
+// Seven bits a byte, the high bit saying another follows; writers pad to any width up to four.
+constexpr int kMaxDescriptorSizeBytes = 4;
+
 bool ReadDescriptorSize(TqovixByteReader& reader, uint32_t& size)
 {
-    uint8_t first = 0;
-    if (!reader.U8(first)) {
-        return false;
+    size = 0;
+    for (int k = 0; k < kMaxDescriptorSizeBytes; ++k) {
+        uint8_t byte = 0;
+        if (!reader.U8(byte)) {
+            return false;
+        }
+        size = (size << 7) | (byte & 0x7F);
+        if ((byte & 0x80) == 0) {
+            return true;
+        }
     }
-    if (first < 0x80) {
-        size = first;
-        return true;
-    }
-    uint8_t second = 0;
-    uint8_t third = 0;
-    uint8_t last = 0;
-    if (first != 0x80 || !reader.U8(second) || !reader.U8(third) || !reader.U8(last) || second != 0x80 ||
-        third != 0x80 || last >= 0x80) {
-        return false;
-    }
-    size = last;
-    return true;
+    return false;  // a fifth byte: no writer makes one, and 28 bits already pass any atom here
 }
 
 // One tag-size-body descriptor; the body must fit what holds it.

@@ -51,8 +51,8 @@ struct DecoderConfig {
 // The payload of the "esds" atom among `children` (or inside a "wave" child).
 std::optional<std::span<const uint8_t>> FindEsds(std::span<const uint8_t> children);
 
-// An "esds" payload from its version and flags on. Descriptor sizes are read in the
-// one-byte form and the four-byte form 0x80 0x80 0x80 n.
+// An "esds" payload from its version and flags on. Descriptor sizes are read in every
+// form from one to four bytes.
 std::optional<DecoderConfig> ParseEsds(std::span<const uint8_t> esds);
 
 }  // namespace TqovixSoundEntry

@@ -1,20 +1,19 @@
+// Streams, volume checks and error numbers (publishing: CTqovixFilePublish.cpp; kernel copy: CTqovixFileCopy.cpp).
 // Movies larger than 4 GiB are the norm, so positions must never pass through a 32-bit off_t.
 #ifndef _FILE_OFFSET_BITS
 #define _FILE_OFFSET_BITS 64
 #endif
 
 #include "file/CTqovixFile.h"
+#include "file/TqovixFileInternal.h"
 
-#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <cstring>
 #include <new>
 #include <fcntl.h>
 #include <libgen.h>
-#include <linux/fs.h>
 #include <linux/magic.h>
-#include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <sys/statfs.h>
 #include <sys/types.h>
@@ -22,6 +21,9 @@
 #include <vector>
 
 static_assert(sizeof(off_t) == 8, "file positions must be 64-bit");
+
+using TqovixFileInternal::InjectedFault;
+using TqovixFileInternal::IsEmptyPath;
 
 namespace {
 
@@ -72,38 +74,18 @@ const char* FileSystemTypeName(uint32_t magic)
 std::atomic<TqovixVolumeQuery> g_volumeQuery{&CTqovixFile::QueryVolume};
 std::atomic<TqovixFaultHook> g_faultHook{nullptr};
 
-std::atomic<bool> g_bUnnamedDestinations{true};
-
-std::string DirectoryOf(const std::string& path)
-{
-    const size_t slash = path.rfind('/');
-    return slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
-}
-
-// ".NAME.PID-N.tqovix-partial" beside `path`: hidden, and plainly ours.
-std::string PartialNameFor(const std::string& path)
-{
-    static std::atomic<unsigned> s_counter{0};
-    const size_t slash = path.rfind('/');
-    const std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
-    return DirectoryOf(path) + "/." + name + "." + std::to_string(getpid()) + "-" + std::to_string(++s_counter) +
-           CTqovixFile::kPartialSuffix;
-}
-
-int InjectedFault(eTqovixFileOperation operation)
-{
-    const TqovixFaultHook hook = g_faultHook.load(std::memory_order_relaxed);
-    return hook == nullptr ? 0 : hook(operation);
-}
-
 // A 4 GiB file cannot exist on FAT: its size field is 32 bits wide.
 constexpr double kMsdosLargestFile = 4294967295.0;
 
 constexpr size_t kStreamBuffer = 256 * 1024;
 
-bool IsEmptyPath(const char* path) { return path == nullptr || path[0] == '\0'; }
-
 }  // namespace
+
+int TqovixFileInternal::InjectedFault(eTqovixFileOperation operation)
+{
+    const TqovixFaultHook hook = g_faultHook.load(std::memory_order_relaxed);
+    return hook == nullptr ? 0 : hook(operation);
+}
 
 CTqovixFile::~CTqovixFile()
 {
@@ -123,27 +105,57 @@ eTqovixErrorCode CTqovixFile::Open(const char* path, int mode)
         return mode == 2 ? eTqovixErrorGeneral : eTqovixErrorInternal;
     }
 
-    // "e" keeps the descriptor out of processes a host may spawn while a job runs.
-    const char* streamMode = "w+e";
     if (mode == 1) {
         if (access(path, R_OK) != 0) {
             return ConvertErrnoToLocalError(errno, m_bReadOnly);
         }
-        // fopen accepts a directory for reading and only the first read would fail. stat, not
-        // chdir: the host's working directory is not ours to move.
-        struct stat status {};
-        if (stat(path, &status) == 0 && S_ISDIR(status.st_mode)) {
-            return eTqovixErrorIsDirectory;
-        }
-        streamMode = "re";
         m_bReadOnly = true;
-    } else {
-        m_bReadOnly = false;
+        return OpenSource(path);
     }
-
-    FILE* stream = std::fopen(path, streamMode);
+    m_bReadOnly = false;
+    if (const int fault = InjectedFault(eTqovixFileOperation::Open)) {
+        return ConvertErrnoToLocalError(fault, m_bReadOnly);
+    }
+    // "e" keeps the descriptor out of processes a host may spawn while a job runs.
+    FILE* stream = std::fopen(path, "w+e");
     if (stream == nullptr) {
         return ConvertErrnoToLocalError(errno, m_bReadOnly);
+    }
+    Adopt(stream);
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixFile::OpenSource(const char* path)
+{
+    if (const int fault = InjectedFault(eTqovixFileOperation::Open)) {
+        return ConvertErrnoToLocalError(fault, true);
+    }
+    // Opening a FIFO waits for a writer that may never come, and a device reads forever or
+    // not at all: without O_NONBLOCK the open returns at once whatever the path names, and
+    // what it names is looked at on the descriptor itself, not through a second lookup.
+    const int descriptor = open(path, O_RDONLY | O_NONBLOCK | O_CLOEXEC);
+    if (descriptor < 0) {
+        return ConvertErrnoToLocalError(errno, true);
+    }
+    struct stat status {};
+    eTqovixErrorCode refusal = eTqovixSuccess;
+    if (fstat(descriptor, &status) != 0) {
+        refusal = ConvertErrnoToLocalError(errno, true);
+    } else if (S_ISDIR(status.st_mode)) {
+        refusal = eTqovixErrorIsDirectory;
+    } else if (!S_ISREG(status.st_mode)) {
+        refusal = eTqovixErrorSourceNotFound;  // not a file to read a movie from
+    } else {
+        const int flags = fcntl(descriptor, F_GETFL);
+        if (flags < 0 || fcntl(descriptor, F_SETFL, flags & ~O_NONBLOCK) != 0) {
+            refusal = ConvertErrnoToLocalError(errno, true);
+        }
+    }
+    FILE* stream = TqovixFailed(refusal) ? nullptr : fdopen(descriptor, "r");
+    if (stream == nullptr) {
+        const int error = errno;
+        close(descriptor);
+        return TqovixFailed(refusal) ? refusal : ConvertErrnoToLocalError(error, true);
     }
     Adopt(stream);
     return eTqovixSuccess;
@@ -181,99 +193,6 @@ void CTqovixFile::Close()
     m_bOpened = false;
 }
 
-eTqovixErrorCode CTqovixFile::OpenDestination(const char* path)
-{
-    if (m_bOpened) {
-        return eTqovixErrorInternal;
-    }
-    if (IsEmptyPath(path)) {
-        return eTqovixErrorGeneral;
-    }
-    const std::string finalPath = path;
-    struct stat status {};
-    if (stat(path, &status) == 0 && S_ISDIR(status.st_mode)) {
-        return eTqovixErrorIsDirectory;
-    }
-    int descriptor = -1;
-    // Unnamed files are named through /proc, which a container may lack.
-    if (g_bUnnamedDestinations.load() && access("/proc/self/fd", X_OK) == 0) {
-        descriptor = open(DirectoryOf(finalPath).c_str(), O_TMPFILE | O_RDWR | O_CLOEXEC, 0666);
-    }
-    std::string partial;
-    if (descriptor < 0) {
-        // No unnamed files here (or not wanted): a hidden name that says what it is.
-        partial = PartialNameFor(finalPath);
-        descriptor = open(partial.c_str(), O_CREAT | O_EXCL | O_RDWR | O_CLOEXEC, 0666);
-        if (descriptor < 0) {
-            return ConvertErrnoToLocalError(errno, false);
-        }
-    }
-    FILE* stream = fdopen(descriptor, "w+");
-    if (stream == nullptr) {
-        const int error = errno;
-        close(descriptor);
-        if (!partial.empty()) {
-            unlink(partial.c_str());
-        }
-        return ConvertErrnoToLocalError(error, false);
-    }
-    Adopt(stream);
-    m_bReadOnly = false;
-    m_finalPath = finalPath;
-    m_partialPath = partial;
-    m_bUnpublished = true;
-    return eTqovixSuccess;
-}
-
-eTqovixErrorCode CTqovixFile::Publish(bool durable)
-{
-    if (!m_bUnpublished || m_stream == nullptr) {
-        return eTqovixErrorInternal;
-    }
-    eTqovixErrorCode result = Flush();
-    if (TqovixFailed(result)) {
-        return result;
-    }
-    const int descriptor = fileno(m_stream);
-    if (durable && fsync(descriptor) != 0) {
-        return ConvertErrnoToLocalError(errno, false);
-    }
-    bool named = false;
-    if (m_partialPath.empty()) {
-        const std::string self = "/proc/self/fd/" + std::to_string(descriptor);
-        // A free name is given in one step; a name taken can only be replaced by rename, so the
-        // file gets a hidden name first (a complete movie, left only if killed between the two).
-        named = linkat(AT_FDCWD, self.c_str(), AT_FDCWD, m_finalPath.c_str(), AT_SYMLINK_FOLLOW) == 0;
-        if (!named && errno != EEXIST) {
-            return ConvertErrnoToLocalError(errno, false);
-        }
-        if (!named) {
-            const std::string hidden = PartialNameFor(m_finalPath);
-            if (linkat(AT_FDCWD, self.c_str(), AT_FDCWD, hidden.c_str(), AT_SYMLINK_FOLLOW) != 0) {
-                return ConvertErrnoToLocalError(errno, false);
-            }
-            m_partialPath = hidden;
-        }
-    }
-    if (!named && rename(m_partialPath.c_str(), m_finalPath.c_str()) != 0) {
-        return ConvertErrnoToLocalError(errno, false);
-    }
-    m_partialPath.clear();
-    m_bUnpublished = false;
-    if (durable) {
-        const int directoryDescriptor = open(DirectoryOf(m_finalPath).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-        if (directoryDescriptor >= 0) {
-            result = fsync(directoryDescriptor) == 0 ? eTqovixSuccess : ConvertErrnoToLocalError(errno, false);
-            close(directoryDescriptor);
-        }
-    }
-    return result;
-}
-
-bool CTqovixFile::SetUnnamedDestinations(bool enabled)
-{
-    return g_bUnnamedDestinations.exchange(enabled);
-}
 
 eTqovixErrorCode CTqovixFile::Read(void* buffer, unsigned int* readSize, unsigned int size)
 {
@@ -350,91 +269,6 @@ eTqovixErrorCode CTqovixFile::FlushStream()
     return eTqovixSuccess;
 }
 
-eTqovixErrorCode CTqovixFile::CopyFrom(CTqovixFile& source, unsigned long long size, bool* copied)
-{
-    if (copied == nullptr || m_stream == nullptr || source.m_stream == nullptr) {
-        return eTqovixErrorInternal;
-    }
-    *copied = false;
-    if (m_bKernelCopyRefused) {
-        return eTqovixSuccess;
-    }
-    // Our buffered bytes go first; both streams' positions include what they buffer.
-    if (const eTqovixErrorCode flushed = FlushStream(); TqovixFailed(flushed)) {
-        return flushed;
-    }
-    const off_t in = ftello(source.m_stream);
-    const off_t out = ftello(m_stream);
-    if (in < 0 || out < 0) {
-        return ConvertErrnoToLocalError(errno, false);
-    }
-    const eTqovixErrorCode result = CopyRange(source, static_cast<unsigned long long>(in),
-                                              static_cast<unsigned long long>(out), size, copied, nullptr);
-    if (TqovixFailed(result) || !*copied) {
-        return result;
-    }
-    // The descriptors' own offsets never moved; the streams are put where the copy ended.
-    if (fseeko(source.m_stream, in + static_cast<off_t>(size), SEEK_SET) != 0 ||
-        fseeko(m_stream, out + static_cast<off_t>(size), SEEK_SET) != 0) {
-        return ConvertErrnoToLocalError(errno, false);
-    }
-    return eTqovixSuccess;
-}
-
-eTqovixErrorCode CTqovixFile::CopyRange(CTqovixFile& source, unsigned long long from, unsigned long long to,
-                                        unsigned long long size, bool* copied, const std::atomic<bool>* cancel,
-                                        std::atomic<unsigned long long>* reached)
-{
-    if (copied == nullptr || m_stream == nullptr || source.m_stream == nullptr) {
-        return eTqovixErrorInternal;
-    }
-    *copied = false;
-    if (m_bKernelCopyRefused) {
-        return eTqovixSuccess;
-    }
-    if (const int fault = InjectedFault(eTqovixFileOperation::Read)) {
-        return ConvertErrnoToLocalError(fault, true);
-    }
-    if (const int fault = InjectedFault(eTqovixFileOperation::Write)) {
-        return ConvertErrnoToLocalError(fault, false);
-    }
-    // Pieces, so that a copy asked to stop stops soon.
-    constexpr unsigned long long kPiece = 16ULL << 20;
-    auto in = static_cast<off_t>(from);
-    auto out = static_cast<off_t>(to);
-    unsigned long long left = size;
-    while (left > 0) {
-        if (cancel != nullptr && cancel->load(std::memory_order_relaxed)) {
-            return eTqovixErrorAborted;
-        }
-        const ssize_t done =
-            copy_file_range(source.m_descriptor, &in, m_descriptor, &out, std::min(left, kPiece), 0);
-        if (done < 0) {
-            const int error = errno;
-            if (error == EINTR) {
-                continue;
-            }
-            // Files the kernel cannot copy between (other file systems, old kernels, pipes).
-            const bool refused = error == EXDEV || error == EINVAL || error == ENOSYS || error == EOPNOTSUPP ||
-                                 error == EBADF;
-            if (refused && left == size) {
-                m_bKernelCopyRefused = true;
-                return eTqovixSuccess;
-            }
-            return ConvertErrnoToLocalError(error, false);
-        }
-        if (done == 0) {
-            // The caller checked the range against the file size: the source shrank meanwhile.
-            return eTqovixErrorInternal;
-        }
-        left -= static_cast<unsigned long long>(done);
-        if (reached != nullptr) {
-            reached->store(static_cast<unsigned long long>(out), std::memory_order_release);
-        }
-    }
-    *copied = true;
-    return eTqovixSuccess;
-}
 
 eTqovixErrorCode CTqovixFile::GetPosition(long long* position) const
 {
@@ -557,11 +391,20 @@ eTqovixErrorCode CTqovixFile::ConvertErrnoToLocalError(int errorNumber, bool rea
     case EPERM:
     case EACCES:
         return readOnly ? eTqovixErrorSourceAccessDenied : eTqovixErrorDestinationAccessDenied;
+    case EROFS:
+    case ETXTBSY:
+        // Only opening for writing meets these: what cannot be written is the destination.
+        return eTqovixErrorDestinationAccessDenied;
     case ENOENT:
+    case ENOTDIR:
+    case ENAMETOOLONG:
+    case ELOOP:
+        // A name the system cannot follow to a file: not found, or not to be created.
         return readOnly ? eTqovixErrorSourceNotFound : eTqovixErrorDestinationNotFound;
     case ENOMEM:
         return eTqovixErrorOutOfMemory;
     case ENOSPC:
+    case EDQUOT:
         return eTqovixErrorDiskFull;
     case EEXIST:
         return eTqovixErrorFileExists;
@@ -575,9 +418,7 @@ eTqovixErrorCode CTqovixFile::ConvertErrnoToLocalError(int errorNumber, bool rea
     case E2BIG:
     case EINVAL:
     case ESPIPE:
-    case EROFS:
     case EDOM:
-    case ENAMETOOLONG:
     case EOVERFLOW:
         return eTqovixErrorInvalidArgument;
     case ENXIO:
@@ -652,20 +493,4 @@ eTqovixErrorCode CTqovixFile::ReadAt(unsigned long long offset, void* buffer, un
         *readSize += static_cast<unsigned int>(got);
     }
     return eTqovixSuccess;
-}
-
-void CTqovixFile::HintSmallCopyOnWrite()
-{
-    if (m_stream == nullptr) {
-        return;
-    }
-    const int descriptor = fileno(m_stream);
-    struct stat status {};
-    fsxattr attributes {};
-    if (fstat(descriptor, &status) != 0 || ioctl(descriptor, FS_IOC_FSGETXATTR, &attributes) != 0) {
-        return;
-    }
-    attributes.fsx_xflags |= FS_XFLAG_COWEXTSIZE;
-    attributes.fsx_cowextsize = static_cast<uint32_t>(status.st_blksize);
-    ioctl(descriptor, FS_IOC_FSSETXATTR, &attributes);
 }

@@ -20,8 +20,9 @@ struct TqovixVolumeInformation {
 // Fills the record for the volume holding `directory`; returns false with errno set on failure.
 using TqovixVolumeQuery = bool (*)(const char* directory, TqovixVolumeInformation* information);
 
-// The operations a fault seam can fail.
-enum class eTqovixFileOperation { Read, Write, Seek, Position, Truncate, Flush };
+// The operations a fault seam can fail. Open: a source or a destination; Link and Rename: giving
+// a destination its name (or its hidden one); Sync: the data, or the directory, reaching the device.
+enum class eTqovixFileOperation { Read, Write, Seek, Position, Truncate, Flush, Open, Link, Rename, Sync };
 
 // Answers an errno to fail the operation with, or 0 to let it run (for a write, -1: it comes
 // back short without a reason). Tests use it to fail the Nth call of a whole job and check
@@ -96,6 +97,8 @@ public:
     static constexpr const char* kPartialSuffix = ".tqovix-partial";
 
 private:
+    // The source: a regular file only, and never a wait for a FIFO's writer.
+    eTqovixErrorCode OpenSource(const char* path);
     // fflush alone: the kernel copy must not count as a flush for the fault seam.
     eTqovixErrorCode FlushStream();
     // Takes an opened stream over, with our buffer.

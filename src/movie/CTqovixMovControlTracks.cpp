@@ -105,6 +105,17 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
     if (m_audioChunks.empty() || information.GetCount() > chunkSamples) {
         return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::Malformed, "the sound track's tables promise more sound than its chunks hold");
     }
+    // The AAC writer closes a chunk with the packet that fills it: a chunk of no packets is never
+    // closed and the tables written after would not match. Refused here, where the property
+    // query decides too. (Uncompressed sound counts bytes, and an empty chunk is simply passed.)
+    if (!m_bPCM) {
+        for (const TqovixChunkInformation& chunk : m_audioChunks) {
+            if (chunk.sampleCount == 0) {
+                return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedLayout,
+                              Words({"AAC sound chunk ", std::to_string(chunk.chunkNumber), " holds no packets"}));
+            }
+        }
+    }
     if (!forJob) {
         return eTqovixSuccess;
     }

@@ -101,6 +101,7 @@ const std::vector<ReasonRow>& ReasonTable()
         {Reason::Aborted, "aborted", 200, "aborted"},
         {Reason::SourceMissing, "source-missing", 110, "file not found"},
         {Reason::SourceIsDirectory, "source-is-directory", 190, "the source is a directory"},
+        {Reason::SourceNotRegularFile, "not-a-regular-file", 110, "not a regular file"},
         {Reason::SourceAccessDenied, "source-access-denied", 120, "cannot read the file"},
         {Reason::SameFile, "same-file", 190, "source and destination are the same file"},
         {Reason::DestinationIsDirectory, "destination-is-directory", 190, "the destination is a directory"},
@@ -193,6 +194,11 @@ Verdict Explain(int code, const std::string& source, const std::string& destinat
     }
     if (S_ISDIR(sourceStatus.st_mode)) {
         return MakeVerdict(code, Reason::SourceIsDirectory);
+    }
+    // A FIFO or a device: the library refused it without opening it for good, and so must we
+    // (reading one to explain it would wait on it).
+    if (!S_ISREG(sourceStatus.st_mode)) {
+        return MakeVerdict(code, Reason::SourceNotRegularFile);
     }
     if (access(source.c_str(), R_OK) != 0) {
         return MakeVerdict(code, Reason::SourceAccessDenied, std::strerror(errno));

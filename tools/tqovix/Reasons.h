@@ -11,6 +11,7 @@ enum class Reason {
     Aborted,
     SourceMissing,
     SourceIsDirectory,
+    SourceNotRegularFile,
     SourceAccessDenied,
     SameFile,
     DestinationIsDirectory,
