@@ -272,6 +272,11 @@ TEST(CliTest, NotRegularFilesAreRefusedAtOnce)
         const Outcome batch = Tool("batch -o " + Q(dir.File("batch")) + " " + Q(source), 30);
         EXPECT_EQ(batch.status, 1) << batch.output;
         EXPECT_NE(batch.output.find("not a regular file"), std::string::npos) << batch.output;
+        const Outcome inspect = Tool("inspect " + Q(source), 30);
+        EXPECT_EQ(inspect.status, 1) << inspect.output;
+        EXPECT_NE(inspect.output.find("not a regular file"), std::string::npos) << inspect.output;
+        const Outcome compare = Tool("compare " + Q(source) + " " + Q(source), 30);
+        EXPECT_EQ(compare.status, 1) << compare.output;
     }
 }
 
@@ -682,5 +687,158 @@ TEST(CliCompareTest, AacDestinationsMatchTheirSourceWithoutOffset)
     EXPECT_EQ(Numbers(measured.output, "offsetFrames"), std::vector<double>{0}) << measured.output;
     EXPECT_GT(Numbers(measured.output, "correlation").at(0), 0.99) << measured.output;
 }
+
+// ---- compare: destinations whose sound is not all there, or not the same shape ----
+
+uint32_t ReadBE32(const std::vector<uint8_t>& bytes, size_t at)
+{
+    return uint32_t{bytes[at]} << 24 | uint32_t{bytes[at + 1]} << 16 | uint32_t{bytes[at + 2]} << 8 | bytes[at + 3];
+}
+
+void WriteBE32(std::vector<uint8_t>& bytes, size_t at, uint32_t value)
+{
+    for (int k = 0; k < 4; ++k) {
+        bytes[at + k] = static_cast<uint8_t>(value >> (24 - 8 * k));
+    }
+}
+
+// Where the sound track's table `type` starts (its size field) in the movie atom; 0 if absent.
+size_t SoundTable(const std::vector<uint8_t>& bytes, const std::string& type)
+{
+    size_t moov = 0;
+    for (size_t at = 0; at + 8 <= bytes.size();) {
+        uint64_t size = ReadBE32(bytes, at);
+        if (size == 1 && at + 16 <= bytes.size()) {
+            size = uint64_t{ReadBE32(bytes, at + 8)} << 32 | ReadBE32(bytes, at + 12);
+        }
+        if (std::string(bytes.begin() + at + 4, bytes.begin() + at + 8) == "moov") {
+            moov = at;
+            break;
+        }
+        if (size < 8) {
+            return 0;
+        }
+        at += size;
+    }
+    const auto find = [&](const std::string& name, size_t from) {
+        const auto found = std::search(bytes.begin() + from, bytes.end(), name.begin(), name.end());
+        return found == bytes.end() ? size_t{0} : static_cast<size_t>(found - bytes.begin()) - 4;
+    };
+    const size_t sound = moov == 0 ? 0 : find("smhd", moov);
+    return sound == 0 ? 0 : find(type, sound);
+}
+
+// The processed movie with its sound track's tables edited in place.
+std::string EditedCopy(const TempDir& dir, const std::string& processed, const std::string& name,
+                       void (*edit)(std::vector<uint8_t>&, size_t))
+{
+    std::vector<uint8_t> bytes = testsupport::ReadFile(processed);
+    const std::string path = dir.File(name);
+    edit(bytes, bytes.size());
+    EXPECT_TRUE(testsupport::WriteFile(path, bytes));
+    return path;
+}
+
+// The processed movie's sound remuxed by ffmpeg with `filters` (original samples, other shape).
+std::string Remuxed(const TempDir& dir, const std::string& processed, const std::string& name,
+                    const std::string& filters)
+{
+    const std::string path = dir.File(name);
+    std::string output;
+    EXPECT_EQ(testsupport::RunCommand("ffmpeg -v error -nostdin -i " + Q(processed) + " -map 0:a " + filters +
+                                          " -c:a pcm_s16be -f mov " + Q(path) + " 2>&1",
+                                      &output),
+              0)
+        << output;
+    return path;
+}
+
+struct ShapeRow {
+    const char* name;
+    std::string (*make)(const TempDir& dir, const std::string& processed);
+    int status;
+    const char* reason;  // the JSON report's; "" for a comparison that succeeds
+    const char* said;     // in the text
+};
+void PrintTo(const ShapeRow& row, std::ostream* os) { *os << row.name; }
+
+class CliCompareShapeTest : public ::testing::TestWithParam<ShapeRow> {
+protected:
+    static void SetUpTestSuite()
+    {
+        s_dir = new TempDir;
+        ASSERT_EQ(Tool("make-sample " + Q(s_dir->File("src.mov")) + " --seconds 4").status, 0);
+        ASSERT_EQ(Tool("process " + Q(s_dir->File("src.mov")) + " " + Q(s_dir->File("dst.mov")) + " --quiet").status,
+                  0);
+    }
+    static void TearDownTestSuite()
+    {
+        delete s_dir;
+        s_dir = nullptr;
+    }
+    static TempDir* s_dir;
+};
+TempDir* CliCompareShapeTest::s_dir = nullptr;
+
+// Each side must give all the sound its tables promise, at the same rate and channel count and
+// for as long as the other: otherwise compare fails and says what differs, in text and JSON.
+TEST_P(CliCompareShapeTest, FailsNamingWhatDiffers)
+{
+    const ShapeRow& row = GetParam();
+    const std::string source = s_dir->File("src.mov");
+    const std::string destination = row.make(*s_dir, s_dir->File("dst.mov"));
+    const Outcome text = Tool("compare " + Q(source) + " " + Q(destination));
+    EXPECT_EQ(text.status, row.status) << text.output;
+    EXPECT_NE(text.output.find(row.said), std::string::npos) << text.output;
+    Outcome json{};
+    json.status = testsupport::RunCommand(
+        Q(TQOVIX_TOOL) + " compare --json " + Q(source) + " " + Q(destination) + " 2>/dev/null", &json.output);
+    EXPECT_EQ(json.status, row.status) << json.output;
+    const std::string verdict = *row.reason == 0 ? "\"compared\":true"
+                                                 : "\"compared\":false,\"reason\":\"" + std::string(row.reason) + "\"";
+    EXPECT_NE(json.output.find(verdict), std::string::npos) << json.output;
+    EXPECT_TRUE(json.output.starts_with("{\"version\":1,") && json.output.ends_with("}\n")) << json.output;
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Destinations, CliCompareShapeTest,
+    ::testing::Values(
+        ShapeRow{"Processed", [](const TempDir&, const std::string& processed) { return processed; }, 0, "",
+                 "0 frames differ"},
+        // The last sample-to-chunk run cut to 100 samples: the time table still counts them all.
+        ShapeRow{"LastRunCut",
+                 [](const TempDir& dir, const std::string& processed) {
+                     return EditedCopy(dir, processed, "cut.mov", [](std::vector<uint8_t>& bytes, size_t) {
+                         const size_t stsc = SoundTable(bytes, "stsc");
+                         ASSERT_NE(stsc, 0u);
+                         const uint32_t runs = ReadBE32(bytes, stsc + 12);
+                         ASSERT_GT(runs, 0u);
+                         WriteBE32(bytes, stsc + 16 + 12 * (runs - 1) + 4, 100);
+                     });
+                 },
+                 1, "tables-inconsistent", "cut.mov: the sound track's tables promise more sound than its chunks hold"},
+        // Consistent tables, but the last chunk lies at the file's end: its sound stops early.
+        ShapeRow{"LastChunkPastTheEnd",
+                 [](const TempDir& dir, const std::string& processed) {
+                     return EditedCopy(dir, processed, "past.mov", [](std::vector<uint8_t>& bytes, size_t size) {
+                         const size_t stco = SoundTable(bytes, "stco");
+                         ASSERT_NE(stco, 0u);
+                         const uint32_t chunks = ReadBE32(bytes, stco + 12);
+                         ASSERT_GT(chunks, 0u);
+                         WriteBE32(bytes, stco + 16 + 4 * (chunks - 1), static_cast<uint32_t>(size - 100));
+                     });
+                 },
+                 1, "sound-stops-early", "past.mov: its sound stops at"},
+        ShapeRow{"Stretched",
+                 [](const TempDir& dir, const std::string& processed) {
+                     return Remuxed(dir, processed, "long.mov", "-af apad=pad_dur=0.5");
+                 },
+                 1, "length-differs", "its sound differs in length"},
+        ShapeRow{"Resampled",
+                 [](const TempDir& dir, const std::string& processed) {
+                     return Remuxed(dir, processed, "44k.mov", "-ar 44100");
+                 },
+                 1, "rate-differs", "its sound differs in rate: 44100 Hz against 48000 Hz"}),
+    [](const ::testing::TestParamInfo<ShapeRow>& info) { return std::string(info.param.name); });
 
 }  // namespace

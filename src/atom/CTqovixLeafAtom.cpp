@@ -11,6 +11,9 @@ namespace {
 
 // The largest count one file read or write takes.
 constexpr uint64_t kMaxPiece = 4294967295ULL;
+// A payload larger than this goes from the source to the destination in pieces of this size
+// (or inside the kernel) instead of being loaded: its size is the file's to choose.
+constexpr uint64_t kStreamPiece = 1 << 20;
 
 }  // namespace
 
@@ -30,6 +33,20 @@ uint64_t CTqovixLeafAtom::GetSize() const
     return SizeWithHeader(GetDataSize(), m_bLargeHeader);
 }
 
+eTqovixErrorCode CTqovixLeafAtom::CheckPayloadInFile() const
+{
+    // A size that the file cannot hold must not turn into an allocation or a long copy.
+    long long fileSize = 0;
+    const eTqovixErrorCode result = m_pFile->GetFileSize(&fileSize);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    if (m_offset < 0 || m_offset > fileSize || m_size > static_cast<uint64_t>(fileSize - m_offset)) {
+        return eTqovixErrorInvalidMovie;
+    }
+    return eTqovixSuccess;
+}
+
 eTqovixErrorCode CTqovixLeafAtom::LoadData() const
 {
     if (m_pFile == nullptr) {
@@ -39,14 +56,9 @@ eTqovixErrorCode CTqovixLeafAtom::LoadData() const
     if (size == 0) {
         return eTqovixSuccess;
     }
-    // A size that the file cannot hold must not turn into an allocation.
-    long long fileSize = 0;
-    eTqovixErrorCode result = m_pFile->GetFileSize(&fileSize);
+    eTqovixErrorCode result = CheckPayloadInFile();
     if (TqovixFailed(result)) {
         return result;
-    }
-    if (m_offset < 0 || m_offset > fileSize || size > static_cast<uint64_t>(fileSize - m_offset)) {
-        return eTqovixErrorInvalidMovie;
     }
     result = m_pFile->Seek(m_offset, CTqovixFile::eTqovixSeekBegin);
     if (TqovixFailed(result)) {
@@ -127,6 +139,9 @@ eTqovixErrorCode CTqovixLeafAtom::Write(CTqovixFile& file) const
     if (!file.IsOpened()) {
         return eTqovixErrorInternal;
     }
+    if (m_pFile != nullptr && m_size > kStreamPiece) {
+        return CopyPayload(file);
+    }
     // Load before the header goes out, so an unreadable payload leaves nothing half-written.
     eTqovixErrorCode result = LoadData();
     if (TqovixFailed(result)) {
@@ -144,6 +159,48 @@ eTqovixErrorCode CTqovixLeafAtom::Write(CTqovixFile& file) const
             return result;
         }
         done += piece;
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixLeafAtom::CopyPayload(CTqovixFile& file) const
+{
+    eTqovixErrorCode result = CheckPayloadInFile();
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    result = WriteHeader(file, m_bLargeHeader);
+    if (!TqovixFailed(result)) {
+        result = m_pFile->Seek(m_offset, CTqovixFile::eTqovixSeekBegin);
+    }
+    bool copied = false;
+    if (!TqovixFailed(result)) {
+        result = file.CopyFrom(*m_pFile, m_size, &copied);
+    }
+    if (TqovixFailed(result) || copied) {
+        return result;
+    }
+    std::vector<uint8_t> piece;
+    try {
+        piece.resize(kStreamPiece);
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    for (uint64_t done = 0; done < m_size;) {
+        const auto size = static_cast<unsigned int>(std::min(kStreamPiece, m_size - done));
+        unsigned int got = 0;
+        result = m_pFile->Read(piece.data(), &got, size);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        if (got < size) {
+            return eTqovixErrorInvalidMovie;  // the file shrank under us
+        }
+        result = file.Write(piece.data(), size);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        done += size;
     }
     return eTqovixSuccess;
 }

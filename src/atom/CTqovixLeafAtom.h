@@ -31,6 +31,10 @@ public:
     long long GetOffset() const { return m_offset; }
 
 private:
+    eTqovixErrorCode CheckPayloadInFile() const;
+    // Source to destination without holding more than a piece of the payload.
+    eTqovixErrorCode CopyPayload(CTqovixFile& file) const;
+
     eTqovixAtomType m_type;
     mutable std::vector<uint8_t> m_data;
     mutable CTqovixFile* m_pFile;

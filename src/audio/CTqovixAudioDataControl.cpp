@@ -1,5 +1,6 @@
 #include "audio/CTqovixAudioDataControl.h"
 
+#include <algorithm>
 #include <cstring>
 #include <new>
 #include <stdexcept>
@@ -73,74 +74,119 @@ eTqovixErrorCode CTqovixAudioDataControl::Close()
     m_outputChunkIndex = 0;
     m_bBigEndian = true;
     std::vector<uint8_t>().swap(m_scratch);
+    m_scratchHead = 0;
+    m_scratchFill = 0;
+    m_packetIndex = 0;
+    m_bChunkChecked = false;
     return eTqovixSuccess;
 }
 
-eTqovixErrorCode CTqovixAudioDataControl::DecodeChunk(const CTqovixAudioChunk& chunk, const uint8_t* bytes,
-                                                      unsigned int size)
+void CTqovixAudioDataControl::NextChunk()
 {
-    std::vector<uint8_t> collected;
-    uint8_t block[kDecodedPacketBytes];
-    unsigned int offset = 0;
-    for (int k = 0; offset < size; ++k) {
-        const uint32_t packetSize = chunk.GetSampleSize(k);
-        // Sizes that do not add up to the chunk must not read past it or stall.
-        if (packetSize == 0 || packetSize > size - offset) {
-            return eTqovixErrorInternal;
-        }
-        unsigned int pcmSize = 0;
-        unsigned int used = 0;
-        const eTqovixErrorCode result = DecodeAAC2PCM(block, &pcmSize, &used, bytes + offset, packetSize);
-        if (TqovixFailed(result)) {
-            return result;
-        }
-        if (used == 0 || used > size - offset || pcmSize > kDecodedPacketBytes) {
-            return eTqovixErrorInternal;
-        }
-        try {
-            collected.insert(collected.end(), block, block + pcmSize);
-        } catch (const std::bad_alloc&) {
-            return eTqovixErrorOutOfMemory;
-        }
-        offset += used;
-    }
-    if (collected.empty()) {
-        return eTqovixSuccess;
-    }
-    return TqovixFailed(m_decodedPool->PushDecodedData(collected.data(), collected.size())) ? eTqovixErrorInternal
-                                                                                          : eTqovixSuccess;
+    ++m_inputChunkIndex;
+    m_scratchHead = 0;
+    m_scratchFill = 0;
+    m_packetIndex = 0;
+    m_bChunkChecked = false;
 }
 
-eTqovixErrorCode CTqovixAudioDataControl::FillPool(unsigned long requested)
+eTqovixErrorCode CTqovixAudioDataControl::ServePcmPiece(CTqovixAudioChunk& chunk)
 {
-    while (m_decodedPool->GetDecodedDataSize() < requested && m_inputChunkIndex < m_chunks.size()) {
-        CTqovixAudioChunk& chunk = *m_chunks[m_inputChunkIndex];
-        const auto size = static_cast<unsigned int>(chunk.GetInputDataSize());
-        if (size == 0) {
-            ++m_inputChunkIndex;
-            continue;
+    const auto size = static_cast<unsigned int>(std::min<uint64_t>(chunk.GetInputDataSize(), kReadPieceBytes));
+    eTqovixErrorCode result = Reserve(m_scratch, size);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    unsigned int got = 0;
+    result = chunk.PopInputData(m_scratch.data(), &got, size);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    if (got == 0) {
+        return eTqovixErrorInternal;  // the file ends before this chunk
+    }
+    // Pieces are even-sized, so a sample's two bytes never straddle two of them.
+    if (m_bBigEndian) {
+        SwapWords(m_scratch.data(), got);
+    }
+    return TqovixFailed(m_decodedPool->PushDecodedData(m_scratch.data(), got)) ? eTqovixErrorInternal
+                                                                             : eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::DecodeNextPacket(CTqovixAudioChunk& chunk)
+{
+    const uint64_t chunkSize = chunk.GetChunkInformation().size;
+    if (!m_bChunkChecked) {
+        // Sizes that do not add up to the chunk must not read past it or stall; checked before
+        // any of its sound is served, so that a bad table gives none of it.
+        uint64_t total = 0;
+        for (int k = 0; total < chunkSize; ++k) {
+            const uint32_t packetSize = chunk.GetSampleSize(k);
+            if (packetSize == 0 || packetSize > chunkSize - total || packetSize > kReadPieceBytes) {
+                return eTqovixErrorInternal;
+            }
+            total += packetSize;
         }
-        eTqovixErrorCode result = Reserve(m_scratch, size);
+        m_bChunkChecked = true;
+    }
+    const uint32_t packetSize = chunk.GetSampleSize(static_cast<int>(m_packetIndex));
+    const size_t held = m_scratchFill - m_scratchHead;
+    if (packetSize == 0 || packetSize > held + chunk.GetInputDataSize() || packetSize > kReadPieceBytes) {
+        return eTqovixErrorInternal;
+    }
+    if (held < packetSize) {
+        // The undecoded tail moves to the front and the chunk's next bytes follow it.
+        if (held != 0) {
+            std::memmove(m_scratch.data(), m_scratch.data() + m_scratchHead, held);
+        }
+        m_scratchHead = 0;
+        m_scratchFill = held;
+        const auto want =
+            static_cast<unsigned int>(std::min<uint64_t>(chunk.GetInputDataSize(), kReadPieceBytes - held));
+        eTqovixErrorCode result = Reserve(m_scratch, held + want);
         if (TqovixFailed(result)) {
             return result;
         }
         unsigned int got = 0;
-        result = chunk.PopInputData(m_scratch.data(), &got, size);
+        result = chunk.PopInputData(m_scratch.data() + held, &got, want);
         if (TqovixFailed(result)) {
             return result;
         }
-        if (got == 0) {
-            return eTqovixErrorInternal;  // the file ends before this chunk
+        m_scratchFill += got;
+        if (m_scratchFill < packetSize) {
+            return eTqovixErrorInternal;  // the file ends inside this chunk
         }
-        if (IsAACCodec()) {
-            result = DecodeChunk(chunk, m_scratch.data(), got);
-        } else {
-            if (m_bBigEndian) {
-                SwapWords(m_scratch.data(), got);
-            }
-            result = TqovixFailed(m_decodedPool->PushDecodedData(m_scratch.data(), got)) ? eTqovixErrorInternal
-                                                                                      : eTqovixSuccess;
+    }
+    uint8_t block[kDecodedPacketBytes];
+    unsigned int pcmSize = 0;
+    unsigned int used = 0;
+    const eTqovixErrorCode result =
+        DecodeAAC2PCM(block, &pcmSize, &used, m_scratch.data() + m_scratchHead, packetSize);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    if (used == 0 || used > packetSize || pcmSize > kDecodedPacketBytes) {
+        return eTqovixErrorInternal;
+    }
+    m_scratchHead += used;
+    ++m_packetIndex;
+    if (pcmSize == 0) {
+        return eTqovixSuccess;
+    }
+    return TqovixFailed(m_decodedPool->PushDecodedData(block, pcmSize)) ? eTqovixErrorInternal : eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixAudioDataControl::FillPool(unsigned long requested)
+{
+    // A piece or a packet at a time, however large the chunk: the pool ends at most one piece
+    // past the request.
+    while (m_decodedPool->GetDecodedDataSize() < requested && m_inputChunkIndex < m_chunks.size()) {
+        CTqovixAudioChunk& chunk = *m_chunks[m_inputChunkIndex];
+        if (chunk.GetInputDataSize() == 0 && m_scratchHead == m_scratchFill) {
+            NextChunk();
+            continue;
         }
+        const eTqovixErrorCode result = IsAACCodec() ? DecodeNextPacket(chunk) : ServePcmPiece(chunk);
         if (TqovixFailed(result)) {
             return result;
         }

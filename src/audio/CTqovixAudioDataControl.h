@@ -19,6 +19,9 @@ class CTqovixAudioDataControl {
 public:
     // The largest PCM one AAC packet decodes to (1024 frames of up to 8 channels of 48 bits).
     static constexpr unsigned int kDecodedPacketBytes = 49152;
+    // What one read from the file takes at most; whatever a chunk's size, no more is held
+    // (a source packet larger than this is no sound packet).
+    static constexpr unsigned int kReadPieceBytes = 1 << 20;
 
     virtual ~CTqovixAudioDataControl();
 
@@ -50,12 +53,20 @@ public:
 
 private:
     eTqovixErrorCode FillPool(unsigned long requested);
-    eTqovixErrorCode DecodeChunk(const CTqovixAudioChunk& chunk, const uint8_t* bytes, unsigned int size);
+    eTqovixErrorCode ServePcmPiece(CTqovixAudioChunk& chunk);
+    eTqovixErrorCode DecodeNextPacket(CTqovixAudioChunk& chunk);
+    void NextChunk();
 
     std::vector<std::shared_ptr<CTqovixAudioChunk>> m_chunks;
     std::shared_ptr<CTqovixAudioChunk> m_decodedPool;
     bool m_bBigEndian = true;
     uint32_t m_inputChunkIndex = 0;
     uint32_t m_outputChunkIndex = 0;
-    std::vector<uint8_t> m_scratch;  // one chunk's bytes, reused from chunk to chunk
+    // At most one piece of the current chunk's bytes, read ahead of the decoder; a chunk's
+    // size comes from the file, so it never decides how much is held.
+    std::vector<uint8_t> m_scratch;
+    size_t m_scratchHead = 0;
+    size_t m_scratchFill = 0;
+    uint32_t m_packetIndex = 0;  // the next packet of the current chunk
+    bool m_bChunkChecked = false;
 };

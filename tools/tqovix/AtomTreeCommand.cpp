@@ -31,7 +31,7 @@ int InspectCommand(const Arguments& arguments)
     }
     const std::string path = line.Operands()[0];
     struct stat status {};
-    const bool file = stat(path.c_str(), &status) == 0 && !S_ISDIR(status.st_mode);
+    const bool file = stat(path.c_str(), &status) == 0 && S_ISREG(status.st_mode);
     const Inspection inspection = file ? Inspect(path) : Inspection{};
     if (!file || !inspection.structure.readable) {
         const Verdict verdict = Explain(190, path);

@@ -17,14 +17,16 @@ constexpr const char* kUsage =
     "  and after and the reduction, elsewhere how many frames differ (PCM: none should) or\n"
     "  the largest difference (AAC), and DST's offset against SRC in frames; --png draws both\n"
     "  spectrograms with the AF intervals and the level difference over time\n"
-    "  exit status: 0 compared, 1 DST is not the processed form of SRC (or unreadable), 2 usage\n";
+    "  exit status: 0 compared, 1 DST is not the processed form of SRC (its sound differs in\n"
+    "  rate, channels or length, or does not match), either sound stops short of what its tables\n"
+    "  promise, or a file is unreadable; 2 usage\n";
 
 double Seconds(uint64_t frame, uint32_t rate) { return static_cast<double>(frame) / rate; }
 
 void PrintJson(const std::string& source, const std::string& destination, const SoundComparison& c,
                const std::string& png)
 {
-    std::printf("{\"version\":1,\"source\":%s,\"destination\":%s,\"rate\":%u,\"channels\":%u,\"frames\":%" PRIu64
+    std::printf("{\"version\":1,\"source\":%s,\"destination\":%s,\"compared\":true,\"rate\":%u,\"channels\":%u,\"frames\":%" PRIu64
                 ",\"codec\":\"%s\",\"intervals\":[",
                 JsonString(source).c_str(), JsonString(destination).c_str(), c.rate, c.channels, c.frames,
                 c.aac ? "aac" : "pcm");
@@ -80,19 +82,29 @@ int CompareCommand(const Arguments& arguments)
     const bool json = line.Has("json");
     const std::string png = line.Value("png");
     const Arguments& paths = line.Operands();
+    // Every refusal says why: with --json in the report, else on standard error.
+    const auto refuse = [&](const std::string& reason, const std::string& why) {
+        if (json) {
+            std::printf("{\"version\":1,\"source\":%s,\"destination\":%s,\"compared\":false,\"reason\":%s,"
+                        "\"message\":%s}\n",
+                        JsonString(paths[0]).c_str(), JsonString(paths[1]).c_str(), JsonString(reason).c_str(),
+                        JsonString(why).c_str());
+        } else {
+            std::fprintf(stderr, "tqovix compare: %s\n", why.c_str());
+        }
+        return 1;
+    };
     // The picture needs the sound's shape before the first block: open it once to learn it.
     Spectrogram picture;
     bool drawing = false;
     if (!png.empty()) {
         SoundStream probe;
         if (const std::string why = probe.Open(paths[0]); !why.empty()) {
-            std::fprintf(stderr, "tqovix compare: %s: %s\n", paths[0].c_str(), why.c_str());
-            return 1;
+            return refuse("unreadable", paths[0] + ": " + why);
         }
         if (const std::string why = picture.Begin(probe.Rate(), probe.Channels(), probe.Frames(), probe.Intervals());
             !why.empty()) {
-            std::fprintf(stderr, "tqovix compare: no picture: %s\n", why.c_str());
-            return 1;
+            return refuse("no-picture", "no picture: " + why);
         }
         drawing = true;
     }
@@ -104,8 +116,7 @@ int CompareCommand(const Arguments& arguments)
                                               }
                                           });
     if (!why.empty()) {
-        std::fprintf(stderr, "tqovix compare: %s\n", why.c_str());
-        return 1;
+        return refuse(comparison.reason, why);
     }
     if (drawing) {
         if (const std::string failed = picture.Save(png); !failed.empty()) {

@@ -2,6 +2,8 @@
 
 #include <algorithm>
 #include <cmath>
+#include <cstdio>
+#include <utility>
 
 namespace {
 
@@ -80,6 +82,28 @@ std::string MeasureOffset(const std::string& sourcePath, const std::string& dest
     return "";
 }
 
+// As many frames as asked, unless the sound ends: blocks of both sounds then cover the same
+// frames, however the stream happens to hand them out.
+uint64_t ReadBlock(SoundStream& stream, int16_t* samples, uint64_t frames)
+{
+    uint64_t done = 0;
+    while (done < frames) {
+        const uint64_t got = stream.Read(samples + done * stream.Channels(), frames - done);
+        if (got == 0) {
+            break;
+        }
+        done += got;
+    }
+    return done;
+}
+
+std::string Seconds(uint64_t frames, uint32_t rate)
+{
+    char text[32];
+    std::snprintf(text, sizeof text, "%.3f s", static_cast<double>(frames) / rate);
+    return text;
+}
+
 }  // namespace
 
 std::string CompareSounds(const std::string& sourcePath, const std::string& destinationPath, SoundComparison& result,
@@ -87,17 +111,31 @@ std::string CompareSounds(const std::string& sourcePath, const std::string& dest
 {
     SoundStream source;
     SoundStream destination;
-    if (const std::string why = source.Open(sourcePath); !why.empty()) {
-        return sourcePath + ": " + why;
+    result.reason = "unreadable";
+    for (const auto& [stream, path] : {std::pair{&source, &sourcePath}, std::pair{&destination, &destinationPath}}) {
+        if (const std::string why = stream->Open(*path); !why.empty()) {
+            result.reason = stream->HasInconsistentTables() ? "tables-inconsistent" : "unreadable";
+            return *path + ": " + why;
+        }
     }
-    if (const std::string why = destination.Open(destinationPath); !why.empty()) {
-        return destinationPath + ": " + why;
+    const std::string different = destinationPath + ": not the processed form of " + sourcePath + " (";
+    if (source.Rate() != destination.Rate()) {
+        result.reason = "rate-differs";
+        return different + "its sound differs in rate: " + std::to_string(destination.Rate()) + " Hz against " +
+               std::to_string(source.Rate()) + " Hz)";
     }
-    if (source.Rate() != destination.Rate() || source.Channels() != destination.Channels() ||
-        source.Frames() != destination.Frames()) {
-        return destinationPath + ": not the processed form of " + sourcePath +
-               " (its sound differs in rate, channels or length)";
+    if (source.Channels() != destination.Channels()) {
+        result.reason = "channels-differ";
+        return different + "its sound differs in channels: " + std::to_string(destination.Channels()) +
+               " against " + std::to_string(source.Channels()) + ")";
     }
+    if (source.Frames() != destination.Frames()) {
+        result.reason = "length-differs";
+        return different + "its sound differs in length: " + std::to_string(destination.Frames()) + " frames (" +
+               Seconds(destination.Frames(), destination.Rate()) + ") against " + std::to_string(source.Frames()) +
+               " (" + Seconds(source.Frames(), source.Rate()) + "))";
+    }
+    result.reason.clear();
     result.rate = source.Rate();
     result.channels = source.Channels();
     result.frames = source.Frames();
@@ -109,9 +147,10 @@ std::string CompareSounds(const std::string& sourcePath, const std::string& dest
     std::vector<uint64_t> counted(intervals.size());
     std::vector<int16_t> a(kBlockFrames * result.channels);
     std::vector<int16_t> b(kBlockFrames * result.channels);
-    for (uint64_t first = 0; first < result.frames;) {
-        const uint64_t na = source.Read(a.data(), kBlockFrames);
-        const uint64_t nb = destination.Read(b.data(), kBlockFrames);
+    uint64_t first = 0;
+    while (first < result.frames) {
+        const uint64_t na = ReadBlock(source, a.data(), kBlockFrames);
+        const uint64_t nb = ReadBlock(destination, b.data(), kBlockFrames);
         const uint64_t n = std::min(na, nb);
         if (n == 0) {
             break;
@@ -143,14 +182,30 @@ std::string CompareSounds(const std::string& sourcePath, const std::string& dest
             sink(a.data(), b.data(), first, n);
         }
         first += n;
+        if (na != nb) {
+            break;  // one of them stopped short
+        }
+    }
+    // Each side must deliver all the sound its tables promise: one that stops early is no
+    // match, however well the frames before agree. The side that stopped first is named.
+    const bool destinationShort =
+        destination.Position() < result.frames && destination.Position() <= source.Position();
+    if (destinationShort || source.Position() < result.frames) {
+        const SoundStream& stopped = destinationShort ? destination : source;
+        result.reason = "sound-stops-early";
+        return (destinationShort ? destinationPath : sourcePath) + ": its sound stops at " +
+               Seconds(stopped.Position(), result.rate) + " of the " + Seconds(result.frames, result.rate) +
+               " its tables promise";
     }
     for (size_t i = 0; i < intervals.size(); ++i) {
         result.intervals.push_back({intervals[i], Decibels(before[i], counted[i]), Decibels(after[i], counted[i])});
     }
     if (const std::string why = MeasureOffset(sourcePath, destinationPath, intervals, ramp, result); !why.empty()) {
+        result.reason = "unreadable";
         return why;
     }
     if (result.correlation < 0.5) {
+        result.reason = "sound-differs";
         return destinationPath + ": not the processed form of " + sourcePath + " (its sound does not match)";
     }
     return "";

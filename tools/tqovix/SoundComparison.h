@@ -26,6 +26,10 @@ struct SoundComparison {
     int largestDifference = 0;     // of one sample, outside them
     int64_t offset = 0;            // the destination's lag behind the source, in frames
     double correlation = 0;        // at that lag
+    // When the two cannot be compared, the kind in words: "unreadable", "tables-inconsistent"
+    // (the time table and the chunks disagree), "rate-differs", "channels-differ",
+    // "length-differs", "sound-stops-early" (before what its tables promise) or "sound-differs".
+    std::string reason;
 };
 
 // Sees every block of both sounds as it streams by (interleaved frames from `first` on).
@@ -33,6 +37,7 @@ using SoundBlockSink = std::function<void(const int16_t* source, const int16_t* 
                                           uint64_t frames)>;
 
 // Empty on success, else why the two cannot be compared (then the movie is not the processed
-// form of the source, or one of them has no sound we read).
+// form of the source, or one of them has no sound we read, or tables that disagree with its
+// chunks); result.reason then names the kind.
 std::string CompareSounds(const std::string& sourcePath, const std::string& destinationPath, SoundComparison& result,
                           const SoundBlockSink& sink = {});

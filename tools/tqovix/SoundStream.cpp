@@ -85,6 +85,19 @@ std::string SoundStream::Open(const std::string& path)
             return "the sound track's tables cannot be read";
         }
     }
+    // The time table and the chunks must agree on how much sound there is: otherwise the
+    // stream would end early, or pad with silence, and a comparison would measure that.
+    uint64_t chunkSamples = 0;
+    for (const TqovixChunkInformation& chunk : chunks) {
+        chunkSamples += chunk.sampleCount;
+    }
+    m_bInconsistentTables = information.GetCount() != chunkSamples;
+    if (information.GetCount() > chunkSamples) {
+        return "the sound track's tables promise more sound than its chunks hold";
+    }
+    if (information.GetCount() < chunkSamples) {
+        return "the sound track's chunks hold more sound than its tables count";
+    }
     m_bAac = information.GetAudioSpecificConfigSize() != 0;
     m_rate = information.GetSampleRateHz();
     m_channels = information.GetChannel();

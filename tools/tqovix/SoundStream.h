@@ -31,10 +31,15 @@ public:
     uint32_t Channels() const { return m_channels; }
     uint64_t Frames() const { return m_frames; }
     bool IsAac() const { return m_bAac; }
+    // Open refused the movie because its sound tables disagree with its chunks.
+    bool HasInconsistentTables() const { return m_bInconsistentTables; }
     // The AF intervals of the "AFR1" maker block, on this stream's frames; none for a foreign block.
     const std::vector<SoundInterval>& Intervals() const { return m_intervals; }
-    // Up to `frames` interleaved frames; fewer only at the end.
+    // Up to `frames` interleaved frames; fewer at the end, or where the sound stops short of
+    // Frames() (a chunk that cannot be read or decoded).
     uint64_t Read(int16_t* samples, uint64_t frames);
+    // Frames read so far.
+    uint64_t Position() const { return m_position; }
 
 private:
     std::unique_ptr<CTqovixFile> m_file;
@@ -45,5 +50,6 @@ private:
     uint64_t m_frames = 0;
     uint64_t m_position = 0;
     bool m_bAac = false;
+    bool m_bInconsistentTables = false;
     std::vector<SoundInterval> m_intervals;
 };
