@@ -193,7 +193,7 @@ INSTANTIATE_TEST_SUITE_P(
         ReaderRow{"DataElsewhere", [] { return Shown(ta::ParseDataInFile(moviekit::Concat({U32s({0, 1, 16}), Text("alis"), U32s({0, 7})})), [](bool in) { return in ? "here" : "elsewhere"; }); }, "elsewhere"},
         ReaderRow{"SoundEntryVersion0", [] { return Entry(PcmDescription("twos", 2)); }, "twos v0 2ch 16bit 48000Hz frame 4"},
         ReaderRow{"SoundEntryVersion1FrameField", [] { return Entry(PcmDescription("sowt", 6, 1, 12)); }, "sowt v1 6ch 16bit 48000Hz frame 12"},
-        ReaderRow{"SoundEntryVersion1Cut", [] { Bytes d = PcmDescription("sowt", 2, 1, 4); d.resize(d.size() - 8); return Entry(d); }, "refused"},
+        ReaderRow{"SoundEntryVersion1Cut", [] { Bytes d = PcmDescription("sowt", 2, 1, 4); d.resize(d.size() > 8 ? d.size() - 8 : 0); return Entry(d); }, "refused"},
         ReaderRow{"SoundEntryVersion3", [] { return Entry(PcmDescription("twos", 2, 3)); }, "refused"},
         ReaderRow{"EsdsDirect", [] { return Esds(Atom("esds", kEsdsPayload)); }, "rate 2 config 2"},
         ReaderRow{"EsdsInsideWave", [] { return Esds(Container("wave", {Atom("frma", Text("mp4a")), Atom("esds", kEsdsPayload), Bytes(8, 0)})); }, "rate 2 config 2"},
