@@ -3,6 +3,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
@@ -13,6 +14,7 @@
 #include "atom/CTqovixTCTGAtom.h"
 #include "atom/TqovixSoundEntry.h"
 #include "atom/TqovixTrackAtoms.h"
+#include "bridge/TqovixCodeTable.h"
 #include "engine/CTqovixMainFrame.h"
 #include "file/CTqovixFile.h"
 #include "visitor/CTqovixAudioDataVisitor.h"
@@ -56,6 +58,57 @@ private:
     std::string m_path;
 };
 
+// The file still holds exactly the input.
+bool Holds(const std::string& path, const uint8_t* data, size_t size)
+{
+    FILE* file = std::fopen(path.c_str(), "rb");
+    if (file == nullptr) {
+        return false;
+    }
+    std::vector<uint8_t> bytes(size + 1);
+    const size_t read = std::fread(bytes.data(), 1, bytes.size(), file);
+    std::fclose(file);
+    return read == size && std::equal(data, data + size, bytes.begin());
+}
+
+bool Exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
+
+// What the property query may answer about a readable file of ours: processable, a verdict, not
+// a movie, out of memory. 190 would be an internal failure leaking out as "anything else".
+bool IsPropertyAnswer(eTqovixErrorCode code)
+{
+    constexpr std::array kAnswers = {0, 7, 8, 9, 20, 100};
+    return std::ranges::find(kAnswers, TqovixCodes::Exported(code)) != kAnswers.end();
+}
+
+// A chunk list as the builder promises it: numbered from 1 in order, each chunk as long as its samples.
+bool WellFormed(const std::vector<TqovixChunkInformation>& chunks)
+{
+    for (size_t k = 0; k < chunks.size(); ++k) {
+        const TqovixChunkInformation& chunk = chunks[k];
+        uint64_t bytes = 0;
+        for (uint32_t sample : chunk.sampleSizes) {
+            bytes += sample;
+        }
+        if (chunk.chunkNumber != k + 1 || (!chunk.sampleSizes.empty() && bytes != chunk.size) ||
+            (!chunk.sampleSizes.empty() && chunk.sampleSizes.size() != chunk.sampleCount)) {
+            return false;
+        }
+    }
+    return true;
+}
+
+// The first track with that handler among all tracks, as the whole-movie walk read it.
+const TqovixTrackTables* FirstTrack(const CTqovixTrackListVisitor& tracks, const char (&subtype)[5])
+{
+    for (const TqovixTrackTables& track : tracks.GetTracks()) {
+        if (track.IsHandler(subtype)) {
+            return &track;
+        }
+    }
+    return nullptr;
+}
+
 }  // namespace
 
 int AtomTree(const uint8_t* data, size_t size)
@@ -69,26 +122,45 @@ int AtomTree(const uint8_t* data, size_t size)
     if (TqovixFailed(tree.Initialize(file))) {
         return 0;
     }
+    // The sound and video walks pick their track themselves; the walk over every track must
+    // find the same tables there and build the same chunks from them.
+    CTqovixTrackListVisitor tracks;
+    const bool listed = !TqovixFailed(tree.Analyze(tracks));
+    if (listed) {
+        for (const TqovixTrackTables& track : tracks.GetTracks()) {
+            std::vector<TqovixChunkInformation> trackChunks;
+            if (!TqovixFailed(TqovixBuildChunkList(
+                    track, track.soundEntry ? TqovixSoundEntry::FrameBytes(*track.soundEntry) : 0, trackChunks)) &&
+                !WellFormed(trackChunks)) {
+                return kBrokenChunkList;
+            }
+        }
+    }
     CTqovixAudioInformationVisitor information;
     if (!TqovixFailed(tree.Analyze(information))) {
         CTqovixAudioDataVisitor audio;
         std::vector<TqovixChunkInformation> chunks;
-        if (!TqovixFailed(tree.Analyze(audio))) {
-            audio.GetAudioChunkInformation(chunks, information.GetFrameBytes());
-        }
-    }
-    CTqovixTrackListVisitor tracks;
-    if (!TqovixFailed(tree.Analyze(tracks))) {
-        for (const TqovixTrackTables& track : tracks.GetTracks()) {
-            std::vector<TqovixChunkInformation> trackChunks;
-            TqovixBuildChunkList(track, track.soundEntry ? TqovixSoundEntry::FrameBytes(*track.soundEntry) : 0,
-                                 trackChunks);
+        if (!TqovixFailed(tree.Analyze(audio)) &&
+            !TqovixFailed(audio.GetAudioChunkInformation(chunks, information.GetFrameBytes()))) {
+            const TqovixTrackTables* sound = listed ? FirstTrack(tracks, "soun") : nullptr;
+            std::vector<TqovixChunkInformation> again;
+            if (!WellFormed(chunks) || (sound != nullptr && (TqovixFailed(TqovixBuildChunkList(
+                                                                  *sound, information.GetFrameBytes(), again)) ||
+                                                              again != chunks))) {
+                return kWalksDisagree;
+            }
         }
     }
     CTqovixMovieDataVisitor video;
     std::vector<TqovixChunkInformation> videoChunks;
-    if (!TqovixFailed(tree.Analyze(video))) {
-        video.GetOffset(videoChunks);
+    if (!TqovixFailed(tree.Analyze(video)) && !TqovixFailed(video.GetOffset(videoChunks))) {
+        const TqovixTrackTables* picture = listed ? FirstTrack(tracks, "vide") : nullptr;
+        std::vector<TqovixChunkInformation> again;
+        if (!WellFormed(videoChunks) ||
+            (picture != nullptr &&
+             (TqovixFailed(TqovixBuildChunkList(*picture, 0, again)) || again != videoChunks))) {
+            return kWalksDisagree;
+        }
     }
     CTqovixTrimInformationVisitor trim;
     tree.Analyze(trim);
@@ -204,12 +276,20 @@ int Property(const uint8_t* data, size_t size)
     InputFile input(data, size);
     CTqovixMainFrame engine;
     g_pMainFrame = &engine;
+    int broken = 0;
     if (!TqovixFailed(engine.Initialize())) {
-        engine.GetProperty(input.Path().c_str());
+        const eTqovixErrorCode answer = engine.GetProperty(input.Path().c_str());
+        if (!IsPropertyAnswer(answer)) {
+            broken = kUnlistedPropertyAnswer;
+        } else if (engine.GetProperty(input.Path().c_str()) != answer) {
+            broken = kPropertyChangedItsMind;
+        } else if (!Holds(input.Path(), data, size)) {
+            broken = kSourceWritten;
+        }
     }
     engine.Close();
     g_pMainFrame = nullptr;
-    return 0;
+    return broken;
 }
 
 int Job(const uint8_t* data, size_t size)
@@ -217,20 +297,36 @@ int Job(const uint8_t* data, size_t size)
     InputFile input(data, size);
     CTqovixMainFrame engine;
     g_pMainFrame = &engine;
-    if (!TqovixFailed(engine.Initialize()) &&
-        !TqovixFailed(engine.Execute(input.Path().c_str(), input.Output().c_str(), 0))) {
-        // A job that does not end in time is a hang worth reporting.
-        const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
-        while (engine.GetProcessingState() == eTqovixRunning) {
-            if (std::chrono::steady_clock::now() > deadline) {
-                std::abort();
+    int broken = 0;
+    if (!TqovixFailed(engine.Initialize())) {
+        const eTqovixErrorCode promised = engine.GetProperty(input.Path().c_str());
+        // Refusals come back as failures or as the library's verdicts.
+        const bool refused =
+            TqovixCodes::Exported(engine.Execute(input.Path().c_str(), input.Output().c_str(), 0)) != 0;
+        if (!refused) {
+            // A job that does not end in time is a hang worth reporting.
+            const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+            while (engine.GetProcessingState() == eTqovixRunning) {
+                if (std::chrono::steady_clock::now() > deadline) {
+                    std::abort();
+                }
+                std::this_thread::sleep_for(std::chrono::microseconds(100));
             }
-            std::this_thread::sleep_for(std::chrono::microseconds(100));
+        }
+        const bool finished = !refused && engine.GetProcessingState() == eTqovixFinished;
+        if (TqovixCodes::Exported(promised) == 0 && refused) {
+            broken = kRefusedWhatThePropertyAccepted;
+        } else if (Exists(input.Output()) != finished) {
+            broken = kOutputWithoutSuccess;
+        } else if (finished && TqovixCodes::Exported(engine.GetProperty(input.Output().c_str())) != 20) {
+            broken = kOutputNotMarkedProcessed;
+        } else if (!Holds(input.Path(), data, size)) {
+            broken = kSourceWritten;
         }
     }
     engine.Close();
     g_pMainFrame = nullptr;
-    return 0;
+    return broken;
 }
 
 }  // namespace fuzztarget

@@ -328,19 +328,48 @@ TEST_F(ApiTest, TheHostsProcessIsLeftAlone)
     Recipe shortMovie;
     shortMovie.video.frameCount = 10;
     const std::string source = Write(shortMovie, "short.mov");
+    g_callbackCalls = 0;
     std::atomic<bool> stop{false};
+    std::atomic<long> settings{0};
+    std::atomic<long> refusedSettings{0};
     std::thread setter([&] {
         while (!stop) {
-            TqSetCallBackNotifyProgressOVIX(HostCallback);
-            TqSetCallBackNotifyProgressOVIX(nullptr);
+            // Refused while a job runs (190), accepted between jobs (0); nothing else.
+            for (auto callback : {HostCallback, static_cast<int (*)(int, int)>(nullptr)}) {
+                const int result = TqSetCallBackNotifyProgressOVIX(callback);
+                ++(result == 0 ? settings : refusedSettings);
+                if (result != 0 && result != 190) {
+                    ADD_FAILURE() << "setting the callback answered " << result;
+                }
+            }
         }
     });
+    // The jobs start once the setter is at work, and it works until they are all done.
+    while (settings + refusedSettings == 0) {
+        std::this_thread::yield();
+    }
+    int done = 0;
+    int answered = 0;
     for (int job = 0; job < 10; ++job) {
-        ASSERT_EQ(TqExecuteOVIX(source.c_str(), m_dir.File("out.mov").c_str()), 0);
-        jobtest::WaitForJob();
+        const std::string destination = m_dir.File("out" + std::to_string(job) + ".mov");
+        ASSERT_EQ(TqExecuteOVIX(source.c_str(), destination.c_str()), 0);
+        // Done, or ended by the callback's answer when it was installed as the job began.
+        const int result = jobtest::WaitForJob();
+        if (result == 1) {
+            ++done;
+            EXPECT_EQ(TqGetPropertyOVIX(destination.c_str()), 20) << "job " << job;
+        } else {
+            ++answered;
+            EXPECT_EQ(result, 131) << "job " << job;
+            EXPECT_FALSE(Exists(destination)) << "job " << job;
+        }
     }
     stop = true;
     setter.join();
+    EXPECT_EQ(done + answered, 10);
+    EXPECT_GT(settings + refusedSettings, 0);
+    // A job that the callback ended heard from it.
+    EXPECT_GE(g_callbackCalls.load(), answered);
 }
 
 }  // namespace

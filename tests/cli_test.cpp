@@ -664,7 +664,49 @@ TEST(CliCompareTest, MeasuresDrawsAndRefuses)
     EXPECT_NE(none.output.find("notes.txt: not a movie"), std::string::npos) << none.output;
 }
 
+// The first sound stream as ffmpeg decodes it, channels summed; empty on failure.
+std::vector<double> FfmpegMono(const std::string& path, int channels)
+{
+    TempDir scratch;
+    const std::string raw = scratch.File("sound.raw");
+    std::string output;
+    if (testsupport::RunCommand("ffmpeg -v error -nostdin -i " + Q(path) + " -map 0:a:0 -f s16le -acodec pcm_s16le " +
+                                    Q(raw) + " 2>&1",
+                                &output) != 0) {
+        return {};
+    }
+    const std::vector<uint8_t> bytes = testsupport::ReadFile(raw);
+    std::vector<double> mono(bytes.size() / 2 / channels);
+    for (size_t k = 0; k < mono.size() * channels; ++k) {
+        mono[k / channels] += static_cast<int16_t>(bytes[2 * k] | (bytes[2 * k + 1] << 8));
+    }
+    return mono;
+}
+
+// The lag of b against a that correlates best over a[from, to), within +-range frames.
+int64_t BestLag(const std::vector<double>& a, const std::vector<double>& b, int64_t from, int64_t to, int64_t range)
+{
+    int64_t best = 0;
+    double bestScore = -2;
+    for (int64_t lag = -range; lag <= range; ++lag) {
+        double ab = 0, aa = 0, bb = 0;
+        for (int64_t f = from; f < to && f + lag >= 0 && f + lag < static_cast<int64_t>(b.size()); ++f) {
+            ab += a[f] * b[f + lag];
+            aa += a[f] * a[f];
+            bb += b[f + lag] * b[f + lag];
+        }
+        const double score = aa > 0 && bb > 0 ? ab / std::sqrt(aa * bb) : -1;
+        if (score > bestScore) {
+            bestScore = score;
+            best = lag;
+        }
+    }
+    return best;
+}
+
 // AAC re-encoded by a job: no offset against the source, and a close match outside the intervals.
+// compare decodes through the library's own codecs, which the job used too: ffmpeg, reading the
+// edit lists as any player does, says first where the sound really lies.
 TEST(CliCompareTest, AacDestinationsMatchTheirSourceWithoutOffset)
 {
     TempDir dir;
@@ -682,6 +724,12 @@ TEST(CliCompareTest, AacDestinationsMatchTheirSourceWithoutOffset)
     ASSERT_TRUE(moviekit::AddMakerData(source, recipe, 3 * 48000, &error)) << error;
     const std::string processed = dir.File("dst.mov");
     ASSERT_EQ(Tool("process " + Q(source) + " " + Q(processed) + " --quiet").status, 0);
+    const std::vector<double> before = FfmpegMono(source, 2);
+    const std::vector<double> after = FfmpegMono(processed, 2);
+    ASSERT_GT(before.size(), 48000u);
+    ASSERT_EQ(after.size(), before.size());
+    // A stretch before the interval, past the encoders' first packets; the sweep has one best match.
+    EXPECT_EQ(BestLag(before, after, 4096, 4096 + 16384, 2048), 0) << "ffmpeg hears the sound moved";
     const Outcome measured = Tool("compare " + Q(source) + " " + Q(processed) + " --json");
     ASSERT_EQ(measured.status, 0) << measured.output;
     EXPECT_EQ(Numbers(measured.output, "offsetFrames"), std::vector<double>{0}) << measured.output;

@@ -193,10 +193,19 @@ TEST(ProgressDataControlTest, ReaderNeverSeesHalfOfTwoNotifications)
 {
     CTqovixProgressDataControl progress;
     progress.SetFinished(eTqovixRunning);
+    constexpr long kReads = 20000;
+    std::atomic<long> reads{0};
     std::atomic<bool> done{false};
+    unsigned long written = 0;
+    // The writer starts once the reader reads and goes on until it has read often: reads and
+    // writes overlap, however the two threads are scheduled.
     std::thread writer([&] {
-        for (unsigned long i = 1; i <= 20000; ++i) {
+        while (reads == 0) {
+            std::this_thread::yield();
+        }
+        for (unsigned long i = 1; (i <= 20000 || reads < kReads) && i < (1ul << 30); ++i) {
             progress.SetProgress(i, 2 * i);
+            written = i;
         }
         done = true;
     });
@@ -205,9 +214,16 @@ TEST(ProgressDataControlTest, ReaderNeverSeesHalfOfTwoNotifications)
         int first = 0, second = 0;
         progress.GetProgress(&first, &second);
         torn += second != 2 * first ? 1 : 0;
+        ++reads;
     }
     writer.join();
     EXPECT_EQ(torn, 0);
+    EXPECT_GE(reads.load(), kReads);
+    ASSERT_GE(written, 20000u);
+    int first = 0, second = 0;
+    progress.GetProgress(&first, &second);
+    EXPECT_EQ(std::pair(first, second), std::pair(static_cast<int>(written), static_cast<int>(2 * written)))
+        << "the last notification is what the reader sees";
 }
 
 }  // namespace

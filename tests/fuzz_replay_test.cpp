@@ -23,16 +23,18 @@ TEST(FuzzReplayTest, KeptInputsRunCleanly)
                                        {"trackatoms", fuzztarget::TrackAtoms},
                                        {"property", fuzztarget::Property},
                                        {"job", fuzztarget::Job}}) {
+        // Every target keeps at least one input: a folder gone missing is a replay that silently stopped.
         const std::filesystem::path directory = root / name;
-        if (!std::filesystem::is_directory(directory)) {
-            continue;
-        }
+        ASSERT_TRUE(std::filesystem::is_directory(directory)) << directory << " is missing";
+        size_t kept = 0;
         for (const auto& entry : std::filesystem::directory_iterator(directory)) {
             SCOPED_TRACE(entry.path().string());
             const std::vector<uint8_t> bytes = testsupport::ReadFile(entry.path().string());
-            EXPECT_EQ(target(bytes.data(), bytes.size()), 0);
-            ++inputs;
+            EXPECT_EQ(target(bytes.data(), bytes.size()), 0) << "a property of the target does not hold";
+            ++kept;
         }
+        EXPECT_GT(kept, 0u) << directory << " holds no input";
+        inputs += kept;
     }
     RecordProperty("inputs", static_cast<int>(inputs));
 }

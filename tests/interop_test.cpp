@@ -5,6 +5,7 @@
 #include "host/ChunkAccount.h"
 #include "host/JobHarness.h"
 #include "MakerInjector.h"
+#include "support/ProcessedRegions.h"
 
 #include <algorithm>
 #include <cmath>
@@ -21,6 +22,11 @@ using moviekit::AfInterval;
 constexpr int kDone = 1;
 constexpr int kRefused = 8;
 constexpr double kSeconds = 2.0;
+// Signal over difference between the decodes of the source and of the re-encoded destination, per
+// channel: a second generation measures above 30 dB where nothing was processed, rumble processed
+// at 70 % strength about 3 dB.
+constexpr double kAacKeptDb = 20.0;
+constexpr double kAacChangedDb = 10.0;
 
 enum class Sound { Pcm, Aac };
 
@@ -45,13 +51,24 @@ std::string Shell(const std::string& command)
     return status == 0 ? "" : output.empty() ? "exit " + std::to_string(status) : output;
 }
 
-// A sweep under a slow swell: no two stretches alike, so a cross-correlation has one peak.
-std::string SoundSource(uint32_t rate, uint32_t channels)
+// A sweep under a slow swell: no two stretches alike, so a cross-correlation has one peak. Over
+// each interval (and 20 ms either side) a loud low rumble, so that processing there must change
+// samples, down to the ramp's first steps at low rates.
+std::string SoundSource(uint32_t rate, uint32_t channels, const std::vector<AfInterval>& intervals)
 {
+    std::ostringstream motor;
+    motor << "(0";
+    for (const AfInterval& interval : intervals) {
+        motor << "+between(t," << (static_cast<double>(interval.startFrame) - rate / 50.0) / rate << ","
+              << (static_cast<double>(interval.endFrame) + rate / 50.0) / rate << ")";
+    }
+    motor << ")";
     std::ostringstream expression;
     for (uint32_t c = 0; c < channels; ++c) {
         expression << (c ? "|" : "") << "(0.3+0.1*sin(2*PI*1.3*t+" << c
-                   << "))*sin(2*PI*(180*t+260*t*t))+0.08*sin(2*PI*(2100+" << 150 * c << ")*t)";
+                   << "))*sin(2*PI*(180*t+260*t*t))+0.08*sin(2*PI*(2100+" << 150 * c << ")*t)+" << motor.str()
+                   << "*0.12*(sin(2*PI*47*t+" << c << ")+sin(2*PI*78*t+1.3)+sin(2*PI*109*t+2.6+" << c
+                   << ")+sin(2*PI*140*t+3.9))";
     }
     std::ostringstream source;
     source << "-f lavfi -i \"aevalsrc='" << expression.str() << "':s=" << rate << ":d=" << kSeconds << "\"";
@@ -99,6 +116,15 @@ std::vector<int16_t> Decode(const std::string& path, int index)
     return samples;
 }
 
+std::vector<testsupport::FrameSpan> Spans(const std::vector<AfInterval>& intervals)
+{
+    std::vector<testsupport::FrameSpan> spans;
+    for (const AfInterval& interval : intervals) {
+        spans.push_back({interval.startFrame, interval.endFrame});
+    }
+    return spans;
+}
+
 bool Outside(uint64_t frame, const std::vector<AfInterval>& intervals, uint64_t margin)
 {
     for (const AfInterval& span : intervals) {
@@ -137,7 +163,7 @@ protected:
     {
         const std::string path = m_dir.File(std::string("source") + w.extension);
         const std::string video = "-f lavfi -i testsrc=size=64x36:rate=30:d=" + std::to_string(kSeconds);
-        EXPECT_EQ(Shell("ffmpeg -v error -nostdin -y " + video + " " + SoundSource(w.rate, w.channels) +
+        EXPECT_EQ(Shell("ffmpeg -v error -nostdin -y " + video + " " + SoundSource(w.rate, w.channels, intervals) +
                         " -map 0:v -map 1:a -c:v mjpeg -c:a " + w.codec + " -ac " + std::to_string(w.channels) +
                         " " + w.extra + " " + testsupport::ShellQuote(path)),
                   "");
@@ -183,6 +209,11 @@ protected:
         for (size_t i = 0; i < intervals.size(); ++i) {
             EXPECT_GT(changedInside[i] * 2, inside[i]) << "AF interval " << i << " left as it was";
         }
+        // At 44.1 and 48 kHz the ramp's first weights (1e-5) cannot move a sample by one step; at
+        // low rates they can, so there processing must begin and end where the ramps do.
+        if (w.rate < 20000) {
+            EXPECT_EQ(testsupport::CheckProcessedRegions(before, after, w.channels, Spans(intervals), ramp), "");
+        }
     }
 
     void ExpectAacInSync(const std::string& source, const std::string& destination, const Writer& w,
@@ -193,7 +224,6 @@ protected:
         ASSERT_EQ(b.size(), a.size()) << "the sound changed its length";
         // The encoder's lead-in (its first packet) cannot match; the rest outside the intervals must.
         const int64_t from = 2048;
-        const auto frames = static_cast<int64_t>(a.size() / w.channels);
         const auto outside = [&](int64_t f) { return Outside(static_cast<uint64_t>(f), intervals, 2048); };
         int64_t lag = 0;
         double best = -2;
@@ -205,7 +235,10 @@ protected:
             }
         }
         EXPECT_EQ(lag, 0) << "the sound moved against the video";
-        EXPECT_GT(Correlation(a, b, w.channels, 0, from, frames, outside), 0.99);
+        // Every channel: within coding noise outside, the rumble gone inside.
+        EXPECT_EQ(jobtest::CheckReencodedSound(a, b, w.channels, Spans(intervals), 2048, 2048, kAacKeptDb,
+                                               kAacChangedDb),
+                  "");
     }
 };
 
@@ -272,6 +305,7 @@ INSTANTIATE_TEST_SUITE_P(
                       Writer{"PcmBigEndian44kMono", "pcm_s16be", 44100, 1, ".mov", "", 0},
                       Writer{"PcmLittleEndian44kStereo", "pcm_s16le", 44100, 2, ".mov", "", 0},
                       Writer{"PcmSixChannels", "pcm_s16le", 48000, 6, ".mov", "", 0},
+                      Writer{"PcmBigEndian8kStereo", "pcm_s16be", 8000, 2, ".mov", "", 0},
                       Writer{"AacStereo48kMov", "aac", 48000, 2, ".mov", "", 0, Sound::Aac},
                       Writer{"AacMono44kMov", "aac", 44100, 1, ".mov", "", 0, Sound::Aac},
                       Writer{"AacMono48kMp4", "aac", 48000, 1, ".mp4", kMp42, 0, Sound::Aac},

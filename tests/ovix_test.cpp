@@ -6,6 +6,7 @@
 #include "ByteWriter.h"
 #include "MakerData.h"
 #include "support/OvixHarness.h"
+#include "support/ProcessedRegions.h"
 #include "NoiseSuppressor.h"
 
 #include <algorithm>
@@ -287,6 +288,57 @@ INSTANTIATE_TEST_SUITE_P(Strengths, OvixStrengthTest,
                          ::testing::Values(StrengthRow{"Full", 1000, -99.0, -12.0}, StrengthRow{"Half", 500, -9.0, -3.0},
                                            StrengthRow{"BeyondFull", 4000, -99.0, -12.0}),
                          [](const ::testing::TestParamInfo<StrengthRow>& info) { return std::string(info.param.name); });
+
+struct RegionRow {
+    const char* name;
+    unsigned long kiloHertz;
+    uint32_t rate;        // what those kHz stand for
+    unsigned channels;
+    int32_t startOffset;  // frames the record's positions move by
+    uint32_t recordRate;  // the rate the AF record counts in
+    size_t deliveryFrames;
+};
+void PrintTo(const RegionRow& row, std::ostream* os) { *os << row.name; }
+
+class OvixRegionTest : public OvixTest, public ::testing::WithParamInterface<RegionRow> {};
+
+// Processing begins and ends where the intervals, moved by the start offset and widened by the ramp,
+// do: to the frame, give or take one. At these rates the ramp's first weights change loud samples,
+// so an interval placed one frame late or early shows at one end or the other.
+TEST_P(OvixRegionTest, ProcessingKeepsToTheIntervalsAndTheirRamps)
+{
+    const RegionRow& row = GetParam();
+    const uint64_t frames = 3 * uint64_t{row.rate};
+    const std::vector<moviekit::AfInterval> intervals = {
+        {row.recordRate / 2, row.recordRate * 7 / 8, 1000},
+        {row.recordRate * 5 / 4, row.recordRate * 5 / 4 + row.recordRate / 20, 600},
+        {row.recordRate * 2, row.recordRate * 5 / 2, 300}};
+    std::vector<testsupport::FrameSpan> spans;
+    for (const moviekit::AfInterval& interval : intervals) {
+        // Starts round down and ends up when the record counts in another rate.
+        const uint64_t start = interval.startFrame * row.rate / row.recordRate;
+        const uint64_t end = (interval.endFrame * uint64_t{row.rate} + row.recordRate - 1) / row.recordRate;
+        spans.push_back({start + row.startOffset, end + row.startOffset});
+    }
+    Script script{.afBlock = AfBlock(intervals, row.recordRate),
+                  .pcm = testsupport::MotorOverSpans(frames, row.channels, row.rate, spans),
+                  .channels = row.channels,
+                  .audioFrameLimit = row.deliveryFrames};
+    const std::vector<int16_t> input = script.pcm;
+    const TqovixAudioInformation audio{sizeof(TqovixAudioInformation), row.kiloHertz, row.channels, 16, frames,
+                                       static_cast<unsigned>(row.startOffset), 0};
+    ASSERT_EQ(Run(std::move(script), audio), ovix::kSessionFinished);
+    EXPECT_EQ(testsupport::CheckProcessedRegions(input, m_harness->pushed, row.channels, spans, row.rate / 100), "");
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Placements, OvixRegionTest,
+    ::testing::Values(RegionRow{"Stereo8k", 8, 8000, 2, 0, 8000, SIZE_MAX / 64},
+                      RegionRow{"Stereo8kShiftedLater", 8, 8000, 2, 333, 8000, SIZE_MAX / 64},
+                      RegionRow{"Stereo8kShiftedEarlierInOddDeliveries", 8, 8000, 2, -250, 8000, 700},
+                      RegionRow{"FourChannels11025RecordAt48k", 11, 11025, 4, 0, 48000, SIZE_MAX / 64},
+                      RegionRow{"SixChannels8kShiftedLater", 8, 8000, 6, 77, 8000, SIZE_MAX / 64}),
+    [](const ::testing::TestParamInfo<RegionRow>& info) { return std::string(info.param.name); });
 
 // A full-scale 50 Hz square wave: the high-pass doubles every edge, which must clip, not wrap.
 TEST_F(OvixTest, EdgesSaturate)

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <cstdint>
+#include <fstream>
 #include <functional>
 #include <sstream>
 #include <string>
@@ -459,7 +460,7 @@ TEST_F(TrackTest, RewritesKeepEachTableOrGrowItIntoCo64)
     far.back().offset = (uint64_t{1} << 32) + 12;
     CTqovixAudioDataVisitor update;
     update.SetAudioChunkInformation(far);
-    EXPECT_NE(m_tree.Update(update), eTqovixErrorInternal);
+    EXPECT_EQ(m_tree.Update(update), eTqovixVisitSkip) << "the rewrite walks the whole tree";
     const Bytes written = WriteTree();
     ASSERT_EQ(Load(written), eTqovixSuccess);
     CTqovixTrackListVisitor tracks;
@@ -470,6 +471,56 @@ TEST_F(TrackTest, RewritesKeepEachTableOrGrowItIntoCo64)
     Chunks read;
     ASSERT_EQ(TqovixBuildChunkList(tracks.GetTracks()[1], 0, read), eTqovixSuccess);
     EXPECT_EQ(read, far);
+
+    // ffprobe, which shares nothing with our reader, finds every packet where the records put it:
+    // the rewritten movie with the last sound chunk moved past 4 GiB into a sparse file.
+    testsupport::TempDir dir;
+    const std::string path = dir.File("co64.mov");
+    ASSERT_TRUE(testsupport::WriteFile(path, written));
+    const std::vector<uint8_t> lastChunk(movie.begin() + static_cast<std::ptrdiff_t>(sound.back().offset),
+                                         movie.begin() + static_cast<std::ptrdiff_t>(sound.back().offset +
+                                                                                     sound.back().size));
+    {
+        std::fstream file(path, std::ios::in | std::ios::out | std::ios::binary);
+        file.seekp(static_cast<std::streamoff>(far.back().offset));
+        file.write(reinterpret_cast<const char*>(lastChunk.data()), static_cast<std::streamsize>(lastChunk.size()));
+        ASSERT_TRUE(file.good());
+    }
+    const auto packets = [&](const char* stream) {
+        std::string output;
+        EXPECT_EQ(testsupport::RunCommand("ffprobe -v error -select_streams " + std::string(stream) +
+                                              " -show_entries packet=pos,size -of csv=p=0 " +
+                                              testsupport::ShellQuote(path),
+                                          &output),
+                  0);
+        // "size,pos" per packet; a packet with side data adds a field and a line of its own.
+        std::istringstream lines(output);
+        std::string line;
+        std::string sizes;
+        while (std::getline(lines, line)) {
+            std::istringstream fields(line);
+            std::string size;
+            std::string position;
+            if (std::getline(fields, size, ',') && std::getline(fields, position, ',') && !size.empty()) {
+                sizes += size + "," + position + "\n";
+            }
+        }
+        return sizes;
+    };
+    const auto expected = [](const Chunks& chunks, uint64_t commonSize) {
+        std::ostringstream out;
+        for (const TqovixChunkInformation& chunk : chunks) {
+            uint64_t at = chunk.offset;
+            for (uint32_t k = 0; k < chunk.sampleCount; ++k) {
+                const uint64_t size = chunk.sampleSizes.empty() ? commonSize : chunk.sampleSizes[k];
+                out << size << "," << at << "\n";
+                at += size;
+            }
+        }
+        return out.str();
+    };
+    EXPECT_EQ(packets("a:0"), expected(far, 0));
+    EXPECT_EQ(packets("v:0"), expected(video, video.front().size / video.front().sampleCount));
 }
 
 }  // namespace

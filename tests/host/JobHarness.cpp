@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cmath>
 #include <sstream>
 #include <thread>
 #include <utility>
@@ -122,6 +123,76 @@ bool DecodeSound(const std::string& path, std::vector<int16_t>& samples)
         samples[k] = static_cast<int16_t>(bytes[2 * k] | (bytes[2 * k + 1] << 8));
     }
     return true;
+}
+
+std::string CheckReencodedSound(const std::vector<int16_t>& source, const std::vector<int16_t>& destination,
+                                unsigned channels, const std::vector<testsupport::FrameSpan>& spans, uint64_t margin,
+                                uint64_t leadIn, double keptDb, double changedDb)
+{
+    if (source.size() != destination.size() || source.empty() || source.size() % channels != 0) {
+        return "the sound changed its length";
+    }
+    const uint64_t frames = source.size() / channels;
+    // Region of a frame: 0 outside, 1 + i inside span i, -1 near an edge, in the encoder's lead-in
+    // or in its flush at the end (not judged).
+    const auto region = [&](uint64_t f) {
+        for (size_t i = 0; i < spans.size(); ++i) {
+            if (f + margin >= spans[i].start && f < spans[i].end + margin) {
+                return f >= spans[i].start + margin && f + margin < spans[i].end ? static_cast<int>(i) + 1 : -1;
+            }
+        }
+        return f < leadIn || f + leadIn >= frames ? -1 : 0;
+    };
+    const auto decibels = [](double signal, double difference) {
+        return difference == 0 ? 999.0 : signal == 0 ? -999.0 : 10.0 * std::log10(signal / difference);
+    };
+    // Outside, packet by packet, so that one packet out of place or gone quiet shows.
+    constexpr uint64_t kBlock = 1024;
+    std::ostringstream problems;
+    for (unsigned c = 0; c < channels; ++c) {
+        std::vector<double> signal(spans.size() + 1);
+        std::vector<double> difference(spans.size() + 1);
+        double worst = 999.0;
+        uint64_t worstAt = 0;
+        uint64_t blocks = 0;
+        for (uint64_t from = 0; from + kBlock <= frames; from += kBlock) {
+            double blockSignal = 0;
+            double blockDifference = 0;
+            bool outside = true;
+            for (uint64_t f = from; f < from + kBlock; ++f) {
+                const int r = region(f);
+                const double a = source[f * channels + c];
+                const double b = destination[f * channels + c];
+                outside = outside && r == 0;
+                if (r >= 0) {
+                    signal[r] += a * a;
+                    difference[r] += (a - b) * (a - b);
+                }
+                blockSignal += a * a;
+                blockDifference += (a - b) * (a - b);
+            }
+            if (outside) {
+                ++blocks;
+                if (decibels(blockSignal, blockDifference) < worst) {
+                    worst = decibels(blockSignal, blockDifference);
+                    worstAt = from;
+                }
+            }
+        }
+        if (blocks == 0) {
+            problems << "no whole block outside the intervals to judge; ";
+        } else if (worst < keptDb) {
+            problems << "channel " << c << " outside the intervals, frames " << worstAt << " on: " << worst
+                     << " dB from the source; ";
+        }
+        for (size_t r = 1; r < signal.size(); ++r) {
+            if (decibels(signal[r], difference[r]) > changedDb) {
+                problems << "channel " << c << " in interval " << r - 1 << ": " << decibels(signal[r], difference[r])
+                         << " dB from the source, as good as unchanged; ";
+            }
+        }
+    }
+    return problems.str();
 }
 
 std::vector<uint8_t> ReadRange(const std::string& path, uint64_t offset, uint64_t size)

@@ -12,6 +12,7 @@
 
 #include "Movie.h"
 #include "api/TqOVIXUtility.h"
+#include "support/ProcessedRegions.h"
 #include "support/TestSupport.h"
 
 namespace jobtest {
@@ -39,6 +40,15 @@ std::string ProbeErrors(const std::string& path);
 uint64_t PacketCount(const std::string& path, const std::string& stream);
 // Decodes the first sound stream to interleaved s16; false when ffmpeg reports an error.
 bool DecodeSound(const std::string& path, std::vector<int16_t>& samples);
+
+// Re-encoded sound against the source's decode, both from ffmpeg, channel by channel and frame
+// for frame (no lag allowed): outside the spans widened by `margin` (where coding smears an edge),
+// apart from the first and last `leadIn` frames (the encoder's start and flush), every whole block
+// of 1024 frames at least `keptDb` of signal over difference; inside each span shrunk by `margin`,
+// at most `changedDb`. Empty when that holds, else what does not.
+std::string CheckReencodedSound(const std::vector<int16_t>& source, const std::vector<int16_t>& destination,
+                                unsigned channels, const std::vector<testsupport::FrameSpan>& spans, uint64_t margin,
+                                uint64_t leadIn, double keptDb, double changedDb);
 
 // A top-level atom as its header declares it (size 0 runs to the end of the file).
 struct TopAtom {
