@@ -1,0 +1,79 @@
+"""The case table: which clean material, which lens motor, which SNR and which movie format.
+
+Each material meets each motor once; the SNRs rotate so that every motor is heard at 0, 5
+and 10 dB across the materials.  Every clip is 8 s with three AF intervals of 0.5-2 s; in
+about half of the clips one interval is motor-free (the AF drive was inaudible), in the
+others all three carry the motor.  --quick keeps a spread of eight of them.
+"""
+from dataclasses import dataclass
+
+import numpy as np
+
+from motors import KINDS
+
+SECONDS = 8.0
+# (name, material kind, rate, channels)
+MATERIALS = [
+    ("speech-mono", "speech", 48000, 1),
+    ("voice-mono", "voice", 48000, 1),
+    ("music-stereo", "music", 48000, 2),
+    ("ambience-stereo", "ambience", 48000, 2),
+    ("music-mono-44k", "music", 44100, 1),
+    ("speech-stereo", "speech", 48000, 2),
+]
+SNRS = [0, 5, 10]
+
+
+@dataclass
+class Case:
+    name: str
+    material: str
+    kind: str
+    rate: int
+    channels: int
+    motor: str
+    snr: float
+    codec: str
+    seed: int
+    intervals: list      # [(start, end)] frames, exclusive end
+    motor_in: list       # per interval: whether the motor runs
+
+
+def _intervals(rate, rng, count):
+    """count intervals of 0.5-2 s, at least 0.35 s from each other and from the clip's ends."""
+    frames = int(SECONDS * rate)
+    while True:
+        lengths = rng.uniform(0.5, 2.0, count)
+        free = SECONDS - lengths.sum() - 0.35 * (count + 1)
+        if free < 0:
+            continue
+        gaps = rng.dirichlet(np.ones(count + 1)) * free + 0.35
+        out, at = [], 0.0
+        for i in range(count):
+            at += gaps[i]
+            out.append((int(at * rate), min(int((at + lengths[i]) * rate), frames)))
+            at += lengths[i]
+        return out
+
+
+def all_cases():
+    cases = []
+    for m, (mname, kind, rate, channels) in enumerate(MATERIALS):
+        for k, motor in enumerate(KINDS):
+            index = m * len(KINDS) + k
+            snr = SNRS[(m + k) % 3]
+            codec = "aac" if index % 6 == 5 else ("sowt" if index % 4 == 1 else "twos")
+            rng = np.random.default_rng(1000 + index)
+            intervals = _intervals(rate, rng, 3)
+            motor_in = [True, True, True]
+            if index % 2 == 0:
+                motor_in[int(rng.integers(3))] = False
+            cases.append(Case(f"{mname}/{motor}/{snr}dB/{codec}", mname, kind, rate, channels, motor, snr, codec,
+                              1000 + index, intervals, motor_in))
+    return cases
+
+
+def quick_cases():
+    picks = [0, 7, 9, 11, 16, 20, 23, 28]
+    every = all_cases()
+    return [every[i] for i in picks]
