@@ -277,6 +277,17 @@ TEST_P(PropertyVerdictTest, LeavesFileAndEngineAlone)
     EXPECT_EQ(TqGetPropertyOVIX(path.c_str()), GetParam().expected);
     EXPECT_EQ(StampFile(path), before);
     EXPECT_EQ(TqIsFinishedOVIX(), 1);
+    // What the query promises, a job's start keeps: refused at once with the same code, or
+    // started and ended with the library's verdict.
+    const std::string destination = m_dir.File("out.mov");
+    const int started = TqExecuteOVIX(path.c_str(), destination.c_str());
+    if (GetParam().expected == 8) {
+        EXPECT_EQ(started, 8);
+    } else {
+        ASSERT_EQ(started, 0);
+        EXPECT_EQ(jobtest::WaitForJob(std::chrono::seconds(30)), GetParam().expected == 0 ? 1 : GetParam().expected);
+    }
+    EXPECT_EQ(jobtest::Exists(destination), GetParam().expected == 0);
 }
 
 INSTANTIATE_TEST_SUITE_P(
@@ -289,7 +300,9 @@ INSTANTIATE_TEST_SUITE_P(
                     9},
         PropertyRow{"ShortAfBlock", [](Recipe& r) { r.maker.afPayload = moviekit::Bytes{'A', 'F'}; }, 7},
         PropertyRow{"NoAfBlock", [](Recipe& r) { r.maker.afInformation = false; }, 8},
-        PropertyRow{"OtherBrand", [](Recipe& r) { r.majorBrand = "isom"; }, 8}),
+        PropertyRow{"OtherBrand", [](Recipe& r) { r.majorBrand = "isom"; }, 8},
+        PropertyRow{"NoTagAtom", [](Recipe& r) { r.maker.tagAtom = false; }, 8},
+        PropertyRow{"NoTrimTags", [](Recipe& r) { r.maker.tags = std::vector<moviekit::Tag>{}; }, 8}),
     [](const ::testing::TestParamInfo<PropertyRow>& info) { return std::string(info.param.name); });
 
 TEST_F(ApiTest, PropertyQueryNamesMissingDirectoryAndUnreadable)
@@ -527,6 +540,31 @@ std::string Shell(const std::string& command)
     std::string output;
     const int status = testsupport::RunCommand(command + " 2>&1", &output);
     return status == 0 ? "" : output.empty() ? "exit " + std::to_string(status) : output;
+}
+
+// A track of near silence averages a few kb/s, below what any encoder takes: the job
+// re-encodes at a usable rate instead of refusing what the query accepted.
+TEST_F(ApiTest, AacOfNearSilenceIsProcessed)
+{
+    const std::string source = m_dir.File("quiet.mov");
+    ASSERT_EQ(Shell("ffmpeg -v error -nostdin -y -f lavfi -i testsrc=size=64x36:rate=30:d=2 -f lavfi -i "
+                    "anullsrc=r=48000:cl=mono -t 2 -map 0:v -map 1:a -c:v mjpeg -c:a aac " +
+                    testsupport::ShellQuote(source)),
+              "");
+    std::string rate;
+    ASSERT_EQ(testsupport::RunCommand("ffprobe -v error -select_streams a -show_entries stream=bit_rate -of csv=p=0 " +
+                                          testsupport::ShellQuote(source),
+                                      &rate),
+              0);
+    ASSERT_LT(std::stol(rate), 8000) << "the source must average below the encoder's lowest rate";
+    Recipe recipe;
+    std::string error;
+    ASSERT_TRUE(moviekit::AddMakerData(source, recipe, 48000, &error)) << error;
+    ASSERT_EQ(TqGetPropertyOVIX(source.c_str()), 0);
+    const std::string destination = m_dir.File("out.mov");
+    EXPECT_EQ(Run(source, destination), 1);
+    EXPECT_EQ(jobtest::ProbeErrors(destination), "");
+    EXPECT_EQ(TqGetPropertyOVIX(destination.c_str()), 20);
 }
 
 // Another muxer's esds: sizes in the two-byte form 80 NN. ffprobe still reads the movie,

@@ -1,5 +1,6 @@
 #include "codec/CTqovixAudioDataControlMac.h"
 
+#include <algorithm>
 #include <new>
 
 #include "bridge/TqovixInterfaceConvert.h"
@@ -11,6 +12,7 @@ namespace {
 
 constexpr unsigned int kStreamBufferSize = 4096;
 constexpr uint32_t kPcmFlags = 12;  // signed integer, packed, host order
+constexpr double kFloorBitRatePerChannel = 64000;
 
 }  // namespace
 
@@ -89,6 +91,14 @@ eTqovixErrorCode CTqovixAudioDataControlMac::OpenEncoderAAC(
     m_pEncoderStream->buffer = m_pStreamBuffer.get();
     m_pEncoderStream->bufferSize = kStreamBufferSize;
     m_pEncoderStream->userData = m_pBinding.get();
+    // The source's average rate says what its sound cost, not what the processed sound needs:
+    // a track of near silence averages a few kb/s, which no encoder takes. Quality has a floor.
+    if (bitRate != 0) {
+        // 64 kb/s a channel, less at low rates, where a frame holds fewer bits.
+        const double perChannel = std::min(kFloorBitRatePerChannel, m_pAACFormat->sampleRate * 4 / 3);
+        const auto floor = static_cast<unsigned int>(perChannel * m_pAACFormat->channelsPerFrame);
+        bitRate = std::max(bitRate, floor);
+    }
     const eTqovixErrorCode opened =
         ConvertOVIXResult(m_pEncoder->Initialize(*m_pPCMFormat, *m_pAACFormat, bitRate, m_pEncoderStream.get()));
     if (TqovixFailed(opened)) {

@@ -100,6 +100,18 @@ eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const cha
         m_audioLevelInformation = level.TakeAudioLevelInformation();
     }
     result = AnalyzeTracks(destinationPath != nullptr);
+    if (!TqovixFailed(result)) {
+        // The job's start needs the trim tags too: the property query must not promise a job
+        // that its start refuses.
+        CTqovixTrimInformationVisitor trim;
+        const eTqovixErrorCode found = m_atomControl.Analyze(trim);
+        if (TqovixFailed(found)) {
+            result = found == eTqovixErrorInvalidMovie
+                         ? Refuse(found, eTqovixRefusal::Malformed,
+                                  "the maker's tag atom lacks the trim information (removed frames and frame rate)")
+                         : found;
+        }
+    }
     if (TqovixFailed(result)) {
         Close();
     }
