@@ -403,6 +403,17 @@ TEST_P(CliLateFileTest, KeptUnlessForced)
     command = Filled(Filled(command, "{DST}", Q(destination)), "{OUT}", Q(out));
     Outcome outcome{};
     std::atomic<bool> ended{false};
+    const auto makeTheirs = [&] {
+        const int made = open(destination.c_str(), O_CREAT | O_EXCL | O_WRONLY | O_CLOEXEC, 0644);
+        const bool written = made >= 0 && write(made, "theirs", 6) == 6;
+        if (made >= 0) {
+            close(made);
+        }
+        return written;
+    };
+    // Replacing takes whatever stands there when the job ends, early or late: made first, so
+    // that a fast job cannot end before it.
+    const bool early = row.replaced && makeTheirs();
     std::thread job([&] {
         outcome.status = testsupport::RunCommand("timeout 120 " + Q(TQOVIX_TOOL) + " " + command + " 2>" + Q(errors),
                                                  &outcome.output);
@@ -415,11 +426,7 @@ TEST_P(CliLateFileTest, KeptUnlessForced)
     while (!ended && !running()) {
         std::this_thread::sleep_for(std::chrono::milliseconds(2));
     }
-    const int made = open(destination.c_str(), O_CREAT | O_EXCL | O_WRONLY | O_CLOEXEC, 0644);
-    const bool written = made >= 0 && write(made, "theirs", 6) == 6;
-    if (made >= 0) {
-        close(made);
-    }
+    const bool written = early || makeTheirs();
     job.join();
     ASSERT_TRUE(written) << "the job named its destination before the test could make a file there\n" << outcome.output;
     const std::vector<uint8_t> told = testsupport::ReadFile(errors);
