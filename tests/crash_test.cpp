@@ -68,6 +68,16 @@ class CrashTest : public ::testing::TestWithParam<CrashRow> {
 protected:
     void TearDown() override { CTqovixFile::SetUnnamedDestinations(true); }
 
+    static void WriteSource(const CrashRow& row, const std::string& source)
+    {
+        moviekit::MovieRecipe recipe;
+        recipe.sound.codec = row.codec;
+        recipe.video.frameCount = 150;
+        recipe.video.frameSize = 60000;  // about 10 MB, so that kills land inside the job
+        std::string error;
+        ASSERT_TRUE(moviekit::WriteMovie(source, recipe, nullptr, &error)) << error;
+    }
+
     // After a kill: the name holds nothing new or the complete movie, and beside it only
     // hidden partial files. True when the complete movie is there.
     bool ExpectNoDamage(const CrashRow& row, const std::string& kill, const std::vector<uint8_t>& earlier)
@@ -103,14 +113,9 @@ TEST_P(CrashTest, KilledAnywhereTheNameHoldsNothingNewOrTheWholeMovie)
 {
     const CrashRow& row = GetParam();
     CTqovixFile::SetUnnamedDestinations(row.unnamed);
-    moviekit::MovieRecipe recipe;
-    recipe.sound.codec = row.codec;
-    recipe.video.frameCount = 150;
-    recipe.video.frameSize = 60000;  // about 10 MB, so that kills land inside the job
     const std::string source = m_dir.File("src.mov");
     const std::string destination = m_dir.File("dst.mov");
-    std::string error;
-    ASSERT_TRUE(moviekit::WriteMovie(source, recipe, nullptr, &error)) << error;
+    ASSERT_NO_FATAL_FAILURE(WriteSource(row, source));
     const std::vector<uint8_t> earlier = {'o', 'l', 'd'};
 
     // A clean run gives the job's length, over which the kills are spread.
@@ -215,14 +220,9 @@ TEST_P(CrashTest, KilledAtEveryStage)
 {
     const CrashRow& row = GetParam();
     CTqovixFile::SetUnnamedDestinations(row.unnamed);
-    moviekit::MovieRecipe recipe;
-    recipe.sound.codec = row.codec;
-    recipe.video.frameCount = 150;
-    recipe.video.frameSize = 60000;
     const std::string source = m_dir.File("src.mov");
     const std::string destination = m_dir.File("dst.mov");
-    std::string error;
-    ASSERT_TRUE(moviekit::WriteMovie(source, recipe, nullptr, &error)) << error;
+    ASSERT_NO_FATAL_FAILURE(WriteSource(row, source));
     const std::vector<uint8_t> earlier = {'o', 'l', 'd'};
     std::vector<Stage> stages = {Stage::BeforeOutput, Stage::Sound, Stage::Publishing};
     if (row.codec != moviekit::SoundCodec::Aac) {

@@ -120,6 +120,20 @@ struct OperationRow {
 };
 void PrintTo(const OperationRow& row, std::ostream* out) { *out << row.name; }
 
+const std::vector<uint8_t> kEarlier = {'o', 'l', 'd'};
+
+// A short camera movie, and the file standing at the destination when the job replaces one.
+void PrepareFiles(const std::string& source, const std::string& destination, bool replacing)
+{
+    moviekit::MovieRecipe recipe;
+    recipe.video.frameCount = 20;
+    std::string error;
+    ASSERT_TRUE(moviekit::WriteMovie(source, recipe, nullptr, &error)) << error;
+    if (replacing) {
+        ASSERT_TRUE(testsupport::WriteFile(destination, kEarlier));
+    }
+}
+
 class OperationFaultTest : public ::testing::TestWithParam<OperationRow> {
 protected:
     void TearDown() override { CTqovixFile::SetFaultHook(nullptr); }
@@ -129,16 +143,9 @@ TEST_P(OperationFaultTest, TheHostHearsWhatTheErrorMeans)
 {
     const OperationRow& row = GetParam();
     testsupport::TempDir dir;
-    moviekit::MovieRecipe recipe;
-    recipe.video.frameCount = 20;
     const std::string source = dir.File("src.mov");
     const std::string destination = dir.File("dst.mov");
-    std::string error;
-    ASSERT_TRUE(moviekit::WriteMovie(source, recipe, nullptr, &error)) << error;
-    const std::vector<uint8_t> earlier = {'o', 'l', 'd'};
-    if (row.replacing) {
-        ASSERT_TRUE(testsupport::WriteFile(destination, earlier));
-    }
+    ASSERT_NO_FATAL_FAILURE(PrepareFiles(source, destination, row.replacing));
     g_operation = static_cast<int>(row.operation);
     g_occurrence = row.occurrence;
     g_errno = row.error;
@@ -148,7 +155,7 @@ TEST_P(OperationFaultTest, TheHostHearsWhatTheErrorMeans)
     const eTqovixErrorCode code = TqovixFailed(outcome.started) ? outcome.started : outcome.ended;
     EXPECT_GE(g_calls.load(), row.occurrence) << "the job never reached the operation";
     EXPECT_EQ(TqovixCodes::Exported(code), row.exported) << code;
-    EXPECT_EQ(testsupport::ReadFile(destination), row.replacing ? earlier : std::vector<uint8_t>{});
+    EXPECT_EQ(testsupport::ReadFile(destination), row.replacing ? kEarlier : std::vector<uint8_t>{});
     EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.Path()), {}), row.replacing ? 2 : 1)
         << "a file left behind";
 }
@@ -218,16 +225,9 @@ TEST_P(NamingFaultTest, TheHostHearsWhatTheErrorMeansAndTheNameKeepsItsFile)
     for (const bool unnamed : {true, false}) {
         CTqovixFile::SetUnnamedDestinations(unnamed);
         testsupport::TempDir dir;
-        moviekit::MovieRecipe recipe;
-        recipe.video.frameCount = 20;
         const std::string source = dir.File("src.mov");
         const std::string destination = dir.File("dst.mov");
-        std::string error;
-        ASSERT_TRUE(moviekit::WriteMovie(source, recipe, nullptr, &error)) << error;
-        const std::vector<uint8_t> earlier = {'o', 'l', 'd'};
-        if (row.replacing) {
-            ASSERT_TRUE(testsupport::WriteFile(destination, earlier));
-        }
+        ASSERT_NO_FATAL_FAILURE(PrepareFiles(source, destination, row.replacing));
         g_namingOperation = static_cast<int>(row.operation);
         g_namingCalls = 0;
         g_errno = row.error;
@@ -243,7 +243,7 @@ TEST_P(NamingFaultTest, TheHostHearsWhatTheErrorMeansAndTheNameKeepsItsFile)
         }
         reached = true;
         EXPECT_EQ(TqovixCodes::Exported(code), row.exported) << (unnamed ? "unnamed: " : "hidden name: ") << code;
-        EXPECT_EQ(testsupport::ReadFile(destination), row.replacing ? earlier : std::vector<uint8_t>{});
+        EXPECT_EQ(testsupport::ReadFile(destination), row.replacing ? kEarlier : std::vector<uint8_t>{});
         EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.Path()), {}), row.replacing ? 2 : 1)
             << "a file left behind";
     }
