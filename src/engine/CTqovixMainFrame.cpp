@@ -252,6 +252,11 @@ eTqovixErrorCode CTqovixMainFrame::GetProperty(const char* path) const
         if (!TqovixFailed(result)) {
             result = ovixbridge::TqovixIsEnable(block.data(), size);
         }
+        if (result == eTqovixSuccess) {
+            // A job's start opens the codecs too: a track they refuse is refused here as well.
+            ovixbridge::TqovixAudioInformation audio;
+            result = control.GetAudioInformation(audio);
+        }
     }
     control.Close();
     return result;

@@ -13,6 +13,7 @@
 namespace {
 
 constexpr uint32_t kMaxPcmChannels = 8;  // what the processing library takes
+constexpr uint32_t kMaxRateKiloHertz = 1000;  // likewise
 constexpr uint32_t kMaxAacChannels = 2;
 constexpr uint8_t kAacLowComplexity = 2;
 
@@ -102,6 +103,9 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
     for (const TqovixChunkInformation& chunk : m_audioChunks) {
         chunkSamples += chunk.sampleCount;
     }
+    if (information.GetCount() == 0) {
+        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::Malformed, "the sound track's tables hold no samples");
+    }
     if (m_audioChunks.empty() || information.GetCount() > chunkSamples) {
         return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::Malformed, "the sound track's tables promise more sound than its chunks hold");
     }
@@ -137,6 +141,10 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeSoundFormat(const CTqovixAudioInforma
     const uint32_t channels = information.GetChannel();
     if (information.GetRate() == 0) {
         return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound, "sound has no sample rate");
+    }
+    if (information.GetRate() > kMaxRateKiloHertz) {
+        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound,
+                      Words({"sound at ", std::to_string(information.GetEntry().sampleRateHz), " Hz is not processed"}));
     }
     if (TqovixSoundEntry::IsAac(entry)) {
         const uint8_t objectType = information.GetAudioSpecificConfigData()[0] >> 3;
