@@ -73,6 +73,22 @@ bool Holds(const std::string& path, const uint8_t* data, size_t size)
 
 bool Exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
 
+// Whether the movie's AF block carries our own payload, which processing marks; another
+// camera's payload is passed through as it is, so its result cannot say it was processed.
+bool HasOwnAfPayload(const std::string& path)
+{
+    CTqovixMovControl control;
+    bool own = false;
+    if (!TqovixFailed(control.Initialize(path.c_str(), nullptr))) {
+        std::array<uint8_t, 12> head{};
+        unsigned long delivered = 0;
+        own = !TqovixFailed(control.GetAFInformation(head.data(), &delivered, head.size(), 0)) &&
+              delivered == head.size() && std::equal(head.begin() + 8, head.end(), "AFR1");
+    }
+    control.Close();
+    return own;
+}
+
 // What the property query may answer about a readable file of ours: processable, a verdict, not
 // a movie, out of memory. 190 would be an internal failure leaking out as "anything else".
 bool IsPropertyAnswer(eTqovixErrorCode code)
@@ -318,7 +334,8 @@ int Job(const uint8_t* data, size_t size)
             broken = kRefusedWhatThePropertyAccepted;
         } else if (Exists(input.Output()) != finished) {
             broken = kOutputWithoutSuccess;
-        } else if (finished && TqovixCodes::Exported(engine.GetProperty(input.Output().c_str())) != 20) {
+        } else if (finished && HasOwnAfPayload(input.Path()) &&
+                   TqovixCodes::Exported(engine.GetProperty(input.Output().c_str())) != 20) {
             broken = kOutputNotMarkedProcessed;
         } else if (!Holds(input.Path(), data, size)) {
             broken = kSourceWritten;

@@ -16,7 +16,7 @@ enum Broken : int {
     kSourceWritten = 5,                   // the source's bytes changed
     kRefusedWhatThePropertyAccepted = 6,  // the property query said 0, the job's start refused
     kOutputWithoutSuccess = 7,            // a destination without a finished job, or none after one
-    kOutputNotMarkedProcessed = 8,        // a finished destination the property query does not call processed
+    kOutputNotMarkedProcessed = 8,        // a finished destination of our AF payload not called processed
 };
 
 // The atom tree parser with its acceptance rules, then every reading walk over what it built

@@ -252,7 +252,7 @@ eTqovixErrorCode CTqovixMainFrame::GetProperty(const char* path) const
         if (!TqovixFailed(result)) {
             result = ovixbridge::TqovixIsEnable(block.data(), size);
         }
-        if (result == eTqovixSuccess) {
+        if (result == eTqovixEnable) {
             // A job's start opens the codecs too: a track they refuse is refused here as well.
             ovixbridge::TqovixAudioInformation audio;
             result = control.GetAudioInformation(audio);

@@ -36,8 +36,10 @@ std::string PartialNameFor(const std::string& path)
     static std::atomic<unsigned> s_counter{0};
     const size_t slash = path.rfind('/');
     std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
-    const std::string tail = "." + std::to_string(getpid()) + "-" + std::to_string(++s_counter) +
-                             CTqovixFile::kPartialSuffix;
+    // Appended piece by piece: g++ 12 warns falsely on a chain of + that starts with a literal.
+    std::string tail(1, '.');
+    tail.append(std::to_string(getpid())).append(1, '-').append(std::to_string(++s_counter));
+    tail.append(CTqovixFile::kPartialSuffix);
     const size_t room = kLongestName - 1 - tail.size();
     if (name.size() > room) {
         size_t cut = room;

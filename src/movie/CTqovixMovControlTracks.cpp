@@ -121,7 +121,9 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
         }
     }
     if (!forJob) {
-        return eTqovixSuccess;
+        // The property query sets the sound up as a job's start does, so that it refuses what
+        // the start would.
+        return m_audioDataControl.Initialize(m_sourceFile, m_audioChunks, m_bBigEndian);
     }
     // Whether copying then patching will do, so that the sound served from now on is kept to
     // compare with; the writer decides for good when it starts.
