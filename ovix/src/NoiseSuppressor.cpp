@@ -2,45 +2,55 @@
 
 #include <algorithm>
 #include <cmath>
+#include <cstdio>
+#include <cstdlib>
 #include <numbers>
 
 namespace ovix {
 namespace {
 
-// Motor rumble and whine sit mostly below 1 kHz: cut below 120 Hz, shelve the rest of that
-// band down by 24 dB, and leave speech presence and ambience above 2 kHz nearly untouched.
-constexpr double kHighPassHz = 120.0;
-constexpr double kHighPassQ = std::numbers::sqrt2 / 2.0;
-constexpr double kShelfHz = 800.0;
-constexpr double kShelfGainDb = -24.0;
-constexpr uint64_t kRampsPerSecond = 100;  // 10 ms
-// The slowest pole (the high-pass's) decays by e in about 2 ms: after 100 ms a filter started
-// cold differs from one that ran all along by far less than one step of 16 bits.
-constexpr uint64_t kWarmUpsPerSecond = 10;
+// Below this share of the interval's power the motor is not audible: masked by the wanted
+// sound or too quiet to matter. The interval then leaves as it came.
+constexpr double kAudibleShare = 0.02;
+
+int64_t FloorDiv(int64_t a, int64_t b)
+{
+    return a >= 0 ? a / b : -((-a + b - 1) / b);
+}
 
 uint64_t SaturatingAdd(uint64_t a, uint64_t b)
 {
     return a > UINT64_MAX - b ? UINT64_MAX : a + b;
 }
 
-int16_t Saturate(double value)
+size_t SegmentRows(const SuppressorParameters& p)
 {
-    const long rounded = std::lrint(value);
-    return static_cast<int16_t>(std::clamp<long>(rounded, INT16_MIN, INT16_MAX));
+    return (p.segmentFrames + 2 * p.rampFrames + p.fftSize) / p.hop + 2;
 }
 
 }  // namespace
 
-NoiseSuppressor::NoiseSuppressor(uint64_t rateHz, unsigned channels)
-    : m_channels(std::clamp(channels, 1u, kMaxChannels)),
-      m_ramp(std::max<uint64_t>(1, rateHz / kRampsPerSecond)),
-      m_mix(kBlockFrames),
-      m_warmUp(std::max<uint64_t>(1, rateHz / kWarmUpsPerSecond))
+NoiseSuppressor::NoiseSuppressor(uint64_t rateHz, unsigned channels, uint64_t frameCount)
+    : m_parameters(rateHz, std::clamp(channels, 1u, kMaxChannels)),
+      m_total(frameCount),
+      m_ring(m_parameters.capacityFrames * m_parameters.channels),
+      m_fft(m_parameters.fftSize),
+      m_window(m_parameters.fftSize),
+      m_ramp(m_parameters.rampFrames),
+      m_overlap(m_parameters.fftSize * m_parameters.channels),
+      m_gain(m_parameters.bins),
+      m_roles(SegmentRows(m_parameters)),
+      m_power(SegmentRows(m_parameters), m_parameters.bins),
+      m_noise(SegmentRows(m_parameters), m_parameters.bins),
+      m_around(2 * m_parameters.contextFrames / m_parameters.hop + 4, m_parameters.bins),
+      m_estimator(m_parameters),
+      m_gainRule(m_parameters.bins)
 {
-    const double rate = static_cast<double>(std::max<uint64_t>(rateHz, 1));
-    // Keep both corners well below Nyquist at unusually low rates.
-    m_highPass = DesignHighPass(rate, std::min(kHighPassHz, 0.2 * rate), kHighPassQ);
-    m_lowShelf = DesignLowShelf(rate, std::min(kShelfHz, 0.4 * rate), kShelfGainDb);
+    const size_t n = m_parameters.fftSize;
+    for (size_t i = 0; i < n; ++i) {
+        m_window[i] = static_cast<float>(
+            std::sqrt(0.5 - 0.5 * std::cos(2.0 * std::numbers::pi * static_cast<double>(i) / static_cast<double>(n))));
+    }
     const double steps = static_cast<double>(m_ramp.size() + 1);
     for (size_t k = 0; k < m_ramp.size(); ++k) {
         m_ramp[k] = static_cast<float>(0.5 - 0.5 * std::cos(std::numbers::pi * static_cast<double>(k + 1) / steps));
@@ -50,120 +60,273 @@ NoiseSuppressor::NoiseSuppressor(uint64_t rateHz, unsigned channels)
 void NoiseSuppressor::SetSpans(std::vector<DriveSpan> spans)
 {
     m_spans = std::move(spans);
-    m_cursor = 0;
+    m_next = 0;
+    m_segmentAt = m_spans.empty() ? 0 : m_spans.front().start;
 }
 
-void NoiseSuppressor::Process(int16_t* samples, uint64_t firstFrame, size_t frames)
+bool NoiseSuppressor::PendingSegment(Segment& segment) const
 {
-    if (m_spans.empty()) {
+    if (m_next >= m_spans.size()) {
+        return false;
+    }
+    const DriveSpan& span = m_spans[m_next];
+    const uint64_t ramp = m_parameters.rampFrames;
+    segment.span = &span;
+    segment.coreStart = m_segmentAt;
+    segment.coreEnd = std::min(span.end, SaturatingAdd(m_segmentAt, m_parameters.segmentFrames));
+    segment.first = m_segmentAt == span.start;
+    segment.last = segment.coreEnd == span.end;
+    segment.writeStart = segment.first ? (span.start > ramp ? span.start - ramp : 0) : segment.coreStart;
+    segment.writeEnd = std::min(m_total, segment.last ? SaturatingAdd(span.end, ramp) : segment.coreEnd);
+    return true;
+}
+
+// The first frame a segment reads: its analysis windows and, for an interval's first
+// segment, the surroundings before it.
+uint64_t NoiseSuppressor::NeededFrom(const Segment& segment) const
+{
+    uint64_t from = segment.writeStart;
+    if (segment.first) {
+        from = from > m_parameters.contextFrames ? from - m_parameters.contextFrames : 0;
+    }
+    return from > m_parameters.fftSize ? from - m_parameters.fftSize : 0;
+}
+
+uint64_t NoiseSuppressor::NeededUntil(const Segment& segment) const
+{
+    uint64_t until = SaturatingAdd(segment.writeEnd, m_parameters.fftSize);
+    if (segment.last) {
+        until = std::max(until, SaturatingAdd(segment.writeEnd, m_parameters.contextFrames));
+    }
+    return std::min(until, m_total);
+}
+
+uint64_t NoiseSuppressor::Room() const
+{
+    uint64_t base = std::min(m_released, m_end);
+    Segment segment;
+    if (PendingSegment(segment)) {
+        base = std::min(base, NeededFrom(segment));
+    }
+    return m_parameters.capacityFrames - (m_end - base);
+}
+
+void NoiseSuppressor::Append(const int16_t* samples, size_t frames)
+{
+    const unsigned channels = m_parameters.channels;
+    for (size_t f = 0; f < frames; ++f) {
+        std::copy_n(samples + f * channels, channels,
+                    m_ring.begin() + static_cast<ptrdiff_t>(((m_end + f) % m_parameters.capacityFrames) * channels));
+    }
+    m_end += frames;
+    ProcessComplete();
+}
+
+void NoiseSuppressor::Finish()
+{
+    m_total = std::min(m_total, m_end);
+    ProcessComplete();
+}
+
+uint64_t NoiseSuppressor::Ready() const
+{
+    Segment segment;
+    if (PendingSegment(segment)) {
+        return std::min(m_end, segment.writeStart);
+    }
+    return m_end;
+}
+
+void NoiseSuppressor::Read(uint64_t firstFrame, size_t frames, int16_t* out) const
+{
+    const unsigned channels = m_parameters.channels;
+    for (size_t f = 0; f < frames; ++f) {
+        const int16_t* frame = m_ring.data() + ((firstFrame + f) % m_parameters.capacityFrames) * channels;
+        std::copy_n(frame, channels, out + f * channels);
+    }
+}
+
+void NoiseSuppressor::ProcessComplete()
+{
+    Segment segment;
+    while (PendingSegment(segment) && m_end >= NeededUntil(segment)) {
+        if (segment.writeStart < segment.writeEnd) {
+            ProcessSegment(segment);
+        }
+        if (segment.last) {
+            ++m_next;
+            m_segmentAt = m_next < m_spans.size() ? m_spans[m_next].start : 0;
+        } else {
+            m_segmentAt = segment.coreEnd;
+        }
+    }
+}
+
+// Frame j of the analysis covers [j*hop, j*hop + fftSize); frames before the track or past
+// its end read silence.
+void NoiseSuppressor::LoadFrame(int64_t frame, unsigned channel)
+{
+    float* time = m_fft.Time();
+    const int64_t start = frame * static_cast<int64_t>(m_parameters.hop);
+    for (size_t i = 0; i < m_parameters.fftSize; ++i) {
+        const int64_t t = start + static_cast<int64_t>(i);
+        const bool held = t >= 0 && static_cast<uint64_t>(t) < m_end;
+        time[i] = held ? m_window[i] * static_cast<float>(Held(static_cast<uint64_t>(t), channel)) : 0.0f;
+    }
+    m_fft.Forward();
+}
+
+void NoiseSuppressor::Analyse(int64_t frame, float* power)
+{
+    const float scale = 1.0f / static_cast<float>(m_parameters.channels);
+    for (unsigned c = 0; c < m_parameters.channels; ++c) {
+        LoadFrame(frame, c);
+        const std::complex<float>* spectrum = m_fft.Spectrum();
+        for (size_t k = 0; k < m_parameters.bins; ++k) {
+            power[k] += std::norm(spectrum[k]) * scale;
+        }
+    }
+}
+
+// Analysis frames lying wholly within [from, to).
+void NoiseSuppressor::AddSurroundings(uint64_t from, uint64_t to)
+{
+    const int64_t hop = static_cast<int64_t>(m_parameters.hop);
+    const int64_t size = static_cast<int64_t>(m_parameters.fftSize);
+    for (int64_t j = FloorDiv(static_cast<int64_t>(from) + hop - 1, hop); j * hop + size <= static_cast<int64_t>(to);
+         ++j) {
+        float* row = m_around.AddRow();
+        if (row == nullptr) {
+            return;
+        }
+        Analyse(j, row);
+    }
+}
+
+void NoiseSuppressor::ProcessSegment(const Segment& segment)
+{
+    const DriveSpan& span = *segment.span;
+    const uint64_t ramp = m_parameters.rampFrames;
+    const int64_t hop = static_cast<int64_t>(m_parameters.hop);
+    const int64_t size = static_cast<int64_t>(m_parameters.fftSize);
+
+    // The surroundings: before the interval (back to the previous interval's ramp) when it
+    // begins, after it (up to the next one's ramp) when it ends.
+    if (segment.first) {
+        m_around.Clear();
+        uint64_t from = segment.writeStart > m_parameters.contextFrames ? segment.writeStart - m_parameters.contextFrames : 0;
+        if (m_next > 0) {
+            from = std::max(from, SaturatingAdd(m_spans[m_next - 1].end, ramp));
+        }
+        AddSurroundings(from, segment.writeStart);
+    }
+    if (segment.last) {
+        uint64_t to = std::min(m_end, SaturatingAdd(segment.writeEnd, m_parameters.contextFrames));
+        if (m_next + 1 < m_spans.size()) {
+            const uint64_t next = m_spans[m_next + 1].start;
+            to = std::min(to, next > ramp ? next - ramp : 0);
+        }
+        AddSurroundings(segment.writeEnd, to);
+    }
+    m_estimator.SetSurroundings(m_around);
+
+    const int64_t firstRow = FloorDiv(static_cast<int64_t>(segment.writeStart) - size, hop) + 1;
+    const int64_t lastRow = FloorDiv(static_cast<int64_t>(segment.writeEnd) - 1, hop);
+    m_power.Clear();
+    for (int64_t j = firstRow; j <= lastRow; ++j) {
+        float* row = m_power.AddRow();
+        if (row == nullptr) {
+            break;  // cannot happen with the sizes the parameters give
+        }
+        Analyse(j, row);
+        const int64_t centre = j * hop + size / 2;
+        const int64_t start = static_cast<int64_t>(span.start);
+        const int64_t end = static_cast<int64_t>(span.end);
+        const int64_t edge = static_cast<int64_t>(m_parameters.edgeFrames);
+        FrameRole role = FrameRole::kAround;
+        if (centre >= start && centre < end) {
+            role = (centre < start + edge || centre >= end - edge) ? FrameRole::kEdge : FrameRole::kCore;
+        }
+        m_roles[m_power.Rows() - 1] = role;
+    }
+    m_lastShare = m_estimator.Estimate(m_power, m_roles.data(), m_noise);
+    if (std::getenv("OVIX_DEBUG") != nullptr) {
+        std::fprintf(stderr, "segment %llu-%llu share %.4f\n", static_cast<unsigned long long>(segment.coreStart),
+                     static_cast<unsigned long long>(segment.coreEnd), m_lastShare);
+    }
+    if (m_lastShare < kAudibleShare) {
         return;
     }
-    while (frames > 0) {
-        const size_t block = std::min(frames, kBlockFrames);
-        ProcessBlock(samples, firstFrame, block);
-        samples += block * m_channels;
-        firstFrame += block;
-        frames -= block;
-    }
+    m_estimator.Learn(m_noise, m_roles.data());
+    Resynthesise(segment, firstRow, lastRow);
 }
 
-bool NoiseSuppressor::FillMix(uint64_t firstFrame, size_t frames)
+float NoiseSuppressor::RampWeight(const DriveSpan& span, uint64_t frame) const
 {
     const uint64_t ramp = m_ramp.size();
-    const uint64_t blockEnd = firstFrame + frames;
-    while (m_cursor < m_spans.size() && SaturatingAdd(m_spans[m_cursor].end, ramp) <= firstFrame) {
-        ++m_cursor;
+    if (frame < span.start) {
+        return m_ramp[ramp - (span.start - frame)];
     }
-    std::fill_n(m_mix.begin(), frames, 0.0f);
-    bool any = false;
-    for (size_t i = m_cursor; i < m_spans.size() && m_spans[i].start < SaturatingAdd(blockEnd, ramp); ++i) {
-        const DriveSpan& span = m_spans[i];
-        const uint64_t from = std::max(firstFrame, span.start > ramp ? span.start - ramp : 0);
-        const uint64_t to = std::min(blockEnd, SaturatingAdd(span.end, ramp));
-        for (uint64_t t = from; t < to; ++t) {
-            float weight = 1.0f;
-            if (t < span.start) {
-                weight = m_ramp[ramp - (span.start - t)];
-            } else if (t >= span.end) {
-                weight = m_ramp[ramp - 1 - (t - span.end)];
+    if (frame >= span.end) {
+        return m_ramp[ramp - 1 - (frame - span.end)];
+    }
+    return 1.0f;
+}
+
+// Overlap-adds the removed part frame by frame; a frame's first hop is complete once the
+// frame is added, since the next frame starts after it.
+void NoiseSuppressor::Resynthesise(const Segment& segment, int64_t firstRow, int64_t lastRow)
+{
+    const unsigned channels = m_parameters.channels;
+    const size_t size = m_parameters.fftSize;
+    const int64_t hop = static_cast<int64_t>(m_parameters.hop);
+    // Sum of the squared windows at a quarter-window hop.
+    const float synthesis = 0.5f;
+    std::fill(m_overlap.begin(), m_overlap.end(), 0.0f);
+    m_gainRule.Reset();
+    for (int64_t j = firstRow; j <= lastRow; ++j) {
+        const size_t row = static_cast<size_t>(j - firstRow);
+        m_gainRule.Compute(m_power.Row(row), m_noise.Row(row), segment.span->strength, m_gain.data());
+        bool touched = false;
+        for (size_t k = 0; k < m_parameters.bins && !touched; ++k) {
+            touched = m_gain[k] < 1.0f;
+        }
+        for (unsigned c = 0; c < channels && touched; ++c) {
+            LoadFrame(j, c);
+            std::complex<float>* spectrum = m_fft.Spectrum();
+            for (size_t k = 0; k < m_parameters.bins; ++k) {
+                spectrum[k] *= 1.0f - m_gain[k];
             }
-            float& mix = m_mix[t - firstFrame];
-            mix = std::max(mix, weight * span.strength);
-        }
-        any = any || from < to;
-    }
-    return any;
-}
-
-bool NoiseSuppressor::NeedsFilter(uint64_t firstFrame, size_t frames) const
-{
-    const uint64_t lead = SaturatingAdd(m_ramp.size(), m_warmUp);
-    const uint64_t blockEnd = firstFrame + frames;
-    for (size_t i = m_cursor; i < m_spans.size(); ++i) {
-        const uint64_t from = m_spans[i].start > lead ? m_spans[i].start - lead : 0;
-        if (from >= blockEnd) {
-            return false;  // spans are sorted: later ones begin later still
-        }
-        if (SaturatingAdd(m_spans[i].end, m_ramp.size()) > firstFrame) {
-            return true;
-        }
-    }
-    return false;
-}
-
-void NoiseSuppressor::ProcessBlock(int16_t* samples, uint64_t firstFrame, size_t frames)
-{
-    const bool mixAny = FillMix(firstFrame, frames);
-    // Outside every span, ramp and warm-up the sound leaves as it came: nothing to compute.
-    if (!mixAny && !NeedsFilter(firstFrame, frames)) {
-        m_bSettled = false;
-        return;
-    }
-    if (!m_bSettled) {
-        m_highPassState.fill({});
-        m_lowShelfState.fill({});
-        m_bSettled = true;
-    }
-    switch (m_channels) {
-    case 1: Filter<1>(samples, frames, mixAny); break;
-    case 2: Filter<2>(samples, frames, mixAny); break;
-    case 3: Filter<3>(samples, frames, mixAny); break;
-    case 4: Filter<4>(samples, frames, mixAny); break;
-    case 5: Filter<5>(samples, frames, mixAny); break;
-    case 6: Filter<6>(samples, frames, mixAny); break;
-    case 7: Filter<7>(samples, frames, mixAny); break;
-    default: Filter<8>(samples, frames, mixAny); break;
-    }
-    for (unsigned c = 0; c < m_channels; ++c) {
-        m_highPassState[c].Flush();
-        m_lowShelfState[c].Flush();
-    }
-}
-
-// The filters run on every frame of a block they are needed in, touched or not, so that their
-// state is settled when a ramp begins; only frames with a mix above zero are written.
-template <unsigned Channels>
-void NoiseSuppressor::Filter(int16_t* samples, size_t frames, bool mixAny)
-{
-    std::array<BiquadState, Channels> highPass;
-    std::array<BiquadState, Channels> lowShelf;
-    std::copy_n(m_highPassState.begin(), Channels, highPass.begin());
-    std::copy_n(m_lowShelfState.begin(), Channels, lowShelf.begin());
-    const BiquadCoefficients hp = m_highPass;
-    const BiquadCoefficients ls = m_lowShelf;
-    for (size_t f = 0; f < frames; ++f) {
-        int16_t* frame = samples + f * Channels;
-        const double mix = mixAny ? m_mix[f] : 0.0;
-        for (unsigned c = 0; c < Channels; ++c) {
-            const double x = frame[c];
-            const double y = RunBiquad(ls, lowShelf[c], RunBiquad(hp, highPass[c], x));
-            if (mix > 0.0) {
-                frame[c] = Saturate(x + mix * (y - x));
+            m_fft.Inverse();
+            const float* time = m_fft.Time();
+            const int64_t start = j * hop;
+            for (size_t i = 0; i < size; ++i) {
+                const uint64_t slot = static_cast<uint64_t>(start + static_cast<int64_t>(i)) % size;
+                m_overlap[slot * channels + c] += synthesis * m_window[i] * time[i];
             }
         }
+        // Samples [j*hop, (j+1)*hop) are complete: write those inside the segment, then
+        // clear their slots for the frames to come.
+        for (int64_t t = j * hop; t < (j + 1) * hop; ++t) {
+            if (t < 0) {
+                continue;
+            }
+            const uint64_t frame = static_cast<uint64_t>(t);
+            const uint64_t slot = (frame % size) * channels;
+            if (frame >= segment.writeStart && frame < segment.writeEnd) {
+                const float weight = RampWeight(*segment.span, frame);
+                int16_t* out = m_ring.data() + (frame % m_parameters.capacityFrames) * channels;
+                for (unsigned c = 0; c < channels; ++c) {
+                    const float removed = m_overlap[slot + c];
+                    if (removed != 0.0f) {
+                        const long value = std::lrint(static_cast<float>(out[c]) - weight * removed);
+                        out[c] = static_cast<int16_t>(std::clamp<long>(value, INT16_MIN, INT16_MAX));
+                    }
+                }
+            }
+            std::fill_n(m_overlap.begin() + static_cast<ptrdiff_t>(slot), channels, 0.0f);
+        }
     }
-    std::copy_n(highPass.begin(), Channels, m_highPassState.begin());
-    std::copy_n(lowShelf.begin(), Channels, m_lowShelfState.begin());
 }
 
 }  // namespace ovix

@@ -1,13 +1,21 @@
-// Attenuates the band where lens motor noise lives, inside the AF drive spans only: a high-pass
-// and a low-shelf section run through each span from a warm-up before it, and their output is
-// mixed in by strength x ramp.
-// Frames outside the spans and their ramps leave bit-exact.
+// Removes the lens motor's noise inside AF drive intervals and nothing else.
+// Sound is appended as the session pulls it and read back once final. An interval is
+// processed when its sound and the sound after it are all held (look-ahead), in segments for
+// long intervals; frames before the first pending interval are final at once. Per segment:
+// power spectra of the interval and its surroundings, the motor's noise per frame
+// (MotorEstimator), a spectral gain (GainRule), and the removed part resynthesised and
+// subtracted under 10 ms raised-cosine ramps. Where nothing is removed the sound leaves
+// bit-exact; an interval whose motor is not audible is left untouched.
+// Everything is allocated by the constructor and SetSpans; blocks allocate nothing.
 #pragma once
 
 #include "AfInformation.h"
-#include "Biquad.h"
+#include "GainRule.h"
+#include "MotorEstimator.h"
+#include "RealFft.h"
+#include "SpectralFrames.h"
+#include "SuppressorParameters.h"
 
-#include <array>
 #include <cstddef>
 #include <cstdint>
 #include <vector>
@@ -17,42 +25,78 @@ namespace ovix {
 class NoiseSuppressor {
 public:
     static constexpr unsigned kMaxChannels = 8;
-    static constexpr size_t kBlockFrames = 1024;
+    static constexpr size_t kBlockFrames = SuppressorParameters::kBlockFrames;
 
-    // Allocates everything the blocks need; channels 1..kMaxChannels.
-    NoiseSuppressor(uint64_t rateHz, unsigned channels);
+    // `frameCount` bounds the sound (it may end earlier, see Finish). May throw std::bad_alloc.
+    NoiseSuppressor(uint64_t rateHz, unsigned channels, uint64_t frameCount);
 
-    // Sorted spans as AfInformation::Spans gives them; call before the first block.
+    // Sorted spans as AfInformation::Spans gives them; before the first frame.
     void SetSpans(std::vector<DriveSpan> spans);
-    // Interleaved 16-bit frames; blocks must arrive in order. Allocation-free.
-    void Process(int16_t* samples, uint64_t firstFrame, size_t frames);
 
-    size_t RampFrames() const { return m_ramp.size(); }
-    // Frames filtered before each ramp so that the filters have settled when it begins;
-    // elsewhere outside the spans nothing is computed. The default (100 ms) is far past the
-    // filters' decay; UINT64_MAX filters every frame (what tests compare with).
-    void SetWarmUpFrames(uint64_t frames) { m_warmUp = frames; }
+    // Frames the look-ahead can take now; at least kBlockFrames once Ready() frames are released.
+    uint64_t Room() const;
+    // Appends interleaved frames (at most Room()) and processes what they complete.
+    void Append(const int16_t* samples, size_t frames);
+    // No more sound: pending intervals are processed with what there is.
+    void Finish();
+    // Frames [0, Ready()) are final.
+    uint64_t Ready() const;
+    // Copies final frames that are still held (from Released() on).
+    void Read(uint64_t firstFrame, size_t frames, int16_t* out) const;
+    // Frames before `frame` are no longer needed by the reader.
+    void Release(uint64_t frame) { m_released = frame; }
+
+    const SuppressorParameters& Parameters() const { return m_parameters; }
+    // The motor share the last processed segment was judged by; for the bench and tests.
+    double LastMotorShare() const { return m_lastShare; }
 
 private:
-    // Fills m_mix for one block; false when no frame of it is touched.
-    bool FillMix(uint64_t firstFrame, size_t frames);
-    // Whether a block lies within a span, its ramps or the warm-up before them.
-    bool NeedsFilter(uint64_t firstFrame, size_t frames) const;
-    void ProcessBlock(int16_t* samples, uint64_t firstFrame, size_t frames);
-    template <unsigned Channels>
-    void Filter(int16_t* samples, size_t frames, bool mixAny);
+    struct Segment {
+        const DriveSpan* span = nullptr;
+        uint64_t coreStart = 0;  // this segment's share of the interval
+        uint64_t coreEnd = 0;
+        uint64_t writeStart = 0;  // with the ramps at the interval's ends
+        uint64_t writeEnd = 0;
+        bool first = false;
+        bool last = false;
+    };
 
-    unsigned m_channels;
-    std::vector<float> m_ramp;  // rising half of a raised cosine, strictly between 0 and 1
-    std::vector<float> m_mix;
+    bool PendingSegment(Segment& segment) const;
+    uint64_t NeededFrom(const Segment& segment) const;
+    uint64_t NeededUntil(const Segment& segment) const;
+    void ProcessComplete();
+    void ProcessSegment(const Segment& segment);
+    void AddSurroundings(uint64_t from, uint64_t to);
+    void Analyse(int64_t frame, float* power);
+    void LoadFrame(int64_t frame, unsigned channel);
+    void Resynthesise(const Segment& segment, int64_t firstRow, int64_t lastRow);
+    float RampWeight(const DriveSpan& span, uint64_t frame) const;
+    int16_t Held(uint64_t frame, unsigned channel) const
+    {
+        return m_ring[(frame % m_parameters.capacityFrames) * m_parameters.channels + channel];
+    }
+
+    const SuppressorParameters m_parameters;
+    uint64_t m_total;
+    uint64_t m_end = 0;  // frames appended
+    uint64_t m_released = 0;
+    std::vector<int16_t> m_ring;
     std::vector<DriveSpan> m_spans;
-    size_t m_cursor = 0;  // first span whose ramp-out may still reach the next block
-    uint64_t m_warmUp;
-    bool m_bSettled = true;  // the filter states follow the sound (false after skipped blocks)
-    BiquadCoefficients m_highPass;
-    BiquadCoefficients m_lowShelf;
-    std::array<BiquadState, kMaxChannels> m_highPassState{};
-    std::array<BiquadState, kMaxChannels> m_lowShelfState{};
+    size_t m_next = 0;  // first span not fully processed
+    uint64_t m_segmentAt = 0;  // where its next segment begins
+
+    RealFft m_fft;
+    std::vector<float> m_window;  // square root of a periodic Hann: analysis and synthesis
+    std::vector<float> m_ramp;  // rising half of a raised cosine, strictly between 0 and 1
+    std::vector<float> m_overlap;  // removed sound being overlap-added, fftSize frames
+    std::vector<float> m_gain;
+    std::vector<FrameRole> m_roles;
+    SpectralFrames m_power;
+    SpectralFrames m_noise;
+    SpectralFrames m_around;
+    MotorEstimator m_estimator;
+    GainRule m_gainRule;
+    double m_lastShare = 0.0;
 };
 
 }  // namespace ovix

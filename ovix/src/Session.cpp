@@ -11,8 +11,10 @@ namespace ovix {
 Session::Session(const SessionFormat& format, const SessionCallbacks& callbacks)
     : m_format(format),
       m_callbacks(callbacks),
-      m_block(NoiseSuppressor::kBlockFrames * format.channels),
-      m_suppressor(format.rateHz, format.channels)
+      m_block((NoiseSuppressor::kBlockFrames + 1) * format.channels),
+      m_suppressor(format.rateHz, format.channels, format.sampleCount),
+      // Blocks of one frame at worst.
+      m_blocks(m_suppressor.Parameters().capacityFrames + 1)
 {
 }
 
@@ -147,14 +149,23 @@ unsigned long Session::Prepare(std::vector<uint8_t> block)
 
 // The library cannot tell AAC from PCM: decoded AAC is followed by zeros forever, so the
 // sample count bounds the pull, and PCM may still end earlier with an empty delivery.
+// Blocks are pushed back once the suppressor has made them final, which for sound near an
+// interval is after the interval and its surroundings have been pulled.
 unsigned long Session::ProcessAudio()
 {
     if (m_callbacks.inputAudio == nullptr || m_callbacks.outputAudio == nullptr) {
         return kFailure;
     }
     const uint64_t frameBytes = uint64_t{m_format.channels} * sizeof(int16_t);
-    while (m_framesDone < m_format.sampleCount) {
-        const uint64_t frames = std::min<uint64_t>(NoiseSuppressor::kBlockFrames, m_format.sampleCount - m_framesDone);
+    bool ended = false;
+    while (!ended) {
+        const uint64_t frames = std::min<uint64_t>(NoiseSuppressor::kBlockFrames, m_format.sampleCount - m_framesPulled);
+        if (frames == 0) {
+            break;
+        }
+        if (m_suppressor.Room() < frames || m_blocksCount == m_blocks.size()) {
+            return kFailure;  // the look-ahead's sizes rule this out
+        }
         const unsigned long requested = frames * frameBytes;
         if (Stopped()) {
             return kAborted;
@@ -167,26 +178,59 @@ unsigned long Session::ProcessAudio()
             break;
         }
         const uint64_t whole = delivered / frameBytes;
-        m_suppressor.Process(m_block.data(), m_framesDone, whole);
+        // A piece of a frame can only be the tail of a truncated stream: it goes back as it came.
+        m_tailBytes = delivered - whole * frameBytes;
+        ended = m_tailBytes != 0;
+        m_blocks[(m_blocksHead + m_blocksCount++) % m_blocks.size()] = static_cast<uint16_t>(whole);
+        m_framesPulled += whole;
+        if (ended) {
+            std::memcpy(m_block.data() + NoiseSuppressor::kBlockFrames * m_format.channels,
+                        reinterpret_cast<const uint8_t*>(m_block.data()) + whole * frameBytes, m_tailBytes);
+        }
+        m_suppressor.Append(m_block.data(), whole);
+        const unsigned long result = PushReady(false);
+        if (result != kRunning) {
+            return result;
+        }
+    }
+    m_suppressor.Finish();
+    const unsigned long result = PushReady(true);
+    return result != kRunning ? result : kSessionFinished;
+}
+
+unsigned long Session::PushReady(bool ended)
+{
+    const uint64_t frameBytes = uint64_t{m_format.channels} * sizeof(int16_t);
+    while (m_blocksCount > 0) {
+        const uint64_t frames = m_blocks[m_blocksHead];
+        if (m_framesDone + frames > m_suppressor.Ready()) {
+            return kRunning;
+        }
+        m_suppressor.Read(m_framesDone, frames, m_block.data());
+        unsigned long bytes = frames * frameBytes;
+        if (ended && m_blocksCount == 1 && m_tailBytes != 0) {
+            std::memmove(reinterpret_cast<uint8_t*>(m_block.data()) + bytes,
+                         m_block.data() + NoiseSuppressor::kBlockFrames * m_format.channels, m_tailBytes);
+            bytes += m_tailBytes;
+        }
         if (Stopped()) {
             return kAborted;
         }
-        if (m_callbacks.outputAudio(m_block.data(), delivered) != kSuccess) {
+        if (m_callbacks.outputAudio(m_block.data(), bytes) != kSuccess) {
             return kFailure;
         }
-        m_framesDone += whole;
+        m_blocksHead = (m_blocksHead + 1) % m_blocks.size();
+        --m_blocksCount;
+        m_framesDone += frames;
+        m_suppressor.Release(m_framesDone);
         if (Stopped()) {
             return kAborted;
         }
         if (m_callbacks.notifyProgress != nullptr) {
             m_callbacks.notifyProgress(m_framesDone, m_format.sampleCount);
         }
-        // A piece of a frame can only be the tail of a truncated stream.
-        if (whole * frameBytes != delivered) {
-            break;
-        }
     }
-    return kSessionFinished;
+    return kRunning;
 }
 
 // The host learns of every end only through a notification, so each end sends exactly

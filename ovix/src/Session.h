@@ -51,15 +51,23 @@ private:
     unsigned long ReadBlock(TqovixInputCallback input, uint64_t size, std::vector<uint8_t>& block);
     unsigned long Prepare(std::vector<uint8_t> block);
     unsigned long ProcessAudio();
+    // Pushes every pulled block whose frames are final; kRunning to go on.
+    unsigned long PushReady(bool ended);
     bool Stopped() const { return State() != kRunning; }
     void Finish(unsigned long endState);
 
     const SessionFormat m_format;
     const SessionCallbacks m_callbacks;
     std::atomic<unsigned long> m_state{kRunning};
-    uint64_t m_framesDone = 0;  // worker only
-    std::vector<int16_t> m_block;
+    uint64_t m_framesDone = 0;  // pushed; worker only
+    uint64_t m_framesPulled = 0;
+    std::vector<int16_t> m_block;  // one block and the piece of a frame a truncated stream ends in
     NoiseSuppressor m_suppressor;
+    // Frames of each pulled block not yet pushed, oldest first: pushes mirror the pulls.
+    std::vector<uint16_t> m_blocks;
+    size_t m_blocksHead = 0;
+    size_t m_blocksCount = 0;
+    size_t m_tailBytes = 0;
 
     std::mutex m_processedMutex;
     std::vector<uint8_t> m_processed;  // empty until built

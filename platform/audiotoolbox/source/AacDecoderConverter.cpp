@@ -192,7 +192,7 @@ OSStatus AacDecoderConverter::TakeInput(AudioConverterComplexInputDataProc proc,
 
 OSStatus AacDecoderConverter::DecodePacket(const uint8_t* data, UInt32 size)
 {
-    if (size == 0 || size > kAacMaxPacketBytesPerChannel * m_output.mChannelsPerFrame) {
+    if (size == 0 || size > kAacMaxDecodablePacketBytesPerChannel * m_output.mChannelsPerFrame) {
         return kAudioConverterErr_InvalidInputSize;
     }
     Libav().av_packet_unref(m_packet.get());

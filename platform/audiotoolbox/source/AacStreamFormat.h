@@ -13,6 +13,9 @@ namespace atcompat {
 inline constexpr UInt32 kAacFramesPerPacket = 1024;
 // A raw AAC packet carries at most 6144 bits per channel.
 inline constexpr UInt32 kAacMaxPacketBytesPerChannel = 768;
+// Some writers' encoders (ffmpeg's among them) overshoot that bound now and then; what
+// they wrote still decodes, so the decoder takes packets up to four times as large.
+inline constexpr UInt32 kAacMaxDecodablePacketBytesPerChannel = 4 * kAacMaxPacketBytesPerChannel;
 // Channel configurations 1 to 6; 7 and 8 channels have no unambiguous channel order.
 inline constexpr UInt32 kAacMaxChannels = 6;
 

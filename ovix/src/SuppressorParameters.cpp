@@ -1,0 +1,43 @@
+#include "SuppressorParameters.h"
+
+#include <algorithm>
+#include <bit>
+#include <cmath>
+
+namespace ovix {
+namespace {
+
+constexpr double kWindowSeconds = 0.021;
+constexpr size_t kMinFftSize = 64;
+constexpr size_t kMaxFftSize = 32768;
+constexpr uint64_t kRampsPerSecond = 100;  // 10 ms
+constexpr uint64_t kEdgesPerSecond = 25;  // 40 ms
+constexpr double kContextSeconds = 1.0;
+constexpr double kLongestSegmentSeconds = 10.0;
+
+}  // namespace
+
+SuppressorParameters::SuppressorParameters(uint64_t rate, unsigned channelCount)
+    : rateHz(std::max<uint64_t>(rate, 1)), channels(std::max(channelCount, 1u))
+{
+    const double wanted = kWindowSeconds * static_cast<double>(rateHz);
+    const size_t rounded = size_t{1} << static_cast<unsigned>(std::lround(std::log2(std::max(wanted, 1.0))));
+    fftSize = std::clamp(rounded, kMinFftSize, kMaxFftSize);
+    hop = fftSize / 4;
+    bins = fftSize / 2 + 1;
+    rampFrames = std::max<uint64_t>(1, rateHz / kRampsPerSecond);
+    edgeFrames = std::max<uint64_t>(1, rateHz / kEdgesPerSecond);
+
+    // Room for a whole segment with its context on both sides, the analysis windows that
+    // reach past it and a pulled block at either end.
+    const uint64_t margin = 2 * (fftSize + rampFrames + kBlockFrames);
+    const uint64_t byBudget = kMaxHeldBytes / (uint64_t{channels} * sizeof(int16_t));
+    const uint64_t wanted10s = static_cast<uint64_t>(kLongestSegmentSeconds * static_cast<double>(rateHz)) +
+                               2 * static_cast<uint64_t>(kContextSeconds * static_cast<double>(rateHz)) + margin;
+    capacityFrames = std::max(std::min(byBudget, wanted10s), 8 * margin);
+    contextFrames = std::min<uint64_t>(static_cast<uint64_t>(kContextSeconds * static_cast<double>(rateHz)),
+                                       capacityFrames / 6);
+    segmentFrames = std::max<uint64_t>(capacityFrames - 2 * contextFrames - margin, fftSize);
+}
+
+}  // namespace ovix
