@@ -39,6 +39,8 @@ RealFft::~RealFft()
 void RealFft::Forward()
 {
     m_forwardFunction(m_forward, m_spectrum.get(), m_time.get(), sizeof(float));
+    // The last bin's imaginary part is left unwritten by some versions; it is zero.
+    m_spectrum.get()[m_size / 2].imag(0.0f);
 }
 
 void RealFft::Inverse()
