@@ -6,8 +6,9 @@
 namespace ovix {
 namespace {
 
-constexpr float kSmoothing = 0.7f;  // weight of the previous frame in the a-priori SNR
-constexpr float kFloor = 0.03f;  // -30 dB
+// Weight of the previous frame in the a-priori SNR: high, so that what remains is steady.
+constexpr float kSmoothing = 0.95f;
+constexpr float kFloor = 0.1f;  // -20 dB: the motor's rest stays under the wanted sound
 constexpr float kTiny = 1e-20f;
 
 }  // namespace

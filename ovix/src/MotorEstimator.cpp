@@ -6,44 +6,47 @@
 namespace ovix {
 namespace {
 
-constexpr double kLowQuantile = 0.2;
-constexpr double kHighQuantile = 0.9;
+// The wanted sound's floor around an interval, and its ceiling: the loudest it got there.
+constexpr double kFloorQuantile = 0.2;
+constexpr double kCeilingQuantile = 1.0;
+// Over the motor's bins, the share that wanted sound may raise without raising the estimate.
+constexpr double kActivationQuantile = 0.3;
+// How far above the surroundings' ceiling a cell must rise to be taken for motor: at the
+// drive's start and stop, where transients are expected, and in its steady part.
+constexpr float kRiseEdge = 2.0f;
+constexpr float kRiseCore = 4.0f;
+// Each side of a drive's start or stop: long enough for medians to pass over syllables.
+constexpr double kWindowSeconds = 0.3;
 constexpr size_t kMinRows = 8;
-// How far above the surroundings' ceiling a cell must rise to count as motor: well above
-// what one loud syllable or note more does to a bin.
-constexpr float kRiseSteady = 2.0f;
-constexpr float kRiseEdge = 1.0f;
 
 }  // namespace
 
 MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
     : m_bins(parameters.bins),
-      m_aroundLow(m_bins),
-      m_aroundHigh(m_bins),
-      m_steady(m_bins),
-      m_template(m_bins)
+      m_windowRows(std::max<size_t>(kMinRows, static_cast<size_t>(kWindowSeconds * static_cast<double>(parameters.rateHz)) /
+                                                  parameters.hop)),
+      m_floor(m_bins),
+      m_ceiling(m_bins),
+      m_inside(m_bins),
+      m_outside(m_bins),
+      m_step(m_bins),
+      m_motor(m_bins),
+      m_history(kRemembered * m_bins)
 {
-    // The longest column is a whole segment's rows.
-    const size_t rows = parameters.segmentFrames / parameters.hop + parameters.fftSize / parameters.hop + 8 +
-                        2 * (parameters.rampFrames / parameters.hop + 1);
-    m_column.resize(std::max(rows, parameters.contextFrames * 2 / parameters.hop + 8));
+    const size_t rows = (parameters.segmentFrames + parameters.fftSize + 2 * parameters.rampFrames) / parameters.hop + 8;
+    m_column.resize(std::max({rows, parameters.contextFrames * 2 / parameters.hop + 8, m_bins, kRemembered}));
 }
 
-void MotorEstimator::Quantiles(const SpectralFrames& frames, const FrameRole* roles, FrameRole wanted,
-                               double q, std::vector<float>& out, size_t& used)
+void MotorEstimator::Quantile(const SpectralFrames& frames, size_t from, size_t to, double q, std::vector<float>& out)
 {
-    used = 0;
+    const size_t n = std::min(to, frames.Rows()) - std::min(from, frames.Rows());
     for (size_t k = 0; k < m_bins; ++k) {
-        size_t n = 0;
-        for (size_t row = 0; row < frames.Rows() && n < m_column.size(); ++row) {
-            if (roles == nullptr || roles[row] == wanted) {
-                m_column[n++] = frames.Row(row)[k];
-            }
-        }
-        used = n;
         if (n == 0) {
             out[k] = 0.0f;
             continue;
+        }
+        for (size_t i = 0; i < n; ++i) {
+            m_column[i] = frames.Row(from + i)[k];
         }
         const size_t at = std::min(n - 1, static_cast<size_t>(q * static_cast<double>(n)));
         std::nth_element(m_column.begin(), m_column.begin() + static_cast<ptrdiff_t>(at),
@@ -52,47 +55,128 @@ void MotorEstimator::Quantiles(const SpectralFrames& frames, const FrameRole* ro
     }
 }
 
-void MotorEstimator::SetSurroundings(const SpectralFrames& around)
+void MotorEstimator::SetSurroundings(const SpectralFrames& around, size_t before, bool first, bool last)
 {
-    if (around.Rows() < kMinRows) {
-        return;  // keep what earlier intervals heard around them
+    m_around = &around;
+    m_before = std::min(before, around.Rows());
+    m_bFirst = first;
+    m_bLast = last;
+    if (around.Rows() >= kMinRows) {
+        Quantile(around, 0, around.Rows(), kFloorQuantile, m_floor);
+        Quantile(around, 0, around.Rows(), kCeilingQuantile, m_ceiling);
     }
-    size_t used = 0;
-    Quantiles(around, nullptr, FrameRole::kCore, kLowQuantile, m_aroundLow, used);
-    Quantiles(around, nullptr, FrameRole::kCore, kHighQuantile, m_aroundHigh, used);
-    m_bHaveAround = true;
+    // Otherwise what was heard around earlier intervals stands.
 }
 
-double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* roles,
-                                SpectralFrames& noise)
+bool MotorEstimator::StepSpectrum(const SpectralFrames& power, const FrameRole* roles)
 {
-    size_t coreRows = 0;
-    Quantiles(power, roles, FrameRole::kCore, kLowQuantile, m_steady, coreRows);
-    if (coreRows < kMinRows) {
-        size_t edgeRows = 0;
-        Quantiles(power, roles, FrameRole::kEdge, kLowQuantile, m_steady, edgeRows);
+    size_t firstCore = power.Rows();
+    size_t endCore = 0;
+    for (size_t row = 0; row < power.Rows(); ++row) {
+        if (roles[row] == FrameRole::kCore) {
+            firstCore = std::min(firstCore, row);
+            endCore = row + 1;
+        }
     }
-    if (!m_bHaveAround) {
-        // Nothing heard without the motor: only the template of earlier intervals could
-        // tell motor from sound, and there is none yet either.
-        std::fill(m_aroundLow.begin(), m_aroundLow.end(), 0.0f);
-        std::copy(m_steady.begin(), m_steady.end(), m_aroundHigh.begin());
+    if (firstCore >= endCore || endCore - firstCore < kMinRows) {
+        return false;
     }
-    for (size_t k = 0; k < m_bins; ++k) {
-        m_steady[k] = std::max(0.0f, m_steady[k] - m_aroundLow[k]);
+    const size_t window = std::min(m_windowRows, endCore - firstCore);
+    const size_t after = m_around->Rows() - m_before;
+    bool any = false;
+    if (m_bFirst && m_before >= kMinRows) {
+        Quantile(power, firstCore, firstCore + window, 0.5, m_inside);
+        Quantile(*m_around, m_before - std::min(m_before, m_windowRows), m_before, 0.5, m_outside);
+        for (size_t k = 0; k < m_bins; ++k) {
+            m_step[k] = std::max(0.0f, m_inside[k] - m_outside[k]);
+        }
+        any = true;
     }
+    if (m_bLast && after >= kMinRows) {
+        Quantile(power, endCore - window, endCore, 0.5, m_inside);
+        Quantile(*m_around, m_before, m_before + std::min(after, m_windowRows), 0.5, m_outside);
+        for (size_t k = 0; k < m_bins; ++k) {
+            const float step = std::max(0.0f, m_inside[k] - m_outside[k]);
+            m_step[k] = any ? std::min(m_step[k], step) : step;
+        }
+        any = true;
+    }
+    return any;
+}
 
+void MotorEstimator::Remember()
+{
+    double sum = 0.0;
+    for (size_t k = 0; k < m_bins; ++k) {
+        sum += m_step[k];
+    }
+    if (sum <= 0.0) {
+        return;
+    }
+    float* row = m_history.data() + m_historyNext * m_bins;
+    for (size_t k = 0; k < m_bins; ++k) {
+        row[k] = static_cast<float>(m_step[k] / sum);
+    }
+    m_historyNext = (m_historyNext + 1) % kRemembered;
+    m_historyCount = std::min(m_historyCount + 1, kRemembered);
+}
+
+void MotorEstimator::Template()
+{
+    for (size_t k = 0; k < m_bins; ++k) {
+        for (size_t i = 0; i < m_historyCount; ++i) {
+            m_column[i] = m_history[i * m_bins + k];
+        }
+        const size_t middle = m_historyCount / 2;
+        std::nth_element(m_column.begin(), m_column.begin() + static_cast<ptrdiff_t>(middle),
+                         m_column.begin() + static_cast<ptrdiff_t>(m_historyCount));
+        m_motor[k] = m_column[middle];
+    }
+}
+
+double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* roles, SpectralFrames& noise)
+{
     noise.Clear();
+    if (StepSpectrum(power, roles)) {
+        Remember();
+    }
+    if (m_historyCount == 0) {
+        for (size_t row = 0; row < power.Rows(); ++row) {
+            noise.AddRow();
+        }
+        return 0.0;
+    }
+    Template();
+    double mean = 0.0;
+    for (size_t k = 0; k < m_bins; ++k) {
+        mean += m_motor[k];
+    }
+    mean /= static_cast<double>(m_bins);
+
     double motor = 0.0;
     double total = 0.0;
     for (size_t row = 0; row < power.Rows(); ++row) {
         const float* p = power.Row(row);
         float* n = noise.AddRow();
-        const float rise = roles[row] == FrameRole::kEdge ? kRiseEdge : kRiseSteady;
+        size_t used = 0;
         for (size_t k = 0; k < m_bins; ++k) {
-            const float ceiling = m_aroundHigh[k] + m_steady[k];
+            if (m_motor[k] > mean) {
+                m_column[used++] = std::max(0.0f, p[k] - m_floor[k]) / m_motor[k];
+            }
+        }
+        float activation = 0.0f;
+        if (used > 0) {
+            const size_t at = std::min(used - 1, static_cast<size_t>(kActivationQuantile * static_cast<double>(used)));
+            std::nth_element(m_column.begin(), m_column.begin() + static_cast<ptrdiff_t>(at),
+                             m_column.begin() + static_cast<ptrdiff_t>(used));
+            activation = m_column[at];
+        }
+        const float rise = roles[row] == FrameRole::kEdge ? kRiseEdge : kRiseCore;
+        for (size_t k = 0; k < m_bins; ++k) {
+            const float steady = activation * m_motor[k];
+            const float ceiling = m_ceiling[k] + steady;
             const float excess = p[k] > rise * ceiling ? p[k] - ceiling : 0.0f;
-            n[k] = std::min(p[k], m_steady[k] + excess);
+            n[k] = std::min(p[k], steady + excess);
         }
         if (roles[row] != FrameRole::kAround) {
             for (size_t k = 0; k < m_bins; ++k) {
@@ -102,33 +186,6 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
         }
     }
     return total > 0.0 ? motor / total : 0.0;
-}
-
-void MotorEstimator::Learn(const SpectralFrames& noise, const FrameRole* roles)
-{
-    double sum = 0.0;
-    for (size_t row = 0; row < noise.Rows(); ++row) {
-        if (roles[row] == FrameRole::kCore) {
-            for (size_t k = 0; k < m_bins; ++k) {
-                sum += noise.Row(row)[k];
-            }
-        }
-    }
-    if (sum <= 0.0) {
-        return;
-    }
-    // A running mean of unit-sum spectra: each interval counts alike whatever its level.
-    const float weight = 1.0f / static_cast<float>(std::min(m_learned + 1, 16u));
-    for (size_t k = 0; k < m_bins; ++k) {
-        double bin = 0.0;
-        for (size_t row = 0; row < noise.Rows(); ++row) {
-            if (roles[row] == FrameRole::kCore) {
-                bin += noise.Row(row)[k];
-            }
-        }
-        m_template[k] += weight * (static_cast<float>(bin / sum) - m_template[k]);
-    }
-    ++m_learned;
 }
 
 }  // namespace ovix

@@ -1,14 +1,16 @@
 // Estimates the lens motor's noise power in every frame of an AF interval from what the
-// camera tells us: the motor runs inside the interval and is silent around it. The sound
-// around the interval shows how the wanted sound behaves; what the interval holds beyond
-// that is the motor's.
-// - A steady part: the interval's low quantile against its surroundings' (low quantiles
-//   pass over speech and notes, so they are not taken for noise).
-// - A moving part: per frame and bin, what rises far above anything the surroundings
-//   reached (a whine sweeping with the motor's speed, micro-step ticks, bursts).
-// - The drive's start and stop transients are judged apart, with a lower bar.
-// - Across intervals (one lens, one noise): the motor's spectral shape learned from earlier
-//   intervals tells a quiet motor from wanted sound that happens to be louder inside.
+// camera tells us: the motor runs exactly inside the interval and is silent around it.
+// - Its spectrum: what the sound gains where the drive starts and loses where it stops,
+//   compared with the sound just outside (medians over short windows). Wanted sound seldom
+//   changes in the same bins at both ends, so the smaller of the two steps is the motor's.
+// - Across intervals (one lens, one noise): the spectra of recent intervals, each scaled to
+//   unit power, and a median across them, so one interval's music or speech does not pass
+//   for the motor; an interval with no ends of its own (a long drive's middle) uses them alone.
+// - Per frame, how strongly the motor runs (it accelerates, brakes, is driven in bursts): a
+//   low quantile over the motor's bins of the frame's power beyond the wanted sound's floor,
+//   relative to the motor's spectrum. Wanted sound only raises some bins, so it passes.
+// - The drive's start and stop transients, judged apart: at the interval's edges, what rises
+//   far above anything the surroundings reached.
 #pragma once
 
 #include "SpectralFrames.h"
@@ -29,27 +31,38 @@ class MotorEstimator {
 public:
     explicit MotorEstimator(const SuppressorParameters& parameters);
 
-    // Rows of the sound around the interval. With too few rows (an interval at the start of
-    // the track, neighbours close by) the surroundings of earlier intervals stand in.
-    void SetSurroundings(const SpectralFrames& around);
+    // Rows heard around the interval: [0, before) before it, the rest after it. `first` and
+    // `last` say whether the segment to estimate holds the interval's start and end.
+    void SetSurroundings(const SpectralFrames& around, size_t before, bool first, bool last);
     // Fills `noise` (same rows as `power`) and answers the motor's share of the power in the
     // interval's frames: near 0 when the motor is not audible there.
     double Estimate(const SpectralFrames& power, const FrameRole* roles, SpectralFrames& noise);
-    // Remembers the motor of an interval that was processed.
-    void Learn(const SpectralFrames& noise, const FrameRole* roles);
 
 private:
-    void Quantiles(const SpectralFrames& frames, const FrameRole* roles, FrameRole wanted,
-                   double q, std::vector<float>& out, size_t& used);
+    // Per-bin quantile over rows [from, to) of `frames`.
+    void Quantile(const SpectralFrames& frames, size_t from, size_t to, double q, std::vector<float>& out);
+    // The motor's spectrum from this interval's ends; false when it has no usable end.
+    bool StepSpectrum(const SpectralFrames& power, const FrameRole* roles);
+    void Remember();
+    void Template();
 
     size_t m_bins;
-    std::vector<float> m_aroundLow;
-    std::vector<float> m_aroundHigh;
-    bool m_bHaveAround = false;
-    std::vector<float> m_steady;
-    std::vector<float> m_column;  // one bin across rows, for the quantiles
-    std::vector<float> m_template;  // the motor's mean spectrum over learned intervals
-    unsigned m_learned = 0;
+    size_t m_windowRows;  // rows on each side of a drive's start or stop
+    const SpectralFrames* m_around = nullptr;
+    size_t m_before = 0;
+    bool m_bFirst = false;
+    bool m_bLast = false;
+    std::vector<float> m_floor;  // the wanted sound's floor around the interval
+    std::vector<float> m_ceiling;  // and the most it reached
+    std::vector<float> m_inside;
+    std::vector<float> m_outside;
+    std::vector<float> m_step;
+    std::vector<float> m_motor;  // the motor's spectrum used for this interval
+    std::vector<float> m_column;  // scratch: one bin across rows, or one row across bins
+    static constexpr size_t kRemembered = 5;
+    std::vector<float> m_history;  // unit-power spectra of recent intervals, kRemembered rows
+    size_t m_historyCount = 0;
+    size_t m_historyNext = 0;
 };
 
 }  // namespace ovix

@@ -2,8 +2,6 @@
 
 #include <algorithm>
 #include <cmath>
-#include <cstdio>
-#include <cstdlib>
 #include <numbers>
 
 namespace ovix {
@@ -219,6 +217,7 @@ void NoiseSuppressor::ProcessSegment(const Segment& segment)
             from = std::max(from, SaturatingAdd(m_spans[m_next - 1].end, ramp));
         }
         AddSurroundings(from, segment.writeStart);
+        m_aroundBefore = m_around.Rows();
     }
     if (segment.last) {
         uint64_t to = std::min(m_end, SaturatingAdd(segment.writeEnd, m_parameters.contextFrames));
@@ -228,7 +227,7 @@ void NoiseSuppressor::ProcessSegment(const Segment& segment)
         }
         AddSurroundings(segment.writeEnd, to);
     }
-    m_estimator.SetSurroundings(m_around);
+    m_estimator.SetSurroundings(m_around, m_aroundBefore, segment.first, segment.last);
 
     const int64_t firstRow = FloorDiv(static_cast<int64_t>(segment.writeStart) - size, hop) + 1;
     const int64_t lastRow = FloorDiv(static_cast<int64_t>(segment.writeEnd) - 1, hop);
@@ -250,14 +249,9 @@ void NoiseSuppressor::ProcessSegment(const Segment& segment)
         m_roles[m_power.Rows() - 1] = role;
     }
     m_lastShare = m_estimator.Estimate(m_power, m_roles.data(), m_noise);
-    if (std::getenv("OVIX_DEBUG") != nullptr) {
-        std::fprintf(stderr, "segment %llu-%llu share %.4f\n", static_cast<unsigned long long>(segment.coreStart),
-                     static_cast<unsigned long long>(segment.coreEnd), m_lastShare);
-    }
     if (m_lastShare < kAudibleShare) {
         return;
     }
-    m_estimator.Learn(m_noise, m_roles.data());
     Resynthesise(segment, firstRow, lastRow);
 }
 

@@ -94,6 +94,7 @@ private:
     SpectralFrames m_power;
     SpectralFrames m_noise;
     SpectralFrames m_around;
+    size_t m_aroundBefore = 0;  // rows of m_around heard before the interval
     MotorEstimator m_estimator;
     GainRule m_gainRule;
     double m_lastShare = 0.0;
