@@ -6,9 +6,8 @@
 namespace ovix {
 namespace {
 
-// The wanted sound's floor around an interval, and its ceiling: the loudest it got there.
+// The wanted sound's floor around an interval (its ceiling is the loudest it got there).
 constexpr double kFloorQuantile = 0.2;
-constexpr double kCeilingQuantile = 1.0;
 // Over the motor's bins, the share that wanted sound may raise without raising the estimate.
 constexpr double kActivationQuantile = 0.3;
 // How far above the surroundings' ceiling a cell must rise to be taken for motor: at the
@@ -18,6 +17,8 @@ constexpr float kRiseCore = 4.0f;
 // Each side of a drive's start or stop: long enough for medians to pass over syllables.
 constexpr double kWindowSeconds = 0.3;
 constexpr size_t kMinRows = 8;
+// Enough bins to judge a frame by, few enough to judge every frame quickly.
+constexpr size_t kMaxMotorBins = 64;
 
 }  // namespace
 
@@ -33,6 +34,7 @@ MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
       m_motor(m_bins),
       m_history(kRemembered * m_bins)
 {
+    m_motorBins.reserve(m_bins);
     const size_t rows = (parameters.segmentFrames + parameters.fftSize + 2 * parameters.rampFrames) / parameters.hop + 8;
     m_column.resize(std::max({rows, parameters.contextFrames * 2 / parameters.hop + 8, m_bins, kRemembered}));
 }
@@ -63,7 +65,13 @@ void MotorEstimator::SetSurroundings(const SpectralFrames& around, size_t before
     m_bLast = last;
     if (around.Rows() >= kMinRows) {
         Quantile(around, 0, around.Rows(), kFloorQuantile, m_floor);
-        Quantile(around, 0, around.Rows(), kCeilingQuantile, m_ceiling);
+        std::fill(m_ceiling.begin(), m_ceiling.end(), 0.0f);
+        for (size_t row = 0; row < around.Rows(); ++row) {
+            const float* p = around.Row(row);
+            for (size_t k = 0; k < m_bins; ++k) {
+                m_ceiling[k] = std::max(m_ceiling[k], p[k]);
+            }
+        }
     }
     // Otherwise what was heard around earlier intervals stands.
 }
@@ -134,6 +142,27 @@ void MotorEstimator::Template()
     }
 }
 
+// The bins where the motor is strongest: above its mean, at most kMaxMotorBins of them.
+void MotorEstimator::SelectMotorBins()
+{
+    double mean = 0.0;
+    for (size_t k = 0; k < m_bins; ++k) {
+        mean += m_motor[k];
+    }
+    mean /= static_cast<double>(m_bins);
+    m_motorBins.clear();
+    for (size_t k = 0; k < m_bins; ++k) {
+        if (m_motor[k] > mean) {
+            m_motorBins.push_back(k);
+        }
+    }
+    if (m_motorBins.size() > kMaxMotorBins) {
+        std::nth_element(m_motorBins.begin(), m_motorBins.begin() + kMaxMotorBins, m_motorBins.end(),
+                         [this](size_t a, size_t b) { return m_motor[a] > m_motor[b]; });
+        m_motorBins.resize(kMaxMotorBins);
+    }
+}
+
 double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* roles, SpectralFrames& noise)
 {
     noise.Clear();
@@ -147,25 +176,20 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
         return 0.0;
     }
     Template();
-    double mean = 0.0;
-    for (size_t k = 0; k < m_bins; ++k) {
-        mean += m_motor[k];
-    }
-    mean /= static_cast<double>(m_bins);
+    SelectMotorBins();
 
     double motor = 0.0;
     double total = 0.0;
     for (size_t row = 0; row < power.Rows(); ++row) {
         const float* p = power.Row(row);
         float* n = noise.AddRow();
-        size_t used = 0;
-        for (size_t k = 0; k < m_bins; ++k) {
-            if (m_motor[k] > mean) {
-                m_column[used++] = std::max(0.0f, p[k] - m_floor[k]) / m_motor[k];
-            }
-        }
         float activation = 0.0f;
+        const size_t used = m_motorBins.size();
         if (used > 0) {
+            for (size_t i = 0; i < used; ++i) {
+                const size_t k = m_motorBins[i];
+                m_column[i] = std::max(0.0f, p[k] - m_floor[k]) / m_motor[k];
+            }
             const size_t at = std::min(used - 1, static_cast<size_t>(kActivationQuantile * static_cast<double>(used)));
             std::nth_element(m_column.begin(), m_column.begin() + static_cast<ptrdiff_t>(at),
                              m_column.begin() + static_cast<ptrdiff_t>(used));

@@ -45,6 +45,7 @@ private:
     bool StepSpectrum(const SpectralFrames& power, const FrameRole* roles);
     void Remember();
     void Template();
+    void SelectMotorBins();
 
     size_t m_bins;
     size_t m_windowRows;  // rows on each side of a drive's start or stop
@@ -58,6 +59,7 @@ private:
     std::vector<float> m_outside;
     std::vector<float> m_step;
     std::vector<float> m_motor;  // the motor's spectrum used for this interval
+    std::vector<size_t> m_motorBins;
     std::vector<float> m_column;  // scratch: one bin across rows, or one row across bins
     static constexpr size_t kRemembered = 5;
     std::vector<float> m_history;  // unit-power spectra of recent intervals, kRemembered rows

@@ -165,11 +165,22 @@ void NoiseSuppressor::ProcessComplete()
 void NoiseSuppressor::LoadFrame(int64_t frame, unsigned channel)
 {
     float* time = m_fft.Time();
+    const size_t size = m_parameters.fftSize;
     const int64_t start = frame * static_cast<int64_t>(m_parameters.hop);
-    for (size_t i = 0; i < m_parameters.fftSize; ++i) {
-        const int64_t t = start + static_cast<int64_t>(i);
-        const bool held = t >= 0 && static_cast<uint64_t>(t) < m_end;
-        time[i] = held ? m_window[i] * static_cast<float>(Held(static_cast<uint64_t>(t), channel)) : 0.0f;
+    const int64_t end = static_cast<int64_t>(m_end);
+    const size_t from = static_cast<size_t>(std::clamp<int64_t>(-start, 0, static_cast<int64_t>(size)));
+    const size_t to = static_cast<size_t>(std::clamp<int64_t>(end - start, static_cast<int64_t>(from),
+                                                              static_cast<int64_t>(size)));
+    std::fill(time, time + from, 0.0f);
+    std::fill(time + to, time + size, 0.0f);
+    const unsigned channels = m_parameters.channels;
+    const uint64_t capacity = m_parameters.capacityFrames;
+    uint64_t at = static_cast<uint64_t>(start + static_cast<int64_t>(from)) % capacity;
+    for (size_t i = from; i < to; ++i) {
+        time[i] = m_window[i] * static_cast<float>(m_ring[at * channels + channel]);
+        if (++at == capacity) {
+            at = 0;
+        }
     }
     m_fft.Forward();
 }
@@ -181,7 +192,8 @@ void NoiseSuppressor::Analyse(int64_t frame, float* power)
         LoadFrame(frame, c);
         const std::complex<float>* spectrum = m_fft.Spectrum();
         for (size_t k = 0; k < m_parameters.bins; ++k) {
-            power[k] += std::norm(spectrum[k]) * scale;
+            // std::norm goes through the modulus on some libraries: far slower than this.
+            power[k] += (spectrum[k].real() * spectrum[k].real() + spectrum[k].imag() * spectrum[k].imag()) * scale;
         }
     }
 }
@@ -293,9 +305,10 @@ void NoiseSuppressor::Resynthesise(const Segment& segment, int64_t firstRow, int
             }
             m_fft.Inverse();
             const float* time = m_fft.Time();
-            const int64_t start = j * hop;
+            // The window is a power of two long: slots wrap with a mask.
+            const size_t offset = static_cast<size_t>(j * hop) & (size - 1);
             for (size_t i = 0; i < size; ++i) {
-                const uint64_t slot = static_cast<uint64_t>(start + static_cast<int64_t>(i)) % size;
+                const size_t slot = (offset + i) & (size - 1);
                 m_overlap[slot * channels + c] += synthesis * m_window[i] * time[i];
             }
         }
