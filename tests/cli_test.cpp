@@ -616,9 +616,9 @@ TEST(CliCompareTest, MeasuresDrawsAndRefuses)
     const std::vector<double> reductions = Numbers(measured.output, "reductionDb");
     ASSERT_EQ(reductions.size(), 2u) << measured.output;
     for (double reduction : reductions) {
-        // The shelf takes the motor band down by up to 24 dB; on the sample's broadband bursts
-        // that is a few dB of the whole level.
-        EXPECT_GT(reduction, 3.0) << measured.output;
+        // The sample's motor is about as loud as its tone: taking it out lowers the whole level
+        // by up to 3 dB, less where the interval's strength is lower.
+        EXPECT_GT(reduction, 0.5) << measured.output;
     }
     EXPECT_EQ(Numbers(measured.output, "differingFrames"), std::vector<double>{0}) << "PCM outside the intervals";
     EXPECT_EQ(Numbers(measured.output, "offsetFrames"), std::vector<double>{0});

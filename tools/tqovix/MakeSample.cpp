@@ -19,7 +19,7 @@ constexpr const char* kUsage =
     "usage: tqovix make-sample [--pcm|--aac] [--seconds N] [--size-gib N] [--little-endian] [-f] DST\n"
     "  writes a 30 fps camera-style movie with 48 kHz stereo sound, AF information, audio\n"
     "  level information and trim tags\n"
-    "  --pcm             16-bit PCM sound: a tone, with noise bursts while the AF motor runs\n"
+    "  --pcm             16-bit PCM sound: a tone, with a motor's whine and hiss while the AF motor runs\n"
     "                    (the default; movies over 20 minutes get the tone alone)\n"
     "  --aac             an AAC sound track (silent packets)\n"
     "  --seconds N       length of the movie (default 10)\n"
@@ -35,8 +35,9 @@ constexpr unsigned long kMaxExplicitSoundSeconds = 20 * 60;
 // Video frames are generated in memory one at a time; keep each one modest.
 constexpr uint64_t kMaxFrameBytes = 64ULL << 20;
 
-// A steady tone, and inside each AF interval bursts of noise as a lens motor makes
-// (30 ms on, 70 ms off), as loud as the interval's strength says.
+// A steady tone, and inside each AF interval the noise a lens motor makes: a whine whose pitch
+// rises as the motor speeds up, holds, and falls as it brakes, with two harmonics and a hiss,
+// as loud as the interval's strength says.
 std::vector<int16_t> ToneWithMotorNoise(uint64_t frames, const std::vector<moviekit::AfInterval>& intervals)
 {
     std::vector<int16_t> samples(frames * kChannels);
@@ -45,16 +46,22 @@ std::vector<int16_t> ToneWithMotorNoise(uint64_t frames, const std::vector<movie
         samples[f * kChannels] = static_cast<int16_t>(std::lround(6000 * std::sin(1000 * phase)));
         samples[f * kChannels + 1] = static_cast<int16_t>(std::lround(6000 * std::sin(1500 * phase)));
     }
-    const uint64_t period = kSampleRate / 10;
-    const uint64_t burst = kSampleRate * 3 / 100;
     for (const moviekit::AfInterval& interval : intervals) {
-        for (uint64_t f = interval.startFrame; f < interval.endFrame && f < frames; ++f) {
-            if ((f - interval.startFrame) % period >= burst) {
-                continue;
-            }
+        const uint64_t end = std::min<uint64_t>(interval.endFrame, frames);
+        if (interval.startFrame >= end) {
+            continue;
+        }
+        const double length = static_cast<double>(end - interval.startFrame);
+        double whine = 0.0;
+        for (uint64_t f = interval.startFrame; f < end; ++f) {
+            const double at = static_cast<double>(f - interval.startFrame) / length;
+            const double speed = std::min({1.0, at * 4.0, (1.0 - at) * 4.0});
+            whine += 2 * std::numbers::pi * (250.0 + 650.0 * speed) / kSampleRate;
+            const double tone = std::sin(whine) + 0.5 * std::sin(2 * whine) + 0.25 * std::sin(3 * whine);
             for (uint64_t c = 0; c < kChannels; ++c) {
-                const auto noise = static_cast<int64_t>(moviekit::SplitMix64(f * kChannels + c) % 8001) - 4000;
-                const int64_t mixed = samples[f * kChannels + c] + noise * interval.strength / 1000;
+                const auto hiss = static_cast<double>(moviekit::SplitMix64(f * kChannels + c) % 4001) - 2000.0;
+                const double noise = (5000.0 * tone + hiss) * interval.strength / 1000.0;
+                const int64_t mixed = samples[f * kChannels + c] + std::llround(noise);
                 samples[f * kChannels + c] = static_cast<int16_t>(std::clamp<int64_t>(mixed, -32768, 32767));
             }
         }
