@@ -7,8 +7,8 @@ namespace ovix {
 namespace {
 
 // Weight of the previous frame in the a-priori SNR: high, so that what remains is steady.
-constexpr float kSmoothing = 0.95f;
-constexpr float kFloor = 0.1f;  // -20 dB: the motor's rest stays under the wanted sound
+constexpr float kSmoothing = 0.98f;
+constexpr float kFloor = 0.05f;  // -26 dB: the motor's rest stays under the wanted sound
 constexpr float kTiny = 1e-20f;
 
 }  // namespace

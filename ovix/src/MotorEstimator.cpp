@@ -6,14 +6,16 @@
 namespace ovix {
 namespace {
 
-// The wanted sound's floor around an interval (its ceiling is the loudest it got there).
-constexpr double kFloorQuantile = 0.2;
+// The wanted sound's usual level around an interval (its ceiling is the loudest it got there):
+// what the motor's activation is measured beyond.
+constexpr double kFloorQuantile = 0.35;
+constexpr size_t kCeilingSpread = 2;
 // Over the motor's bins, the share that wanted sound may raise without raising the estimate.
 constexpr double kActivationQuantile = 0.3;
 // How far above the surroundings' ceiling a cell must rise to be taken for motor: at the
 // drive's start and stop, where transients are expected, and in its steady part.
 constexpr float kRiseEdge = 2.0f;
-constexpr float kRiseCore = 4.0f;
+constexpr float kRiseCore = 2.0f;
 // Each side of a drive's start or stop: long enough for medians to pass over syllables.
 constexpr double kWindowSeconds = 0.3;
 constexpr size_t kMinRows = 8;
@@ -71,6 +73,15 @@ void MotorEstimator::SetSurroundings(const SpectralFrames& around, size_t before
             for (size_t k = 0; k < m_bins; ++k) {
                 m_ceiling[k] = std::max(m_ceiling[k], p[k]);
             }
+        }
+        // A bin's ceiling is the loudest of it and its neighbours: a voice's harmonics move with
+        // its pitch, and one louder syllable a bin away is no motor.
+        std::copy(m_ceiling.begin(), m_ceiling.end(), m_inside.begin());
+        for (size_t k = 0; k < m_bins; ++k) {
+            const size_t from = k > kCeilingSpread ? k - kCeilingSpread : 0;
+            const size_t to = std::min(m_bins, k + kCeilingSpread + 1);
+            m_ceiling[k] = *std::max_element(m_inside.begin() + static_cast<ptrdiff_t>(from),
+                                             m_inside.begin() + static_cast<ptrdiff_t>(to));
         }
     }
     // Otherwise what was heard around earlier intervals stands.
