@@ -19,6 +19,10 @@ constexpr float kRiseCore = 2.0f;
 // Each side of a drive's start or stop: long enough for medians to pass over syllables.
 constexpr double kWindowSeconds = 0.3;
 constexpr size_t kMinRows = 8;
+// What shows a motor in an interval: the smaller of its two end steps carries this share of
+// the sound at that end, or what rises far above the surroundings this share of its power.
+constexpr double kClearStep = 0.065;
+constexpr double kClearRise = 0.045;
 // Enough bins to judge a frame by, few enough to judge every frame quickly.
 constexpr size_t kMaxMotorBins = 64;
 
@@ -177,7 +181,17 @@ void MotorEstimator::SelectMotorBins()
 double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* roles, SpectralFrames& noise)
 {
     noise.Clear();
+    // The interval shows its own motor by a step at its ends or by a strong rise above the
+    // surroundings; only a clear step teaches the template.
+    double stepShare = 0.0;
     if (StepSpectrum(power, roles)) {
+        double step = 0.0;
+        double inside = 0.0;
+        for (size_t k = 0; k < m_bins; ++k) {
+            step += m_step[k];
+            inside += m_inside[k];
+        }
+        stepShare = inside > 0.0 ? step / inside : 0.0;
         Remember();
     }
     if (m_historyCount == 0) {
@@ -190,6 +204,7 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
     SelectMotorBins();
 
     double motor = 0.0;
+    double rise = 0.0;
     double total = 0.0;
     for (size_t row = 0; row < power.Rows(); ++row) {
         const float* p = power.Row(row);
@@ -206,12 +221,15 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
                              m_column.begin() + static_cast<ptrdiff_t>(used));
             activation = m_column[at];
         }
-        const float rise = roles[row] == FrameRole::kEdge ? kRiseEdge : kRiseCore;
+        const float bar = roles[row] == FrameRole::kEdge ? kRiseEdge : kRiseCore;
         for (size_t k = 0; k < m_bins; ++k) {
             const float steady = activation * m_motor[k];
             const float ceiling = m_ceiling[k] + steady;
-            const float excess = p[k] > rise * ceiling ? p[k] - ceiling : 0.0f;
+            const float excess = p[k] > bar * ceiling ? p[k] - ceiling : 0.0f;
             n[k] = std::min(p[k], steady + excess);
+            if (roles[row] == FrameRole::kCore) {
+                rise += n[k] - std::min(p[k], steady);
+            }
         }
         if (roles[row] != FrameRole::kAround) {
             for (size_t k = 0; k < m_bins; ++k) {
@@ -220,7 +238,18 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
             }
         }
     }
-    return total > 0.0 ? motor / total : 0.0;
+    if (total <= 0.0) {
+        return 0.0;
+    }
+    // A long drive's middle has no ends: it goes with what its start showed.
+    bool shown = stepShare >= kClearStep || rise / total >= kClearRise;
+    if (!m_bFirst && !m_bLast) {
+        shown = m_bShown;
+    } else if (!m_bFirst) {
+        shown = shown || m_bShown;
+    }
+    m_bShown = shown;
+    return shown ? motor / total : 0.0;
 }
 
 }  // namespace ovix

@@ -35,7 +35,7 @@ public:
     // `last` say whether the segment to estimate holds the interval's start and end.
     void SetSurroundings(const SpectralFrames& around, size_t before, bool first, bool last);
     // Fills `noise` (same rows as `power`) and answers the motor's share of the power in the
-    // interval's frames: near 0 when the motor is not audible there.
+    // interval's frames: 0 when the interval does not show a motor (a quiet lens).
     double Estimate(const SpectralFrames& power, const FrameRole* roles, SpectralFrames& noise);
 
 private:
@@ -53,6 +53,7 @@ private:
     size_t m_before = 0;
     bool m_bFirst = false;
     bool m_bLast = false;
+    bool m_bShown = false;  // whether the interval's earlier segments showed a motor
     std::vector<float> m_floor;  // the wanted sound's floor around the interval
     std::vector<float> m_ceiling;  // and the most it reached
     std::vector<float> m_inside;
