@@ -5,6 +5,7 @@
 #include <ovix/Ovix.h>
 
 #include <algorithm>
+#include <array>
 #include <atomic>
 #include <chrono>
 #include <cstdint>
@@ -45,6 +46,7 @@ struct Script {
     bool zerosAfterEnd = false;  // decoded AAC: the track is followed by zeros forever
     size_t infoPieceLimit = SIZE_MAX;
     size_t audioFrameLimit = SIZE_MAX / 64;
+    std::vector<size_t> deliveryCycle = {};  // if set, the n-th pull delivers at most deliveryCycle[n % size] frames
     unsigned long afSize = 0;  // if not 0, announced instead of the true size
     bool overDeliver = false;  // the audio reader claims one byte more than asked
     Trigger failAt = {}, abortAt = {}, holdAt = {};  // held at the harness's gate
@@ -73,6 +75,7 @@ public:
             Harness& h = *s_current;
             const int16_t* samples = static_cast<const int16_t*>(data);
             h.pushed.insert(h.pushed.end(), samples, samples + size / sizeof(int16_t));
+            h.pushedBytes.push_back(size);
             return h.Enter('O') ? ovix::kSuccess : ovix::kFailure;
         });
         TqovixSetCallbackNotifyProgress([](unsigned long done, unsigned long total) {
@@ -86,6 +89,7 @@ public:
     std::string events;
     std::vector<int16_t> pushed;
     std::vector<Note> notes;
+    std::vector<size_t> pulledBytes, pushedBytes;  // every delivery and push, in order
     Gate gate;
 
 private:
@@ -94,7 +98,7 @@ private:
     // Records the event and plays the scripted fault; false when this call is to fail.
     bool Enter(char event)
     {
-        const Trigger now{event, static_cast<int>(std::ranges::count(events, event))};
+        const Trigger now{event, m_calls[static_cast<unsigned char>(event)]++};
         events.push_back(event);
         if (now == m_script.abortAt) {
             TqovixAbortSession();
@@ -133,7 +137,9 @@ private:
             return ovix::kFailure;
         }
         const size_t left = (s.pcm.size() - h.m_samplePosition) * sizeof(int16_t);
-        size_t piece = std::min({size_t{size}, left, s.audioFrameLimit * s.channels * sizeof(int16_t)});
+        const size_t limit = s.deliveryCycle.empty() ? s.audioFrameLimit
+                                                     : s.deliveryCycle[h.pulledBytes.size() % s.deliveryCycle.size()];
+        size_t piece = std::min({size_t{size}, left, limit * s.channels * sizeof(int16_t)});
         uint8_t* out = static_cast<uint8_t*>(buffer);
         std::copy_n(reinterpret_cast<const uint8_t*>(s.pcm.data() + h.m_samplePosition), piece, out);
         h.m_samplePosition += piece / sizeof(int16_t);
@@ -141,11 +147,13 @@ private:
             piece = std::fill_n(out + piece, size - piece, 0) - out;
         }
         *delivered = piece + (s.overDeliver ? 1 : 0);
+        h.pulledBytes.push_back(*delivered);
         return ovix::kSuccess;
     }
 
     Script m_script;
     size_t m_afPosition = 0, m_levelPosition = 0, m_samplePosition = 0;
+    std::array<int, 256> m_calls = {};  // by event letter
 };
 
 }  // namespace ovixtest
