@@ -5,6 +5,7 @@
 #include "host/ChunkAccount.h"
 #include "host/JobHarness.h"
 #include "MakerInjector.h"
+#include "support/MotorSound.h"
 #include "support/ProcessedRegions.h"
 
 #include <algorithm>
@@ -319,5 +320,70 @@ INSTANTIATE_TEST_SUITE_P(
                       Writer{"Fragmented", "aac", 48000, 2, ".mov", "-movflags frag_keyframe+empty_moov",
                              kRefused, Sound::Aac, "fragmented movie"}),
     [](const ::testing::TestParamInfo<Writer>& info) { return std::string(info.param.name); });
+
+
+class InteropSceneTest : public HostTest {};
+
+// A scene (a chord over room ambience) with a lens motor over its AF intervals, muxed by ffmpeg as
+// 48 kHz stereo PCM. The job must bring every interval closer to the clean scene, by at least
+// 3 dB of scale-invariant signal-to-distortion ratio over the input's, and give back every frame
+// outside the intervals and their 10 ms ramps bit-exact.
+TEST_F(InteropSceneTest, MotorRemovedInsideBitExactOutside)
+{
+    if (!testsupport::HaveCommand("ffmpeg")) {
+        GTEST_SKIP() << "ffmpeg is not installed";
+    }
+    constexpr uint32_t kRate = 48000, kChannels = 2;
+    constexpr double kSceneSeconds = 6.0;
+    const uint64_t frames = static_cast<uint64_t>(kSceneSeconds * kRate);
+    const std::vector<AfInterval> intervals = {{48000, 86400, 1000}, {124800, 148800, 1000}, {201600, 254400, 1000}};
+    std::vector<testsupport::MotorSpan> spans;
+    for (const AfInterval& interval : intervals) {
+        spans.push_back({interval.startFrame, interval.endFrame});
+    }
+    const std::vector<double> clean = testsupport::Sum(testsupport::Chord(frames, kChannels, kRate, 1200.0),
+                                                       testsupport::Ambience(frames, kChannels, 300.0));
+    const std::vector<int16_t> mixed =
+        testsupport::ToPcm(testsupport::Sum(clean, testsupport::MotorNoise(frames, kChannels, kRate, spans, 2500.0)));
+    std::vector<uint8_t> bytes(mixed.size() * 2);
+    for (size_t k = 0; k < mixed.size(); ++k) {
+        bytes[2 * k] = static_cast<uint8_t>(static_cast<uint16_t>(mixed[k]));
+        bytes[2 * k + 1] = static_cast<uint8_t>(static_cast<uint16_t>(mixed[k]) >> 8);
+    }
+    const std::string raw = m_dir.File("scene.raw");
+    ASSERT_TRUE(testsupport::WriteFile(raw, bytes));
+    const std::string source = m_dir.File("scene.mov");
+    ASSERT_EQ(Shell("ffmpeg -v error -nostdin -y -f lavfi -i testsrc=size=64x36:rate=30:d=" +
+                    std::to_string(kSceneSeconds) + " -f s16le -ar 48000 -ac 2 -i " + testsupport::ShellQuote(raw) +
+                    " -map 0:v -map 1:a -c:v mjpeg -c:a pcm_s16le " + testsupport::ShellQuote(source)),
+              "");
+    moviekit::MovieRecipe recipe;
+    recipe.sound.sampleRate = kRate;
+    recipe.maker.afIntervals = intervals;
+    std::string error;
+    ASSERT_TRUE(moviekit::AddMakerData(source, recipe, frames, &error)) << error;
+    const std::string destination = m_dir.File("processed.mov");
+    ASSERT_EQ(HostTest::Run(source, destination), kDone);
+
+    const std::vector<int16_t> before = Decode(source, 0);
+    const std::vector<int16_t> after = Decode(destination, 0);
+    ASSERT_TRUE(before == mixed) << "ffmpeg did not keep the scene's samples";
+    ASSERT_EQ(after.size(), before.size());
+    const uint64_t ramp = kRate / 100;
+    uint64_t strays = 0, firstStray = 0;
+    for (uint64_t f = 0; f < frames; ++f) {
+        const auto at = static_cast<std::ptrdiff_t>(f * kChannels);
+        if (Outside(f, intervals, ramp) && !std::equal(before.begin() + at, before.begin() + at + kChannels, after.begin() + at)) {
+            firstStray = strays++ == 0 ? f : firstStray;
+        }
+    }
+    EXPECT_EQ(strays, 0u) << "frames changed outside the intervals and their ramps, the first at " << firstStray;
+    for (const AfInterval& interval : intervals) {
+        const double input = testsupport::SiSdr(before, clean, kChannels, interval.startFrame, interval.endFrame);
+        const double output = testsupport::SiSdr(after, clean, kChannels, interval.startFrame, interval.endFrame);
+        EXPECT_GE(output - input, 3.0) << "interval at " << interval.startFrame << ": " << input << " dB in, " << output
+                                       << " dB out";
+    }
+}
 
 }  // namespace
