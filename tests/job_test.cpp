@@ -605,6 +605,11 @@ TEST_F(JobTest, LargeMovieGetsA64BitMdat)
     recipe.video.framesPerChunk = 8;
     recipe.keepSoundBytes = false;
     recipe.maker.afIntervals = kIntervals;
+    // Motor over the intervals: where nothing but the default tone plays there is nothing to remove.
+    const uint64_t soundFrames = uint64_t{recipe.sound.sampleRate} * recipe.video.frameCount * recipe.video.frameDuration /
+                                 recipe.video.timeScale;
+    recipe.sound.pcm = testsupport::MotorOverSpans(soundFrames, recipe.sound.channels, recipe.sound.sampleRate,
+                                                   Spans(kIntervals, 0));
     moviekit::MovieLayout layout;
     const std::string source = m_dir.File("src.mov");
     std::string error;
