@@ -458,7 +458,6 @@ INSTANTIATE_TEST_SUITE_P(
     ::testing::Values(MotorRow{"MotorInQuietStereo48k", 48000, 2, 0.0, 3000.0},
                       MotorRow{"MotorInQuietMono44k", 44100, 1, 0.0, 3000.0},
                       MotorRow{"SoftMotorInQuietSixChannels48k", 48000, 6, 0.0, 800.0},
-                      MotorRow{"DISABLED_MotorUnderChordStereo48k", 48000, 2, 2000.0, 1500.0},
                       MotorRow{"LoudMotorOverChordMono44k", 44100, 1, 1000.0, 3000.0}),
     [](const ::testing::TestParamInfo<MotorRow>& info) { return std::string(info.param.name); });
 

@@ -205,7 +205,8 @@ TEST_P(StopTest, NothingIsPublishedAndTheProgressWaitsForTheCopy)
     while (CountThreads() > threadsBefore && std::chrono::steady_clock::now() < deadline) {
         std::this_thread::sleep_for(std::chrono::milliseconds(2));
     }
-    EXPECT_EQ(CountThreads(), threadsBefore) << "a thread outlived the job";
+    // Fewer is fine: a thread of an earlier test may still have been ending when counted.
+    EXPECT_LE(CountThreads(), threadsBefore) << "a thread outlived the job";
 }
 
 INSTANTIATE_TEST_SUITE_P(
