@@ -27,7 +27,9 @@ thread_local bool t_countAllocations = false;
 thread_local uint64_t t_allocations = 0;
 }  // namespace
 
-void* operator new(std::size_t size)
+// Not inlined either way: g++ would pair an inlined malloc or free with the other side of
+// `new` and `delete` at every call site and warn.
+[[gnu::noinline]] void* operator new(std::size_t size)
 {
     if (t_countAllocations) {
         ++t_allocations;
@@ -37,8 +39,8 @@ void* operator new(std::size_t size)
     }
     throw std::bad_alloc();
 }
-void* operator new[](std::size_t size) { return operator new(size); }
-void* operator new(std::size_t size, const std::nothrow_t&) noexcept
+[[gnu::noinline]] void* operator new[](std::size_t size) { return operator new(size); }
+[[gnu::noinline]] void* operator new(std::size_t size, const std::nothrow_t&) noexcept
 {
     try {
         return operator new(size);
@@ -46,8 +48,10 @@ void* operator new(std::size_t size, const std::nothrow_t&) noexcept
         return nullptr;
     }
 }
-void* operator new[](std::size_t size, const std::nothrow_t& tag) noexcept { return operator new(size, tag); }
-// Not inlined: g++ would pair the inlined free with `new` at every call site and warn.
+[[gnu::noinline]] void* operator new[](std::size_t size, const std::nothrow_t& tag) noexcept
+{
+    return operator new(size, tag);
+}
 [[gnu::noinline]] void operator delete(void* block) noexcept { std::free(block); }
 [[gnu::noinline]] void operator delete[](void* block) noexcept { std::free(block); }
 [[gnu::noinline]] void operator delete(void* block, std::size_t) noexcept { std::free(block); }
