@@ -327,6 +327,15 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
         }
         FillWhine(power.Row(row), noise.Row(row), bar, m_whine[row]);
     }
+    // Never below the wanted sound's usual level around the interval: what a bin holds up to
+    // that level is taken for wanted sound, whatever the motor's estimate says.
+    for (size_t row = 0; row < power.Rows(); ++row) {
+        const float* p = power.Row(row);
+        float* n = noise.Row(row);
+        for (size_t k = 0; k < m_bins; ++k) {
+            n[k] = std::min(n[k], std::max(0.0f, p[k] - m_floor[k]));
+        }
+    }
     double motor = 0.0;
     double total = 0.0;
     for (size_t row = 0; row < power.Rows(); ++row) {
