@@ -19,6 +19,13 @@ constexpr float kRiseCore = 2.0f;
 // Each side of a drive's start or stop: long enough for medians to pass over syllables.
 constexpr double kWindowSeconds = 0.3;
 constexpr size_t kMinRows = 8;
+// A stepping motor's whine: fundamentals searched in 1/48-octave steps, eight harmonics.
+constexpr double kMinWhineHz = 100.0;
+constexpr double kMaxWhineHz = 2500.0;
+const double kWhineStep = std::pow(2.0, 1.0 / 48.0);
+constexpr int kHarmonics = 8;
+constexpr int kMinHarmonics = 3;
+constexpr float kLobeSide = 0.4f;  // a partial's power one bin off its centre, under this window
 // What shows a motor in an interval: the smaller of its two end steps carries this share of
 // the sound at that end, or what rises far above the surroundings this share of its power.
 constexpr double kClearStep = 0.065;
@@ -41,8 +48,14 @@ MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
       m_history(kRemembered * m_bins)
 {
     m_motorBins.reserve(m_bins);
+    m_base.resize(m_bins);
+    m_salience.resize(m_bins);
+
+    m_binHz = static_cast<double>(parameters.rateHz) / static_cast<double>(parameters.fftSize);
     const size_t rows = (parameters.segmentFrames + parameters.fftSize + 2 * parameters.rampFrames) / parameters.hop + 8;
     m_column.resize(std::max({rows, parameters.contextFrames * 2 / parameters.hop + 8, m_bins, kRemembered}));
+    m_activation.resize(m_column.size());
+    m_whine.resize(m_column.size());
 }
 
 void MotorEstimator::Quantile(const SpectralFrames& frames, size_t from, size_t to, double q, std::vector<float>& out)
@@ -178,6 +191,75 @@ void MotorEstimator::SelectMotorBins()
     }
 }
 
+// Per bin, how far the frame stands out above the ceiling (log of the ratio), 0 where it does
+// not; answers how many bins stand out.
+size_t MotorEstimator::Salience(const float* p, float bar)
+{
+    size_t standing = 0;
+    for (size_t k = 0; k < m_bins; ++k) {
+        const bool stands = p[k] > bar * m_base[k] && m_base[k] > 0.0f;
+        m_salience[k] = stands ? std::log(p[k] / m_base[k]) : 0.0f;
+        standing += stands ? 1 : 0;
+    }
+    return standing;
+}
+
+// A whine: the fundamental whose harmonics stand out most above the wanted sound's ceiling, at
+// least three of them and half of those in range; 0 when there is none.
+double MotorEstimator::DetectWhine(const float* p, float bar)
+{
+    if (Salience(p, bar) < static_cast<size_t>(kMinHarmonics)) {
+        return 0.0;
+    }
+    double bestScore = 0.0;
+    double bestF0 = 0.0;
+    const double top = static_cast<double>(m_bins - 2);
+    for (double f0 = kMinWhineHz; f0 <= kMaxWhineHz; f0 *= kWhineStep) {
+        const double step = f0 / m_binHz;
+        int considered = 0;
+        int count = 0;
+        double score = 0.0;
+        for (int h = 1; h <= kHarmonics && h * step <= top; ++h) {
+            const auto k = static_cast<size_t>(h * step + 0.5);
+            const float s = std::max({m_salience[k - 1], m_salience[k], m_salience[k + 1]});
+            ++considered;
+            if (s > 0.0f) {
+                ++count;
+                score += s;
+            }
+        }
+        if (count >= kMinHarmonics && 2 * count >= considered && score > bestScore) {
+            bestScore = score;
+            bestF0 = f0;
+        }
+    }
+    return bestF0;
+}
+
+// Every harmonic of a whine, the hidden ones too, gets at least the power of its strongest
+// harmonic that stands out, spread over the window's main lobe.
+void MotorEstimator::FillWhine(const float* p, float* n, float bar, double f0)
+{
+    Salience(p, bar);
+    const double top = static_cast<double>(m_bins - 2);
+    float strongest = 0.0f;
+    for (int h = 1; h <= kHarmonics && h * f0 / m_binHz <= top; ++h) {
+        const auto k = static_cast<size_t>(h * f0 / m_binHz + 0.5);
+        for (size_t j = k - 1; j <= k + 1; ++j) {
+            if (m_salience[j] > 0.0f) {
+                strongest = std::max(strongest, p[j] - m_base[j]);
+            }
+        }
+    }
+    const float lobe[3] = {kLobeSide, 1.0f, kLobeSide};
+    for (int h = 1; h <= kHarmonics && h * f0 / m_binHz <= top; ++h) {
+        const auto k = static_cast<size_t>(h * f0 / m_binHz + 0.5);
+        for (size_t j = k - 1; j <= k + 1; ++j) {
+            n[j] = std::min(p[j], std::max(n[j], strongest * lobe[j + 1 - k]));
+        }
+    }
+}
+
 double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* roles, SpectralFrames& noise)
 {
     noise.Clear();
@@ -203,9 +285,7 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
     Template();
     SelectMotorBins();
 
-    double motor = 0.0;
     double rise = 0.0;
-    double total = 0.0;
     for (size_t row = 0; row < power.Rows(); ++row) {
         const float* p = power.Row(row);
         float* n = noise.AddRow();
@@ -221,17 +301,47 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
                              m_column.begin() + static_cast<ptrdiff_t>(used));
             activation = m_column[at];
         }
+        m_activation[row] = activation;
         const float bar = roles[row] == FrameRole::kEdge ? kRiseEdge : kRiseCore;
         for (size_t k = 0; k < m_bins; ++k) {
             const float steady = activation * m_motor[k];
             const float ceiling = m_ceiling[k] + steady;
             const float excess = p[k] > bar * ceiling ? p[k] - ceiling : 0.0f;
             n[k] = std::min(p[k], steady + excess);
+            m_base[k] = ceiling;
             if (roles[row] == FrameRole::kCore) {
                 rise += n[k] - std::min(p[k], steady);
             }
         }
+        m_whine[row] = DetectWhine(p, bar);
+    }
+    // A whine sweeping with the motor's speed hides some harmonics under the wanted sound: they
+    // are given the power of those that show.
+    for (size_t row = 0; row < power.Rows(); ++row) {
+        if (m_whine[row] == 0.0) {
+            continue;
+        }
+        const float bar = roles[row] == FrameRole::kEdge ? kRiseEdge : kRiseCore;
+        for (size_t k = 0; k < m_bins; ++k) {
+            m_base[k] = m_ceiling[k] + m_activation[row] * m_motor[k];
+        }
+        FillWhine(power.Row(row), noise.Row(row), bar, m_whine[row]);
+    }
+    // Never below the wanted sound's usual level around the interval: what a bin holds up to
+    // that level is taken for wanted sound, whatever the motor's estimate says.
+    for (size_t row = 0; row < power.Rows(); ++row) {
+        const float* p = power.Row(row);
+        float* n = noise.Row(row);
+        for (size_t k = 0; k < m_bins; ++k) {
+            n[k] = std::min(n[k], std::max(0.0f, p[k] - m_floor[k]));
+        }
+    }
+    double motor = 0.0;
+    double total = 0.0;
+    for (size_t row = 0; row < power.Rows(); ++row) {
         if (roles[row] != FrameRole::kAround) {
+            const float* p = power.Row(row);
+            const float* n = noise.Row(row);
             for (size_t k = 0; k < m_bins; ++k) {
                 motor += n[k];
                 total += p[k];

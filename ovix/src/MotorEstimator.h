@@ -11,6 +11,8 @@
 //   relative to the motor's spectrum. Wanted sound only raises some bins, so it passes.
 // - The drive's start and stop transients, judged apart: at the interval's edges, what rises
 //   far above anything the surroundings reached.
+// - A stepping motor's whine sweeps with its speed: per frame the fundamental whose harmonics
+//   stand out, and its harmonics hidden under the wanted sound given the power of those shown.
 #pragma once
 
 #include "SpectralFrames.h"
@@ -46,6 +48,9 @@ private:
     void Remember();
     void Template();
     void SelectMotorBins();
+    size_t Salience(const float* p, float bar);
+    double DetectWhine(const float* p, float bar);
+    void FillWhine(const float* p, float* n, float bar, double f0);
 
     size_t m_bins;
     size_t m_windowRows;  // rows on each side of a drive's start or stop
@@ -61,6 +66,11 @@ private:
     std::vector<float> m_step;
     std::vector<float> m_motor;  // the motor's spectrum used for this interval
     std::vector<size_t> m_motorBins;
+    std::vector<float> m_base;  // per frame: the wanted sound's ceiling plus the steady motor
+    std::vector<float> m_salience;
+    std::vector<float> m_activation;
+    std::vector<double> m_whine;  // per frame: the whine's fundamental, 0 for none
+    double m_binHz = 1.0;
     std::vector<float> m_column;  // scratch: one bin across rows, or one row across bins
     static constexpr size_t kRemembered = 5;
     std::vector<float> m_history;  // unit-power spectra of recent intervals, kRemembered rows
