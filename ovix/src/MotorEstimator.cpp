@@ -50,8 +50,22 @@ MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
     m_motorBins.reserve(m_bins);
     m_base.resize(m_bins);
     m_salience.resize(m_bins);
-
+    m_spread.resize(m_bins);
     m_binHz = static_cast<double>(parameters.rateHz) / static_cast<double>(parameters.fftSize);
+    static_assert(kHarmonics <= kMaxHarmonics);
+    // The fundamentals searched and where their harmonics fall, worked out once.
+    const double top = static_cast<double>(m_bins - 2);
+    for (double f0 = kMinWhineHz; f0 <= kMaxWhineHz; f0 *= kWhineStep) {
+        Candidate candidate;
+        candidate.hz = f0;
+        const double step = f0 / m_binHz;
+        for (int h = 1; h <= kHarmonics && h * step <= top && h * step >= 1.0; ++h) {
+            candidate.bins[candidate.harmonics++] = static_cast<uint16_t>(h * step + 0.5);
+        }
+        if (candidate.harmonics >= kMinHarmonics) {
+            m_candidates.push_back(candidate);
+        }
+    }
     const size_t rows = (parameters.segmentFrames + parameters.fftSize + 2 * parameters.rampFrames) / parameters.hop + 8;
     m_column.resize(std::max({rows, parameters.contextFrames * 2 / parameters.hop + 8, m_bins, kRemembered}));
     m_activation.resize(m_column.size());
@@ -211,29 +225,28 @@ double MotorEstimator::DetectWhine(const float* p, float bar)
     if (Salience(p, bar) < static_cast<size_t>(kMinHarmonics)) {
         return 0.0;
     }
+    // A harmonic may fall a bin either side of where its fundamental puts it.
+    m_spread[0] = std::max(m_salience[0], m_salience[1]);
+    for (size_t k = 1; k + 1 < m_bins; ++k) {
+        m_spread[k] = std::max({m_salience[k - 1], m_salience[k], m_salience[k + 1]});
+    }
     double bestScore = 0.0;
-    double bestF0 = 0.0;
-    const double top = static_cast<double>(m_bins - 2);
-    for (double f0 = kMinWhineHz; f0 <= kMaxWhineHz; f0 *= kWhineStep) {
-        const double step = f0 / m_binHz;
-        int considered = 0;
+    size_t best = m_candidates.size();
+    for (size_t c = 0; c < m_candidates.size(); ++c) {
+        const Candidate& candidate = m_candidates[c];
         int count = 0;
         double score = 0.0;
-        for (int h = 1; h <= kHarmonics && h * step <= top; ++h) {
-            const auto k = static_cast<size_t>(h * step + 0.5);
-            const float s = std::max({m_salience[k - 1], m_salience[k], m_salience[k + 1]});
-            ++considered;
-            if (s > 0.0f) {
-                ++count;
-                score += s;
-            }
+        for (int h = 0; h < candidate.harmonics; ++h) {
+            const float s = m_spread[candidate.bins[h]];
+            count += s > 0.0f ? 1 : 0;
+            score += s;
         }
-        if (count >= kMinHarmonics && 2 * count >= considered && score > bestScore) {
+        if (count >= kMinHarmonics && 2 * count >= candidate.harmonics && score > bestScore) {
             bestScore = score;
-            bestF0 = f0;
+            best = c;
         }
     }
-    return bestF0;
+    return best < m_candidates.size() ? m_candidates[best].hz : 0.0;
 }
 
 // Every harmonic of a whine, the hidden ones too, gets at least the power of its strongest

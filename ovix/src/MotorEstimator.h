@@ -68,6 +68,14 @@ private:
     std::vector<size_t> m_motorBins;
     std::vector<float> m_base;  // per frame: the wanted sound's ceiling plus the steady motor
     std::vector<float> m_salience;
+    std::vector<float> m_spread;  // the salience, at most a bin away
+    static constexpr int kMaxHarmonics = 8;
+    struct Candidate {
+        double hz = 0.0;
+        int harmonics = 0;
+        uint16_t bins[kMaxHarmonics] = {};
+    };
+    std::vector<Candidate> m_candidates;
     std::vector<float> m_activation;
     std::vector<double> m_whine;  // per frame: the whine's fundamental, 0 for none
     double m_binHz = 1.0;
