@@ -12,10 +12,8 @@ constexpr double kFloorQuantile = 0.35;
 constexpr size_t kCeilingSpread = 2;
 // Over the motor's bins, the share that wanted sound may raise without raising the estimate.
 constexpr double kActivationQuantile = 0.3;
-// How far above the surroundings' ceiling a cell must rise to be taken for motor: at the
-// drive's start and stop, where transients are expected, and in its steady part.
-constexpr float kRiseEdge = 2.0f;
-constexpr float kRiseCore = 2.0f;
+// How far above the surroundings' ceiling a cell must rise to be taken for motor.
+constexpr float kRise = 2.0f;
 // Each side of a drive's start or stop: long enough for medians to pass over syllables.
 constexpr double kWindowSeconds = 0.3;
 constexpr size_t kMinRows = 8;
@@ -207,11 +205,11 @@ void MotorEstimator::SelectMotorBins()
 
 // Per bin, how far the frame stands out above the ceiling (log of the ratio), 0 where it does
 // not; answers how many bins stand out.
-size_t MotorEstimator::Salience(const float* p, float bar)
+size_t MotorEstimator::Salience(const float* p)
 {
     size_t standing = 0;
     for (size_t k = 0; k < m_bins; ++k) {
-        const bool stands = p[k] > bar * m_base[k] && m_base[k] > 0.0f;
+        const bool stands = p[k] > kRise * m_base[k] && m_base[k] > 0.0f;
         m_salience[k] = stands ? std::log(p[k] / m_base[k]) : 0.0f;
         standing += stands ? 1 : 0;
     }
@@ -220,9 +218,9 @@ size_t MotorEstimator::Salience(const float* p, float bar)
 
 // A whine: the fundamental whose harmonics stand out most above the wanted sound's ceiling, at
 // least three of them and half of those in range; 0 when there is none.
-double MotorEstimator::DetectWhine(const float* p, float bar)
+double MotorEstimator::DetectWhine(const float* p)
 {
-    if (Salience(p, bar) < static_cast<size_t>(kMinHarmonics)) {
+    if (Salience(p) < static_cast<size_t>(kMinHarmonics)) {
         return 0.0;
     }
     // A harmonic may fall a bin either side of where its fundamental puts it.
@@ -251,9 +249,9 @@ double MotorEstimator::DetectWhine(const float* p, float bar)
 
 // Every harmonic of a whine, the hidden ones too, gets at least the power of its strongest
 // harmonic that stands out, spread over the window's main lobe.
-void MotorEstimator::FillWhine(const float* p, float* n, float bar, double f0)
+void MotorEstimator::FillWhine(const float* p, float* n, double f0)
 {
-    Salience(p, bar);
+    Salience(p);
     const double top = static_cast<double>(m_bins - 2);
     float strongest = 0.0f;
     for (int h = 1; h <= kHarmonics && h * f0 / m_binHz <= top; ++h) {
@@ -315,18 +313,17 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
             activation = m_column[at];
         }
         m_activation[row] = activation;
-        const float bar = roles[row] == FrameRole::kEdge ? kRiseEdge : kRiseCore;
         for (size_t k = 0; k < m_bins; ++k) {
             const float steady = activation * m_motor[k];
             const float ceiling = m_ceiling[k] + steady;
-            const float excess = p[k] > bar * ceiling ? p[k] - ceiling : 0.0f;
+            const float excess = p[k] > kRise * ceiling ? p[k] - ceiling : 0.0f;
             n[k] = std::min(p[k], steady + excess);
             m_base[k] = ceiling;
             if (roles[row] == FrameRole::kCore) {
                 rise += n[k] - std::min(p[k], steady);
             }
         }
-        m_whine[row] = DetectWhine(p, bar);
+        m_whine[row] = DetectWhine(p);
     }
     // A whine sweeping with the motor's speed hides some harmonics under the wanted sound: they
     // are given the power of those that show.
@@ -334,11 +331,10 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
         if (m_whine[row] == 0.0) {
             continue;
         }
-        const float bar = roles[row] == FrameRole::kEdge ? kRiseEdge : kRiseCore;
         for (size_t k = 0; k < m_bins; ++k) {
             m_base[k] = m_ceiling[k] + m_activation[row] * m_motor[k];
         }
-        FillWhine(power.Row(row), noise.Row(row), bar, m_whine[row]);
+        FillWhine(power.Row(row), noise.Row(row), m_whine[row]);
     }
     // Never below the wanted sound's usual level around the interval: what a bin holds up to
     // that level is taken for wanted sound, whatever the motor's estimate says.

@@ -9,8 +9,8 @@
 // - Per frame, how strongly the motor runs (it accelerates, brakes, is driven in bursts): a
 //   low quantile over the motor's bins of the frame's power beyond the wanted sound's floor,
 //   relative to the motor's spectrum. Wanted sound only raises some bins, so it passes.
-// - The drive's start and stop transients, judged apart: at the interval's edges, what rises
-//   far above anything the surroundings reached.
+// - Ticks and the drive's start and stop transients: what rises far above anything the
+//   surroundings reached (the edges are kept out of the end steps' windows).
 // - A stepping motor's whine sweeps with its speed: per frame the fundamental whose harmonics
 //   stand out, and its harmonics hidden under the wanted sound given the power of those shown.
 #pragma once
@@ -48,9 +48,9 @@ private:
     void Remember();
     void Template();
     void SelectMotorBins();
-    size_t Salience(const float* p, float bar);
-    double DetectWhine(const float* p, float bar);
-    void FillWhine(const float* p, float* n, float bar, double f0);
+    size_t Salience(const float* p);
+    double DetectWhine(const float* p);
+    void FillWhine(const float* p, float* n, double f0);
 
     size_t m_bins;
     size_t m_windowRows;  // rows on each side of a drive's start or stop
