@@ -28,6 +28,11 @@ constexpr float kLobeSide = 0.4f;  // a partial's power one bin off its centre, 
 // the sound at that end, or what rises far above the surroundings this share of its power.
 constexpr double kClearStep = 0.065;
 constexpr double kClearRise = 0.045;
+// And that evidence looks like the lens heard in earlier intervals: this share of its power in
+// bands where theirs was. Unrelated spectra share a few percent, a chord under a whine's sweep
+// over a tenth.
+constexpr double kLikeLens = 0.2;
+constexpr double kBandsPerOctave = 4.0;
 // Enough bins to judge a frame by, few enough to judge every frame quickly.
 constexpr size_t kMaxMotorBins = 64;
 
@@ -46,6 +51,16 @@ MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
       m_history(kRemembered * m_bins)
 {
     m_motorBins.reserve(m_bins);
+    m_band.resize(m_bins);
+    for (size_t k = 1; k < m_bins; ++k) {
+        m_band[k] = static_cast<uint8_t>(kBandsPerOctave * std::log2(static_cast<double>(k)));
+    }
+    m_band[0] = m_band[1];
+    m_bands = static_cast<size_t>(m_band[m_bins - 1]) + 1;
+    m_stepBands.resize(m_bands);
+    m_riseBands.resize(m_bands);
+    m_templateBands.resize(m_bands);
+    m_riseHistory.resize(kRemembered * m_bands);
     m_base.resize(m_bins);
     m_salience.resize(m_bins);
     m_spread.resize(m_bins);
@@ -152,34 +167,58 @@ bool MotorEstimator::StepSpectrum(const SpectralFrames& power, const FrameRole* 
     return any;
 }
 
-void MotorEstimator::Remember()
+void MotorEstimator::Remember(const float* spectrum, size_t width, std::vector<float>& history, size_t& count,
+                              size_t& next)
 {
-    double sum = 0.0;
-    for (size_t k = 0; k < m_bins; ++k) {
-        sum += m_step[k];
-    }
-    if (sum <= 0.0) {
-        return;
-    }
-    float* row = m_history.data() + m_historyNext * m_bins;
-    for (size_t k = 0; k < m_bins; ++k) {
-        row[k] = static_cast<float>(m_step[k] / sum);
-    }
-    m_historyNext = (m_historyNext + 1) % kRemembered;
-    m_historyCount = std::min(m_historyCount + 1, kRemembered);
+    std::copy(spectrum, spectrum + width, history.begin() + static_cast<ptrdiff_t>(next * width));
+    next = (next + 1) % kRemembered;
+    count = std::min(count + 1, kRemembered);
 }
 
-void MotorEstimator::Template()
+void MotorEstimator::Template(bool withStep)
 {
+    const size_t rows = m_historyCount + (withStep ? 1 : 0);
     for (size_t k = 0; k < m_bins; ++k) {
         for (size_t i = 0; i < m_historyCount; ++i) {
             m_column[i] = m_history[i * m_bins + k];
         }
-        const size_t middle = m_historyCount / 2;
+        if (withStep) {
+            m_column[m_historyCount] = m_step[k];
+        }
+        const size_t middle = rows / 2;
         std::nth_element(m_column.begin(), m_column.begin() + static_cast<ptrdiff_t>(middle),
-                         m_column.begin() + static_cast<ptrdiff_t>(m_historyCount));
+                         m_column.begin() + static_cast<ptrdiff_t>(rows));
         m_motor[k] = m_column[middle];
     }
+}
+
+void MotorEstimator::ToBands(const float* spectrum, std::vector<float>& bands) const
+{
+    std::fill(bands.begin(), bands.end(), 0.0f);
+    double sum = 0.0;
+    for (size_t k = 0; k < m_bins; ++k) {
+        bands[m_band[k]] += spectrum[k];
+        sum += spectrum[k];
+    }
+    for (float& band : bands) {
+        band = sum > 0.0 ? static_cast<float>(band / sum) : 0.0f;
+    }
+}
+
+double MotorEstimator::Likeness(const std::vector<float>& spectrum, const std::vector<float>& history, size_t count) const
+{
+    if (count == 0) {
+        return 1.0;  // nothing heard yet to compare with
+    }
+    double best = 0.0;
+    for (size_t i = 0; i < count; ++i) {
+        double shared = 0.0;
+        for (size_t b = 0; b < m_bands; ++b) {
+            shared += std::min(spectrum[b], history[i * m_bands + b]);
+        }
+        best = std::max(best, shared);
+    }
+    return best;
 }
 
 // The bins where the motor is strongest: above its mean, at most kMaxMotorBins of them.
@@ -275,9 +314,12 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
 {
     noise.Clear();
     // The interval shows its own motor by a step at its ends or by a strong rise above the
-    // surroundings; only a clear step teaches the template.
+    // surroundings, either like the lens heard before; only such an interval teaches what the
+    // lens sounds like.
     double stepShare = 0.0;
-    if (StepSpectrum(power, roles)) {
+    double stepLikeness = 0.0;
+    bool stepped = StepSpectrum(power, roles);
+    if (stepped) {
         double step = 0.0;
         double inside = 0.0;
         for (size_t k = 0; k < m_bins; ++k) {
@@ -285,16 +327,28 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
             inside += m_inside[k];
         }
         stepShare = inside > 0.0 ? step / inside : 0.0;
-        Remember();
+        stepped = step > 0.0;
+        for (float& value : m_step) {
+            value = stepped ? static_cast<float>(value / step) : 0.0f;
+        }
+        if (stepped && m_historyCount > 0) {
+            Template(false);
+            ToBands(m_motor.data(), m_templateBands);
+            ToBands(m_step.data(), m_stepBands);
+            stepLikeness = Likeness(m_stepBands, m_templateBands, 1);
+        } else {
+            stepLikeness = 1.0;
+        }
     }
-    if (m_historyCount == 0) {
+    if (m_historyCount == 0 && !stepped) {
         for (size_t row = 0; row < power.Rows(); ++row) {
             noise.AddRow();
         }
         return 0.0;
     }
-    Template();
+    Template(stepped);
     SelectMotorBins();
+    std::fill(m_inside.begin(), m_inside.end(), 0.0f);  // from here: what rose, per bin
 
     double rise = 0.0;
     for (size_t row = 0; row < power.Rows(); ++row) {
@@ -320,7 +374,9 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
             n[k] = std::min(p[k], steady + excess);
             m_base[k] = ceiling;
             if (roles[row] == FrameRole::kCore) {
-                rise += n[k] - std::min(p[k], steady);
+                const float risen = n[k] - std::min(p[k], steady);
+                rise += risen;
+                m_inside[k] += risen;
             }
         }
         m_whine[row] = DetectWhine(p);
@@ -360,14 +416,23 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
     if (total <= 0.0) {
         return 0.0;
     }
+    ToBands(m_inside.data(), m_riseBands);
+    const bool rose = rise / total >= kClearRise && Likeness(m_riseBands, m_riseHistory, m_riseCount) >= kLikeLens;
+    bool shown = (stepShare >= kClearStep && stepLikeness >= kLikeLens) || rose;
     // A long drive's middle has no ends: it goes with what its start showed.
-    bool shown = stepShare >= kClearStep || rise / total >= kClearRise;
     if (!m_bFirst && !m_bLast) {
         shown = m_bShown;
     } else if (!m_bFirst) {
         shown = shown || m_bShown;
     }
     m_bShown = shown;
+    // Only a motor shown teaches what the lens sounds like.
+    if (shown && stepped) {
+        Remember(m_step.data(), m_bins, m_history, m_historyCount, m_historyNext);
+    }
+    if (shown && rise > 0.0) {
+        Remember(m_riseBands.data(), m_bands, m_riseHistory, m_riseCount, m_riseNext);
+    }
     return shown ? motor / total : 0.0;
 }
 

@@ -11,6 +11,9 @@
 //   relative to the motor's spectrum. Wanted sound only raises some bins, so it passes.
 // - Ticks and the drive's start and stop transients: what rises far above anything the
 //   surroundings reached (the edges are kept out of the end steps' windows).
+// - Whether the interval shows a motor at all: a clear step at its ends or a clear rise, each
+//   looking like what the lens made in earlier intervals that showed one (wanted sound that
+//   happens to start and stop with a drive does not).
 // - A stepping motor's whine sweeps with its speed: per frame the fundamental whose harmonics
 //   stand out, and its harmonics hidden under the wanted sound given the power of those shown.
 #pragma once
@@ -45,8 +48,13 @@ private:
     void Quantile(const SpectralFrames& frames, size_t from, size_t to, double q, std::vector<float>& out);
     // The motor's spectrum from this interval's ends; false when it has no usable end.
     bool StepSpectrum(const SpectralFrames& power, const FrameRole* roles);
-    void Remember();
-    void Template();
+    // Adds `spectrum` (unit power) to the rows of `history`, a ring of kRemembered rows.
+    static void Remember(const float* spectrum, size_t width, std::vector<float>& history, size_t& count, size_t& next);
+    // The motor's spectrum: per bin, the median over remembered intervals and this one's step.
+    void Template(bool withStep);
+    // How much of `spectrum`'s power (unit power, in bands) falls where a remembered one's does.
+    double Likeness(const std::vector<float>& spectrum, const std::vector<float>& history, size_t count) const;
+    void ToBands(const float* spectrum, std::vector<float>& bands) const;
     void SelectMotorBins();
     size_t Salience(const float* p);
     double DetectWhine(const float* p);
@@ -84,6 +92,16 @@ private:
     std::vector<float> m_history;  // unit-power spectra of recent intervals, kRemembered rows
     size_t m_historyCount = 0;
     size_t m_historyNext = 0;
+    // The same lens rises the same way in every interval: what rose above the surroundings in
+    // recent intervals that showed a motor, in quarter-octave bands of unit power.
+    std::vector<uint8_t> m_band;  // per bin
+    size_t m_bands = 0;
+    std::vector<float> m_stepBands;
+    std::vector<float> m_riseBands;
+    std::vector<float> m_templateBands;
+    std::vector<float> m_riseHistory;
+    size_t m_riseCount = 0;
+    size_t m_riseNext = 0;
 };
 
 }  // namespace ovix
