@@ -13,7 +13,6 @@
 #include <atomic>
 #include <csignal>
 #include <filesystem>
-#include <iterator>
 #include <set>
 #include <sstream>
 #include <thread>
@@ -30,12 +29,7 @@ std::atomic<int> g_callbackCalls{0};
 int HostCallback(int, int) { ++g_callbackCalls; return 131; }
 
 // Threads and open descriptors of this process.
-std::pair<long, long> Census()
-{
-    using std::filesystem::directory_iterator;
-    return {std::distance(directory_iterator("/proc/self/task"), directory_iterator()),
-            std::distance(directory_iterator("/proc/self/fd"), directory_iterator())};
-}
+std::pair<size_t, size_t> Census() { return {testsupport::ThreadCount(), testsupport::DescriptorCount()}; }
 
 using ApiTest = jobtest::HostTest;
 
@@ -113,7 +107,7 @@ TEST_F(ApiTest, RepeatedCyclesReleaseThreadsAndDescriptors)
     TqCloseOVIX();
     // Sanitizer runtimes start a helper thread with the first thread: start one first.
     std::thread([] {}).join();
-    const std::pair<long, long> before = Census();
+    const std::pair<size_t, size_t> before = Census();
 
     for (int cycle = 0; cycle < 200; ++cycle) {
         ASSERT_EQ(TqInitializeOVIX(), 0) << "cycle " << cycle;

@@ -89,6 +89,11 @@ size_t ThreadCount()
     return static_cast<size_t>(std::distance(std::filesystem::directory_iterator("/proc/self/task"), {}));
 }
 
+size_t DescriptorCount()
+{
+    return static_cast<size_t>(std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {}));
+}
+
 uint32_t GetBE32(const std::vector<uint8_t>& bytes, size_t at)
 {
     return uint32_t{bytes[at]} << 24 | uint32_t{bytes[at + 1]} << 16 | uint32_t{bytes[at + 2]} << 8 | bytes[at + 3];

@@ -32,8 +32,9 @@ bool HaveCommand(const std::string& name);
 std::string ShellQuote(const std::string& text);
 // Runs a shell command with its errors; empty when it succeeds, else what it said.
 std::string Shell(const std::string& command);
-// Threads of this process.
+// Threads and open descriptors of this process.
 size_t ThreadCount();
+size_t DescriptorCount();
 
 uint32_t GetBE32(const std::vector<uint8_t>& bytes, size_t at);
 void PutBE32(std::vector<uint8_t>& bytes, size_t at, uint32_t value);
