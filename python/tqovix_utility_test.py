@@ -94,22 +94,7 @@ class ModuleTest(unittest.TestCase):
                 self.assertEqual(raised.exception.message, tqovix_utility.describe(code))
                 self.assertFalse(os.path.exists(destination))
 
-    def test_callback_answering_false_aborts_with_200(self):
-        destination = self.path("aborted.mov")
-        calls = []
-
-        def stop_at_first(percent):
-            calls.append(percent)
-            return False
-
-        with self.assertRaises(tqovix_utility.Error) as raised:
-            tqovix_utility.process(self.pcm, destination, progress=stop_at_first)
-        self.assertEqual((raised.exception.code, raised.exception.message), (200, "aborted"))
-        self.assertEqual(len(calls), 1)
-        self.assertFalse(os.path.exists(destination))
-        self.assertEqual(os.listdir(self.folder), [])
-
-    def test_abort_keeps_what_stood_at_the_destination(self):
+    def test_callback_answering_false_aborts_with_200_and_keeps_the_destination(self):
         destination = self.path("kept.mov")
         with open(destination, "wb") as kept:
             kept.write(b"earlier")
@@ -121,12 +106,13 @@ class ModuleTest(unittest.TestCase):
 
         with self.assertRaises(tqovix_utility.Error) as raised:
             tqovix_utility.process(self.aac, destination, progress=stop_at_thirty, overwrite=True)
-        self.assertEqual(raised.exception.code, 200)
+        self.assertEqual((raised.exception.code, raised.exception.message), (200, "aborted"))
         # Stopped mid-job, at the first answer of False: no call after it.
         self.assertGreater(len(calls), 1)
         self.assertEqual([percent >= 30 for percent in calls].index(True), len(calls) - 1)
         with open(destination, "rb") as kept:
             self.assertEqual(kept.read(), b"earlier")
+        self.assertEqual(os.listdir(self.folder), ["kept.mov"])
 
     def test_exception_in_callback_aborts_and_reaches_the_caller(self):
         destination = self.path("raised.mov")

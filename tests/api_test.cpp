@@ -13,7 +13,6 @@
 #include <atomic>
 #include <csignal>
 #include <filesystem>
-#include <iterator>
 #include <set>
 #include <sstream>
 #include <thread>
@@ -30,12 +29,7 @@ std::atomic<int> g_callbackCalls{0};
 int HostCallback(int, int) { ++g_callbackCalls; return 131; }
 
 // Threads and open descriptors of this process.
-std::pair<long, long> Census()
-{
-    using std::filesystem::directory_iterator;
-    return {std::distance(directory_iterator("/proc/self/task"), directory_iterator()),
-            std::distance(directory_iterator("/proc/self/fd"), directory_iterator())};
-}
+std::pair<size_t, size_t> Census() { return {testsupport::ThreadCount(), testsupport::DescriptorCount()}; }
 
 using ApiTest = jobtest::HostTest;
 
@@ -113,7 +107,7 @@ TEST_F(ApiTest, RepeatedCyclesReleaseThreadsAndDescriptors)
     TqCloseOVIX();
     // Sanitizer runtimes start a helper thread with the first thread: start one first.
     std::thread([] {}).join();
-    const std::pair<long, long> before = Census();
+    const std::pair<size_t, size_t> before = Census();
 
     for (int cycle = 0; cycle < 200; ++cycle) {
         ASSERT_EQ(TqInitializeOVIX(), 0) << "cycle " << cycle;
@@ -393,17 +387,9 @@ namespace {
 
 using Bytes = std::vector<uint8_t>;
 
-uint32_t U32At(const Bytes& b, size_t at)
-{
-    return static_cast<uint32_t>(b[at] << 24 | b[at + 1] << 16 | b[at + 2] << 8 | b[at + 3]);
-}
-
-void PutU32At(Bytes& b, size_t at, uint32_t value)
-{
-    for (int k = 0; k < 4; ++k) {
-        b[at + k] = static_cast<uint8_t>(value >> (24 - 8 * k));
-    }
-}
+using testsupport::GetBE32;
+using testsupport::PutBE32;
+using testsupport::Shell;
 
 struct Node {
     size_t offset;
@@ -417,10 +403,10 @@ struct Node {
 void Walk(const Bytes& b, size_t begin, size_t end, int parent, std::vector<Node>& out)
 {
     for (size_t at = begin; at + 8 <= end;) {
-        uint64_t size = U32At(b, at);
+        uint64_t size = GetBE32(b, at);
         size_t header = 8;
         if (size == 1) {
-            size = uint64_t{U32At(b, at + 8)} << 32 | U32At(b, at + 12);
+            size = uint64_t{GetBE32(b, at + 8)} << 32 | GetBE32(b, at + 12);
             header = 16;
         } else if (size == 0) {
             size = end - at;
@@ -490,7 +476,7 @@ void ReplacePayload(Bytes& b, const std::vector<Node>& nodes, int index, const B
     for (int up = index; up >= 0; up = nodes[static_cast<size_t>(up)].parent) {
         const Node& around = nodes[static_cast<size_t>(up)];
         ASSERT_EQ(around.header, 8u) << around.type;
-        PutU32At(b, around.offset, static_cast<uint32_t>(static_cast<int64_t>(around.size) + delta));
+        PutBE32(b, around.offset, static_cast<uint32_t>(static_cast<int64_t>(around.size) + delta));
     }
 }
 
@@ -533,13 +519,6 @@ Bytes Resized(const Bytes& in, size_t at, size_t end, int width)
         at += size;
     }
     return out;
-}
-
-std::string Shell(const std::string& command)
-{
-    std::string output;
-    const int status = testsupport::RunCommand(command + " 2>&1", &output);
-    return status == 0 ? "" : output.empty() ? "exit " + std::to_string(status) : output;
 }
 
 // A track of near silence averages a few kb/s, below what any encoder takes: the job
@@ -629,36 +608,36 @@ TEST_P(EmptyChunkTest, QueryAndJobAgree)
     };
     const Bytes runs = payloadOf(stsc);
     const Bytes offsets = payloadOf(stco);
-    const uint32_t chunks = U32At(offsets, 4);
+    const uint32_t chunks = GetBE32(offsets, 4);
     ASSERT_GE(chunks, 3u);
     std::vector<uint32_t> counts(chunks);
-    for (uint32_t r = 0, entries = U32At(runs, 4); r < entries; ++r) {
-        const uint32_t first = U32At(runs, 8 + 12 * r);
-        const uint32_t next = r + 1 < entries ? U32At(runs, 8 + 12 * (r + 1)) : chunks + 1;
+    for (uint32_t r = 0, entries = GetBE32(runs, 4); r < entries; ++r) {
+        const uint32_t first = GetBE32(runs, 8 + 12 * r);
+        const uint32_t next = r + 1 < entries ? GetBE32(runs, 8 + 12 * (r + 1)) : chunks + 1;
         for (uint32_t c = first; c < next; ++c) {
-            counts[c - 1] = U32At(runs, 8 + 12 * r + 4);
+            counts[c - 1] = GetBE32(runs, 8 + 12 * r + 4);
         }
     }
     // An empty chunk between the first and the second, where the second begins.
     counts.insert(counts.begin() + 1, 0);
     Bytes newOffsets(8 + 4 * (chunks + 1));
-    PutU32At(newOffsets, 4, chunks + 1);
+    PutBE32(newOffsets, 4, chunks + 1);
     for (uint32_t c = 0; c <= chunks; ++c) {
         const uint32_t from = c <= 1 ? c : c - 1;
-        PutU32At(newOffsets, 8 + 4 * c, U32At(offsets, 8 + 4 * from));
+        PutBE32(newOffsets, 8 + 4 * c, GetBE32(offsets, 8 + 4 * from));
     }
     Bytes newRuns(8);
     uint32_t entries = 0;
     for (uint32_t c = 0; c < counts.size(); ++c) {
         if (c == 0 || counts[c] != counts[c - 1]) {
             newRuns.resize(newRuns.size() + 12);
-            PutU32At(newRuns, newRuns.size() - 12, c + 1);
-            PutU32At(newRuns, newRuns.size() - 8, counts[c]);
-            PutU32At(newRuns, newRuns.size() - 4, 1);
+            PutBE32(newRuns, newRuns.size() - 12, c + 1);
+            PutBE32(newRuns, newRuns.size() - 8, counts[c]);
+            PutBE32(newRuns, newRuns.size() - 4, 1);
             ++entries;
         }
     }
-    PutU32At(newRuns, 4, entries);
+    PutBE32(newRuns, 4, entries);
     ReplacePayload(movie, nodes, stco, newOffsets);
     nodes = Tree(movie);  // the atoms around have new sizes
     ReplacePayload(movie, nodes, SoundAtom(nodes, "stsc"), newRuns);

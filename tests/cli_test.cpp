@@ -24,6 +24,8 @@ namespace {
 
 using testsupport::TempDir;
 using Recipe = moviekit::MovieRecipe;
+using testsupport::GetBE32;
+using testsupport::PutBE32;
 
 std::string Q(const std::string& text) { return testsupport::ShellQuote(text); }
 bool Exists(const std::string& path) { return std::filesystem::exists(path); }
@@ -44,7 +46,7 @@ Outcome Tool(const std::string& arguments, int seconds = 120)
 }
 
 // A small camera-style movie; `edit` changes the recipe before it is written.
-std::string Movie(const TempDir& dir, const std::string& name, void (*edit)(Recipe&) = nullptr)
+std::string Movie(const std::string& path, void (*edit)(Recipe&) = nullptr)
 {
     Recipe recipe;
     recipe.video.frameCount = 60;
@@ -52,8 +54,8 @@ std::string Movie(const TempDir& dir, const std::string& name, void (*edit)(Reci
         edit(recipe);
     }
     std::string error;
-    EXPECT_TRUE(moviekit::WriteMovie(dir.File(name), recipe, nullptr, &error)) << error;
-    return dir.File(name);
+    EXPECT_TRUE(moviekit::WriteMovie(path, recipe, nullptr, &error)) << error;
+    return path;
 }
 
 void ForeignBrand(Recipe& recipe) { recipe.majorBrand = "isom"; recipe.compatibleBrands = {"isom"}; }
@@ -95,7 +97,7 @@ TEST(CliTest, VersionAndUsageErrors)
 TEST(CliTest, ArgumentForms)
 {
     TempDir dir;
-    const std::string source = Movie(dir, "-dash.mov");  // a name only "--" can pass
+    const std::string source = Movie(dir.File("-dash.mov"));  // a name only "--" can pass
     const std::string out = dir.File("out");
     struct Form {
         std::string arguments;
@@ -157,14 +159,6 @@ struct ReasonCase {
 void PrintTo(const ReasonCase& row, std::ostream* out) { *out << row.name; }
 
 void WriteText(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
-void MakeMovie(const std::string& path, void (*edit)(Recipe&))
-{
-    Recipe recipe;
-    recipe.video.frameCount = 60;
-    edit(recipe);
-    std::string error;
-    ASSERT_TRUE(moviekit::WriteMovie(path, recipe, nullptr, &error)) << error;
-}
 
 const ReasonCase kReasons[] = {
     {"SourceMissing", [](const TempDir&, const std::string&) {}, "file not found", "source-missing"},
@@ -173,24 +167,24 @@ const ReasonCase kReasons[] = {
     {"EmptyFile", [](const TempDir&, const std::string& path) { WriteText(path, ""); }, "empty file", "empty-file"},
     {"NotAMovie", [](const TempDir&, const std::string& path) { WriteText(path, "not a movie at all\n"); },
      "not a QuickTime/ISO movie", "not-a-movie"},
-    {"WrongBrand", [](const TempDir&, const std::string& path) { MakeMovie(path, ForeignBrand); },
+    {"WrongBrand", [](const TempDir&, const std::string& path) { Movie(path, ForeignBrand); },
      "not a camera movie (brand 'isom')", "wrong-brand"},
     {"MalformedAtom",
      [](const TempDir&, const std::string& path) {
-         MakeMovie(path, [](Recipe&) {});
+         Movie(path);
          std::filesystem::resize_file(path, std::filesystem::file_size(path) - 10);  // the moov is cut short
      },
      "malformed atom: 'moov' at offset ", "malformed-atom"},
-    {"NoSoundTrack", [](const TempDir&, const std::string& path) { MakeMovie(path, [](Recipe& r) { r.sound.present = false; }); },
+    {"NoSoundTrack", [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.sound.present = false; }); },
      "no sound track", "no-sound-track"},
     {"UnsupportedSound",
-     [](const TempDir&, const std::string& path) { MakeMovie(path, [](Recipe& r) { r.sound.channels = 10; }); },
+     [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.sound.channels = 10; }); },
      "unsupported sound: sound has 10 channels; 1 to 8 are processed", "unsupported-sound"},
     {"NoAFInformation",
-     [](const TempDir&, const std::string& path) { MakeMovie(path, [](Recipe& r) { r.maker.afInformation = false; }); },
+     [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.maker.afInformation = false; }); },
      "no AF information", "no-af-information"},
     {"AlreadyProcessed",
-     [](const TempDir&, const std::string& path) { MakeMovie(path, [](Recipe& r) { r.maker.afProcessed = true; }); },
+     [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.maker.afProcessed = true; }); },
      "already processed", "already-processed"},
 };
 
@@ -228,7 +222,7 @@ INSTANTIATE_TEST_SUITE_P(Reasons, CliReasonTest, ::testing::ValuesIn(kReasons),
 TEST(CliTest, DestinationReasons)
 {
     TempDir dir;
-    const std::string source = Movie(dir, "in.mov");
+    const std::string source = Movie(dir.File("in.mov"));
     std::filesystem::create_directory(dir.File("folder"));
     const std::pair<std::string, std::string> rows[] = {
         {"process " + Q(source) + " " + Q(source), source + ": source and destination are the same file"},
@@ -284,7 +278,7 @@ TEST(CliTest, NotRegularFilesAreRefusedAtOnce)
 TEST(CliTest, JsonReports)
 {
     TempDir dir;
-    const std::string source = Movie(dir, "in\xff\xfe\xc0\xaf\xed\xa0\x80.mov");  // stray, overlong, surrogate
+    const std::string source = Movie(dir.File("in\xff\xfe\xc0\xaf\xed\xa0\x80.mov"));  // stray, overlong, surrogate
     const std::string destination = dir.File("out\xc3.mov");
     const std::string strict = "python3 -c 'import json,sys; d=json.loads(sys.stdin.buffer.read().decode(\"utf-8\")); "
                                "assert d[\"version\"] == 1' 2>&1";
@@ -321,10 +315,10 @@ TEST(CliTest, BatchOverACardsFolders)
     const std::string card = dir.File("card");
     std::filesystem::create_directories(card + "/DCIM/100CAM");
     std::filesystem::create_directories(card + "/MISC");
-    Movie(dir, "card/DCIM/100CAM/PCM.MOV");
-    Movie(dir, "card/DCIM/100CAM/AAC.MOV", [](Recipe& r) { r.sound.codec = moviekit::SoundCodec::Aac; });
-    Movie(dir, "card/DCIM/DONE.MOV", [](Recipe& r) { r.maker.afProcessed = true; });
-    Movie(dir, "card/FOREIGN.MP4", ForeignBrand);
+    Movie(dir.File("card/DCIM/100CAM/PCM.MOV"));
+    Movie(dir.File("card/DCIM/100CAM/AAC.MOV"), [](Recipe& r) { r.sound.codec = moviekit::SoundCodec::Aac; });
+    Movie(dir.File("card/DCIM/DONE.MOV"), [](Recipe& r) { r.maker.afProcessed = true; });
+    Movie(dir.File("card/FOREIGN.MP4"), ForeignBrand);
     WriteText(card + "/DCIM/100CAM/STILL.JPG", "\xff\xd8\xff\xe0 a still");
     WriteText(card + "/MISC/notes.txt", "a sidecar\n");
     const std::string out = dir.File("out/nested");  // created, parents too
@@ -476,10 +470,13 @@ TEST_F(CliLateFileTest, KilledJobLeavesOnlyAPartialFileThatIsClearedLater)
     EXPECT_TRUE(left[0].starts_with(".long.mov." + killed + "-") && left[0].ends_with(".tqovix-partial")) << left[0];
     std::filesystem::last_write_time(out + "/" + left[0],
                                      std::filesystem::file_time_type::clock::now() - std::chrono::hours(25));
-    const Outcome next = Tool("process -q " + Q(Movie(dir, "small.mov")) + " " + Q(out + "/small.mov"));
+    // One younger than a day may belong to a running job: it stays.
+    const std::string fresh = ".long.mov.1-2.tqovix-partial";
+    WriteText(out + "/" + fresh, "running");
+    const Outcome next = Tool("process -q " + Q(Movie(dir.File("small.mov"))) + " " + Q(out + "/small.mov"));
     EXPECT_EQ(next.status, 0) << next.output;
     EXPECT_NE(next.output.find("removed " + out + "/" + left[0]), std::string::npos) << next.output;
-    EXPECT_EQ(HiddenFiles(out), std::vector<std::string>{});
+    EXPECT_EQ(HiddenFiles(out), std::vector<std::string>{fresh});
 }
 
 const LateFileCase kLateFiles[] = {
@@ -502,8 +499,8 @@ TEST(CliTest, BatchNamesThatDifferOnlyInCase)
     TempDir dir;
     std::filesystem::create_directories(dir.File("a"));
     std::filesystem::create_directories(dir.File("b"));
-    const std::string upper = Movie(dir, "a/CLIP.MOV");
-    const std::string lower = Movie(dir, "b/clip.mov", [](Recipe& r) { r.video.frameCount = 90; });
+    const std::string upper = Movie(dir.File("a/CLIP.MOV"));
+    const std::string lower = Movie(dir.File("b/clip.mov"), [](Recipe& r) { r.video.frameCount = 90; });
     for (const char* force : {"", "-f "}) {
         for (const bool folding : {true, false}) {
             SCOPED_TRACE(std::string(force) + (folding ? "case-insensitive" : "case-sensitive"));
@@ -671,49 +668,9 @@ TEST(CliCompareTest, MeasuresDrawsAndRefuses)
     EXPECT_NE(none.output.find("notes.txt: not a movie"), std::string::npos) << none.output;
 }
 
-// The first sound stream as ffmpeg decodes it, channels summed; empty on failure.
-std::vector<double> FfmpegMono(const std::string& path, int channels)
-{
-    TempDir scratch;
-    const std::string raw = scratch.File("sound.raw");
-    std::string output;
-    if (testsupport::RunCommand("ffmpeg -v error -nostdin -i " + Q(path) + " -map 0:a:0 -f s16le -acodec pcm_s16le " +
-                                    Q(raw) + " 2>&1",
-                                &output) != 0) {
-        return {};
-    }
-    const std::vector<uint8_t> bytes = testsupport::ReadFile(raw);
-    std::vector<double> mono(bytes.size() / 2 / channels);
-    for (size_t k = 0; k < mono.size() * channels; ++k) {
-        mono[k / channels] += static_cast<int16_t>(bytes[2 * k] | (bytes[2 * k + 1] << 8));
-    }
-    return mono;
-}
-
-// The lag of b against a that correlates best over a[from, to), within +-range frames.
-int64_t BestLag(const std::vector<double>& a, const std::vector<double>& b, int64_t from, int64_t to, int64_t range)
-{
-    int64_t best = 0;
-    double bestScore = -2;
-    for (int64_t lag = -range; lag <= range; ++lag) {
-        double ab = 0, aa = 0, bb = 0;
-        for (int64_t f = from; f < to && f + lag >= 0 && f + lag < static_cast<int64_t>(b.size()); ++f) {
-            ab += a[f] * b[f + lag];
-            aa += a[f] * a[f];
-            bb += b[f + lag] * b[f + lag];
-        }
-        const double score = aa > 0 && bb > 0 ? ab / std::sqrt(aa * bb) : -1;
-        if (score > bestScore) {
-            bestScore = score;
-            best = lag;
-        }
-    }
-    return best;
-}
-
-// AAC re-encoded by a job: no offset against the source, and a close match outside the intervals.
-// compare decodes through the library's own codecs, which the job used too: ffmpeg, reading the
-// edit lists as any player does, says first where the sound really lies.
+// AAC re-encoded by a job: compare finds no offset against the source, and a close match outside
+// the intervals. That ffmpeg, reading the edit lists as any player does, hears no offset either is
+// interop_test's to judge, frame for frame.
 TEST(CliCompareTest, AacDestinationsMatchTheirSourceWithoutOffset)
 {
     TempDir dir;
@@ -731,12 +688,6 @@ TEST(CliCompareTest, AacDestinationsMatchTheirSourceWithoutOffset)
     ASSERT_TRUE(moviekit::AddMakerData(source, recipe, 3 * 48000, &error)) << error;
     const std::string processed = dir.File("dst.mov");
     ASSERT_EQ(Tool("process " + Q(source) + " " + Q(processed) + " --quiet").status, 0);
-    const std::vector<double> before = FfmpegMono(source, 2);
-    const std::vector<double> after = FfmpegMono(processed, 2);
-    ASSERT_GT(before.size(), 48000u);
-    ASSERT_EQ(after.size(), before.size());
-    // A stretch before the interval, past the encoders' first packets; the sweep has one best match.
-    EXPECT_EQ(BestLag(before, after, 4096, 4096 + 16384, 2048), 0) << "ffmpeg hears the sound moved";
     const Outcome measured = Tool("compare " + Q(source) + " " + Q(processed) + " --json");
     ASSERT_EQ(measured.status, 0) << measured.output;
     EXPECT_EQ(Numbers(measured.output, "offsetFrames"), std::vector<double>{0}) << measured.output;
@@ -745,26 +696,14 @@ TEST(CliCompareTest, AacDestinationsMatchTheirSourceWithoutOffset)
 
 // ---- compare: destinations whose sound is not all there, or not the same shape ----
 
-uint32_t ReadBE32(const std::vector<uint8_t>& bytes, size_t at)
-{
-    return uint32_t{bytes[at]} << 24 | uint32_t{bytes[at + 1]} << 16 | uint32_t{bytes[at + 2]} << 8 | bytes[at + 3];
-}
-
-void WriteBE32(std::vector<uint8_t>& bytes, size_t at, uint32_t value)
-{
-    for (int k = 0; k < 4; ++k) {
-        bytes[at + k] = static_cast<uint8_t>(value >> (24 - 8 * k));
-    }
-}
-
 // Where the sound track's table `type` starts (its size field) in the movie atom; 0 if absent.
 size_t SoundTable(const std::vector<uint8_t>& bytes, const std::string& type)
 {
     size_t moov = 0;
     for (size_t at = 0; at + 8 <= bytes.size();) {
-        uint64_t size = ReadBE32(bytes, at);
+        uint64_t size = GetBE32(bytes, at);
         if (size == 1 && at + 16 <= bytes.size()) {
-            size = uint64_t{ReadBE32(bytes, at + 8)} << 32 | ReadBE32(bytes, at + 12);
+            size = uint64_t{GetBE32(bytes, at + 8)} << 32 | GetBE32(bytes, at + 12);
         }
         if (std::string(bytes.begin() + at + 4, bytes.begin() + at + 8) == "moov") {
             moov = at;
@@ -866,9 +805,9 @@ INSTANTIATE_TEST_SUITE_P(
                      return EditedCopy(dir, processed, "cut.mov", [](std::vector<uint8_t>& bytes, size_t) {
                          const size_t stsc = SoundTable(bytes, "stsc");
                          ASSERT_NE(stsc, 0u);
-                         const uint32_t runs = ReadBE32(bytes, stsc + 12);
+                         const uint32_t runs = GetBE32(bytes, stsc + 12);
                          ASSERT_GT(runs, 0u);
-                         WriteBE32(bytes, stsc + 16 + 12 * (runs - 1) + 4, 100);
+                         PutBE32(bytes, stsc + 16 + 12 * (runs - 1) + 4, 100);
                      });
                  },
                  1, "tables-inconsistent", "cut.mov: the sound track's tables promise more sound than its chunks hold"},
@@ -878,9 +817,9 @@ INSTANTIATE_TEST_SUITE_P(
                      return EditedCopy(dir, processed, "past.mov", [](std::vector<uint8_t>& bytes, size_t size) {
                          const size_t stco = SoundTable(bytes, "stco");
                          ASSERT_NE(stco, 0u);
-                         const uint32_t chunks = ReadBE32(bytes, stco + 12);
+                         const uint32_t chunks = GetBE32(bytes, stco + 12);
                          ASSERT_GT(chunks, 0u);
-                         WriteBE32(bytes, stco + 16 + 4 * (chunks - 1), static_cast<uint32_t>(size - 100));
+                         PutBE32(bytes, stco + 16 + 4 * (chunks - 1), static_cast<uint32_t>(size - 100));
                      });
                  },
                  1, "sound-stops-early", "past.mov: its sound stops at"},

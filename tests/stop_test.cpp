@@ -107,11 +107,6 @@ int OnProgress(int first, int second)
     return 0;
 }
 
-size_t CountThreads()
-{
-    return static_cast<size_t>(std::distance(std::filesystem::directory_iterator("/proc/self/task"), {}));
-}
-
 class StopTest : public ::testing::TestWithParam<StopRow> {
 protected:
     void SetUp() override
@@ -151,7 +146,7 @@ TEST_P(StopTest, NothingIsPublishedAndTheProgressWaitsForTheCopy)
         ASSERT_TRUE(testsupport::WriteFile(destination, old));
     }
     std::thread([] {}).join();  // sanitizer runtimes start their helpers with the first thread
-    const size_t threadsBefore = CountThreads();
+    const size_t threadsBefore = testsupport::ThreadCount();
 
     {
         CTqovixMainFrame engine;
@@ -202,11 +197,11 @@ TEST_P(StopTest, NothingIsPublishedAndTheProgressWaitsForTheCopy)
     const auto entries = std::distance(std::filesystem::directory_iterator(m_dir.Path()), {});
     EXPECT_EQ(entries, row.stop == Stop::None || row.existing ? 2 : 1) << "something was left beside the movies";
     const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-    while (CountThreads() > threadsBefore && std::chrono::steady_clock::now() < deadline) {
+    while (testsupport::ThreadCount() > threadsBefore && std::chrono::steady_clock::now() < deadline) {
         std::this_thread::sleep_for(std::chrono::milliseconds(2));
     }
     // Fewer is fine: a thread of an earlier test may still have been ending when counted.
-    EXPECT_LE(CountThreads(), threadsBefore) << "a thread outlived the job";
+    EXPECT_LE(testsupport::ThreadCount(), threadsBefore) << "a thread outlived the job";
 }
 
 INSTANTIATE_TEST_SUITE_P(

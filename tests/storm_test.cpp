@@ -2,8 +2,6 @@
 // whether movies can be processed. No deadlock, no leaked thread or descriptor.
 #include <gtest/gtest.h>
 
-#include <dirent.h>
-
 #include <atomic>
 #include <filesystem>
 #include <chrono>
@@ -13,18 +11,6 @@
 #include "host/JobHarness.h"
 
 namespace {
-
-size_t CountEntries(const char* directory)
-{
-    size_t count = 0;
-    if (DIR* dir = opendir(directory)) {
-        while (readdir(dir) != nullptr) {
-            ++count;
-        }
-        closedir(dir);
-    }
-    return count;
-}
 
 // The progress callback's abort point, as a share of the job (above 1: never).
 std::atomic<double> g_abortAt{2.0};
@@ -50,8 +36,8 @@ TEST_F(StormTest, AbortedJobsBesideQueriesLeaveNothingBehind)
     const std::string destination = m_dir.File("dst.mov");
     // Sanitizer runtimes start helper threads with the first thread: start one first.
     std::thread([] {}).join();
-    const size_t threadsBefore = CountEntries("/proc/self/task");
-    const size_t descriptorsBefore = CountEntries("/proc/self/fd");
+    const size_t threadsBefore = testsupport::ThreadCount();
+    const size_t descriptorsBefore = testsupport::DescriptorCount();
 
     std::atomic<bool> stop{false};
     std::atomic<int> badAnswers{0};
@@ -117,11 +103,11 @@ TEST_F(StormTest, AbortedJobsBesideQueriesLeaveNothingBehind)
     TqCloseOVIX();
     ASSERT_EQ(TqInitializeOVIX(), 0);
     const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-    while (CountEntries("/proc/self/task") > threadsBefore && std::chrono::steady_clock::now() < deadline) {
+    while (testsupport::ThreadCount() > threadsBefore && std::chrono::steady_clock::now() < deadline) {
         std::this_thread::sleep_for(std::chrono::milliseconds(5));
     }
-    EXPECT_EQ(CountEntries("/proc/self/task"), threadsBefore);
-    EXPECT_EQ(CountEntries("/proc/self/fd"), descriptorsBefore);
+    EXPECT_EQ(testsupport::ThreadCount(), threadsBefore);
+    EXPECT_EQ(testsupport::DescriptorCount(), descriptorsBefore);
 }
 
 }  // namespace

@@ -196,11 +196,6 @@ int HoldTheCopy(eTqovixFileOperation operation)
     return 0;
 }
 
-size_t CountThreads()
-{
-    return static_cast<size_t>(std::distance(std::filesystem::directory_iterator("/proc/self/task"), {}));
-}
-
 // Whoever waits for the copy can stop it: the wait ends with the answer given, the copy's
 // thread is gone, and the copy went no further than the piece it was in.
 TEST(BackgroundCopyTest, AStopAskedWhileWaitingEndsTheCopy)
@@ -213,7 +208,7 @@ TEST(BackgroundCopyTest, AStopAskedWhileWaitingEndsTheCopy)
         ASSERT_TRUE(testsupport::WriteFile(sourcePath, bytes));
     }
     std::thread([] {}).join();  // sanitizer runtimes start their helpers with the first thread
-    const size_t threadsBefore = CountThreads();
+    const size_t threadsBefore = testsupport::ThreadCount();
     CTqovixFile source;
     CTqovixFile destination;
     ASSERT_EQ(source.Open(sourcePath.c_str(), 1), eTqovixSuccess);
@@ -245,10 +240,10 @@ TEST(BackgroundCopyTest, AStopAskedWhileWaitingEndsTheCopy)
     destination.Close();
     EXPECT_LT(std::filesystem::file_size(dir.File("copy.bin")), kSize);
     const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-    while (CountThreads() > threadsBefore && std::chrono::steady_clock::now() < deadline) {
+    while (testsupport::ThreadCount() > threadsBefore && std::chrono::steady_clock::now() < deadline) {
         std::this_thread::sleep_for(std::chrono::milliseconds(2));
     }
-    EXPECT_EQ(CountThreads(), threadsBefore);
+    EXPECT_EQ(testsupport::ThreadCount(), threadsBefore);
 }
 
 }  // namespace

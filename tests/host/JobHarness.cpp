@@ -195,6 +195,60 @@ std::string CheckReencodedSound(const std::vector<int16_t>& source, const std::v
     return problems.str();
 }
 
+std::vector<testsupport::FrameSpan> Spans(const std::vector<moviekit::AfInterval>& intervals, uint64_t shift)
+{
+    std::vector<testsupport::FrameSpan> spans;
+    for (const moviekit::AfInterval& interval : intervals) {
+        spans.push_back({interval.startFrame + shift, interval.endFrame + shift});
+    }
+    return spans;
+}
+
+bool NearInterval(uint64_t frame, const std::vector<moviekit::AfInterval>& intervals, uint64_t margin)
+{
+    return std::ranges::any_of(intervals, [&](const moviekit::AfInterval& span) {
+        return frame + margin >= span.startFrame && frame < span.endFrame + margin;
+    });
+}
+
+std::string CheckPcmChangedOnlyInside(const std::vector<int16_t>& before, const std::vector<int16_t>& after,
+                                      unsigned channels, const std::vector<moviekit::AfInterval>& intervals,
+                                      uint64_t ramp)
+{
+    if (before.empty() || after.size() != before.size()) {
+        return "the sound is empty or changed its length";
+    }
+    uint64_t strays = 0;
+    uint64_t firstStray = 0;
+    std::vector<uint64_t> inside(intervals.size());
+    std::vector<uint64_t> changedInside(intervals.size());
+    for (uint64_t f = 0; f < before.size() / channels; ++f) {
+        const auto at = static_cast<std::ptrdiff_t>(f * channels);
+        const bool changed = !std::equal(before.begin() + at, before.begin() + at + channels, after.begin() + at);
+        if (changed && !NearInterval(f, intervals, ramp)) {
+            firstStray = strays++ == 0 ? f : firstStray;
+        }
+        for (size_t i = 0; i < intervals.size(); ++i) {
+            if (f >= intervals[i].startFrame + ramp && f + ramp < intervals[i].endFrame) {
+                ++inside[i];
+                changedInside[i] += changed ? 1 : 0;
+            }
+        }
+    }
+    std::ostringstream problems;
+    if (strays != 0) {
+        problems << strays << " frames changed outside the intervals and their ramps, the first at " << firstStray
+                 << "; ";
+    }
+    for (size_t i = 0; i < intervals.size(); ++i) {
+        if (inside[i] == 0 || changedInside[i] * 2 <= inside[i]) {
+            problems << "AF interval " << i << " left as it was: " << changedInside[i] << " of " << inside[i]
+                     << " frames changed; ";
+        }
+    }
+    return problems.str();
+}
+
 std::vector<uint8_t> ReadRange(const std::string& path, uint64_t offset, uint64_t size)
 {
     std::vector<uint8_t> bytes;

@@ -50,6 +50,17 @@ std::string CheckReencodedSound(const std::vector<int16_t>& source, const std::v
                                 unsigned channels, const std::vector<testsupport::FrameSpan>& spans, uint64_t margin,
                                 uint64_t leadIn, double keptDb, double changedDb);
 
+// AF intervals as frame spans, moved `shift` frames on.
+std::vector<testsupport::FrameSpan> Spans(const std::vector<moviekit::AfInterval>& intervals, uint64_t shift = 0);
+// Whether `frame` lies within `margin` frames of an interval or inside one.
+bool NearInterval(uint64_t frame, const std::vector<moviekit::AfInterval>& intervals, uint64_t margin);
+// PCM processed where it may be only: bit-exact outside every interval widened by `ramp` (the
+// library's 10 ms ramp, no other slack), and over half the frames changed inside each interval
+// shrunk by it. Empty when that holds, else what does not.
+std::string CheckPcmChangedOnlyInside(const std::vector<int16_t>& before, const std::vector<int16_t>& after,
+                                      unsigned channels, const std::vector<moviekit::AfInterval>& intervals,
+                                      uint64_t ramp);
+
 // A top-level atom as its header declares it (size 0 runs to the end of the file).
 struct TopAtom {
     std::string type;

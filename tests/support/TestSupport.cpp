@@ -77,4 +77,33 @@ std::string ShellQuote(const std::string& text)
     return quoted + "'";
 }
 
+std::string Shell(const std::string& command)
+{
+    std::string output;
+    const int status = RunCommand(command + " 2>&1", &output);
+    return status == 0 ? "" : output.empty() ? "exit " + std::to_string(status) : output;
+}
+
+size_t ThreadCount()
+{
+    return static_cast<size_t>(std::distance(std::filesystem::directory_iterator("/proc/self/task"), {}));
+}
+
+size_t DescriptorCount()
+{
+    return static_cast<size_t>(std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {}));
+}
+
+uint32_t GetBE32(const std::vector<uint8_t>& bytes, size_t at)
+{
+    return uint32_t{bytes[at]} << 24 | uint32_t{bytes[at + 1]} << 16 | uint32_t{bytes[at + 2]} << 8 | bytes[at + 3];
+}
+
+void PutBE32(std::vector<uint8_t>& bytes, size_t at, uint32_t value)
+{
+    for (int k = 0; k < 4; ++k) {
+        bytes[at + k] = static_cast<uint8_t>(value >> (24 - 8 * k));
+    }
+}
+
 }  // namespace testsupport

@@ -30,5 +30,13 @@ std::vector<uint8_t> ReadFile(const std::string& path);
 int RunCommand(const std::string& command, std::string* output);
 bool HaveCommand(const std::string& name);
 std::string ShellQuote(const std::string& text);
+// Runs a shell command with its errors; empty when it succeeds, else what it said.
+std::string Shell(const std::string& command);
+// Threads and open descriptors of this process.
+size_t ThreadCount();
+size_t DescriptorCount();
+
+uint32_t GetBE32(const std::vector<uint8_t>& bytes, size_t at);
+void PutBE32(std::vector<uint8_t>& bytes, size_t at, uint32_t value);
 
 }  // namespace testsupport
