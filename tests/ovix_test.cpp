@@ -409,7 +409,7 @@ INSTANTIATE_TEST_SUITE_P(
 
 // One lens, one noise: a chord that plays just while a later drive runs rises there as a motor
 // would, but nothing like what the lens made in the first drive; that interval stays as it came.
-TEST(OvixLensTest, WantedSoundUnlikeTheLensHeardBeforeIsKept)
+TEST(OvixWantedSoundTest, UnlikeTheLensHeardBeforeIsKept)
 {
     constexpr uint32_t kRate48k = 48000;
     const uint64_t frames = static_cast<uint64_t>(3.5 * kRate48k);

@@ -14,6 +14,12 @@ constexpr size_t kCeilingSpread = 2;
 constexpr double kActivationQuantile = 0.3;
 // How far above the surroundings' ceiling a cell must rise to be taken for motor.
 constexpr float kRise = 2.0f;
+// A motor keeps making its noise: a bin that rises so in fewer of the interval's frames is a
+// syllable or a note, unless its frame rises across this share of the spectrum for no longer
+// than a tick lasts (a loud syllable rises as broadly, for longer).
+constexpr double kRecurring = 0.2;
+constexpr double kBroadband = 0.2;
+constexpr double kTickSeconds = 0.01;
 // Each side of a drive's start or stop: long enough for medians to pass over syllables.
 constexpr double kWindowSeconds = 0.3;
 constexpr size_t kMinRows = 8;
@@ -23,6 +29,8 @@ constexpr double kMaxWhineHz = 2500.0;
 const double kWhineStep = std::pow(2.0, 1.0 / 48.0);
 constexpr int kHarmonics = 8;
 constexpr int kMinHarmonics = 3;
+constexpr double kTrackSeconds = 0.25;  // each side: longer than a syllable or a short note
+constexpr double kTrackOctaves = 1.0 / 6.0;
 constexpr float kLobeSide = 0.4f;  // a partial's power one bin off its centre, under this window
 // What shows a motor in an interval: the smaller of its two end steps carries this share of
 // the sound at that end, or what rises far above the surroundings this share of its power.
@@ -82,7 +90,14 @@ MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
     const size_t rows = (parameters.segmentFrames + parameters.fftSize + 2 * parameters.rampFrames) / parameters.hop + 8;
     m_column.resize(std::max({rows, parameters.contextFrames * 2 / parameters.hop + 8, m_bins, kRemembered}));
     m_activation.resize(m_column.size());
+    m_risenBins.resize(m_column.size());
+    // A tick shows in the frames whose window reaches it.
+    m_tickRows = (static_cast<size_t>(kTickSeconds * static_cast<double>(parameters.rateHz)) + parameters.fftSize) / parameters.hop;
+    m_risenRows.resize(m_bins);
     m_whine.resize(m_column.size());
+    m_track.resize(m_column.size());
+    m_trackRows = static_cast<size_t>(kTrackSeconds * static_cast<double>(parameters.rateHz)) / parameters.hop;
+    m_window.resize(2 * m_trackRows + 1);
 }
 
 void MotorEstimator::Quantile(const SpectralFrames& frames, size_t from, size_t to, double q, std::vector<float>& out)
@@ -278,7 +293,7 @@ double MotorEstimator::DetectWhine(const float* p)
             count += s > 0.0f ? 1 : 0;
             score += s;
         }
-        if (count >= kMinHarmonics && 2 * count >= candidate.harmonics && score > bestScore) {
+        if (m_spread[candidate.bins[0]] > 0.0f && count >= kMinHarmonics && 2 * count >= candidate.harmonics && score > bestScore) {
             bestScore = score;
             best = c;
         }
@@ -308,6 +323,36 @@ void MotorEstimator::FillWhine(const float* p, float* n, double f0)
             n[j] = std::min(p[j], std::max(n[j], strongest * lobe[j + 1 - k]));
         }
     }
+}
+
+// A motor's whine runs on through the drive and its pitch moves smoothly with the motor's speed;
+// a voice or an instrument found in its place for a syllable or a note is not it. Each frame
+// takes the median of the pitches found around it (none counting as none), so a whine hidden for
+// a moment under louder sound is followed where it goes.
+void MotorEstimator::FollowWhine(const FrameRole* roles, size_t rows)
+{
+    size_t first = rows;
+    size_t end = 0;
+    for (size_t row = 0; row < rows; ++row) {
+        if (roles[row] == FrameRole::kCore) {
+            first = std::min(first, row);
+            end = row + 1;
+        }
+    }
+    std::copy(m_whine.begin(), m_whine.begin() + static_cast<ptrdiff_t>(rows), m_track.begin());
+    for (size_t row = first; row < end; ++row) {
+        // Centred, so that the median of a steady sweep is the frame's own pitch.
+        const size_t side = std::min({m_trackRows, row - first, end - 1 - row});
+        std::copy(m_whine.begin() + static_cast<ptrdiff_t>(row - side),
+                  m_whine.begin() + static_cast<ptrdiff_t>(row + side + 1), m_window.begin());
+        std::nth_element(m_window.begin(), m_window.begin() + static_cast<ptrdiff_t>(side),
+                         m_window.begin() + static_cast<ptrdiff_t>(2 * side + 1));
+        const double median = m_window[side];
+        const double own = m_whine[row];
+        const bool near = own > 0.0 && median > 0.0 && std::abs(std::log2(own / median)) <= kTrackOctaves;
+        m_track[row] = near ? own : median;
+    }
+    std::copy(m_track.begin(), m_track.begin() + static_cast<ptrdiff_t>(rows), m_whine.begin());
 }
 
 double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* roles, SpectralFrames& noise)
@@ -348,8 +393,8 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
     }
     Template(stepped);
     SelectMotorBins();
+    std::fill(m_risenRows.begin(), m_risenRows.end(), 0u);
     std::fill(m_inside.begin(), m_inside.end(), 0.0f);  // from here: what rose, per bin
-
     double rise = 0.0;
     for (size_t row = 0; row < power.Rows(); ++row) {
         const float* p = power.Row(row);
@@ -367,22 +412,56 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
             activation = m_column[at];
         }
         m_activation[row] = activation;
+        uint32_t risen = 0;
         for (size_t k = 0; k < m_bins; ++k) {
             const float steady = activation * m_motor[k];
             const float ceiling = m_ceiling[k] + steady;
-            const float excess = p[k] > kRise * ceiling ? p[k] - ceiling : 0.0f;
-            n[k] = std::min(p[k], steady + excess);
+            const bool rises = p[k] > kRise * ceiling;
+            n[k] = rises ? p[k] - m_ceiling[k] : std::min(p[k], steady);
             m_base[k] = ceiling;
+            m_risenRows[k] += rises ? 1u : 0u;
+            risen += rises ? 1u : 0u;
             if (roles[row] == FrameRole::kCore) {
-                const float risen = n[k] - std::min(p[k], steady);
-                rise += risen;
-                m_inside[k] += risen;
+                const float above = n[k] - std::min(p[k], steady);
+                rise += above;
+                m_inside[k] += above;
             }
         }
+        m_risenBins[row] = risen;
         m_whine[row] = DetectWhine(p);
+    }
+    // What rises only now and then in a bin, in frames that do not rise across the spectrum, is
+    // wanted sound (a whine's sweep, passing through each bin briefly, is followed below).
+    const auto recurring = static_cast<uint32_t>(kRecurring * static_cast<double>(power.Rows()));
+    const auto broadband = static_cast<uint32_t>(kBroadband * static_cast<double>(m_bins));
+    for (size_t row = 0; row < power.Rows();) {
+        if (m_risenBins[row] < broadband) {
+            m_risenBins[row++] = 0u;
+            continue;
+        }
+        size_t end = row;
+        while (end < power.Rows() && m_risenBins[end] >= broadband) {
+            ++end;
+        }
+        const uint32_t tick = end - row <= m_tickRows ? 1u : 0u;
+        for (; row < end; ++row) {
+            m_risenBins[row] = tick;
+        }
+    }
+    for (size_t row = 0; row < power.Rows(); ++row) {
+        const float* p = power.Row(row);
+        float* n = noise.Row(row);
+        const bool tick = m_risenBins[row] != 0u;
+        for (size_t k = 0; k < m_bins; ++k) {
+            const float steady = std::min(p[k], m_activation[row] * m_motor[k]);
+            if (!tick && m_risenRows[k] < recurring) {
+                n[k] = steady;
+            }
+        }
     }
     // A whine sweeping with the motor's speed hides some harmonics under the wanted sound: they
     // are given the power of those that show.
+    FollowWhine(roles, power.Rows());
     for (size_t row = 0; row < power.Rows(); ++row) {
         if (m_whine[row] == 0.0) {
             continue;

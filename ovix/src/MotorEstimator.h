@@ -10,12 +10,15 @@
 //   low quantile over the motor's bins of the frame's power beyond the wanted sound's floor,
 //   relative to the motor's spectrum. Wanted sound only raises some bins, so it passes.
 // - Ticks and the drive's start and stop transients: what rises far above anything the
-//   surroundings reached (the edges are kept out of the end steps' windows).
+//   surroundings reached (the edges are kept out of the end steps' windows), in bins where the
+//   motor keeps rising or across the spectrum for a moment; what rises in a bin only now and
+//   then is a syllable or a note.
 // - Whether the interval shows a motor at all: a clear step at its ends or a clear rise, each
 //   looking like what the lens made in earlier intervals that showed one (wanted sound that
 //   happens to start and stop with a drive does not).
 // - A stepping motor's whine sweeps with its speed: per frame the fundamental whose harmonics
-//   stand out, and its harmonics hidden under the wanted sound given the power of those shown.
+//   stand out, held to the pitch track around it (a voice's syllable is not the whine), and its
+//   harmonics hidden under the wanted sound given the power of those shown.
 #pragma once
 
 #include "SpectralFrames.h"
@@ -59,6 +62,7 @@ private:
     size_t Salience(const float* p);
     double DetectWhine(const float* p);
     void FillWhine(const float* p, float* n, double f0);
+    void FollowWhine(const FrameRole* roles, size_t rows);
 
     size_t m_bins;
     size_t m_windowRows;  // rows on each side of a drive's start or stop
@@ -85,7 +89,14 @@ private:
     };
     std::vector<Candidate> m_candidates;
     std::vector<float> m_activation;
+    // Per frame: how many bins rise far above the surroundings, then whether the frame is a tick.
+    std::vector<uint32_t> m_risenBins;
+    std::vector<uint32_t> m_risenRows;  // per bin: in how many frames it rises so
+    size_t m_tickRows = 0;  // the most frames a tick rises in
     std::vector<double> m_whine;  // per frame: the whine's fundamental, 0 for none
+    std::vector<double> m_track;
+    std::vector<double> m_window;
+    size_t m_trackRows = 0;  // frames each side that a frame's whine is judged with
     double m_binHz = 1.0;
     std::vector<float> m_column;  // scratch: one bin across rows, or one row across bins
     static constexpr size_t kRemembered = 5;
