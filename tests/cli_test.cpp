@@ -169,12 +169,21 @@ const ReasonCase kReasons[] = {
      "not a QuickTime/ISO movie", "not-a-movie"},
     {"WrongBrand", [](const TempDir&, const std::string& path) { Movie(path, ForeignBrand); },
      "not a camera movie (brand 'isom')", "wrong-brand"},
+    {"Truncated",
+     [](const TempDir&, const std::string& path) {
+         Movie(path);
+         std::filesystem::resize_file(path, 300'000);  // a copy broken off
+     },
+     "truncated: 300.0 of ", "truncated"},
     {"MalformedAtom",
      [](const TempDir&, const std::string& path) {
          Movie(path);
-         std::filesystem::resize_file(path, std::filesystem::file_size(path) - 10);  // the moov is cut short
+         std::vector<uint8_t> bytes = testsupport::ReadFile(path);
+         const auto header = std::search(bytes.begin(), bytes.end(), std::begin("mvhd"), std::end("mvhd") - 1);
+         testsupport::PutBE32(bytes, static_cast<size_t>(header - bytes.begin()) - 4, 4);  // smaller than a header
+         testsupport::WriteFile(path, bytes);
      },
-     "malformed atom: 'moov' at offset ", "malformed-atom"},
+     "malformed atom: 'mvhd' at offset ", "malformed-atom"},
     {"NoSoundTrack", [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.sound.present = false; }); },
      "no sound track", "no-sound-track"},
     {"UnsupportedSound",
@@ -309,6 +318,27 @@ TEST(CliTest, JsonReports)
 }
 
 // A card: movies beside stills and notes, in folders; the layout is kept, the rest passed over.
+// Times a source is given, so that a destination can be seen to keep them.
+const timespec kFilmed[2] = {{1'600'000'000, 250'000'000}, {1'500'000'000, 123'456'789}};  // access, modification
+
+void SetTimes(const std::string& path) { ASSERT_EQ(utimensat(AT_FDCWD, path.c_str(), kFilmed, 0), 0) << path; }
+
+// The source's modification time, and its access time as our reading left it (reading moves
+// an old access time on once).
+void ExpectTimesKept(const std::string& source, const std::string& path)
+{
+    struct stat status {};
+    struct stat original {};
+    ASSERT_EQ(stat(path.c_str(), &status), 0) << path;
+    ASSERT_EQ(stat(source.c_str(), &original), 0) << source;
+    EXPECT_EQ(status.st_mtim.tv_sec, kFilmed[1].tv_sec) << path;
+    EXPECT_EQ(status.st_mtim.tv_nsec, kFilmed[1].tv_nsec) << path;
+    EXPECT_EQ(status.st_atim.tv_sec, original.st_atim.tv_sec) << path;
+    EXPECT_EQ(status.st_atim.tv_nsec, original.st_atim.tv_nsec) << path;
+}
+
+// A card's life: planned, processed, run again (nothing to do), a clip added, a destination
+// that holds something else; every destination with its source's dates.
 TEST(CliTest, BatchOverACardsFolders)
 {
     TempDir dir;
@@ -321,6 +351,8 @@ TEST(CliTest, BatchOverACardsFolders)
     Movie(dir.File("card/FOREIGN.MP4"), ForeignBrand);
     WriteText(card + "/DCIM/100CAM/STILL.JPG", "\xff\xd8\xff\xe0 a still");
     WriteText(card + "/MISC/notes.txt", "a sidecar\n");
+    SetTimes(card + "/DCIM/100CAM/PCM.MOV");
+    SetTimes(card + "/DCIM/100CAM/AAC.MOV");
     const std::string out = dir.File("out/nested");  // created, parents too
 
     const Outcome plan = Tool("batch --dry-run -r -o " + Q(out) + " " + Q(card));
@@ -343,11 +375,37 @@ TEST(CliTest, BatchOverACardsFolders)
     EXPECT_NE(outcome.output.find("skipped: not a camera movie (brand 'isom')"), std::string::npos) << outcome.output;
     EXPECT_EQ(outcome.output.find("STILL.JPG"), std::string::npos) << outcome.output;
     EXPECT_NE(outcome.output.find("4 movies: 2 done, 2 skipped, 0 failed"), std::string::npos) << outcome.output;
+    ExpectTimesKept(card + "/DCIM/100CAM/PCM.MOV", out + "/DCIM/100CAM/PCM.MOV");
+    ExpectTimesKept(card + "/DCIM/100CAM/AAC.MOV", out + "/DCIM/100CAM/AAC.MOV");
+    for (const char* options : {"-q", "-q -f"}) {  // a name kept free, or whatever stands there replaced
+        ASSERT_EQ(Tool(std::string("process ") + options + " " + Q(card + "/DCIM/100CAM/PCM.MOV") + " " + Q(dir.File("one.mov"))).status, 0);
+        ExpectTimesKept(card + "/DCIM/100CAM/PCM.MOV", dir.File("one.mov"));
+    }
 
-    // Run again: the destinations exist now, which fails those two without --force.
+    // Run again: nothing left to do, and the plan says so first.
+    const Outcome replan = Tool("batch --dry-run --json -r -o " + Q(out) + " " + Q(card));
+    EXPECT_EQ(replan.status, 0) << replan.output;
+    EXPECT_EQ(replan.output.find("would process"), std::string::npos) << replan.output;
+    EXPECT_NE(replan.output.find(R"("status":"skipped","reason":"already-in-output","message":"already in )" + out),
+              std::string::npos) << replan.output;
     const Outcome again = Tool("batch -r -o " + Q(out) + " " + Q(card));
-    EXPECT_EQ(again.status, 1) << again.output;
-    EXPECT_NE(again.output.find("the destination exists"), std::string::npos) << again.output;
+    EXPECT_EQ(again.status, 0) << again.output;
+    EXPECT_NE(again.output.find("4 movies: 0 done, 4 skipped, 0 failed"), std::string::npos) << again.output;
+    EXPECT_NE(again.output.find("AAC.MOV: skipped: already in " + out), std::string::npos) << again.output;
+
+    // A clip added to the card is the only one done; a destination that holds the unprocessed
+    // movie is not this movie processed: it fails, and -f replaces it.
+    Movie(dir.File("card/DCIM/100CAM/NEW.MOV"));
+    std::filesystem::copy_file(card + "/DCIM/100CAM/PCM.MOV", out + "/DCIM/100CAM/PCM.MOV",
+                               std::filesystem::copy_options::overwrite_existing);
+    const Outcome added = Tool("batch --json -r -o " + Q(out) + " " + Q(card));
+    EXPECT_EQ(added.status, 1) << added.output;
+    EXPECT_NE(added.output.find(R"("done":1,"skipped":3,"failed":1)"), std::string::npos) << added.output;
+    EXPECT_NE(added.output.find(R"(PCM.MOV","status":"failed","reason":"destination-exists")"), std::string::npos)
+        << added.output;
+    const Outcome forced = Tool("batch -f -r -o " + Q(out) + " " + Q(card));
+    EXPECT_EQ(forced.status, 0) << forced.output;
+    EXPECT_NE(Tool("check " + Q(out + "/DCIM/100CAM/PCM.MOV")).output.find("already processed"), std::string::npos);
 }
 
 // A file that someone else makes at the destination while a job runs (a second run, another
@@ -439,6 +497,45 @@ TEST_P(CliLateFileTest, KeptUnlessForced)
 
 // A job killed while it runs leaves no destination, only a hidden file of the recognised form,
 // which a later job in that folder removes once it is old.
+// Ctrl-C in the middle of a card: the running movie is stopped, the others are not started,
+// no folder is left for them, and running the batch again finishes the card.
+TEST_F(CliLateFileTest, InterruptedBatchIsFinishedByTheNextRun)
+{
+    TempDir dir;
+    const std::string card = dir.File("card");
+    for (const char* folder : {"A", "B", "C"}) {
+        std::filesystem::create_directories(card + "/" + folder);
+        std::filesystem::create_hard_link(s_samples->File("long.mov"), card + "/" + folder + "/long.mov");
+    }
+    const std::string out = dir.File("out");
+    std::filesystem::create_directory(out);
+    const std::string pidFile = dir.File("pid");
+    Outcome interrupted{};
+    std::atomic<bool> ended{false};
+    std::thread batch([&] {
+        const std::string inner = "echo $$ > " + Q(pidFile) + "; exec " + Q(TQOVIX_TOOL) + " batch -r -j 1 -o " + Q(out) +
+                                  " " + Q(card);
+        interrupted.status = testsupport::RunCommand("sh -c " + Q(inner) + " 2>&1", &interrupted.output);
+        ended = true;
+    });
+    while (!ended && (!Exists(out + "/A") || HiddenFiles(out + "/A").empty())) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(2));
+    }
+    const std::vector<uint8_t> pid = testsupport::ReadFile(pidFile);
+    if (!ended && !pid.empty()) {
+        kill(std::stoi(std::string(pid.begin(), pid.end() - 1)), SIGINT);
+    }
+    batch.join();
+    ASSERT_EQ(interrupted.status, 130) << "the batch ended before it could be interrupted\n" << interrupted.output;
+    EXPECT_NE(interrupted.output.find("3 movies: 0 done, 0 skipped, 0 failed, 1 stopped, 2 not started"), std::string::npos)
+        << interrupted.output;
+    EXPECT_TRUE(std::filesystem::is_empty(out)) << "no movie, no folder, no partial file";
+
+    const Outcome rerun = Tool("batch -r -o " + Q(out) + " " + Q(card));
+    EXPECT_EQ(rerun.status, 0) << rerun.output;
+    EXPECT_NE(rerun.output.find("3 movies: 3 done, 0 skipped, 0 failed"), std::string::npos) << rerun.output;
+}
+
 TEST_F(CliLateFileTest, KilledJobLeavesOnlyAPartialFileThatIsClearedLater)
 {
     TempDir dir;

@@ -158,6 +158,10 @@ eTqovixErrorCode CTqovixFile::OpenSource(const char* path)
         return TqovixFailed(refusal) ? refusal : ConvertErrnoToLocalError(error, true);
     }
     Adopt(stream);
+    // Before our reading can move the access time on.
+    m_openedTimes[0] = status.st_atim;
+    m_openedTimes[1] = status.st_mtim;
+    m_bTimesKnown = true;
     return eTqovixSuccess;
 }
 
@@ -182,6 +186,7 @@ void CTqovixFile::Close()
         m_stream = nullptr;
     }
     m_descriptor = -1;
+    m_bTimesKnown = false;
     // An unnamed destination vanishes with its descriptor; a hidden one is removed.
     if (m_bUnpublished && !m_partialPath.empty()) {
         unlink(m_partialPath.c_str());

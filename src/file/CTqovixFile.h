@@ -3,6 +3,7 @@
 #pragma once
 
 #include <atomic>
+#include <ctime>
 #include <cstdint>
 #include <cstdio>
 #include <memory>
@@ -45,8 +46,10 @@ public:
     // meanwhile leaves nothing (or the recognisable hidden file) behind. `path` is not touched.
     eTqovixErrorCode OpenDestination(const char* path);
     // Flushes, then gives the destination its name, replacing what stood there in one step.
-    // `durable`: the data, then the directory entry, reach the device first.
-    eTqovixErrorCode Publish(bool durable);
+    // `durable`: the data, then the directory entry, reach the device first. `datesOf`, when
+    // given, is an opened source whose modification and access times (as they were when it was
+    // opened) the destination takes: importers and editors sort clips by them.
+    eTqovixErrorCode Publish(bool durable, const CTqovixFile* datesOf = nullptr);
     // Closes; an unpublished destination is removed with it.
     void Close();
     bool IsOpened() const { return m_bOpened; }
@@ -112,5 +115,7 @@ private:
     bool m_bUnpublished = false;  // a destination not published yet
     FILE* m_stream = nullptr;
     int m_descriptor = -1;
+    struct timespec m_openedTimes[2] = {};  // a source's access and modification times at opening
+    bool m_bTimesKnown = false;
     std::unique_ptr<char[]> m_buffer;  // the stream's; outlives it
 };

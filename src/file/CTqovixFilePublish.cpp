@@ -134,7 +134,7 @@ eTqovixErrorCode CTqovixFile::OpenDestination(const char* path)
     return eTqovixSuccess;
 }
 
-eTqovixErrorCode CTqovixFile::Publish(bool durable)
+eTqovixErrorCode CTqovixFile::Publish(bool durable, const CTqovixFile* datesOf)
 {
     if (!m_bUnpublished || m_stream == nullptr) {
         return eTqovixErrorInternal;
@@ -144,6 +144,11 @@ eTqovixErrorCode CTqovixFile::Publish(bool durable)
         return result;
     }
     const int descriptor = fileno(m_stream);
+    // After the last write, which would move the modification time on again. A file system
+    // that keeps no such times is no reason to fail the job.
+    if (datesOf != nullptr && datesOf->m_bTimesKnown) {
+        futimens(descriptor, datesOf->m_openedTimes);
+    }
     if (durable && Sync(descriptor) != 0) {
         return ConvertErrnoToLocalError(errno, false);
     }

@@ -70,7 +70,7 @@ public:
     // The finishing step has written the moov and the media data size.
     bool IsDestinationComplete() const { return m_bDestinationComplete; }
     // Gives the complete destination its name, replacing what stood there in one step.
-    eTqovixErrorCode PublishDestination() { return m_destinationFile.Publish(false); }
+    eTqovixErrorCode PublishDestination() { return m_destinationFile.Publish(false, &m_sourceFile); }
     // True once after EncodeCallback has written the last packet. The job is finished
     // only after the encoder has returned, so that no codec is closed under its own feet.
     bool TakeFinishPending();

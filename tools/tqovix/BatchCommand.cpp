@@ -19,6 +19,7 @@
 #include <vector>
 
 #include "CommandLine.h"
+#include "Inspection.h"
 #include "Json.h"
 #include "Reasons.h"
 #include "Structure.h"
@@ -39,14 +40,18 @@ constexpr const char* kUsage =
     "  -f, --force        replace existing files in OUTDIR\n"
     "  --dry-run          list what would be done, and do nothing\n"
     "  --json             one JSON object with a row per movie and the totals\n"
-    "  Movies already processed, and files that are not camera movies, are listed as skipped.\n"
+    "  Movies already processed, files that are not camera movies, and movies whose processed\n"
+    "  form OUTDIR already holds are listed as skipped: run it again after adding clips or after\n"
+    "  an interrupt, and it does only what is left. A destination that holds anything else\n"
+    "  fails the movie unless -f. Destinations take their sources' modification times.\n"
     "  exit status: 0 nothing failed, 1 any movie failed, 2 usage error, 130 interrupted\n";
 
 volatile std::sig_atomic_t g_signal = 0;
 
 void OnSignal(int number) { g_signal = number; }
 
-enum class Outcome { Pending, Done, Skipped, Failed };
+// Stopped: its job was running when the batch was interrupted (its output removed).
+enum class Outcome { Pending, Done, Skipped, Failed, Stopped };
 
 struct Job {
     std::string source;
@@ -87,6 +92,7 @@ const char* OutcomeName(Outcome outcome)
     case Outcome::Done: return "done";
     case Outcome::Skipped: return "skipped";
     case Outcome::Failed: return "failed";
+    case Outcome::Stopped: return "stopped";
     case Outcome::Pending: break;
     }
     return "not started";
@@ -150,10 +156,25 @@ public:
             }
             const Verdict verdict = Explain(code, job.source);
             const bool skipped = verdict.code == 8 || verdict.code == 20;
-            Finish(job, skipped ? Outcome::Skipped : Outcome::Failed, verdict.Key(), verdict.text);
+            Finish(job, skipped ? Outcome::Skipped : Outcome::Failed, verdict);
         }
         if (library) {
             TqCloseOVIX();
+        }
+        // What OUTDIR holds already: this movie processed (an earlier run), or something else.
+        // A movie with a case twin is judged when it starts: what stands at its name by then
+        // may be its twin's movie.
+        const bool force = m_line.Has("force");
+        for (Job& job : m_jobs) {
+            if (job.outcome != Outcome::Pending || job.caseTwin != Job::kNone) {
+                continue;
+            }
+            const Verdict verdict = CheckDestination(job.source, job.destination, force);
+            if (verdict.reason == Reason::DestinationExists && HoldsProcessed(job)) {
+                Finish(job, Outcome::Skipped, MakeVerdict(-1, Reason::AlreadyInOutput, m_line.Value("output")));
+            } else if (verdict.reason != Reason::None) {
+                Finish(job, Outcome::Failed, verdict);
+            }
         }
     }
 
@@ -204,7 +225,7 @@ public:
             }
             for (Job& job : m_jobs) {
                 if (job.pid == pid && job.outcome == Outcome::Pending) {
-                    Collect(job, status);
+                    Collect(job, status, forwarded);
                     --running;
                 }
             }
@@ -213,6 +234,14 @@ public:
 
     void ListPlan() const
     {
+        if (m_line.Has("json")) {
+            std::vector<std::string> rows;
+            for (const Job& job : m_jobs) {
+                rows.push_back(Row(job, job.outcome == Outcome::Pending ? "would process" : OutcomeName(job.outcome)));
+            }
+            std::printf("%s\n", JsonObject::Report().AddJson("files", JsonArray(rows)).Text().c_str());
+            return;
+        }
         for (const Job& job : m_jobs) {
             if (job.outcome == Outcome::Pending) {
                 std::printf("would process %s -> %s\n", job.source.c_str(), job.destination.c_str());
@@ -224,7 +253,7 @@ public:
 
     void PrintSummary(double seconds) const
     {
-        size_t counts[4] = {};
+        size_t counts[5] = {};
         uint64_t bytes = 0;
         for (const Job& job : m_jobs) {
             ++counts[static_cast<int>(job.outcome)];
@@ -233,20 +262,15 @@ public:
         if (m_line.Has("json")) {
             std::vector<std::string> rows;
             for (const Job& job : m_jobs) {
-                rows.push_back(JsonObject()
-                                   .Add("source", job.source)
-                                   .Add("destination", job.destination)
-                                   .Add("status", OutcomeName(job.outcome))
-                                   .Add("reason", job.reason)
-                                   .Add("message", job.message)
-                                   .Add("seconds", job.seconds)
-                                   .Text());
+                rows.push_back(Row(job, OutcomeName(job.outcome)));
             }
             std::printf("%s\n", JsonObject::Report()
                                     .AddJson("files", JsonArray(rows))
                                     .Add("done", static_cast<uint64_t>(counts[1]))
                                     .Add("skipped", static_cast<uint64_t>(counts[2]))
-                                    .Add("failed", static_cast<uint64_t>(counts[3] + counts[0]))
+                                    .Add("failed", static_cast<uint64_t>(counts[3]))
+                                    .Add("stopped", static_cast<uint64_t>(counts[4]))
+                                    .Add("notStarted", static_cast<uint64_t>(counts[0]))
                                     .Add("bytes", bytes)
                                     .Add("seconds", seconds)
                                     .Text()
@@ -262,18 +286,69 @@ public:
             std::printf("%-*s  %-7s  %8.2f  %s\n", static_cast<int>(nameWidth), job.source.c_str(),
                         OutcomeName(job.outcome), job.seconds, job.outcome == Outcome::Done ? "" : job.message.c_str());
         }
-        std::printf("%zu %s: %zu done, %zu skipped, %zu failed; %.1f MB in %.1f s\n", m_jobs.size(),
-                    m_jobs.size() == 1 ? "movie" : "movies", counts[1],
-                    counts[2], counts[3] + counts[0], static_cast<double>(bytes) / 1e6, seconds);
+        std::string interrupted;
+        if (counts[4] + counts[0] > 0) {
+            interrupted = ", " + std::to_string(counts[4]) + " stopped, " + std::to_string(counts[0]) + " not started";
+        }
+        std::printf("%zu %s: %zu done, %zu skipped, %zu failed%s; %.1f MB in %.1f s\n", m_jobs.size(),
+                    m_jobs.size() == 1 ? "movie" : "movies", counts[1], counts[2], counts[3], interrupted.c_str(),
+                    static_cast<double>(bytes) / 1e6, seconds);
     }
 
     bool AnyFailed() const
     {
-        return std::any_of(m_jobs.begin(), m_jobs.end(),
-                           [](const Job& job) { return job.outcome == Outcome::Failed || job.outcome == Outcome::Pending; });
+        return std::any_of(m_jobs.begin(), m_jobs.end(), [](const Job& job) { return job.outcome == Outcome::Failed; });
+    }
+
+    // Folders made for destinations that no movie ended up in: an interrupted or failed batch
+    // leaves OUTDIR as it found it, apart from its finished movies.
+    void RemoveEmptyFolders()
+    {
+        std::sort(m_madeFolders.begin(), m_madeFolders.end(),
+                  [](const fs::path& a, const fs::path& b) { return a.native().size() > b.native().size(); });
+        for (const fs::path& folder : m_madeFolders) {
+            std::error_code ignored;
+            if (fs::is_empty(folder, ignored)) {
+                fs::remove(folder, ignored);
+            }
+        }
     }
 
 private:
+    static std::string Row(const Job& job, const char* status)
+    {
+        return JsonObject()
+            .Add("source", job.source)
+            .Add("destination", job.destination)
+            .Add("status", status)
+            .Add("reason", job.reason)
+            .Add("message", job.message)
+            .Add("seconds", job.seconds)
+            .Text();
+    }
+
+    // Whether the destination is this movie as a job makes it: the library's verdict is
+    // "already processed", and it carries as many tracks and sound frames as the source.
+    static bool HoldsProcessed(const Job& job)
+    {
+        const Inspection made = Inspect(job.destination);
+        if (made.verdict.code != 20) {
+            return false;
+        }
+        const Inspection source = Inspect(job.source);
+        if (!source.parsed || !made.parsed || source.tracks.size() != made.tracks.size()) {
+            return false;
+        }
+        for (size_t i = 0; i < source.tracks.size(); ++i) {
+            const InspectedTrack& one = source.tracks[i];
+            const InspectedTrack& other = made.tracks[i];
+            if (one.handler != other.handler || (one.handler == "soun" && (!one.known || one.samples != other.samples))) {
+                return false;
+            }
+        }
+        return true;
+    }
+
     void GatherFolder(const fs::path& root, const fs::path& output)
     {
         std::error_code error;
@@ -345,6 +420,10 @@ private:
     bool Start(Job& job)
     {
         std::error_code error;
+        for (fs::path folder = fs::path(job.destination).parent_path(); !folder.empty() && !fs::exists(folder, error);
+             folder = folder.parent_path()) {
+            m_madeFolders.push_back(folder);
+        }
         fs::create_directories(fs::path(job.destination).parent_path(), error);
         int ends[2];
         if (pipe2(ends, O_CLOEXEC) != 0) {
@@ -367,7 +446,8 @@ private:
         return true;
     }
 
-    void Collect(Job& job, int status)
+    // `interrupted`: the batch was asked to stop while the job ran.
+    void Collect(Job& job, int status, bool interrupted)
     {
         std::string json;
         char buffer[4096];
@@ -384,8 +464,11 @@ private:
                                           : "exit status " + std::to_string(WIFEXITED(status) ? WEXITSTATUS(status) : -1);
         }
         const std::string reason = JsonValue(json, "reason");
-        Finish(job, ok ? Outcome::Done : Outcome::Failed, reason.empty() ? "internal" : reason, message);
+        const Outcome failed = interrupted && (reason == "aborted" || WIFSIGNALED(status)) ? Outcome::Stopped : Outcome::Failed;
+        Finish(job, ok ? Outcome::Done : failed, reason.empty() ? "internal" : reason, message);
     }
+
+    void Finish(Job& job, Outcome outcome, const Verdict& verdict) { Finish(job, outcome, verdict.Key(), verdict.text); }
 
     void Finish(Job& job, Outcome outcome, const std::string& reason, const std::string& message)
     {
@@ -403,6 +486,7 @@ private:
     std::set<std::string> m_destinations;
     std::map<std::string, size_t> m_folded;  // case-folded destination: the latest job with it
     size_t m_finished = 0;
+    std::vector<fs::path> m_madeFolders;
 };
 
 }  // namespace
@@ -445,6 +529,7 @@ int BatchCommand(const Arguments& arguments)
     sigaction(SIGINT, &action, nullptr);
     sigaction(SIGTERM, &action, nullptr);
     batch.Run(parallel);
+    batch.RemoveEmptyFolders();
     batch.PrintSummary(std::chrono::duration<double>(std::chrono::steady_clock::now() - begun).count());
     if (g_signal != 0) {
         return 130;

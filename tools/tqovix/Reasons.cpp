@@ -4,7 +4,9 @@
 #include <sys/statvfs.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <cstdio>
 #include <cstring>
 
 #include "Structure.h"
@@ -68,6 +70,9 @@ Verdict ExplainContent(int code, const std::string& source)
     if (!structure.brand.empty() && structure.brand != "qt  " && structure.brand != "mp42") {
         return MakeVerdict(code, Reason::WrongBrand, structure.brand);
     }
+    if (structure.wholeSize > 0) {
+        return MakeVerdict(code, Reason::Truncated, SizesText(structure.fileSize, structure.wholeSize));
+    }
     if (!structure.fault.empty()) {
         return MakeVerdict(code, Reason::MalformedAtom, structure.fault);
     }
@@ -94,6 +99,40 @@ Verdict ExplainContent(int code, const std::string& source)
 
 }  // namespace
 
+namespace {
+
+struct Unit {
+    double scale;
+    const char* name;
+};
+
+Unit UnitFor(uint64_t bytes)
+{
+    return bytes >= 1'000'000'000 ? Unit{1e9, "GB"} : bytes >= 1'000'000 ? Unit{1e6, "MB"} : Unit{1e3, "KB"};
+}
+
+std::string Formatted(double value)
+{
+    char text[32];
+    std::snprintf(text, sizeof text, "%.1f", value);
+    return text;
+}
+
+}  // namespace
+
+std::string SizeText(uint64_t bytes)
+{
+    const Unit unit = UnitFor(bytes);
+    return Formatted(static_cast<double>(bytes) / unit.scale) + " " + unit.name;
+}
+
+std::string SizesText(uint64_t part, uint64_t whole)
+{
+    const Unit unit = UnitFor(std::max(part, whole));
+    return Formatted(static_cast<double>(part) / unit.scale) + " of " + Formatted(static_cast<double>(whole) / unit.scale) +
+           " " + unit.name;
+}
+
 const std::vector<ReasonRow>& ReasonTable()
 {
     static const std::vector<ReasonRow> table = {
@@ -113,12 +152,14 @@ const std::vector<ReasonRow>& ReasonTable()
         {Reason::NotAMovie, "not-a-movie", 8, "not a QuickTime/ISO movie"},
         {Reason::WrongBrand, "wrong-brand", 8, "not a camera movie (brand '{}')"},
         {Reason::MalformedAtom, "malformed-atom", 8, "malformed atom"},
+        {Reason::Truncated, "truncated", 8, "truncated: {} present"},
         {Reason::Fragmented, "fragmented", 8, "fragmented movie"},
         {Reason::NoSoundTrack, "no-sound-track", 8, "no sound track"},
         {Reason::UnsupportedSound, "unsupported-sound", 8, "unsupported sound"},
         {Reason::UnsupportedLayout, "unsupported-layout", 8, "unsupported layout"},
         {Reason::NoAFInformation, "no-af-information", 8, "no AF information"},
         {Reason::AlreadyProcessed, "already-processed", 20, "already processed"},
+        {Reason::AlreadyInOutput, "already-in-output", -1, "already in {}"},
         {Reason::NoSpace, "no-space", 130, "not enough free space on the destination's volume"},
         {Reason::FileTooLarge, "file-too-large", 131, "the destination's file system cannot hold a file that large"},
         {Reason::OutOfMemory, "out-of-memory", 100, "out of memory"},
@@ -224,9 +265,10 @@ Verdict Explain(int code, const std::string& source, const std::string& destinat
             struct statvfs volume {};
             const unsigned long long free =
                 statvfs(directory.c_str(), &volume) == 0 ? 1ULL * volume.f_bavail * volume.f_frsize : 0;
+            const auto needed = static_cast<uint64_t>(sourceStatus.st_size);
             return MakeVerdict(code, Reason::NoSpace,
-                               "about " + std::to_string(sourceStatus.st_size) + " bytes needed, " +
-                                   std::to_string(free) + " free");
+                               "about " + SizeText(needed) + " needed, " + SizeText(free) + " free (" +
+                                   SizeText(needed > free ? needed - free : 0) + " missing)");
         }
     }
     switch (code) {

@@ -3,6 +3,7 @@
 // file and a 24-bit movie alike); the reason is found from the paths and the file itself.
 #pragma once
 
+#include <cstdint>
 #include <string>
 #include <vector>
 
@@ -22,12 +23,14 @@ enum class Reason {
     NotAMovie,
     WrongBrand,
     MalformedAtom,
+    Truncated,
     Fragmented,
     NoSoundTrack,
     UnsupportedSound,
     UnsupportedLayout,
     NoAFInformation,
     AlreadyProcessed,
+    AlreadyInOutput,
     NoSpace,
     FileTooLarge,
     OutOfMemory,
@@ -43,6 +46,10 @@ struct ReasonRow {
     const char* words;  // "{}" stands for the detail; without it the detail follows a colon
 };
 const std::vector<ReasonRow>& ReasonTable();
+
+// Sizes for people: "26.0 MB", "1.2 GB"; and "26.0 of 53.6 MB" in the larger one's unit.
+std::string SizeText(uint64_t bytes);
+std::string SizesText(uint64_t part, uint64_t whole);
 
 struct Verdict {
     int code = 0;  // exported code

@@ -69,6 +69,9 @@ public:
             if (depth == 0 && offset == 0) {
                 m_structure.atomic = IsTopLevelType(type);
             }
+            if (depth == 0 && size >= headerSize && size > end - offset) {
+                m_structure.wholeSize = offset + size;  // the file was cut short (a copy broken off)
+            }
             if (size < headerSize || size > end - offset) {
                 const std::string said = size == 0 ? "size 0 (to the end of the file)" : "size " + std::to_string(size);
                 const std::string room = size < headerSize ? "smaller than its header"

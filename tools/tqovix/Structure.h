@@ -21,6 +21,7 @@ struct Structure {
     std::string brand;         // the file-type atom's major brand; empty without one
     std::vector<ScannedAtom> atoms;
     std::string fault;         // the first malformed atom, in words; empty when none
+    uint64_t wholeSize = 0;    // what a file cut short would hold, by its last atom's size; 0 when not cut short
     std::string systemError;   // why the file could not be read
 };
 
