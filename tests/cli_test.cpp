@@ -406,6 +406,56 @@ TEST(CliTest, BatchOverACardsFolders)
     const Outcome forced = Tool("batch -f -r -o " + Q(out) + " " + Q(card));
     EXPECT_EQ(forced.status, 0) << forced.output;
     EXPECT_NE(Tool("check " + Q(out + "/DCIM/100CAM/PCM.MOV")).output.find("already processed"), std::string::npos);
+
+    // --all: the whole card, its other files as they were, with their dates.
+    const std::string whole = dir.File("whole");
+    SetTimes(card + "/DCIM/100CAM/STILL.JPG");
+    for (int run = 0; run < 2; ++run) {
+        const Outcome all = Tool("batch --all -r -o " + Q(whole) + " " + Q(card));
+        EXPECT_EQ(all.status, 0) << all.output;
+        EXPECT_NE(all.output.find(run == 0 ? "4 other files: 4 copied" : "4 other files: 0 copied (0.0 KB), 4 already there"),
+                  std::string::npos) << all.output;
+        if (run == 0) {
+            ExpectTimesKept(card + "/DCIM/100CAM/STILL.JPG", whole + "/DCIM/100CAM/STILL.JPG");
+        }
+    }
+    for (const char* other : {"/DCIM/100CAM/STILL.JPG", "/MISC/notes.txt", "/DCIM/DONE.MOV", "/FOREIGN.MP4"}) {
+        EXPECT_EQ(testsupport::ReadFile(whole + other), testsupport::ReadFile(card + other)) << other;
+    }
+    EXPECT_NE(Tool("check " + Q(whole + "/DCIM/100CAM/NEW.MOV")).output.find("already processed"), std::string::npos);
+}
+
+// A volume too small for the card: the batch says what is missing before it writes anything,
+// and a single job says it in megabytes. A small tmpfs stands in for a full card reader's
+// volume (mounting it needs root: skipped otherwise).
+TEST(CliTest, TooLittleSpaceIsToldBeforeAnythingIsWritten)
+{
+    TempDir dir;
+    const std::string small = dir.File("small");
+    std::filesystem::create_directory(small);
+    if (testsupport::RunCommand("mount -t tmpfs -o size=1m tmpfs " + Q(small) + " 2>/dev/null", nullptr) != 0) {
+        GTEST_SKIP() << "cannot mount a small volume here (needs root)";
+    }
+    struct Unmount {
+        std::string path;
+        ~Unmount() { testsupport::RunCommand("umount " + Q(path), nullptr); }
+    } unmount{small};
+    std::filesystem::create_directory(dir.File("card"));
+    for (const char* name : {"card/A.MOV", "card/B.MOV"}) {
+        Movie(dir.File(name), [](Recipe& r) { r.video.frameCount = 120; });
+    }
+    const Outcome plan = Tool("batch --dry-run -o " + Q(small + "/out") + " " + Q(dir.File("card")));
+    EXPECT_EQ(plan.status, 1) << plan.output;
+    EXPECT_NE(plan.output.find("would stop: not enough free space for this batch: about "), std::string::npos)
+        << plan.output;
+    const Outcome batch = Tool("batch -o " + Q(small + "/out") + " " + Q(dir.File("card")));
+    EXPECT_EQ(batch.status, 1) << batch.output;
+    EXPECT_NE(batch.output.find(" MB needed, 1.0 MB free ("), std::string::npos) << batch.output;
+    EXPECT_NE(batch.output.find(" MB missing)"), std::string::npos) << batch.output;
+    EXPECT_TRUE(std::filesystem::is_empty(small)) << "nothing written, no folder made";
+    const Outcome one = Tool("process --json " + Q(dir.File("card/A.MOV")) + " " + Q(small + "/A.MOV"));
+    EXPECT_NE(one.output.find(R"("reason":"no-space")"), std::string::npos) << one.output;
+    EXPECT_NE(one.output.find(" MB needed, "), std::string::npos) << one.output;
 }
 
 // A file that someone else makes at the destination while a job runs (a second run, another

@@ -9,6 +9,9 @@
 #include <cstring>
 #include <fcntl.h>
 #include <filesystem>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/statvfs.h>
 #include <map>
 #include <set>
 #include <string>
@@ -38,13 +41,17 @@ constexpr const char* kUsage =
     "  -j, --jobs N       jobs at a time (default: one per core)\n"
     "  -r, --recursive    search folders and their subfolders\n"
     "  -f, --force        replace existing files in OUTDIR\n"
+    "  -a, --all          copy every other file of the searched folders too (stills, sidecars,\n"
+    "                     movies passed over), dates kept, so that OUTDIR is the whole card\n"
     "  --dry-run          list what would be done, and do nothing\n"
     "  --json             one JSON object with a row per movie and the totals\n"
     "  Movies already processed, files that are not camera movies, and movies whose processed\n"
     "  form OUTDIR already holds are listed as skipped: run it again after adding clips or after\n"
     "  an interrupt, and it does only what is left. A destination that holds anything else\n"
     "  fails the movie unless -f. Destinations take their sources' modification times.\n"
-    "  exit status: 0 nothing failed, 1 any movie failed, 2 usage error, 130 interrupted\n";
+    "  Before anything is done, the free space on OUTDIR's volume is checked for the whole batch.\n"
+    "  exit status: 0 nothing failed, 1 any movie or copy failed (or too little free space),\n"
+    "  2 usage error, 130 interrupted\n";
 
 volatile std::sig_atomic_t g_signal = 0;
 
@@ -68,6 +75,94 @@ struct Job {
     size_t caseTwin = kNone;
     static constexpr size_t kNone = static_cast<size_t>(-1);
 };
+
+// A file that is not processed but copied as it is (batch --all).
+struct Copy {
+    std::string source;
+    std::string destination;
+    uint64_t bytes = 0;
+    enum class State { Pending, Copied, Present, Failed } state = State::Pending;
+    std::string message;
+};
+
+// The source's bytes under a hidden name beside `destination`, which it then takes in one
+// step with the source's dates: a reflink where the file system shares extents, else the
+// kernel's copy, else read and write. An interrupt (`stop`) leaves nothing behind.
+std::string CopyFile(const std::string& source, const std::string& destination, bool replace,
+                     const volatile std::sig_atomic_t& stop)
+{
+    const int from = open(source.c_str(), O_RDONLY | O_CLOEXEC);
+    if (from < 0) {
+        return std::string("cannot read it: ") + std::strerror(errno);
+    }
+    struct stat status {};
+    fstat(from, &status);
+    const fs::path target(destination);
+    const std::string hidden = (target.parent_path() / ("." + target.filename().string() + "." +
+                                                        std::to_string(getpid()) + ".tqovix-copy"))
+                                   .string();
+    const int to = open(hidden.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, status.st_mode & 0777);
+    if (to < 0) {
+        const std::string error = std::strerror(errno);
+        close(from);
+        return "cannot write it: " + error;
+    }
+    std::string failure;
+    if (ioctl(to, FICLONE, from) != 0) {
+        uint64_t left = static_cast<uint64_t>(status.st_size);
+        bool kernel = true;
+        char buffer[1 << 16];
+        while (left > 0 && failure.empty() && stop == 0) {
+            ssize_t moved = kernel ? copy_file_range(from, nullptr, to, nullptr, std::min<uint64_t>(left, 1 << 24), 0) : -1;
+            if (moved < 0 && kernel && (errno == EXDEV || errno == ENOSYS || errno == EOPNOTSUPP || errno == EINVAL)) {
+                kernel = false;
+                continue;
+            }
+            if (moved < 0 && !kernel) {
+                moved = read(from, buffer, std::min<uint64_t>(left, sizeof buffer));
+                if (moved > 0 && write(to, buffer, static_cast<size_t>(moved)) != moved) {
+                    moved = -1;
+                }
+            }
+            if (moved <= 0) {
+                failure = moved == 0 ? "the file ended early" : std::strerror(errno);
+                break;
+            }
+            left -= static_cast<uint64_t>(moved);
+        }
+    }
+    const struct timespec dates[2] = {status.st_atim, status.st_mtim};
+    if (failure.empty() && stop == 0 && futimens(to, dates) != 0) {
+        failure = std::strerror(errno);
+    }
+    close(from);
+    if (close(to) != 0 && failure.empty()) {
+        failure = std::strerror(errno);
+    }
+    if (failure.empty() && stop == 0) {
+        // A name taken meanwhile is kept unless replacing was asked for.
+        const bool named = replace ? rename(hidden.c_str(), destination.c_str()) == 0
+                                   : link(hidden.c_str(), destination.c_str()) == 0;
+        if (!named && errno == EEXIST) {
+            unlink(hidden.c_str());
+            return "the destination exists (use --force to replace it)";
+        }
+        failure = named ? failure : std::strerror(errno);
+    }
+    unlink(hidden.c_str());
+    return stop != 0 && failure.empty() ? "interrupted" : failure.empty() ? std::string() : "cannot copy it: " + failure;
+}
+
+const char* CopyStateName(Copy::State state)
+{
+    switch (state) {
+    case Copy::State::Copied: return "copied";
+    case Copy::State::Present: return "already there";
+    case Copy::State::Failed: return "failed";
+    case Copy::State::Pending: break;
+    }
+    return "not copied";
+}
 
 // ASCII letters only: what every FAT and exFAT volume folds alike.
 std::string FoldCase(std::string text)
@@ -176,6 +271,84 @@ public:
                 Finish(job, Outcome::Failed, verdict);
             }
         }
+        if (!m_line.Has("all")) {
+            return;
+        }
+        // A movie passed over (processed already, another writer's) belongs to the card too.
+        for (const Job& job : m_jobs) {
+            if (job.outcome == Outcome::Skipped && job.reason != std::string("already-in-output")) {
+                Copy copy;
+                copy.source = job.source;
+                copy.destination = job.destination;
+                copy.bytes = job.bytes;
+                m_copies.push_back(std::move(copy));
+            }
+        }
+        for (Copy& copy : m_copies) {
+            struct stat there {};
+            struct stat here {};
+            if (copy.state != Copy::State::Pending || lstat(copy.destination.c_str(), &there) != 0) {
+                continue;
+            }
+            if (stat(copy.source.c_str(), &here) == 0 && S_ISREG(there.st_mode) && there.st_size == here.st_size &&
+                there.st_mtim.tv_sec == here.st_mtim.tv_sec && there.st_mtim.tv_nsec == here.st_mtim.tv_nsec) {
+                copy.state = Copy::State::Present;
+                copy.message = "already in " + m_line.Value("output");
+            } else if (!force) {
+                copy.state = Copy::State::Failed;
+                copy.message = "the destination exists (use --force to replace it)";
+            }
+        }
+    }
+
+    // What the batch will write, against the free space on OUTDIR's volume; empty when it fits.
+    std::string SpaceShortfall() const
+    {
+        uint64_t needed = 0;
+        for (const Job& job : m_jobs) {
+            needed += job.outcome == Outcome::Pending ? job.bytes : 0;
+        }
+        for (const Copy& copy : m_copies) {
+            needed += copy.state == Copy::State::Pending ? copy.bytes : 0;
+        }
+        fs::path probe = m_line.Value("output");
+        std::error_code error;
+        while (!probe.empty() && !fs::exists(probe, error)) {
+            probe = probe.parent_path();
+        }
+        struct statvfs volume {};
+        if (needed == 0 || statvfs(probe.empty() ? "." : probe.c_str(), &volume) != 0) {
+            return {};
+        }
+        const uint64_t free = 1ULL * volume.f_bavail * volume.f_frsize;
+        if (needed <= free) {
+            return {};
+        }
+        return "not enough free space for this batch: about " + SizeText(needed) + " needed, " + SizeText(free) +
+               " free (" + SizeText(needed - free) + " missing)";
+    }
+
+    void RunCopies()
+    {
+        for (Copy& copy : m_copies) {
+            if (copy.state != Copy::State::Pending || g_signal != 0) {
+                continue;
+            }
+            std::error_code error;
+            for (fs::path folder = fs::path(copy.destination).parent_path(); !folder.empty() && !fs::exists(folder, error);
+                 folder = folder.parent_path()) {
+                m_madeFolders.push_back(folder);
+            }
+            fs::create_directories(fs::path(copy.destination).parent_path(), error);
+            copy.message = CopyFile(copy.source, copy.destination, m_line.Has("force"), g_signal);
+            copy.state = copy.message.empty() ? Copy::State::Copied : Copy::State::Failed;
+            if (g_signal != 0 && copy.state == Copy::State::Failed) {
+                copy.state = Copy::State::Pending;
+            }
+            if (copy.state == Copy::State::Failed && !m_line.Quiet() && !m_line.Has("json")) {
+                std::fprintf(stderr, "%s: %s\n", copy.source.c_str(), copy.message.c_str());
+            }
+        }
     }
 
     void Run(long parallel)
@@ -239,7 +412,12 @@ public:
             for (const Job& job : m_jobs) {
                 rows.push_back(Row(job, job.outcome == Outcome::Pending ? "would process" : OutcomeName(job.outcome)));
             }
-            std::printf("%s\n", JsonObject::Report().AddJson("files", JsonArray(rows)).Text().c_str());
+            std::printf("%s\n", JsonObject::Report()
+                                    .AddJson("files", JsonArray(rows))
+                                    .AddJson("copies", CopyRows(true))
+                                    .Add("space", SpaceShortfall())
+                                    .Text()
+                                    .c_str());
             return;
         }
         for (const Job& job : m_jobs) {
@@ -249,6 +427,31 @@ public:
                 std::printf("would skip %s: %s\n", job.source.c_str(), job.message.c_str());
             }
         }
+        for (const Copy& copy : m_copies) {
+            if (copy.state == Copy::State::Pending) {
+                std::printf("would copy %s -> %s\n", copy.source.c_str(), copy.destination.c_str());
+            } else {
+                std::printf("would not copy %s: %s\n", copy.source.c_str(), copy.message.c_str());
+            }
+        }
+        if (const std::string shortfall = SpaceShortfall(); !shortfall.empty()) {
+            std::printf("would stop: %s\n", shortfall.c_str());
+        }
+    }
+
+    std::string CopyRows(bool planned) const
+    {
+        std::vector<std::string> rows;
+        for (const Copy& copy : m_copies) {
+            const bool pending = copy.state == Copy::State::Pending;
+            rows.push_back(JsonObject()
+                               .Add("source", copy.source)
+                               .Add("destination", copy.destination)
+                               .Add("status", planned && pending ? "would copy" : CopyStateName(copy.state))
+                               .Add("message", copy.message)
+                               .Text());
+        }
+        return JsonArray(rows);
     }
 
     void PrintSummary(double seconds) const
@@ -266,6 +469,7 @@ public:
             }
             std::printf("%s\n", JsonObject::Report()
                                     .AddJson("files", JsonArray(rows))
+                                    .AddJson("copies", CopyRows(false))
                                     .Add("done", static_cast<uint64_t>(counts[1]))
                                     .Add("skipped", static_cast<uint64_t>(counts[2]))
                                     .Add("failed", static_cast<uint64_t>(counts[3]))
@@ -293,11 +497,24 @@ public:
         std::printf("%zu %s: %zu done, %zu skipped, %zu failed%s; %.1f MB in %.1f s\n", m_jobs.size(),
                     m_jobs.size() == 1 ? "movie" : "movies", counts[1], counts[2], counts[3], interrupted.c_str(),
                     static_cast<double>(bytes) / 1e6, seconds);
+        if (m_line.Has("all")) {
+            size_t states[4] = {};
+            uint64_t copied = 0;
+            for (const Copy& copy : m_copies) {
+                ++states[static_cast<int>(copy.state)];
+                copied += copy.state == Copy::State::Copied ? copy.bytes : 0;
+            }
+            std::printf("%zu other %s: %zu copied (%s), %zu already there, %zu failed%s\n", m_copies.size(),
+                        m_copies.size() == 1 ? "file" : "files", states[1], SizeText(copied).c_str(), states[2], states[3],
+                        states[0] > 0 ? (", " + std::to_string(states[0]) + " not copied").c_str() : "");
+        }
     }
 
     bool AnyFailed() const
     {
-        return std::any_of(m_jobs.begin(), m_jobs.end(), [](const Job& job) { return job.outcome == Outcome::Failed; });
+        return std::any_of(m_jobs.begin(), m_jobs.end(), [](const Job& job) { return job.outcome == Outcome::Failed; }) ||
+               std::any_of(m_copies.begin(), m_copies.end(),
+                           [](const Copy& copy) { return copy.state == Copy::State::Failed; });
     }
 
     // Folders made for destinations that no movie ended up in: an interrupted or failed batch
@@ -353,11 +570,12 @@ private:
     {
         std::error_code error;
         std::vector<fs::path> files;
+        std::vector<fs::path> others;
         const auto options = fs::directory_options::skip_permission_denied;
         auto keep = [&](const fs::directory_entry& entry) {
             std::error_code ignored;
-            if (entry.is_regular_file(ignored) && StartsLikeMovie(entry.path().string())) {
-                files.push_back(entry.path());
+            if (entry.is_regular_file(ignored)) {
+                (StartsLikeMovie(entry.path().string()) ? files : others).push_back(entry.path());
             }
         };
         if (m_line.Has("recursive")) {
@@ -382,6 +600,26 @@ private:
         for (const fs::path& file : files) {
             Add(file.string(), file.lexically_relative(root));
         }
+        if (m_line.Has("all")) {
+            std::sort(others.begin(), others.end());
+            for (const fs::path& file : others) {
+                AddCopy(file.string(), file.lexically_relative(root));
+            }
+        }
+    }
+
+    void AddCopy(const std::string& source, const fs::path& relative)
+    {
+        Copy copy;
+        copy.source = source;
+        copy.destination = (fs::path(m_line.Value("output")) / relative).string();
+        std::error_code error;
+        copy.bytes = fs::file_size(source, error);
+        if (!m_destinations.insert(copy.destination).second) {
+            copy.state = Copy::State::Failed;
+            copy.message = "another file in this batch goes to the same destination";
+        }
+        m_copies.push_back(std::move(copy));
     }
 
     void Add(const std::string& source, const fs::path& relative)
@@ -487,6 +725,7 @@ private:
     std::map<std::string, size_t> m_folded;  // case-folded destination: the latest job with it
     size_t m_finished = 0;
     std::vector<fs::path> m_madeFolders;
+    std::vector<Copy> m_copies;
 };
 
 }  // namespace
@@ -495,7 +734,7 @@ int BatchCommand(const Arguments& arguments)
 {
     CommandLine line("batch", kUsage,
                      {{"output", 'o', true}, {"jobs", 'j', true}, {"recursive", 'r', false}, {"force", 'f', false},
-                      {"dry-run", 0, false}, {"json", 0, false}});
+                      {"dry-run", 0, false}, {"json", 0, false}, {"all", 'a', false}});
     if (const int status = line.Parse(arguments); status >= 0) {
         return status;
     }
@@ -513,7 +752,11 @@ int BatchCommand(const Arguments& arguments)
     batch.Classify();
     if (line.Has("dry-run")) {
         batch.ListPlan();
-        return 0;
+        return batch.SpaceShortfall().empty() ? 0 : 1;
+    }
+    if (const std::string shortfall = batch.SpaceShortfall(); !shortfall.empty()) {
+        std::fprintf(stderr, "tqovix batch: %s: %s\n", line.Value("output").c_str(), shortfall.c_str());
+        return 1;
     }
     std::error_code error;
     fs::create_directories(line.Value("output"), error);
@@ -529,6 +772,7 @@ int BatchCommand(const Arguments& arguments)
     sigaction(SIGINT, &action, nullptr);
     sigaction(SIGTERM, &action, nullptr);
     batch.Run(parallel);
+    batch.RunCopies();
     batch.RemoveEmptyFolders();
     batch.PrintSummary(std::chrono::duration<double>(std::chrono::steady_clock::now() - begun).count());
     if (g_signal != 0) {
