@@ -425,6 +425,23 @@ TEST(CliTest, BatchOverACardsFolders)
     EXPECT_NE(Tool("check " + Q(whole + "/DCIM/100CAM/NEW.MOV")).output.find("already processed"), std::string::npos);
 }
 
+// The summary's columns line up on a terminal whatever script the names are in: an accent
+// takes two bytes and one column, a Japanese character three bytes and two columns.
+TEST(CliTest, SummaryLinesUpNamesOfAnyScript)
+{
+    TempDir dir;
+    std::filesystem::create_directory(dir.File("card"));
+    for (const char* name : {"ABCDEFGH.MOV", "Café.MOV", "日本.MOV"}) {
+        Movie(dir.File(std::string("card/") + name));
+    }
+    const Outcome outcome = Tool("batch -o " + Q(dir.File("out")) + " " + Q(dir.File("card")));
+    ASSERT_EQ(outcome.status, 0) << outcome.output;
+    // ABCDEFGH.MOV takes 12 columns, the other two 8: they get 4 spaces more.
+    for (const char* line : {"/ABCDEFGH.MOV  done ", "/Café.MOV      done ", "/日本.MOV      done "}) {
+        EXPECT_NE(outcome.output.find(line), std::string::npos) << line << "\n" << outcome.output;
+    }
+}
+
 // A volume too small for the card: the batch says what is missing before it writes anything,
 // and a single job says it in megabytes. A small tmpfs stands in for a full card reader's
 // volume (mounting it needs root: skipped otherwise).
@@ -581,9 +598,29 @@ TEST_F(CliLateFileTest, InterruptedBatchIsFinishedByTheNextRun)
         << interrupted.output;
     EXPECT_TRUE(std::filesystem::is_empty(out)) << "no movie, no folder, no partial file";
 
-    const Outcome rerun = Tool("batch -r -o " + Q(out) + " " + Q(card));
+    const Outcome rerun = Tool("batch -r -j 1 -o " + Q(out) + " " + Q(card));  // one after the other
     EXPECT_EQ(rerun.status, 0) << rerun.output;
     EXPECT_NE(rerun.output.find("3 movies: 3 done, 0 skipped, 0 failed"), std::string::npos) << rerun.output;
+}
+
+// On a terminal a batch shows its running jobs and the whole batch while they run, then
+// erases that display before each finished movie's line; elsewhere only those lines.
+TEST_F(CliLateFileTest, BatchShowsItsRunningJobsOnATerminal)
+{
+    if (!testsupport::HaveCommand("script")) {
+        GTEST_SKIP() << "no script command to give the batch a terminal";
+    }
+    TempDir dir;
+    const std::string batch = Q(TQOVIX_TOOL) + " batch -o " + Q(dir.File("out")) + " " + Q(s_samples->File("long.mov"));
+    std::string shown;
+    ASSERT_EQ(testsupport::RunCommand("script -qfec " + Q(batch) + " /dev/null", &shown), 0) << shown;
+    EXPECT_NE(shown.find("  long.mov "), std::string::npos) << shown;
+    EXPECT_NE(shown.find("[0/1] "), std::string::npos) << shown;
+    EXPECT_NE(shown.find("\033[A\033[2K[1/1] " + s_samples->File("long.mov") + ": done"), std::string::npos) << shown;
+    std::filesystem::remove_all(dir.File("out"));
+    const Outcome plain = Tool("batch -o " + Q(dir.File("out")) + " " + Q(s_samples->File("long.mov")));
+    EXPECT_EQ(plain.output.find("[0/1] "), std::string::npos) << plain.output;
+    EXPECT_EQ(plain.output.find('\033'), std::string::npos) << plain.output;
 }
 
 TEST_F(CliLateFileTest, KilledJobLeavesOnlyAPartialFileThatIsClearedLater)

@@ -10,6 +10,7 @@
 #include <fcntl.h>
 #include <filesystem>
 #include <linux/fs.h>
+#include <poll.h>
 #include <sys/ioctl.h>
 #include <sys/statvfs.h>
 #include <map>
@@ -66,6 +67,10 @@ struct Job {
     uint64_t bytes = 0;
     pid_t pid = -1;
     int output = -1;  // read end of the child's standard output
+    int progress = -1;  // read end of its standard error, where it says "progress N%"
+    std::string heard;  // what came from there and did not end a line yet
+    double fraction = 0;
+    std::chrono::steady_clock::time_point started;
     Outcome outcome = Outcome::Pending;
     std::string reason = "none";
     std::string message;
@@ -75,6 +80,38 @@ struct Job {
     size_t caseTwin = kNone;
     static constexpr size_t kNone = static_cast<size_t>(-1);
 };
+
+// Columns a name takes on a terminal: UTF-8 characters, East Asian wide ones two columns,
+// combining marks none (a stray byte counts as one).
+size_t DisplayWidth(const std::string& text)
+{
+    static constexpr std::pair<char32_t, char32_t> kCombining[] = {
+        {0x300, 0x36F}, {0x1AB0, 0x1AFF}, {0x1DC0, 0x1DFF}, {0x20D0, 0x20FF}, {0xFE20, 0xFE2F}};
+    static constexpr std::pair<char32_t, char32_t> kWide[] = {
+        {0x1100, 0x115F}, {0x2E80, 0x303E}, {0x3041, 0x33FF}, {0x3400, 0x4DBF},  {0x4E00, 0x9FFF},
+        {0xA000, 0xA4CF}, {0xAC00, 0xD7A3}, {0xF900, 0xFAFF}, {0xFE30, 0xFE4F},  {0xFF00, 0xFF60},
+        {0xFFE0, 0xFFE6}, {0x1F300, 0x1F64F}, {0x1F900, 0x1F9FF}, {0x20000, 0x3FFFD}};
+    const auto within = [](char32_t c, const auto& ranges) {
+        return std::any_of(std::begin(ranges), std::end(ranges), [c](const auto& r) { return c >= r.first && c <= r.second; });
+    };
+    size_t width = 0;
+    for (size_t i = 0; i < text.size();) {
+        const auto lead = static_cast<unsigned char>(text[i]);
+        const size_t length = lead < 0x80 ? 1 : (lead >> 5) == 0x6 ? 2 : (lead >> 4) == 0xE ? 3 : (lead >> 3) == 0x1E ? 4 : 0;
+        if (length == 0 || i + length > text.size()) {
+            ++width;
+            ++i;
+            continue;
+        }
+        char32_t c = length == 1 ? lead : lead & (0x7F >> length);
+        for (size_t k = 1; k < length; ++k) {
+            c = c << 6 | (static_cast<unsigned char>(text[i + k]) & 0x3F);
+        }
+        width += within(c, kCombining) ? 0 : within(c, kWide) ? 2 : 1;
+        i += length;
+    }
+    return width;
+}
 
 // A file that is not processed but copied as it is (batch --all).
 struct Copy {
@@ -388,22 +425,27 @@ public:
                 }
                 forwarded = true;
             }
+            Listen();
             int status = 0;
-            const pid_t pid = waitpid(-1, &status, 0);
-            if (pid < 0) {
-                if (errno == EINTR) {
-                    continue;  // a signal: forwarded above
+            pid_t pid = 0;
+            while ((pid = waitpid(-1, &status, WNOHANG)) > 0) {
+                for (Job& job : m_jobs) {
+                    if (job.pid == pid && job.outcome == Outcome::Pending) {
+                        Collect(job, status, forwarded);
+                        --running;
+                    }
                 }
+            }
+            if (pid < 0 && errno != EINTR && errno != ECHILD) {
                 break;
             }
-            for (Job& job : m_jobs) {
-                if (job.pid == pid && job.outcome == Outcome::Pending) {
-                    Collect(job, status, forwarded);
-                    --running;
-                }
-            }
+            Draw();
         }
+        Erase();
     }
+
+    // Whether a display of the running jobs is drawn: on a terminal, unless told to be quiet.
+    void SetDrawing(bool drawing) { m_bDrawing = drawing; }
 
     void ListPlan() const
     {
@@ -483,12 +525,15 @@ public:
         }
         size_t nameWidth = 4;
         for (const Job& job : m_jobs) {
-            nameWidth = std::max(nameWidth, job.source.size());
+            nameWidth = std::max(nameWidth, DisplayWidth(job.source));
         }
-        std::printf("\n%-*s  %-7s  %8s  %s\n", static_cast<int>(nameWidth), "file", "result", "seconds", "reason");
+        const auto padded = [nameWidth](const std::string& name) {
+            return name + std::string(nameWidth - DisplayWidth(name), ' ');
+        };
+        std::printf("\n%s  %-11s  %8s  %s\n", padded("file").c_str(), "result", "seconds", "reason");
         for (const Job& job : m_jobs) {
-            std::printf("%-*s  %-7s  %8.2f  %s\n", static_cast<int>(nameWidth), job.source.c_str(),
-                        OutcomeName(job.outcome), job.seconds, job.outcome == Outcome::Done ? "" : job.message.c_str());
+            std::printf("%s  %-11s  %8.2f  %s\n", padded(job.source).c_str(), OutcomeName(job.outcome), job.seconds,
+                        job.outcome == Outcome::Done ? "" : job.message.c_str());
         }
         std::string interrupted;
         if (counts[4] + counts[0] > 0) {
@@ -532,6 +577,94 @@ public:
     }
 
 private:
+    // Waits a moment for the running jobs to say something and keeps their latest progress.
+    void Listen()
+    {
+        std::vector<pollfd> waiting;
+        std::vector<Job*> owners;
+        for (Job& job : m_jobs) {
+            if (job.pid > 0 && job.outcome == Outcome::Pending && job.progress >= 0) {
+                waiting.push_back({job.progress, POLLIN, 0});
+                owners.push_back(&job);
+            }
+        }
+        if (poll(waiting.data(), waiting.size(), kListenMilliseconds) <= 0) {
+            return;
+        }
+        char buffer[1024];
+        for (size_t i = 0; i < waiting.size(); ++i) {
+            ssize_t count = 0;
+            while ((count = read(waiting[i].fd, buffer, sizeof buffer)) > 0) {
+                owners[i]->heard.append(buffer, static_cast<size_t>(count));
+            }
+            std::string& heard = owners[i]->heard;
+            for (size_t end = heard.find('\n'); end != std::string::npos; end = heard.find('\n')) {
+                int percent = 0;
+                if (std::sscanf(heard.c_str(), "progress %d%%", &percent) == 1) {
+                    owners[i]->fraction = std::clamp(percent / 100.0, 0.0, 1.0);
+                }
+                heard.erase(0, end + 1);
+            }
+        }
+    }
+
+    // One line per running job (file, percent, MB/s, time left), then the whole batch's.
+    void Draw()
+    {
+        const auto now = std::chrono::steady_clock::now();
+        if (!m_bDrawing || now - m_drawnAt < std::chrono::milliseconds(kDrawMilliseconds)) {
+            return;
+        }
+        m_drawnAt = now;
+        Erase();
+        double whole = 0;
+        double done = 0;
+        size_t ended = 0;
+        std::string lines;
+        for (const Job& job : m_jobs) {
+            const bool counted = job.outcome == Outcome::Pending || job.outcome == Outcome::Done;
+            whole += counted ? static_cast<double>(job.bytes) : 0;
+            done += job.outcome == Outcome::Done ? static_cast<double>(job.bytes) : 0;
+            ended += job.outcome != Outcome::Pending ? 1 : 0;
+            if (job.pid <= 0 || job.outcome != Outcome::Pending) {
+                continue;
+            }
+            done += job.fraction * static_cast<double>(job.bytes);
+            const double seconds = std::chrono::duration<double>(now - job.started).count();
+            lines += "  " + fs::path(job.source).filename().string() + "  " + Pace(job.fraction, job.fraction * job.bytes, seconds) + "\n";
+            ++m_drawnLines;
+        }
+        const double seconds = std::chrono::duration<double>(now - m_begun).count();
+        const double fraction = whole > 0 ? done / whole : 0;
+        lines += "[" + std::to_string(ended) + "/" + std::to_string(m_jobs.size()) + "] " + SizeText(static_cast<uint64_t>(whole)) +
+                 "  " + Pace(fraction, done, seconds) + "\n";
+        ++m_drawnLines;
+        std::fputs(lines.c_str(), stderr);
+        std::fflush(stderr);
+    }
+
+    // Removes the drawn lines, so that a finished movie's line goes above them.
+    void Erase()
+    {
+        for (; m_drawnLines > 0; --m_drawnLines) {
+            std::fputs("\033[A\033[2K", stderr);
+        }
+    }
+
+    static std::string Pace(double fraction, double bytes, double seconds)
+    {
+        char text[96];
+        const int percent = static_cast<int>(fraction * 100);
+        if (seconds < 0.5 || fraction <= 0) {
+            std::snprintf(text, sizeof text, "%3d%%", percent);
+        } else {
+            const auto left = static_cast<long>(seconds * (1 - fraction) / fraction + 0.5);
+            std::snprintf(text, sizeof text, "%3d%%  %.1f MB/s  %ld:%02ld left", percent, bytes / seconds / 1e6, left / 60,
+                          left % 60);
+        }
+        return text;
+    }
+
     static std::string Row(const Job& job, const char* status)
     {
         return JsonObject()
@@ -664,23 +797,35 @@ private:
         }
         fs::create_directories(fs::path(job.destination).parent_path(), error);
         int ends[2];
+        int said[2];
         if (pipe2(ends, O_CLOEXEC) != 0) {
             return false;
         }
+        if (pipe2(said, O_CLOEXEC | O_NONBLOCK) != 0) {
+            close(ends[0]);
+            close(ends[1]);
+            return false;
+        }
+        std::vector<const char*> argv = {"tqovix", "process", "--json", m_line.Has("force") ? "--force" : "--no-overwrite"};
+        argv.push_back(m_bDrawing ? "--progress" : "--quiet");  // its progress only when there is a display for it
+        argv.insert(argv.end(), {"--", job.source.c_str(), job.destination.c_str(), nullptr});
         job.pid = fork();
         if (job.pid == 0) {
             dup2(ends[1], STDOUT_FILENO);
-            const char* argv[] = {"tqovix", "process", "--quiet", "--json", m_line.Has("force") ? "--force" : "--no-overwrite",
-                                  "--", job.source.c_str(), job.destination.c_str(), nullptr};
-            execv("/proc/self/exe", const_cast<char* const*>(argv));
+            dup2(said[1], STDERR_FILENO);
+            execv("/proc/self/exe", const_cast<char* const*>(argv.data()));
             _exit(127);
         }
         close(ends[1]);
+        close(said[1]);
         if (job.pid < 0) {
             close(ends[0]);
+            close(said[0]);
             return false;
         }
         job.output = ends[0];
+        job.progress = said[0];
+        job.started = std::chrono::steady_clock::now();
         return true;
     }
 
@@ -694,6 +839,8 @@ private:
             json.append(buffer, static_cast<size_t>(std::max<ssize_t>(count, 0)));
         }
         close(job.output);
+        close(job.progress);
+        job.progress = -1;
         job.seconds = std::atof(JsonValue(json, "seconds").c_str());
         const bool ok = WIFEXITED(status) && WEXITSTATUS(status) == 0 && JsonValue(json, "result") == "0";
         std::string message = JsonValue(json, "message");
@@ -714,6 +861,7 @@ private:
         job.reason = reason;
         job.message = message;
         if (!m_line.Quiet() && !m_line.Has("json") && !m_line.Has("dry-run")) {
+            Erase();
             std::fprintf(stderr, "[%zu/%zu] %s: %s\n", ++m_finished, m_jobs.size(), job.source.c_str(),
                          outcome == Outcome::Done ? "done" : (std::string(OutcomeName(outcome)) + ": " + message).c_str());
         }
@@ -726,6 +874,12 @@ private:
     size_t m_finished = 0;
     std::vector<fs::path> m_madeFolders;
     std::vector<Copy> m_copies;
+    bool m_bDrawing = false;
+    size_t m_drawnLines = 0;
+    std::chrono::steady_clock::time_point m_drawnAt{};
+    const std::chrono::steady_clock::time_point m_begun = std::chrono::steady_clock::now();
+    static constexpr int kListenMilliseconds = 100;
+    static constexpr int kDrawMilliseconds = 250;
 };
 
 }  // namespace
@@ -771,6 +925,7 @@ int BatchCommand(const Arguments& arguments)
     sigemptyset(&action.sa_mask);
     sigaction(SIGINT, &action, nullptr);
     sigaction(SIGTERM, &action, nullptr);
+    batch.SetDrawing(isatty(STDERR_FILENO) == 1 && !line.Quiet() && !line.Has("json"));
     batch.Run(parallel);
     batch.RunCopies();
     batch.RemoveEmptyFolders();

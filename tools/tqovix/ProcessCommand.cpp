@@ -28,6 +28,7 @@ constexpr const char* kUsage =
     "  -n, --no-overwrite  refuse an existing DST (the default)\n"
     "  -q, --quiet         no progress and no \"done\" line\n"
     "  --json              print one JSON object with the outcome instead of text\n"
+    "  --progress          progress on stderr with --json too (for a program showing it)\n"
     "  --sync              make DST durable (on the device, not only in the page cache)\n"
     "  DST appears only when complete; a failed or aborted job (Ctrl-C) leaves it as it was.\n"
     "  Without -f, a file that appears at DST while the job runs is kept too, and the job fails.\n"
@@ -136,6 +137,7 @@ struct Options {
     bool quiet = false;
     bool json = false;
     bool sync = false;
+    bool progress = false;  // with --json too
 };
 
 // fsync of the file, then of its directory: the name and the bytes both reach the device.
@@ -205,7 +207,8 @@ void Report(const Options& options, const Verdict& verdict, bool ran, double sec
 int ProcessCommand(const Arguments& arguments)
 {
     CommandLine line("process", kUsage,
-                     {{"force", 'f', false}, {"no-overwrite", 'n', false}, {"json", 0, false}, {"sync", 0, false}});
+                     {{"force", 'f', false}, {"no-overwrite", 'n', false}, {"json", 0, false}, {"sync", 0, false},
+                      {"progress", 0, false}});
     if (const int status = line.Parse(arguments); status >= 0) {
         return status;
     }
@@ -213,7 +216,7 @@ int ProcessCommand(const Arguments& arguments)
         return line.Misuse("SRC and DST are needed");
     }
     Options options{line.Operands()[0], line.Operands()[1], line.Has("force") && !line.Has("no-overwrite"),
-                    line.Quiet(), line.Has("json"), line.Has("sync")};
+                    line.Quiet(), line.Has("json"), line.Has("sync"), line.Has("progress")};
     RemoveStalePartials(options.destination);
     if (const Verdict refusal = CheckDestination(options.source, options.destination, options.force);
         refusal.reason != Reason::None) {
@@ -239,7 +242,7 @@ int ProcessCommand(const Arguments& arguments)
     const std::string& target = partial.empty() ? options.destination : partial;
     const DirectoryEntry before = DestinationEntry(target);
     const auto start = std::chrono::steady_clock::now();
-    ProgressView view(options.quiet || options.json, sourceBytes);
+    ProgressView view(options.quiet || (options.json && !options.progress), sourceBytes);
     int code = TqInitializeOVIX();
     if (code == 0) {
         code = TqExecuteOVIX(options.source.c_str(), target.c_str());
