@@ -10,6 +10,9 @@ set(TQOVIX_PYTHON_DIR lib/python3/dist-packages)
 install(TARGETS TqOVIXUtility OVIX EXPORT TqOVIXUtilityTargets
   LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR})
 install(FILES ${PROJECT_SOURCE_DIR}/src/api/TqOVIXUtility.h DESTINATION ${CMAKE_INSTALL_INCLUDEDIR})
+# The reasons behind failures, loaded by the Python module from beside the library; no host
+# links it, so it comes without a header or a development link.
+install(TARGETS TqOVIXReasons LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR} NAMELINK_SKIP)
 
 if(TARGET tqovix)
   # The tool finds the installed library wherever the prefix is moved.

@@ -4,16 +4,19 @@
     verdict = tqovix_utility.check("clip.mov")       # Verdict(code=0, message='success')
     tqovix_utility.process("clip.mov", "out.mov", progress=lambda percent: True)
 
-process() raises tqovix_utility.Error (with .code, the library's exported result code, and
-.message) when a job is refused, fails or is aborted; the destination's path is then left as
-it was. It never replaces a file at the destination, not even one that appears while the job
-runs (DestinationExists), unless called with overwrite=True. Paths are str, bytes or
-os.PathLike; one with a NUL character raises ValueError. The library runs one job per
-process, so calls from several threads take turns.
+process() raises tqovix_utility.Error when a job is refused, fails or is aborted, with the
+tool's reason: .reason (its stable key, as in the tool's JSON), .message (its words) and
+.code (the exported code the reason stands for); the destination's path is then left as it
+was. It never replaces a file at the destination, not even one that appears while the job
+runs (DestinationExists, a FileExistsError), unless called with overwrite=True. Paths are str,
+bytes or os.PathLike; one with a NUL character raises ValueError. The library runs one job
+per process, so calls from several threads take turns.
 
 The library is looked for, in this order: the file named by $TQOVIX_UTILITY_LIBRARY; beside
 this module and in the library folder of the prefix it is installed in; the newest
-unsanitized build under the source tree's build folder; the system's loader.
+unsanitized build under the source tree's build folder; the system's loader. The reasons
+(libTqOVIXReasons.so.0, the tool's own) are looked for in the file named by
+$TQOVIX_REASONS_LIBRARY, then beside the library that was loaded, then as the library is.
 """
 
 import ctypes
@@ -29,6 +32,10 @@ from typing import Callable, NamedTuple, Optional
 __all__ = ["Error", "DestinationExists", "Verdict", "check", "process", "describe", "library_path"]
 
 _SONAME = "libTqOVIXUtility.so.0"
+_REASONS_SONAME = "libTqOVIXReasons.so.0"
+# Keys, words and paths the reasons may hold are short; longer words are cut, never overrun.
+_KEY_BYTES = 64
+_TEXT_BYTES = 2048
 _POLL_SECONDS = 0.005
 
 _MESSAGES = {
@@ -49,8 +56,6 @@ _MESSAGES = {
 }
 
 ABORTED = 200
-# Codes about the destination rather than the source: the error names the destination.
-_DESTINATION_CODES = (111, 121, 130, 131)
 _PARTIAL_SUFFIX = b".tqovix-partial"
 # Of a long destination name, what the hidden name keeps: room is left for its own suffix and
 # for the one the library adds where it writes under a hidden name itself (255 bytes in all).
@@ -60,16 +65,19 @@ _RENAME_NOREPLACE = 1
 
 
 def describe(code: int) -> str:
-    """The tool's wording for an exported result code."""
+    """What an exported result code means in general; an Error's .message says why."""
     return _MESSAGES.get(code, "unexpected result %d" % code)
 
 
 class Error(Exception):
-    """A job or query that did not succeed: .code is the exported result code, .path the
-    file it is about (the source, or the destination for the destination's problems)."""
+    """A job or query that did not succeed: .reason is the tool's key for why (None only when
+    the library did not start), .message its words, .code the exported code the reason stands
+    for, .path the file it is about (the source, or the destination for its problems)."""
 
-    def __init__(self, code: Optional[int], path: str = "", message: Optional[str] = None):
+    def __init__(self, code: Optional[int], path: str = "", message: Optional[str] = None,
+                 reason: Optional[str] = None):
         self.code = code
+        self.reason = reason
         self.message = describe(code) if message is None else message
         self.path = path
         told = self.message if code is None else "%s (%d)" % (self.message, code)
@@ -80,15 +88,25 @@ class DestinationExists(Error, FileExistsError):
     """process() without overwrite=True found a file at the destination, before or after the
     job; it is left as it was. .code is None: the library was not asked or said success."""
 
-    def __init__(self, path: str):
-        super().__init__(None, path, "the destination exists (use overwrite=True to replace it)")
+    def __init__(self, path: str, detail: Optional[str] = None):
+        words = _reason_words("destination-exists")
+        message = words + ": " + detail if detail else words + " (use overwrite=True to replace it)"
+        super().__init__(None, path, message, "destination-exists")
 
 
-class Verdict(NamedTuple):
-    """The property query's answer: code 0 means a job on the movie will start."""
-
+class _VerdictFields(NamedTuple):
     code: int
     message: str
+
+
+class Verdict(_VerdictFields):
+    """The property query's answer: code 0 means a job on the movie will start. .reason is the
+    tool's key for why not ("none" when it will); compared as the pair (code, message)."""
+
+    def __new__(cls, code: int, message: str, reason: str = "none"):
+        verdict = super().__new__(cls, code, message)
+        verdict.reason = reason
+        return verdict
 
     @property
     def processable(self) -> bool:
@@ -107,30 +125,30 @@ def _sanitized(build: str) -> bool:
         return True
 
 
-def _candidates():
-    named = os.environ.get("TQOVIX_UTILITY_LIBRARY")
+def _candidates(soname: str = _SONAME, variable: str = "TQOVIX_UTILITY_LIBRARY", name: str = "TqOVIXUtility"):
+    named = os.environ.get(variable)
     if named:
         yield named
         return
     here = os.path.dirname(os.path.abspath(__file__))
     # Installed: <prefix>/lib/python3/dist-packages, the library in <prefix>/lib.
     for folder in (here, os.path.join(here, "..", "..")):
-        yield os.path.join(folder, _SONAME)
+        yield os.path.join(folder, soname)
     root = os.path.dirname(here)
     built = []
-    patterns = (os.path.join(root, "build*", "lib", _SONAME), os.path.join(root, "build*", "*", "lib", _SONAME))
+    patterns = (os.path.join(root, "build*", "lib", soname), os.path.join(root, "build*", "*", "lib", soname))
     for library in (found for pattern in patterns for found in glob.glob(pattern)):
         build = os.path.dirname(os.path.dirname(library))
         if not _sanitized(build):
             built.append((os.path.getmtime(library), library))
     for _, library in sorted(built, reverse=True):
         yield library
-    yield ctypes.util.find_library("TqOVIXUtility") or _SONAME
+    yield ctypes.util.find_library(name) or soname
 
 
-def _load():
+def _load(candidates=None):
     tried = []
-    for candidate in _candidates():
+    for candidate in _candidates() if candidates is None else candidates:
         if os.sep in candidate and not os.path.exists(candidate):
             tried.append(candidate)
             continue
@@ -138,7 +156,9 @@ def _load():
             return ctypes.CDLL(candidate), os.path.normpath(candidate) if os.sep in candidate else candidate
         except OSError as error:
             tried.append("%s (%s)" % (candidate, error))
-    raise OSError("libTqOVIXUtility not found; set TQOVIX_UTILITY_LIBRARY. Tried: " + ", ".join(tried))
+    what = "libTqOVIXUtility not found; set TQOVIX_UTILITY_LIBRARY" if candidates is None else \
+        "libTqOVIXReasons not found; set TQOVIX_REASONS_LIBRARY"
+    raise OSError(what + ". Tried: " + ", ".join(tried))
 
 
 _lock = threading.Lock()
@@ -165,6 +185,60 @@ def _api():
             function.argtypes = arguments
         _library, _library_path = library, path
     return _library
+
+
+_reasons = None
+
+
+def _reasons_candidates():
+    if os.environ.get("TQOVIX_REASONS_LIBRARY"):
+        yield os.environ["TQOVIX_REASONS_LIBRARY"]
+        return
+    # The one built or installed with the library loaded: their reasons and codes agree.
+    _api()
+    if os.sep in _library_path:
+        yield os.path.join(os.path.dirname(_library_path), _REASONS_SONAME)
+    yield from _candidates(_REASONS_SONAME, "TQOVIX_REASONS_LIBRARY", "TqOVIXReasons")
+
+
+def _reasons_api():
+    global _reasons
+    if _reasons is None:
+        library, _ = _load(_reasons_candidates())
+        words = [ctypes.c_char_p, ctypes.c_size_t, ctypes.c_char_p, ctypes.c_size_t]
+        for name, arguments in (
+            ("TqovixExplain", [ctypes.c_int, ctypes.c_char_p, ctypes.c_char_p] + words),
+            ("TqovixCheckDestination", [ctypes.c_char_p, ctypes.c_char_p, ctypes.c_int] + words),
+            ("TqovixReasonWords", [ctypes.c_char_p, ctypes.c_char_p, ctypes.c_size_t]),
+            ("TqovixAboutDestination", [ctypes.c_char_p]),
+        ):
+            function = getattr(library, name)
+            function.restype = ctypes.c_int
+            function.argtypes = arguments
+        _reasons = library
+    return _reasons
+
+
+def _asked(function, *arguments):
+    """(code, key, words) from one of the reasons' functions that fill a key and words."""
+    key = ctypes.create_string_buffer(_KEY_BYTES)
+    text = ctypes.create_string_buffer(_TEXT_BYTES)
+    code = function(*arguments, key, _KEY_BYTES, text, _TEXT_BYTES)
+    return code, key.value.decode("utf-8", "replace"), text.value.decode("utf-8", "replace")
+
+
+def _failure(code: int, source: bytes, destination: Optional[bytes]) -> Error:
+    """The library's answer code for a job (destination None: a query) as the tool explains it."""
+    reasons = _reasons_api()
+    result, key, words = _asked(reasons.TqovixExplain, code, source, destination)
+    about = destination is not None and reasons.TqovixAboutDestination(key.encode()) == 1
+    return Error(result, os.fsdecode(destination if about else source), words, key)
+
+
+def _reason_words(key: str) -> str:
+    text = ctypes.create_string_buffer(_TEXT_BYTES)
+    _reasons_api().TqovixReasonWords(key.encode(), text, _TEXT_BYTES)
+    return text.value.decode("utf-8", "replace")
 
 
 def library_path() -> str:
@@ -234,23 +308,6 @@ def _publish_without_replacing(hidden: bytes, destination: bytes) -> None:
     os.unlink(hidden)
 
 
-def _about_destination(code: int, source: bytes, destination: bytes) -> Optional[str]:
-    """For a failure the library reports with a general code: the destination's words when
-    the fault is its folder's, else None."""
-    if not os.path.isfile(source) or not os.access(source, os.R_OK):
-        return None
-    if os.path.exists(destination) and os.path.samefile(source, destination):
-        return "source and destination are the same file"
-    if os.path.isdir(destination):
-        return "the destination is a directory"
-    folder = os.path.dirname(destination) or b"."
-    if not os.path.isdir(folder):
-        return describe(111)
-    if not os.access(folder, os.W_OK | os.X_OK):
-        return describe(121)
-    return None
-
-
 class _Session:
     """One initialised engine, closed on leaving; closing stops a job still running."""
 
@@ -270,9 +327,14 @@ class _Session:
 
 def check(path) -> Verdict:
     """Whether a job on the movie at path will start, and if not, why."""
-    with _lock, _Session() as api:
-        code = api.TqGetPropertyOVIX(_encode(path))
-    return Verdict(code, describe(code))
+    encoded = _encode(path)
+    with _lock:
+        with _Session() as api:
+            code = api.TqGetPropertyOVIX(encoded)
+        if code == 0:
+            return Verdict(0, "success")
+        error = _failure(code, encoded, None)
+    return Verdict(code, error.message, error.reason)
 
 
 def process(source, destination, progress: Optional[Callable[[int], object]] = None, *,
@@ -287,8 +349,13 @@ def process(source, destination, progress: Optional[Callable[[int], object]] = N
     """
     source_path, destination_path = _encode(source), _encode(destination)
     named = os.fsdecode(destination_path)
-    if not overwrite and os.path.lexists(destination_path) and not os.path.isdir(destination_path):
+    with _lock:
+        refused, key, words = _asked(_reasons_api().TqovixCheckDestination, source_path, destination_path,
+                                     1 if overwrite else 0)
+    if key == "destination-exists":
         raise DestinationExists(named)
+    if key != "none":
+        raise Error(refused, named, words, key)
     state = {"last": -1, "raised": None}
 
     def notify(done: int, total: int) -> int:
@@ -311,7 +378,7 @@ def process(source, destination, progress: Optional[Callable[[int], object]] = N
         with _lock:
             # The library's own publishing replaces a file that appeared meanwhile: when that
             # is not wanted, the job writes a hidden name, given its own name below only if free.
-            if not overwrite and not os.path.isdir(destination_path):
+            if not overwrite:
                 hidden = _reserve_partial(destination_path)
             with _Session() as api:
                 if progress is not None:
@@ -329,17 +396,15 @@ def process(source, destination, progress: Optional[Callable[[int], object]] = N
             if state["raised"] is not None:
                 raise state["raised"]
             if code != 1:
-                if code in _DESTINATION_CODES:
-                    raise Error(code, named)
-                words = _about_destination(code, source_path, destination_path)
-                raise Error(code, os.fsdecode(source_path) if words is None else named, words)
+                raise _failure(code, source_path, destination_path)
             if hidden is not None:
                 try:
                     _publish_without_replacing(hidden, destination_path)
                 except FileExistsError:
-                    raise DestinationExists(named) from None
+                    raise DestinationExists(named, "it appeared while the job ran") from None
                 except OSError as error:
-                    raise Error(190, named, "the destination could not be written: " + error.strerror) from None
+                    raise Error(190, named, _reason_words("write-failed") + ": " + error.strerror,
+                                "write-failed") from None
                 hidden = None
     finally:
         if hidden is not None:

@@ -4,6 +4,7 @@ Run by ctest with TQOVIX_UTILITY_LIBRARY and TQOVIX_TOOL naming the built librar
 exits 77 (skipped) when the library is built with a sanitizer.
 """
 
+import json
 import os
 import pathlib
 import shutil
@@ -73,26 +74,6 @@ class ModuleTest(unittest.TestCase):
                 self.assertEqual(verdict.code, code)
                 told = subprocess.run([TOOL, "check", path], capture_output=True, text=True).stdout
                 self.assertEqual(told.strip(), "%s: not processable: %s" % (path, verdict.message))
-
-    def test_refusals_raise_with_the_exported_code_and_leave_no_destination(self):
-        processed = self.path("processed.mov")
-        tqovix_utility.process(self.pcm, processed)
-        text = self.path("notes.txt")
-        with open(text, "w") as notes:
-            notes.write("not a movie\n")
-        rows = (
-            ("already processed", processed, self.path("again.mov"), 20),
-            ("source missing", self.path("missing.mov"), self.path("a.mov"), 110),
-            ("destination folder missing", self.pcm, self.path("no/such/folder.mov"), 111),
-            ("not a movie", text, self.path("b.mov"), 8),
-        )
-        for name, source, destination, code in rows:
-            with self.subTest(name):
-                with self.assertRaises(tqovix_utility.Error) as raised:
-                    tqovix_utility.process(source, destination)
-                self.assertEqual(raised.exception.code, code)
-                self.assertEqual(raised.exception.message, tqovix_utility.describe(code))
-                self.assertFalse(os.path.exists(destination))
 
     def test_callback_answering_false_aborts_with_200_and_keeps_the_destination(self):
         destination = self.path("kept.mov")
@@ -218,6 +199,117 @@ class ModuleTest(unittest.TestCase):
         with self.assertRaises(tqovix_utility.Error) as raised:
             tqovix_utility.process(self.pcm, self.pcm, overwrite=True)
         self.assertEqual(raised.exception.message, "source and destination are the same file")
+
+    def tool_process_json(self, source, destination):
+        told = subprocess.run([TOOL, "process", "--json", "-q", source, destination], capture_output=True, text=True)
+        return json.loads(told.stdout)
+
+    def test_every_reason_is_worded_as_the_tool_words_it(self):
+        # Each row makes (source, destination) in a folder of its own; both hosts are asked about
+        # the same files, and each leaves them as they were.
+        def missing(folder):
+            return os.path.join(folder, "missing.mov"), os.path.join(folder, "out.mov")
+
+        def folder_source(folder):
+            os.mkdir(os.path.join(folder, "clips.mov"))
+            return os.path.join(folder, "clips.mov"), os.path.join(folder, "out.mov")
+
+        def same_file(folder):
+            shutil.copy(self.pcm, os.path.join(folder, "in.mov"))
+            return os.path.join(folder, "in.mov"), os.path.join(folder, "in.mov")
+
+        def folder_destination(folder):
+            os.mkdir(os.path.join(folder, "out"))
+            return self.pcm, os.path.join(folder, "out")
+
+        def no_directory(folder):
+            return self.pcm, os.path.join(folder, "absent", "out.mov")
+
+        def read_only(folder):
+            os.mkdir(os.path.join(folder, "locked"), 0o500)
+            return self.pcm, os.path.join(folder, "locked", "out.mov")
+
+        def existing(folder):
+            with open(os.path.join(folder, "out.mov"), "wb") as theirs:
+                theirs.write(b"theirs")
+            return self.pcm, os.path.join(folder, "out.mov")
+
+        def written(name, content):
+            def make(folder):
+                with open(os.path.join(folder, name), "wb") as made:
+                    made.write(content(folder))
+                return os.path.join(folder, name), os.path.join(folder, "out.mov")
+            return make
+
+        def sample_bytes():
+            with open(self.pcm, "rb") as sample:
+                return bytearray(sample.read())
+
+        def wrong_brand(folder):
+            data = sample_bytes()
+            self.assertEqual(data[4:8], b"ftyp")
+            data[8:12] = b"isom"
+            return bytes(data)
+
+        def without_af(folder):
+            data = sample_bytes()
+            self.assertEqual(data.count(b"OP01"), 1)
+            return bytes(data.replace(b"OP01", b"XP01"))
+
+        def processed(folder):
+            tqovix_utility.process(self.pcm, os.path.join(folder, "made.mov"))
+            with open(os.path.join(folder, "made.mov"), "rb") as made:
+                return made.read()
+
+        rows = (
+            ("missing source", missing, "source-missing", 110),
+            ("folder source", folder_source, "source-is-directory", 190),
+            ("same file", same_file, "same-file", 190),
+            ("destination is a folder", folder_destination, "destination-is-directory", 190),
+            ("destination directory missing", no_directory, "destination-directory-missing", 111),
+            ("read-only destination", read_only, "destination-access-denied", 121),
+            ("existing destination", existing, "destination-exists", None),
+            ("not a movie", written("notes.mov", lambda folder: b"not a movie at all\n"), "not-a-movie", 8),
+            ("wrong brand", written("isom.mov", wrong_brand), "wrong-brand", 8),
+            ("truncated", written("cut.mov", lambda folder: bytes(sample_bytes()[:300000])), "truncated", 8),
+            ("already processed", written("again.mov", processed), "already-processed", 20),
+            ("no AF information", written("plain.mov", without_af), "no-af-information", 8),
+        )
+        for name, make, key, code in rows:
+            with self.subTest(name):
+                if key == "destination-access-denied" and os.geteuid() == 0:
+                    self.skipTest("root writes a read-only folder")
+                folder = tempfile.mkdtemp(dir=self.folder)
+                source, destination = make(folder)
+                before = sorted(os.listdir(folder))
+                told = self.tool_process_json(source, destination)
+                self.assertEqual((told["reason"], told["result"]), (key, code), told)
+                with self.assertRaises(tqovix_utility.Error) as raised:
+                    tqovix_utility.process(source, destination)
+                error = raised.exception
+                self.assertEqual((error.reason, error.code), (key, code))
+                if key == "destination-exists":
+                    # The words are one; each host names its own way of replacing.
+                    self.assertIsInstance(error, FileExistsError)
+                    self.assertEqual(error.message, told["message"].replace("--force", "overwrite=True"))
+                else:
+                    self.assertEqual(error.message, told["message"])
+                about_destination = key.startswith("destination-") or key == "same-file"
+                self.assertEqual(error.path, destination if about_destination else source)
+                self.assertEqual(sorted(os.listdir(folder)), before)
+
+    def test_check_gives_the_reason_with_its_words(self):
+        with open(self.path("notes.mov"), "w") as notes:
+            notes.write("not a movie\n")
+        for path, code, key in ((self.pcm, 0, "none"), (self.path("notes.mov"), 8, "not-a-movie"),
+                                (self.folder, 190, "source-is-directory")):
+            with self.subTest(key):
+                verdict = tqovix_utility.check(path)
+                self.assertEqual((verdict.code, verdict.reason), (code, key))
+                told = subprocess.run([TOOL, "check", "--json", path], capture_output=True, text=True).stdout
+                row = json.loads(told)["files"][0]
+                self.assertEqual((row["code"], row["reason"]), (code, key))
+                self.assertEqual(verdict.message, row["message"] or "success")
 
 
 if __name__ == "__main__":

@@ -155,26 +155,27 @@ struct ReasonCase {
     void (*make)(const TempDir& dir, const std::string& path);
     std::string text;
     const char* key;
+    int result;  // process --json's: the reason's code, whatever the library answered
 };
 void PrintTo(const ReasonCase& row, std::ostream* out) { *out << row.name; }
 
 void WriteText(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
 
 const ReasonCase kReasons[] = {
-    {"SourceMissing", [](const TempDir&, const std::string&) {}, "file not found", "source-missing"},
+    {"SourceMissing", [](const TempDir&, const std::string&) {}, "file not found", "source-missing", 110},
     {"SourceIsDirectory", [](const TempDir&, const std::string& path) { std::filesystem::create_directory(path); },
-     "the source is a directory", "source-is-directory"},
-    {"EmptyFile", [](const TempDir&, const std::string& path) { WriteText(path, ""); }, "empty file", "empty-file"},
+     "the source is a directory", "source-is-directory", 190},
+    {"EmptyFile", [](const TempDir&, const std::string& path) { WriteText(path, ""); }, "empty file", "empty-file", 8},
     {"NotAMovie", [](const TempDir&, const std::string& path) { WriteText(path, "not a movie at all\n"); },
-     "not a QuickTime/ISO movie", "not-a-movie"},
+     "not a QuickTime/ISO movie", "not-a-movie", 8},
     {"WrongBrand", [](const TempDir&, const std::string& path) { Movie(path, ForeignBrand); },
-     "not a camera movie (brand 'isom')", "wrong-brand"},
+     "not a camera movie (brand 'isom')", "wrong-brand", 8},
     {"Truncated",
      [](const TempDir&, const std::string& path) {
          Movie(path);
          std::filesystem::resize_file(path, 300'000);  // a copy broken off
      },
-     "truncated: 300.0 of ", "truncated"},
+     "truncated: 300.0 of ", "truncated", 8},
     {"MalformedAtom",
      [](const TempDir&, const std::string& path) {
          Movie(path);
@@ -183,18 +184,18 @@ const ReasonCase kReasons[] = {
          testsupport::PutBE32(bytes, static_cast<size_t>(header - bytes.begin()) - 4, 4);  // smaller than a header
          testsupport::WriteFile(path, bytes);
      },
-     "malformed atom: 'mvhd' at offset ", "malformed-atom"},
+     "malformed atom: 'mvhd' at offset ", "malformed-atom", 8},
     {"NoSoundTrack", [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.sound.present = false; }); },
-     "no sound track", "no-sound-track"},
+     "no sound track", "no-sound-track", 8},
     {"UnsupportedSound",
      [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.sound.channels = 10; }); },
-     "unsupported sound: sound has 10 channels; 1 to 8 are processed", "unsupported-sound"},
+     "unsupported sound: sound has 10 channels; 1 to 8 are processed", "unsupported-sound", 8},
     {"NoAFInformation",
      [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.maker.afInformation = false; }); },
-     "no AF information", "no-af-information"},
+     "no AF information", "no-af-information", 8},
     {"AlreadyProcessed",
      [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.maker.afProcessed = true; }); },
-     "already processed", "already-processed"},
+     "already processed", "already-processed", 20},
 };
 
 class CliReasonTest : public ::testing::TestWithParam<ReasonCase> {};
@@ -212,6 +213,7 @@ TEST_P(CliReasonTest, EveryCommandGivesTheSameReason)
     EXPECT_EQ(process.status, 1);
     EXPECT_NE(process.output.find("\"message\":\"" + row.text), std::string::npos) << process.output;
     EXPECT_NE(process.output.find(std::string("\"reason\":\"") + row.key + "\""), std::string::npos) << process.output;
+    EXPECT_NE(process.output.find("\"result\":" + std::to_string(row.result) + ","), std::string::npos) << process.output;
     EXPECT_FALSE(Exists(dir.File("out.mov")));
     const Outcome inspect = Tool("inspect " + Q(source));
     if (row.text == "already processed") {
@@ -256,6 +258,56 @@ TEST(CliTest, DestinationReasons)
     EXPECT_EQ(HiddenFiles(dir.Path()), std::vector<std::string>{});
 }
 
+// process --json answers each destination reason with that reason's code, also where the
+// library's own answer is another (130 for a volume that takes no files) or it was never asked.
+struct DestinationJsonCase {
+    const char* name;
+    const char* destination;  // under the test's folder; "{SRC}" is the source itself
+    const char* key;
+    int result;
+};
+void PrintTo(const DestinationJsonCase& row, std::ostream* out) { *out << row.name; }
+
+class CliDestinationJsonTest : public ::testing::TestWithParam<DestinationJsonCase> {};
+
+TEST_P(CliDestinationJsonTest, ResultIsTheReasonsCode)
+{
+    const DestinationJsonCase& row = GetParam();
+    if (std::string(row.destination).starts_with("locked/") && geteuid() == 0) {
+        GTEST_SKIP() << "root writes a read-only folder";
+    }
+    TempDir dir;
+    const std::string source = Movie(dir.File("in.mov"));
+    std::filesystem::create_directory(dir.File("folder"));
+    std::filesystem::create_directory(dir.File("locked"));
+    std::filesystem::permissions(dir.File("locked"), std::filesystem::perms::owner_read | std::filesystem::perms::owner_exec);
+    const std::string named = row.destination;
+    const std::string destination = named == "{SRC}" ? source : named.starts_with("/") ? named : dir.File(named);
+    const Outcome process = Tool("process --json -f " + Q(source) + " " + Q(destination));
+    std::filesystem::permissions(dir.File("locked"), std::filesystem::perms::owner_all);
+    EXPECT_EQ(process.status, 1) << process.output;
+    EXPECT_NE(process.output.find(std::string("\"reason\":\"") + row.key + "\""), std::string::npos) << process.output;
+    EXPECT_NE(process.output.find("\"result\":" + std::to_string(row.result) + ","), std::string::npos)
+        << process.output;
+    if (named != "{SRC}" && named != "folder") {
+        EXPECT_FALSE(Exists(destination));
+    }
+}
+
+const DestinationJsonCase kDestinationJson[] = {
+    {"ReadOnlyFolder", "locked/out.mov", "destination-access-denied", 121},
+    // No room measured there, so the library says 130; root cannot write there either.
+    {"SystemFolder", "/proc/tqovix-out.mov", "destination-access-denied", 121},
+    {"FolderMissing", "absent/out.mov", "destination-directory-missing", 111},
+    {"IsAFolder", "folder", "destination-is-directory", 190},
+    {"SameFile", "{SRC}", "same-file", 190},
+};
+
+INSTANTIATE_TEST_SUITE_P(Rows, CliDestinationJsonTest, ::testing::ValuesIn(kDestinationJson),
+                         [](const ::testing::TestParamInfo<DestinationJsonCase>& info) {
+                             return std::string(info.param.name);
+                         });
+
 // A FIFO nobody writes and a device are refused at once by check, process and batch, never
 // waited on: each run is ended by `timeout` (status 124) if it blocks.
 TEST(CliTest, NotRegularFilesAreRefusedAtOnce)
@@ -294,7 +346,7 @@ TEST(CliTest, JsonReports)
     const std::pair<std::string, std::vector<std::string>> rows[] = {
         {"check --json " + Q(source), {"\"processable\":true", "\"reason\":\"none\""}},
         {"process --json " + Q(source) + " " + Q(destination),
-         {"\"result\":0,", "\"reason\":\"none\"", "\"message\":\"done\"", "\"seconds\":"}},
+         {"\"result\":0,", "\"reason\":\"none\"", "\"message\":\"done\"", "\"libraryResult\":0,", "\"seconds\":"}},
         {"process --json " + Q(source) + " " + Q(destination),
          {"\"result\":null", "\"reason\":\"destination-exists\""}},
         {"inspect --json " + Q(destination),

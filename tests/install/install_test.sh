@@ -20,16 +20,19 @@ awk '/^```c$/ { inside = 1; next } /^```$/ && inside { exit } inside' "$here/../
 
 cmake --install "$build" --prefix "$prefix" >"$work/install.log" || { cat "$work/install.log"; fail "cmake --install"; }
 
-# Exactly the public pieces: one header, the two libraries and the version links.
+# Exactly the public pieces: one header, the two libraries and the version links, and the
+# reasons for the Python module (no development link: no host links them).
 headers=$(cd "$prefix/include" && find . -type f | sort | tr '\n' ' ')
 [ "$headers" = "./TqOVIXUtility.h " ] || fail "installed headers: $headers"
 pc=$(find "$prefix" -name TqOVIXUtility.pc)
 [ -n "$pc" ] || fail "no TqOVIXUtility.pc"
 libdir=$(dirname "$(dirname "$pc")")
 libraries=$(cd "$libdir" && find . -maxdepth 1 ! -type d | sort | tr '\n' ' ')
-expected="./libOVIX.so ./libTqOVIXUtility.so ./libTqOVIXUtility.so.0 ./libTqOVIXUtility.so.0.1.0 "
+expected="./libOVIX.so ./libTqOVIXReasons.so.0 ./libTqOVIXReasons.so.0.1.0 ./libTqOVIXUtility.so ./libTqOVIXUtility.so.0 ./libTqOVIXUtility.so.0.1.0 "
 [ "$libraries" = "$expected" ] || fail "installed libraries: $libraries"
 readelf -d "$libdir/libTqOVIXUtility.so.0.1.0" | grep -q 'SONAME.*\[libTqOVIXUtility\.so\.0\]' || fail "SONAME"
+[ "$(realpath "$(pkg-config --variable=reasonslibrary "$pc")")" = "$(realpath "$libdir/libTqOVIXReasons.so.0")" ] \
+    || fail "pkg-config's reasonslibrary: $(pkg-config --variable=reasonslibrary "$pc")"
 [ -f "$prefix/share/man/man1/tqovix.1" ] || fail "no manual page"
 
 flags=""
@@ -55,7 +58,7 @@ esac
 
 unset TQOVIX_UTILITY_LIBRARY LD_LIBRARY_PATH
 # The run paths lead to the installed libraries, never back into the build tree.
-for binary in "$prefix/bin/tqovix" "$libdir/libTqOVIXUtility.so.0"; do
+for binary in "$prefix/bin/tqovix" "$libdir/libTqOVIXUtility.so.0" "$libdir/libTqOVIXReasons.so.0"; do
     for loaded in $(ldd "$binary" | awk '/lib(TqOVIXUtility|OVIX)\.so/ { print $3 }'); do
         [ "$(dirname "$(realpath "$loaded")")" = "$(realpath "$libdir")" ] || fail "$binary loads $loaded"
     done
@@ -83,6 +86,9 @@ import tqovix_utility
 prefix, processed = sys.argv[1], sys.argv[2]
 loaded = os.path.realpath(tqovix_utility.library_path())
 assert loaded.startswith(os.path.realpath(prefix) + os.sep), loaded
-assert tqovix_utility.check(processed) == (20, "already processed"), tqovix_utility.check(processed)
+verdict = tqovix_utility.check(processed)
+assert verdict == (20, "already processed") and verdict.reason == "already-processed", (verdict, verdict.reason)
+reasons = [line for line in open("/proc/self/maps") if "libTqOVIXReasons" in line]
+assert reasons and all(os.path.realpath(prefix) in line for line in reasons), reasons
 EOF
 echo "installed, built twice and ran"

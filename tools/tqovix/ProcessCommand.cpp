@@ -192,12 +192,18 @@ void Report(const Options& options, const Verdict& verdict, bool ran, double sec
 {
     JsonObject report = JsonObject::Report();
     report.Add("source", options.source).Add("destination", options.destination);
-    if (ran && verdict.code >= 0) {
-        report.Add("result", verdict.code);
+    // The reason's code, as every host reports it; what the library itself said comes beside.
+    if (verdict.Result() >= 0) {
+        report.Add("result", verdict.Result());
     } else {
         report.AddNull("result");  // refused by the tool, before or after the library's job
     }
     report.Add("reason", verdict.Key()).Add("message", verdict.reason == Reason::None ? "done" : verdict.text);
+    if (ran && verdict.code >= 0) {
+        report.Add("libraryResult", verdict.code);
+    } else {
+        report.AddNull("libraryResult");
+    }
     report.Add("seconds", seconds);
     std::printf("%s\n", report.Text().c_str());
 }

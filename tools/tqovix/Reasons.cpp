@@ -147,7 +147,7 @@ const std::vector<ReasonRow>& ReasonTable()
         {Reason::DestinationDirectoryMissing, "destination-directory-missing", 111,
          "the destination's directory does not exist"},
         {Reason::DestinationAccessDenied, "destination-access-denied", 121, "cannot write the destination"},
-        {Reason::DestinationExists, "destination-exists", -1, "the destination exists (use --force to replace it)"},
+        {Reason::DestinationExists, "destination-exists", -1, "the destination exists"},
         {Reason::EmptyFile, "empty-file", 8, "empty file"},
         {Reason::NotAMovie, "not-a-movie", 8, "not a QuickTime/ISO movie"},
         {Reason::WrongBrand, "wrong-brand", 8, "not a camera movie (brand '{}')"},
@@ -188,6 +188,8 @@ bool AboutDestination(Reason reason)
 
 const char* Verdict::Key() const { return Row(reason).key; }
 
+int Verdict::Result() const { return reason == Reason::None || reason == Reason::Internal ? code : Row(reason).code; }
+
 Verdict MakeVerdict(int code, Reason reason, const std::string& detail)
 {
     Verdict verdict{code, reason, Row(reason).words};
@@ -200,7 +202,7 @@ Verdict MakeVerdict(int code, Reason reason, const std::string& detail)
     return verdict;
 }
 
-Verdict CheckDestination(const std::string& source, const std::string& destination, bool replace)
+Verdict DestinationVerdict(const std::string& source, const std::string& destination, bool replace)
 {
     struct stat status {};
     if (stat(destination.c_str(), &status) == 0) {
@@ -216,6 +218,15 @@ Verdict CheckDestination(const std::string& source, const std::string& destinati
     // A dangling link is a name taken too.
     const bool taken = lstat(destination.c_str(), &status) == 0;
     return taken && !replace ? MakeVerdict(-1, Reason::DestinationExists) : Verdict{};
+}
+
+Verdict CheckDestination(const std::string& source, const std::string& destination, bool replace)
+{
+    Verdict verdict = DestinationVerdict(source, destination, replace);
+    if (verdict.reason == Reason::DestinationExists) {
+        verdict.text += " (use --force to replace it)";
+    }
+    return verdict;
 }
 
 Verdict Explain(int code, const std::string& source, const std::string& destination)
@@ -263,8 +274,16 @@ Verdict Explain(int code, const std::string& source, const std::string& destinat
         }
         if (code == 130) {
             struct statvfs volume {};
-            const unsigned long long free =
-                statvfs(directory.c_str(), &volume) == 0 ? 1ULL * volume.f_bavail * volume.f_frsize : 0;
+            const bool measured = statvfs(directory.c_str(), &volume) == 0;
+            // The library measures the room before it writes: a volume that takes no files
+            // (mounted read-only, or a system one such as /proc) has none, and that is its fault.
+            if (measured && (volume.f_flag & ST_RDONLY) != 0) {
+                return MakeVerdict(code, Reason::DestinationAccessDenied, std::strerror(EROFS));
+            }
+            if (measured && volume.f_blocks == 0) {
+                return MakeVerdict(code, Reason::DestinationAccessDenied, "its volume stores no files");
+            }
+            const unsigned long long free = measured ? 1ULL * volume.f_bavail * volume.f_frsize : 0;
             const auto needed = static_cast<uint64_t>(sourceStatus.st_size);
             return MakeVerdict(code, Reason::NoSpace,
                                "about " + SizeText(needed) + " needed, " + SizeText(free) + " free (" +

@@ -56,6 +56,10 @@ struct Verdict {
     Reason reason = Reason::None;
     std::string text;  // for people; empty when nothing is wrong
     const char* Key() const;
+    // The exported code the reason stands for (its row's), which hosts report: the library
+    // answers 130 for a folder it may not write, and 8 for a processed movie at a job's
+    // start. An internal error keeps the library's code; -1 when the tool refused by itself.
+    int Result() const;
 };
 
 Verdict MakeVerdict(int code, Reason reason, const std::string& detail = {});
@@ -66,4 +70,6 @@ Verdict Explain(int code, const std::string& source, const std::string& destinat
 bool AboutDestination(Reason reason);
 // Whether a job may write `destination`: not the source itself, not a directory, and not a
 // file that stands there unless `replace`.
+Verdict DestinationVerdict(const std::string& source, const std::string& destination, bool replace);
+// The same, worded for this tool: an existing destination says how to replace it.
 Verdict CheckDestination(const std::string& source, const std::string& destination, bool replace);
