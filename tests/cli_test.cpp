@@ -58,6 +58,8 @@ std::string Movie(const std::string& path, void (*edit)(Recipe&) = nullptr)
     return path;
 }
 
+void WriteText(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
+
 void ForeignBrand(Recipe& recipe) { recipe.majorBrand = "isom"; recipe.compatibleBrands = {"isom"}; }
 
 class CliCommandTest : public ::testing::TestWithParam<const char*> {};
@@ -91,6 +93,54 @@ TEST(CliTest, VersionAndUsageErrors)
     EXPECT_EQ(Tool("process only-one-path").status, 2);
     EXPECT_EQ(Tool("no-such-command").status, 2);
     EXPECT_EQ(Tool("make-sample x.mov --aac --little-endian").status, 2);
+}
+
+// A usage error is one line, naming what was likely meant; "help CMD" is CMD's own help.
+TEST(CliTest, UsageErrorsSuggestWhatWasMeant)
+{
+    const std::pair<std::string, std::string> rows[] = {
+        {"proces a b", "unknown command 'proces'; did you mean 'process'?"},
+        {"inpsect a", "did you mean 'inspect'?"},
+        {"batch --dryrun -o out a", "unknown option '--dryrun'; did you mean '--dry-run'?"},
+        {"check -json a", "unknown option '-json'; did you mean '--json'?"},
+        {"compare --pn x a b", "did you mean '--png'?"},
+        {"process -z a b", "unknown option '-z' ("},
+        {"--jsn check a", "did you mean '--json'"},
+        {"help nosuch", "unknown command 'nosuch' ("},
+        {"process a", "SRC and DST are needed"},
+    };
+    for (const auto& [arguments, said] : rows) {
+        const Outcome outcome = Tool(arguments);
+        EXPECT_EQ(outcome.status, 2) << arguments;
+        EXPECT_NE(outcome.output.find(said), std::string::npos) << arguments << "\n" << outcome.output;
+        EXPECT_EQ(std::ranges::count(outcome.output, '\n'), 1) << arguments << "\n" << outcome.output;
+    }
+    EXPECT_EQ(Tool("help make-sample").output, Tool("make-sample --help").output);
+    EXPECT_NE(Tool("help").output.find("usage: tqovix COMMAND"), std::string::npos);
+}
+
+// -q, before the command or after it: a run that succeeds says nothing, one that fails says why.
+TEST(CliTest, QuietRunsSayOnlyWhatWentWrong)
+{
+    TempDir dir;
+    const std::string movie = dir.File("in.mov");
+    const std::string text = dir.File("notes.txt");
+    WriteText(text, "notes\n");
+    const std::pair<std::string, int> rows[] = {
+        {"-q make-sample --seconds 2 " + Q(movie), 0},
+        {"make-sample -q --seconds 2 " + Q(dir.File("second.mov")), 0},
+        {"-q check " + Q(movie), 0},
+        {"--quiet process " + Q(movie) + " " + Q(dir.File("out.mov")), 0},
+        {"-q compare " + Q(movie) + " " + Q(dir.File("out.mov")), 0},
+    };
+    for (const auto& [arguments, status] : rows) {
+        const Outcome outcome = Tool(arguments);
+        EXPECT_EQ(outcome.status, status) << arguments << "\n" << outcome.output;
+        EXPECT_EQ(outcome.output, "") << arguments;
+    }
+    const Outcome refused = Tool("-q check " + Q(movie) + " " + Q(text));
+    EXPECT_EQ(refused.status, 1);
+    EXPECT_EQ(refused.output, text + ": not processable: not a QuickTime/ISO movie\n");
 }
 
 // Every spelling people use for options, and the ones refused as usage errors.
@@ -158,7 +208,6 @@ struct ReasonCase {
 };
 void PrintTo(const ReasonCase& row, std::ostream* out) { *out << row.name; }
 
-void WriteText(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
 
 const ReasonCase kReasons[] = {
     {"SourceMissing", [](const TempDir&, const std::string&) {}, "file not found", "source-missing"},
@@ -192,6 +241,9 @@ const ReasonCase kReasons[] = {
     {"NoAFInformation",
      [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.maker.afInformation = false; }); },
      "no AF information", "no-af-information"},
+    {"AFInformationUnusable",
+     [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.maker.afPayload = moviekit::Bytes{'A', 'F'}; }); },
+     "the processing library cannot use the AF information", "af-information-unusable"},
     {"AlreadyProcessed",
      [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.maker.afProcessed = true; }); },
      "already processed", "already-processed"},
@@ -213,6 +265,10 @@ TEST_P(CliReasonTest, EveryCommandGivesTheSameReason)
     EXPECT_NE(process.output.find("\"message\":\"" + row.text), std::string::npos) << process.output;
     EXPECT_NE(process.output.find(std::string("\"reason\":\"") + row.key + "\""), std::string::npos) << process.output;
     EXPECT_FALSE(Exists(dir.File("out.mov")));
+    // Refused at once: the reason alone, no progress before it.
+    const Outcome text = Tool("process " + Q(source) + " " + Q(dir.File("out.mov")));
+    EXPECT_EQ(text.status, 1);
+    EXPECT_TRUE(text.output.starts_with("tqovix: " + source + ": " + row.text)) << text.output;
     const Outcome inspect = Tool("inspect " + Q(source));
     if (row.text == "already processed") {
         EXPECT_NE(inspect.output.find("AF information processed: yes"), std::string::npos) << inspect.output;
@@ -236,13 +292,25 @@ TEST(CliTest, DestinationReasons)
     const std::pair<std::string, std::string> rows[] = {
         {"process " + Q(source) + " " + Q(source), source + ": source and destination are the same file"},
         {"process --force " + Q(source) + " " + Q(dir.Path() + "/./in.mov"), "source and destination are the same file"},
-        {"process " + Q(source) + " " + Q(dir.File("folder")), dir.File("folder") + ": the destination is a directory"},
         {"process " + Q(source) + " " + Q(dir.File("absent/x.mov")), "the destination's directory does not exist"},
+        {"process " + Q(source) + " " + Q(dir.File("absent") + "/"), "the destination's directory does not exist"},
     };
     for (const auto& [arguments, said] : rows) {
         const Outcome outcome = Tool(arguments);
         EXPECT_EQ(outcome.status, 1) << arguments;
         EXPECT_NE(outcome.output.find(said), std::string::npos) << arguments << "\n" << outcome.output;
+    }
+    // A folder stands for the source's name in it; "-" is no file to read or write.
+    for (const std::string& folder : {dir.File("folder"), dir.File("folder") + "/"}) {
+        const Outcome outcome = Tool("process -f -q " + Q(source) + " " + Q(folder));
+        EXPECT_EQ(outcome.status, 0) << outcome.output;
+        EXPECT_NE(Tool("check " + Q(dir.File("folder/in.mov"))).output.find("already processed"), std::string::npos);
+    }
+    for (const std::string& arguments : {"process " + Q(source) + " -", "process - " + Q(dir.File("x.mov")),
+                                         std::string("make-sample -")}) {
+        const Outcome outcome = Tool(arguments);
+        EXPECT_EQ(outcome.status, 2) << arguments;
+        EXPECT_NE(outcome.output.find("'-' is not a file"), std::string::npos) << outcome.output;
     }
     // A name as long as a file system allows still leaves room for the hidden name beside it.
     std::string longest;
@@ -717,10 +785,14 @@ TEST(CliCompareTest, MeasuresDrawsAndRefuses)
     EXPECT_EQ(Numbers(measured.output, "differingFrames"), std::vector<double>{0}) << "PCM outside the intervals";
     EXPECT_EQ(Numbers(measured.output, "offsetFrames"), std::vector<double>{0});
 
-    const Outcome itself = Tool("compare " + Q(source) + " " + Q(source) + " --json");
-    ASSERT_EQ(itself.status, 0) << itself.output;
-    EXPECT_EQ(Numbers(itself.output, "reductionDb"), (std::vector<double>{0, 0}));
-    EXPECT_EQ(Numbers(itself.output, "largestDifference"), std::vector<double>{0});
+    // A movie is not its own processed form, nor is a copy of it.
+    std::filesystem::copy_file(source, dir.File("copy.mov"));
+    for (const auto& [other, reason] : {std::pair{source, "same-file"}, std::pair{dir.File("copy.mov"), "not-processed"}}) {
+        const Outcome itself = Tool("compare " + Q(source) + " " + Q(other) + " --json");
+        EXPECT_EQ(itself.status, 1) << itself.output;
+        EXPECT_NE(itself.output.find(std::string("\"compared\":false,\"reason\":\"") + reason), std::string::npos)
+            << itself.output;
+    }
 
     // The picture: its size, and the marks above the source panel exactly over the intervals.
     std::string size;

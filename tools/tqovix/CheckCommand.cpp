@@ -14,6 +14,7 @@ constexpr const char* kUsage =
     "  asks the library, for each movie, whether it can remove the AF noise of its sound,\n"
     "  and prints \"FILE: processable\" or \"FILE: not processable: REASON\"\n"
     "  --json    one JSON object with a row per file instead of text\n"
+    "  -q        print only the files that are not processable\n"
     "  exit status: 0 all processable, 1 any file not processable, 2 usage error\n";
 
 }  // namespace
@@ -48,7 +49,9 @@ int CheckCommand(const Arguments& arguments)
             }
             rows.push_back(row.Text());
         } else if (code == 0) {
-            std::printf("%s: processable\n", file.c_str());
+            if (!line.Quiet()) {
+                std::printf("%s: processable\n", file.c_str());
+            }
         } else {
             std::printf("%s: not processable: %s\n", file.c_str(), verdict.text.c_str());
         }

@@ -26,6 +26,7 @@ constexpr const char* kUsage =
     "  --size-gib N      pad the video frames so that the file reaches about N GiB\n"
     "  --little-endian   store PCM sound as \"sowt\" instead of \"twos\"\n"
     "  -f, --force       replace an existing DST\n"
+    "  -q, --quiet       no line about what was written\n"
     "  exit status: 0 written, 1 DST exists or cannot be written, 2 usage error\n";
 
 constexpr uint32_t kSampleRate = 48000;
@@ -83,6 +84,9 @@ int MakeSampleCommand(const Arguments& arguments)
         return line.Misuse("one DST is needed");
     }
     const std::string destination = line.Operands()[0];
+    if (destination == "-") {
+        return line.Misuse("'-' is not a file: a movie cannot be written to standard output");
+    }
     long seconds = 10;
     int status = 2;
     if (!line.Number("seconds", 1, 24 * 3600, seconds, status)) {
@@ -142,6 +146,9 @@ int MakeSampleCommand(const Arguments& arguments)
         std::fprintf(stderr, "tqovix: %s\n", error.c_str());
         std::remove(destination.c_str());
         return 1;
+    }
+    if (line.Quiet()) {
+        return 0;
     }
     std::printf("%s: %llu bytes, %zu video chunks, %zu sound chunks (%s)\n", destination.c_str(),
                 static_cast<unsigned long long>(layout.fileSize), layout.videoChunks.size(),
