@@ -257,9 +257,12 @@ TEST_P(CliReasonTest, EveryCommandGivesTheSameReason)
     TempDir dir;
     const std::string source = dir.File("in.mov");
     row.make(dir, source);
+    // check and inspect search a folder for movies; process refuses it.
+    const bool folder = row.text == "the source is a directory";
     const Outcome check = Tool("check " + Q(source));
     EXPECT_EQ(check.status, 1);
-    EXPECT_NE(check.output.find(source + ": not processable: " + row.text), std::string::npos) << check.output;
+    const std::string checked = folder ? source + ": no movies found" : source + ": not processable: " + row.text;
+    EXPECT_NE(check.output.find(checked), std::string::npos) << check.output;
     const Outcome process = Tool("process --json " + Q(source) + " " + Q(dir.File("out.mov")));
     EXPECT_EQ(process.status, 1);
     EXPECT_NE(process.output.find("\"message\":\"" + row.text), std::string::npos) << process.output;
@@ -273,15 +276,69 @@ TEST_P(CliReasonTest, EveryCommandGivesTheSameReason)
     if (row.text == "already processed") {
         EXPECT_NE(inspect.output.find("AF information processed: yes"), std::string::npos) << inspect.output;
     } else {
-        const bool refusedWhole = row.text == "file not found" || row.text == "the source is a directory";
+        const bool refusedWhole = row.text == "file not found" || folder;
         EXPECT_EQ(inspect.status, refusedWhole ? 1 : 0) << inspect.output;
-        const std::string said = refusedWhole ? source + ": " + row.text : "the library would refuse it: " + row.text;
+        const std::string said = folder         ? checked
+                                 : refusedWhole ? source + ": " + row.text
+                                                : "the library would refuse it: " + row.text;
         EXPECT_NE(inspect.output.find(said), std::string::npos) << inspect.output;
     }
 }
 
 INSTANTIATE_TEST_SUITE_P(Reasons, CliReasonTest, ::testing::ValuesIn(kReasons),
                          [](const ::testing::TestParamInfo<ReasonCase>& info) { return std::string(info.param.name); });
+
+// check and inspect over a card: files named are taken as they are, folders searched for movies
+// by content (-r: subfolders too); inspect names what a file that is no movie seems to be.
+TEST(CliTest, CheckAndInspectSearchFoldersAndNameOtherFiles)
+{
+    TempDir dir;
+    const std::string card = dir.File("card");
+    std::filesystem::create_directories(card + "/SUB");
+    std::filesystem::create_directories(dir.File("empty"));
+    Movie(card + "/A.MOV");
+    Movie(card + "/SUB/B.MOV", [](Recipe& r) { r.maker.afProcessed = true; });
+    const std::pair<std::string, std::string> others[] = {
+        {"STILL.JPG", "\xff\xd8\xff\xe0 a still"}, {"LOGO.PNG", "\x89PNG\r\n\x1a\n...."},
+        {"RAW.CR2", std::string("II*\0\x10\0\0\0", 8)}, {"CLIP.XML", "\xef\xbb\xbf<?xml version=\"1.0\"?>"},
+        {"notes.txt", "notes\n"}};
+    std::string named;
+    for (const auto& [name, bytes] : others) {
+        WriteText(card + "/" + name, bytes);
+        named += " " + Q(card + "/" + name);
+    }
+    const Outcome flat = Tool("check " + Q(card));
+    EXPECT_EQ(flat.status, 0) << flat.output;
+    EXPECT_EQ(flat.output, card + "/A.MOV: processable\n");
+    const Outcome deep = Tool("check --json -r " + Q(card));
+    EXPECT_EQ(deep.status, 1) << deep.output;
+    EXPECT_NE(deep.output.find(R"("files":[{"file":")" + card + R"(/A.MOV","processable":true)"), std::string::npos);
+    EXPECT_NE(deep.output.find(R"(/SUB/B.MOV","processable":false)"), std::string::npos) << deep.output;
+    const Outcome empty = Tool("check " + Q(dir.File("empty")));
+    EXPECT_EQ(empty.status, 1);
+    EXPECT_NE(empty.output.find("no movies found (-r searches subfolders)"), std::string::npos) << empty.output;
+
+    // The summary comes first; -q gives it alone.
+    const Outcome whole = Tool("inspect " + Q(card + "/A.MOV"));
+    EXPECT_EQ(whole.status, 0);
+    EXPECT_TRUE(whole.output.starts_with(card + "/A.MOV: QuickTime/ISO movie, brand 'qt  ', 2.002 s\n"
+                                         "  tracks: vide raw  29.970 fps, soun twos 48000 Hz 2 ch\n"
+                                         "  AF information processed: no\n\n"))
+        << whole.output;
+    EXPECT_NE(whole.output.find("mvhd"), std::string::npos);
+    const Outcome kinds = Tool("inspect -q" + named);
+    EXPECT_EQ(kinds.status, 0) << kinds.output;
+    for (const char* said : {"STILL.JPG: a JPEG image, not a movie", "LOGO.PNG: a PNG image, not a movie",
+                             "RAW.CR2: a TIFF image or raw still, not a movie",
+                             "CLIP.XML: an XML file (a sidecar), not a movie", "notes.txt: plain text, not a movie"}) {
+        EXPECT_NE(kinds.output.find(said), std::string::npos) << said << "\n" << kinds.output;
+    }
+    const Outcome rows = Tool("inspect --json -r " + Q(card));
+    EXPECT_EQ(rows.status, 0);
+    EXPECT_TRUE(rows.output.starts_with(R"({"version":1,"files":[{"file":")" + card + R"(/A.MOV","kind":"movie")"))
+        << rows.output;
+    EXPECT_NE(rows.output.find(R"(/SUB/B.MOV","kind":"movie","seconds":2.002,)"), std::string::npos) << rows.output;
+}
 
 // What stands at the destination is the destination's reason, named with its path.
 TEST(CliTest, DestinationReasons)
