@@ -95,6 +95,22 @@ TEST(CliTest, VersionAndUsageErrors)
     EXPECT_EQ(Tool("make-sample x.mov --aac --little-endian").status, 2);
 }
 
+// --size-gib is reached, or a warning says why not; the help's frame rate is the one inspect reads.
+TEST(CliTest, SampleSizeAndFrameRate)
+{
+    TempDir dir;
+    const Outcome reached = Tool("make-sample -q --seconds 2 --size-gib 0.02 " + Q(dir.File("a.mov")));
+    EXPECT_EQ(reached.status, 0);
+    EXPECT_EQ(reached.output, "");
+    EXPECT_NEAR(static_cast<double>(std::filesystem::file_size(dir.File("a.mov"))), 0.02 * (1 << 30), 0.0002 * (1 << 30));
+    const Outcome overshot = Tool("make-sample -q --seconds 2 --size-gib 0.001 " + Q(dir.File("b.mov")));
+    EXPECT_EQ(overshot.status, 0);
+    EXPECT_NE(overshot.output.find("warning: the movie is 0.010 GiB, not the 0.001 GiB asked"), std::string::npos)
+        << overshot.output;
+    EXPECT_NE(Tool("make-sample --help").output.find(" 29.97 fps "), std::string::npos);
+    EXPECT_NE(Tool("inspect -q " + Q(dir.File("a.mov"))).output.find(" 29.970 fps"), std::string::npos);
+}
+
 // A usage error is one line, naming what was likely meant; "help CMD" is CMD's own help.
 TEST(CliTest, UsageErrorsSuggestWhatWasMeant)
 {

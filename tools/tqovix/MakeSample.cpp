@@ -17,13 +17,14 @@ namespace {
 
 constexpr const char* kUsage =
     "usage: tqovix make-sample [--pcm|--aac] [--seconds N] [--size-gib N] [--little-endian] [-f] DST\n"
-    "  writes a 30 fps camera-style movie with 48 kHz stereo sound, AF information, audio\n"
+    "  writes a 29.97 fps camera-style movie with 48 kHz stereo sound, AF information, audio\n"
     "  level information and trim tags\n"
     "  --pcm             16-bit PCM sound: a tone, with a motor's whine and hiss while the AF motor runs\n"
     "                    (the default; movies over 20 minutes get the tone alone)\n"
     "  --aac             an AAC sound track (silent packets)\n"
     "  --seconds N       length of the movie (default 10)\n"
-    "  --size-gib N      pad the video frames so that the file reaches about N GiB\n"
+    "  --size-gib N      pad the video frames so that the file reaches about N GiB (a warning\n"
+    "                    says when the movie's length makes it larger)\n"
     "  --little-endian   store PCM sound as \"sowt\" instead of \"twos\"\n"
     "  -f, --force       replace an existing DST\n"
     "  -q, --quiet       no line about what was written\n"
@@ -146,6 +147,14 @@ int MakeSampleCommand(const Arguments& arguments)
         std::fprintf(stderr, "tqovix: %s\n", error.c_str());
         std::remove(destination.c_str());
         return 1;
+    }
+    // Frames are never cut below their natural size: a short target is overshot, and said so.
+    const double written = static_cast<double>(layout.fileSize) / (1ULL << 30);
+    if (sizeGib > 0 && std::abs(written - sizeGib) > sizeGib / 100) {
+        std::fprintf(stderr,
+                     "tqovix make-sample: warning: the movie is %.3f GiB, not the %g GiB asked: its %ld seconds "
+                     "need more; give fewer --seconds\n",
+                     written, sizeGib, seconds);
     }
     if (line.Quiet()) {
         return 0;
