@@ -910,6 +910,25 @@ TEST(CliCompareTest, MeasuresDrawsAndRefuses)
     EXPECT_NE(none.output.find("notes.txt: not a movie"), std::string::npos) << none.output;
 }
 
+// The AAC sample carries the PCM sample's tone and motor, so that a job's work can be measured.
+TEST(CliCompareTest, AacSampleHasSoundToMeasure)
+{
+    TempDir dir;
+    ASSERT_EQ(Tool("make-sample -q --aac --seconds 4 " + Q(dir.File("src.mov"))).status, 0);
+    ASSERT_EQ(Tool("process -q " + Q(dir.File("src.mov")) + " " + Q(dir.File("dst.mov"))).status, 0);
+    const Outcome measured = Tool("compare --json " + Q(dir.File("src.mov")) + " " + Q(dir.File("dst.mov")));
+    ASSERT_EQ(measured.status, 0) << measured.output;
+    const std::vector<double> before = Numbers(measured.output, "beforeDb");
+    const std::vector<double> reductions = Numbers(measured.output, "reductionDb");
+    ASSERT_EQ(before.size(), 2u) << measured.output;
+    ASSERT_EQ(reductions.size(), 2u) << measured.output;
+    for (size_t i = 0; i < 2; ++i) {
+        EXPECT_GT(before[i], -30) << measured.output;
+        EXPECT_GT(reductions[i], 0.5) << measured.output;
+    }
+    EXPECT_GT(Numbers(measured.output, "correlation").at(0), 0.99) << measured.output;
+}
+
 // AAC re-encoded by a job: compare finds no offset against the source, and a close match outside
 // the intervals. That ffmpeg, reading the edit lists as any player does, hears no offset either is
 // interop_test's to judge, frame for frame.

@@ -10,6 +10,7 @@
 #include "CommandLine.h"
 #include <sys/stat.h>
 #include "Movie.h"
+#include "codec/AACEncoder.h"
 #include "MoviePlan.h"
 #include "Pattern.h"
 
@@ -21,7 +22,7 @@ constexpr const char* kUsage =
     "  level information and trim tags\n"
     "  --pcm             16-bit PCM sound: a tone, with a motor's whine and hiss while the AF motor runs\n"
     "                    (the default; movies over 20 minutes get the tone alone)\n"
-    "  --aac             an AAC sound track (silent packets)\n"
+    "  --aac             AAC sound: the same tone and motor, encoded (over 20 minutes, silent packets)\n"
     "  --seconds N       length of the movie (default 10)\n"
     "  --size-gib N      pad the video frames so that the file reaches about N GiB (a warning\n"
     "                    says when the movie's length makes it larger)\n"
@@ -69,6 +70,41 @@ std::vector<int16_t> ToneWithMotorNoise(uint64_t frames, const std::vector<movie
         }
     }
     return samples;
+}
+
+// The sound as a camera records it in AAC: through the encoder jobs use, whose packets decode
+// to one packet of priming and then the sound, which the movie's edit skips. `packets` of them.
+bool EncodeAac(std::vector<int16_t> pcm, uint64_t packets, std::vector<moviekit::Bytes>& out)
+{
+    struct Collected {
+        std::vector<moviekit::Bytes>* packets;
+        uint64_t wanted;
+    } collected{&out, packets};
+    ACEncoderStream stream;
+    stream.userData = &collected;
+    stream.resultProc = [](void* self, unsigned char* data, unsigned int size) {
+        auto* into = static_cast<Collected*>(static_cast<ACEncoderStream*>(self)->userData);
+        if (into->packets->size() < into->wanted) {
+            into->packets->emplace_back(data, data + size);
+        }
+        return eTqovixSuccess;
+    };
+    constexpr uint32_t kFrameBytes = 2 * kChannels;
+    const ACFormat aac{kSampleRate, ACFormatAAC, 0, 0, 1024, 0, kChannels, 0};
+    const ACFormat linear{kSampleRate, ACFormatLinearPCM, 12, kFrameBytes, 1, kFrameBytes, kChannels, 16};
+    AACEncoder encoder;
+    if (encoder.Initialize(linear, aac, 128000, &stream) != eConverterSuccess) {
+        return false;
+    }
+    // Pushed a second at a time: one push is limited to what an unsigned int counts.
+    constexpr size_t kPush = kSampleRate * kChannels;
+    for (size_t at = 0; at < pcm.size(); at += kPush) {
+        const size_t count = std::min(kPush, pcm.size() - at);
+        if (encoder.Encode(pcm.data() + at, static_cast<unsigned int>(count * sizeof(int16_t))) != eConverterSuccess) {
+            return false;
+        }
+    }
+    return encoder.EncodeDone() == eConverterSuccess && out.size() == packets;
 }
 
 }  // namespace
@@ -126,8 +162,13 @@ int MakeSampleCommand(const Arguments& arguments)
     const uint64_t n = aac ? moviekit::DivCeil(frames, 1024) * 1024 : frames;
     const std::vector<moviekit::AfInterval> intervals = {{n / 4, n / 4 + n / 10, 800}, {n / 2, n / 2 + n / 8, 500}};
     recipe.maker.afIntervals = intervals;
-    if (!aac && static_cast<unsigned long>(seconds) <= kMaxExplicitSoundSeconds) {
-        recipe.sound.pcm = ToneWithMotorNoise(frames, intervals);
+    if (static_cast<unsigned long>(seconds) <= kMaxExplicitSoundSeconds) {
+        if (!aac) {
+            recipe.sound.pcm = ToneWithMotorNoise(frames, intervals);
+        } else if (!EncodeAac(ToneWithMotorNoise(n, intervals), n / 1024, recipe.sound.aacPackets)) {
+            std::fprintf(stderr, "tqovix make-sample: the AAC encoder is not available (libavcodec)\n");
+            return 1;
+        }
     }
     if (sizeGib > 0) {
         // Sound and the atoms besides the frames are small beside the video: the frames take the rest.
