@@ -342,6 +342,8 @@ TEST(CliTest, CheckAndInspectSearchFoldersAndNameOtherFiles)
                                          "  AF information processed: no\n\n"))
         << whole.output;
     EXPECT_NE(whole.output.find("mvhd"), std::string::npos);
+    const Outcome summary = Tool("-q inspect " + Q(card + "/A.MOV"));
+    EXPECT_EQ(summary.output, whole.output.substr(0, whole.output.find("\n\n") + 1));
     const Outcome kinds = Tool("inspect -q" + named);
     EXPECT_EQ(kinds.status, 0) << kinds.output;
     for (const char* said : {"STILL.JPG: a JPEG image, not a movie", "LOGO.PNG: a PNG image, not a movie",
