@@ -15,6 +15,7 @@
 #include <cmath>
 #include <chrono>
 #include <filesystem>
+#include <map>
 #include <fstream>
 #include <thread>
 
@@ -58,6 +59,8 @@ std::string Movie(const std::string& path, void (*edit)(Recipe&) = nullptr)
     return path;
 }
 
+void WriteText(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
+
 void ForeignBrand(Recipe& recipe) { recipe.majorBrand = "isom"; recipe.compatibleBrands = {"isom"}; }
 
 class CliCommandTest : public ::testing::TestWithParam<const char*> {};
@@ -91,6 +94,74 @@ TEST(CliTest, VersionAndUsageErrors)
     EXPECT_EQ(Tool("process only-one-path").status, 2);
     EXPECT_EQ(Tool("no-such-command").status, 2);
     EXPECT_EQ(Tool("make-sample x.mov --aac --little-endian").status, 2);
+}
+
+// --size-gib is reached, or a warning says why not; the help's frame rate is the one inspect reads.
+TEST(CliTest, SampleSizeAndFrameRate)
+{
+    TempDir dir;
+    const Outcome reached = Tool("make-sample -q --seconds 2 --size-gib 0.02 " + Q(dir.File("a.mov")));
+    EXPECT_EQ(reached.status, 0);
+    EXPECT_EQ(reached.output, "");
+    EXPECT_NEAR(static_cast<double>(std::filesystem::file_size(dir.File("a.mov"))), 0.02 * (1 << 30), 0.0002 * (1 << 30));
+    const Outcome overshot = Tool("make-sample -q --seconds 2 --size-gib 0.001 " + Q(dir.File("b.mov")));
+    EXPECT_EQ(overshot.status, 0);
+    EXPECT_NE(overshot.output.find("warning: the movie is 0.010 GiB, not the 0.001 GiB asked"), std::string::npos)
+        << overshot.output;
+    EXPECT_NE(Tool("make-sample --help").output.find(" 29.97 fps "), std::string::npos);
+    EXPECT_NE(Tool("inspect -q " + Q(dir.File("a.mov"))).output.find(" 29.970 fps"), std::string::npos);
+}
+
+// A usage error is one line, naming what was likely meant; "help CMD" is CMD's own help.
+TEST(CliTest, UsageErrorsSuggestWhatWasMeant)
+{
+    const std::pair<std::string, std::string> rows[] = {
+        {"proces a b", "unknown command 'proces'; did you mean 'process'?"},
+        {"inpsect a", "did you mean 'inspect'?"},
+        {"batch --dryrun -o out a", "unknown option '--dryrun'; did you mean '--dry-run'?"},
+        {"check -json a", "unknown option '-json'; did you mean '--json'?"},
+        {"compare --pn x a b", "did you mean '--png'?"},
+        {"process -z a b", "unknown option '-z' ("},
+        {"--jsn check a", "did you mean '--json'"},
+        {"help nosuch", "unknown command 'nosuch' ("},
+        {"process a", "SRC and DST are needed"},
+    };
+    for (const auto& [arguments, said] : rows) {
+        const Outcome outcome = Tool(arguments);
+        EXPECT_EQ(outcome.status, 2) << arguments;
+        EXPECT_NE(outcome.output.find(said), std::string::npos) << arguments << "\n" << outcome.output;
+        EXPECT_EQ(std::ranges::count(outcome.output, '\n'), 1) << arguments << "\n" << outcome.output;
+    }
+    EXPECT_EQ(Tool("help make-sample").output, Tool("make-sample --help").output);
+    EXPECT_NE(Tool("help").output.find("usage: tqovix COMMAND"), std::string::npos);
+}
+
+// -q, before the command or after it: a run that succeeds says nothing, one that fails says why.
+TEST(CliTest, QuietRunsSayOnlyWhatWentWrong)
+{
+    TempDir dir;
+    const std::string movie = dir.File("in.mov");
+    const std::string text = dir.File("notes.txt");
+    WriteText(text, "notes\n");
+    const std::pair<std::string, int> rows[] = {
+        {"-q make-sample --seconds 2 " + Q(movie), 0},
+        {"make-sample -q --seconds 2 " + Q(dir.File("second.mov")), 0},
+        {"-q check " + Q(movie), 0},
+        {"--quiet process " + Q(movie) + " " + Q(dir.File("out.mov")), 0},
+        {"-q compare " + Q(movie) + " " + Q(dir.File("out.mov")), 0},
+        {"-q batch -o " + Q(dir.File("card")) + " " + Q(movie), 0},
+    };
+    for (const auto& [arguments, status] : rows) {
+        const Outcome outcome = Tool(arguments);
+        EXPECT_EQ(outcome.status, status) << arguments << "\n" << outcome.output;
+        EXPECT_EQ(outcome.output, "") << arguments;
+    }
+    const Outcome refused = Tool("-q check " + Q(movie) + " " + Q(text));
+    EXPECT_EQ(refused.status, 1);
+    EXPECT_EQ(refused.output, text + ": not processable: not a QuickTime/ISO movie\n");
+    const Outcome passedOver = Tool("batch -q -o " + Q(dir.File("card")) + " " + Q(text));
+    EXPECT_EQ(passedOver.status, 0) << "not a movie: skipped, nothing said";
+    EXPECT_EQ(passedOver.output, "");
 }
 
 // Every spelling people use for options, and the ones refused as usage errors.
@@ -159,7 +230,6 @@ struct ReasonCase {
 };
 void PrintTo(const ReasonCase& row, std::ostream* out) { *out << row.name; }
 
-void WriteText(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
 
 const ReasonCase kReasons[] = {
     {"SourceMissing", [](const TempDir&, const std::string&) {}, "file not found", "source-missing", 110},
@@ -193,6 +263,9 @@ const ReasonCase kReasons[] = {
     {"NoAFInformation",
      [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.maker.afInformation = false; }); },
      "no AF information", "no-af-information", 8},
+    {"AFInformationUnusable",
+     [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.maker.afPayload = moviekit::Bytes{'A', 'F'}; }); },
+     "the processing library cannot use the AF information", "af-information-unusable", 9},
     {"AlreadyProcessed",
      [](const TempDir&, const std::string& path) { Movie(path, [](Recipe& r) { r.maker.afProcessed = true; }); },
      "already processed", "already-processed", 20},
@@ -206,28 +279,91 @@ TEST_P(CliReasonTest, EveryCommandGivesTheSameReason)
     TempDir dir;
     const std::string source = dir.File("in.mov");
     row.make(dir, source);
+    // check and inspect search a folder for movies; process refuses it.
+    const bool folder = row.text == "the source is a directory";
     const Outcome check = Tool("check " + Q(source));
     EXPECT_EQ(check.status, 1);
-    EXPECT_NE(check.output.find(source + ": not processable: " + row.text), std::string::npos) << check.output;
+    const std::string checked = folder ? source + ": no movies found" : source + ": not processable: " + row.text;
+    EXPECT_NE(check.output.find(checked), std::string::npos) << check.output;
     const Outcome process = Tool("process --json " + Q(source) + " " + Q(dir.File("out.mov")));
     EXPECT_EQ(process.status, 1);
     EXPECT_NE(process.output.find("\"message\":\"" + row.text), std::string::npos) << process.output;
     EXPECT_NE(process.output.find(std::string("\"reason\":\"") + row.key + "\""), std::string::npos) << process.output;
     EXPECT_NE(process.output.find("\"result\":" + std::to_string(row.result) + ","), std::string::npos) << process.output;
     EXPECT_FALSE(Exists(dir.File("out.mov")));
+    // Refused at once: the reason alone, no progress before it.
+    const Outcome text = Tool("process " + Q(source) + " " + Q(dir.File("out.mov")));
+    EXPECT_EQ(text.status, 1);
+    EXPECT_TRUE(text.output.starts_with("tqovix: " + source + ": " + row.text)) << text.output;
     const Outcome inspect = Tool("inspect " + Q(source));
     if (row.text == "already processed") {
         EXPECT_NE(inspect.output.find("AF information processed: yes"), std::string::npos) << inspect.output;
     } else {
-        const bool refusedWhole = row.text == "file not found" || row.text == "the source is a directory";
+        const bool refusedWhole = row.text == "file not found" || folder;
         EXPECT_EQ(inspect.status, refusedWhole ? 1 : 0) << inspect.output;
-        const std::string said = refusedWhole ? source + ": " + row.text : "the library would refuse it: " + row.text;
+        const std::string said = folder         ? checked
+                                 : refusedWhole ? source + ": " + row.text
+                                                : "the library would refuse it: " + row.text;
         EXPECT_NE(inspect.output.find(said), std::string::npos) << inspect.output;
     }
 }
 
 INSTANTIATE_TEST_SUITE_P(Reasons, CliReasonTest, ::testing::ValuesIn(kReasons),
                          [](const ::testing::TestParamInfo<ReasonCase>& info) { return std::string(info.param.name); });
+
+// check and inspect over a card: files named are taken as they are, folders searched for movies
+// by content (-r: subfolders too); inspect names what a file that is no movie seems to be.
+TEST(CliTest, CheckAndInspectSearchFoldersAndNameOtherFiles)
+{
+    TempDir dir;
+    const std::string card = dir.File("card");
+    std::filesystem::create_directories(card + "/SUB");
+    std::filesystem::create_directories(dir.File("empty"));
+    Movie(card + "/A.MOV");
+    Movie(card + "/SUB/B.MOV", [](Recipe& r) { r.maker.afProcessed = true; });
+    const std::pair<std::string, std::string> others[] = {
+        {"STILL.JPG", "\xff\xd8\xff\xe0 a still"}, {"LOGO.PNG", "\x89PNG\r\n\x1a\n...."},
+        {"RAW.CR2", std::string("II*\0\x10\0\0\0", 8)}, {"CLIP.XML", "\xef\xbb\xbf<?xml version=\"1.0\"?>"},
+        {"notes.txt", "notes\n"}};
+    std::string named;
+    for (const auto& [name, bytes] : others) {
+        WriteText(card + "/" + name, bytes);
+        named += " " + Q(card + "/" + name);
+    }
+    const Outcome flat = Tool("check " + Q(card));
+    EXPECT_EQ(flat.status, 0) << flat.output;
+    EXPECT_EQ(flat.output, card + "/A.MOV: processable\n");
+    const Outcome deep = Tool("check --json -r " + Q(card));
+    EXPECT_EQ(deep.status, 1) << deep.output;
+    EXPECT_NE(deep.output.find(R"("files":[{"file":")" + card + R"(/A.MOV","processable":true)"), std::string::npos);
+    EXPECT_NE(deep.output.find(R"(/SUB/B.MOV","processable":false)"), std::string::npos) << deep.output;
+    const Outcome empty = Tool("check " + Q(dir.File("empty")));
+    EXPECT_EQ(empty.status, 1);
+    EXPECT_NE(empty.output.find("no movies found (-r searches subfolders)"), std::string::npos) << empty.output;
+
+    // The summary comes first; -q gives it alone.
+    const Outcome whole = Tool("inspect " + Q(card + "/A.MOV"));
+    EXPECT_EQ(whole.status, 0);
+    EXPECT_TRUE(whole.output.starts_with(card + "/A.MOV: QuickTime/ISO movie, brand 'qt  ', 2.002 s\n"
+                                         "  tracks: vide raw  29.970 fps, soun twos 48000 Hz 2 ch\n"
+                                         "  AF information processed: no\n\n"))
+        << whole.output;
+    EXPECT_NE(whole.output.find("mvhd"), std::string::npos);
+    const Outcome summary = Tool("-q inspect " + Q(card + "/A.MOV"));
+    EXPECT_EQ(summary.output, whole.output.substr(0, whole.output.find("\n\n") + 1));
+    const Outcome kinds = Tool("inspect -q" + named);
+    EXPECT_EQ(kinds.status, 0) << kinds.output;
+    for (const char* said : {"STILL.JPG: a JPEG image, not a movie", "LOGO.PNG: a PNG image, not a movie",
+                             "RAW.CR2: a TIFF image or raw still, not a movie",
+                             "CLIP.XML: an XML file (a sidecar), not a movie", "notes.txt: plain text, not a movie"}) {
+        EXPECT_NE(kinds.output.find(said), std::string::npos) << said << "\n" << kinds.output;
+    }
+    const Outcome rows = Tool("inspect --json -r " + Q(card));
+    EXPECT_EQ(rows.status, 0);
+    EXPECT_TRUE(rows.output.starts_with(R"({"version":1,"files":[{"file":")" + card + R"(/A.MOV","kind":"movie")"))
+        << rows.output;
+    EXPECT_NE(rows.output.find(R"(/SUB/B.MOV","kind":"movie","seconds":2.002,)"), std::string::npos) << rows.output;
+}
 
 // What stands at the destination is the destination's reason, named with its path.
 TEST(CliTest, DestinationReasons)
@@ -238,13 +374,25 @@ TEST(CliTest, DestinationReasons)
     const std::pair<std::string, std::string> rows[] = {
         {"process " + Q(source) + " " + Q(source), source + ": source and destination are the same file"},
         {"process --force " + Q(source) + " " + Q(dir.Path() + "/./in.mov"), "source and destination are the same file"},
-        {"process " + Q(source) + " " + Q(dir.File("folder")), dir.File("folder") + ": the destination is a directory"},
         {"process " + Q(source) + " " + Q(dir.File("absent/x.mov")), "the destination's directory does not exist"},
+        {"process " + Q(source) + " " + Q(dir.File("absent") + "/"), "the destination's directory does not exist"},
     };
     for (const auto& [arguments, said] : rows) {
         const Outcome outcome = Tool(arguments);
         EXPECT_EQ(outcome.status, 1) << arguments;
         EXPECT_NE(outcome.output.find(said), std::string::npos) << arguments << "\n" << outcome.output;
+    }
+    // A folder stands for the source's name in it; "-" is no file to read or write.
+    for (const std::string& folder : {dir.File("folder"), dir.File("folder") + "/"}) {
+        const Outcome outcome = Tool("process -f -q " + Q(source) + " " + Q(folder));
+        EXPECT_EQ(outcome.status, 0) << outcome.output;
+        EXPECT_NE(Tool("check " + Q(dir.File("folder/in.mov"))).output.find("already processed"), std::string::npos);
+    }
+    for (const std::string& arguments : {"process " + Q(source) + " -", "process - " + Q(dir.File("x.mov")),
+                                         std::string("make-sample -")}) {
+        const Outcome outcome = Tool(arguments);
+        EXPECT_EQ(outcome.status, 2) << arguments;
+        EXPECT_NE(outcome.output.find("'-' is not a file"), std::string::npos) << outcome.output;
     }
     // A name as long as a file system allows still leaves room for the hidden name beside it.
     std::string longest;
@@ -278,7 +426,8 @@ TEST_P(CliDestinationJsonTest, ResultIsTheReasonsCode)
     }
     TempDir dir;
     const std::string source = Movie(dir.File("in.mov"));
-    std::filesystem::create_directory(dir.File("folder"));
+    // A folder where the movie would go inside the folder named: "folder/in.mov" is one too.
+    std::filesystem::create_directories(dir.File("folder/in.mov"));
     std::filesystem::create_directory(dir.File("locked"));
     std::filesystem::permissions(dir.File("locked"), std::filesystem::perms::owner_read | std::filesystem::perms::owner_exec);
     const std::string named = row.destination;
@@ -389,6 +538,25 @@ void ExpectTimesKept(const std::string& source, const std::string& path)
     EXPECT_EQ(status.st_atim.tv_nsec, original.st_atim.tv_nsec) << path;
 }
 
+// Per source in a batch's JSON: its status and reason; a plan's "would process" read as "done".
+std::map<std::string, std::string> Outcomes(const std::string& json, bool planned)
+{
+    const auto field = [&json](const std::string& key, size_t from) {
+        const size_t at = json.find("\"" + key + "\":\"", from);
+        const size_t begin = at + key.size() + 4;
+        return at == std::string::npos ? std::string() : json.substr(begin, json.find('"', begin) - begin);
+    };
+    std::map<std::string, std::string> outcomes;
+    const size_t files = json.find("\"files\":[");
+    const size_t end = json.find("],", files);
+    for (size_t at = json.find("{\"source\"", files); at < end; at = json.find("{\"source\"", at + 1)) {
+        std::string status = field("status", at);
+        status = planned && status == "would process" ? "done" : status;
+        outcomes[field("source", at)] = status + " " + field("reason", at);
+    }
+    return outcomes;
+}
+
 // A card's life: planned, processed, run again (nothing to do), a clip added, a destination
 // that holds something else; every destination with its source's dates.
 TEST(CliTest, BatchOverACardsFolders)
@@ -450,7 +618,9 @@ TEST(CliTest, BatchOverACardsFolders)
     Movie(dir.File("card/DCIM/100CAM/NEW.MOV"));
     std::filesystem::copy_file(card + "/DCIM/100CAM/PCM.MOV", out + "/DCIM/100CAM/PCM.MOV",
                                std::filesystem::copy_options::overwrite_existing);
+    const Outcome foreseen = Tool("batch --dry-run --json -r -o " + Q(out) + " " + Q(card));
     const Outcome added = Tool("batch --json -r -o " + Q(out) + " " + Q(card));
+    EXPECT_EQ(Outcomes(foreseen.output, true), Outcomes(added.output, false)) << foreseen.output << "\n" << added.output;
     EXPECT_EQ(added.status, 1) << added.output;
     EXPECT_NE(added.output.find(R"("done":1,"skipped":3,"failed":1)"), std::string::npos) << added.output;
     EXPECT_NE(added.output.find(R"(PCM.MOV","status":"failed","reason":"destination-exists")"), std::string::npos)
@@ -856,10 +1026,14 @@ TEST(CliCompareTest, MeasuresDrawsAndRefuses)
     EXPECT_EQ(Numbers(measured.output, "differingFrames"), std::vector<double>{0}) << "PCM outside the intervals";
     EXPECT_EQ(Numbers(measured.output, "offsetFrames"), std::vector<double>{0});
 
-    const Outcome itself = Tool("compare " + Q(source) + " " + Q(source) + " --json");
-    ASSERT_EQ(itself.status, 0) << itself.output;
-    EXPECT_EQ(Numbers(itself.output, "reductionDb"), (std::vector<double>{0, 0}));
-    EXPECT_EQ(Numbers(itself.output, "largestDifference"), std::vector<double>{0});
+    // A movie is not its own processed form, nor is a copy of it.
+    std::filesystem::copy_file(source, dir.File("copy.mov"));
+    for (const auto& [other, reason] : {std::pair{source, "same-file"}, std::pair{dir.File("copy.mov"), "not-processed"}}) {
+        const Outcome itself = Tool("compare " + Q(source) + " " + Q(other) + " --json");
+        EXPECT_EQ(itself.status, 1) << itself.output;
+        EXPECT_NE(itself.output.find(std::string("\"compared\":false,\"reason\":\"") + reason), std::string::npos)
+            << itself.output;
+    }
 
     // The picture: its size, and the marks above the source panel exactly over the intervals.
     std::string size;
@@ -902,6 +1076,25 @@ TEST(CliCompareTest, MeasuresDrawsAndRefuses)
     const Outcome none = Tool("compare " + Q(source) + " " + Q(text));
     EXPECT_EQ(none.status, 1);
     EXPECT_NE(none.output.find("notes.txt: not a movie"), std::string::npos) << none.output;
+}
+
+// The AAC sample carries the PCM sample's tone and motor, so that a job's work can be measured.
+TEST(CliCompareTest, AacSampleHasSoundToMeasure)
+{
+    TempDir dir;
+    ASSERT_EQ(Tool("make-sample -q --aac --seconds 4 " + Q(dir.File("src.mov"))).status, 0);
+    ASSERT_EQ(Tool("process -q " + Q(dir.File("src.mov")) + " " + Q(dir.File("dst.mov"))).status, 0);
+    const Outcome measured = Tool("compare --json " + Q(dir.File("src.mov")) + " " + Q(dir.File("dst.mov")));
+    ASSERT_EQ(measured.status, 0) << measured.output;
+    const std::vector<double> before = Numbers(measured.output, "beforeDb");
+    const std::vector<double> reductions = Numbers(measured.output, "reductionDb");
+    ASSERT_EQ(before.size(), 2u) << measured.output;
+    ASSERT_EQ(reductions.size(), 2u) << measured.output;
+    for (size_t i = 0; i < 2; ++i) {
+        EXPECT_GT(before[i], -30) << measured.output;
+        EXPECT_GT(reductions[i], 0.5) << measured.output;
+    }
+    EXPECT_GT(Numbers(measured.output, "correlation").at(0), 0.99) << measured.output;
 }
 
 // AAC re-encoded by a job: compare finds no offset against the source, and a close match outside

@@ -523,6 +523,20 @@ public:
                                     .c_str());
             return;
         }
+        if (m_line.Quiet()) {
+            // Quiet: only what went wrong.
+            for (const Job& job : m_jobs) {
+                if (job.outcome == Outcome::Failed) {
+                    std::fprintf(stderr, "tqovix: %s: %s\n", job.source.c_str(), job.message.c_str());
+                }
+            }
+            for (const Copy& copy : m_copies) {
+                if (copy.state == Copy::State::Failed) {
+                    std::fprintf(stderr, "tqovix: %s: %s\n", copy.source.c_str(), copy.message.c_str());
+                }
+            }
+            return;
+        }
         size_t nameWidth = 4;
         for (const Job& job : m_jobs) {
             nameWidth = std::max(nameWidth, DisplayWidth(job.source));

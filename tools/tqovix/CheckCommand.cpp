@@ -4,37 +4,43 @@
 
 #include "CommandLine.h"
 #include "Json.h"
+#include "MovieSearch.h"
 #include "Reasons.h"
 #include "api/TqOVIXUtility.h"
 
 namespace {
 
 constexpr const char* kUsage =
-    "usage: tqovix check [--json] FILE...\n"
+    "usage: tqovix check [-r] [--json] PATH...\n"
     "  asks the library, for each movie, whether it can remove the AF noise of its sound,\n"
-    "  and prints \"FILE: processable\" or \"FILE: not processable: REASON\"\n"
-    "  --json    one JSON object with a row per file instead of text\n"
-    "  exit status: 0 all processable, 1 any file not processable, 2 usage error\n";
+    "  and prints \"FILE: processable\" or \"FILE: not processable: REASON\". A folder PATH\n"
+    "  is searched for movies (by their content, not their names; other files are passed over)\n"
+    "  -r, --recursive   search folders and their subfolders\n"
+    "  --json            one JSON object with a row per file instead of text\n"
+    "  -q                print only the files that are not processable\n"
+    "  exit status: 0 all processable, 1 any file not processable or a folder without movies,\n"
+    "  2 usage error\n";
 
 }  // namespace
 
 int CheckCommand(const Arguments& arguments)
 {
-    CommandLine line("check", kUsage, {{"json", 0, false}});
+    CommandLine line("check", kUsage, {{"json", 0, false}, {"recursive", 'r', false}});
     if (const int status = line.Parse(arguments); status >= 0) {
         return status;
     }
     if (line.Operands().empty()) {
-        return line.Misuse("no FILE given");
+        return line.Misuse("no PATH given");
     }
+    const MovieSearch search = FindMovies(line.Operands(), line.Has("recursive"), "check");
     const int started = TqInitializeOVIX();
     if (started != 0) {
         std::fprintf(stderr, "tqovix: the library did not start: %s\n", Explain(started, "").text.c_str());
         return 1;
     }
-    bool allProcessable = true;
+    bool allProcessable = !search.anyFolderEmpty;
     std::vector<std::string> rows;
-    for (const std::string& file : line.Operands()) {
+    for (const std::string& file : search.files) {
         const int code = TqGetPropertyOVIX(file.c_str());
         const Verdict verdict = Explain(code, file);
         allProcessable = allProcessable && code == 0;
@@ -48,7 +54,9 @@ int CheckCommand(const Arguments& arguments)
             }
             rows.push_back(row.Text());
         } else if (code == 0) {
-            std::printf("%s: processable\n", file.c_str());
+            if (!line.Quiet()) {
+                std::printf("%s: processable\n", file.c_str());
+            }
         } else {
             std::printf("%s: not processable: %s\n", file.c_str(), verdict.text.c_str());
         }

@@ -31,12 +31,14 @@ public:
     bool Quiet() const { return Has("quiet"); }
     bool Verbose() const { return Has("verbose"); }
 
-    // A usage error: says `message` and the usage on stderr, and gives the status 2.
+    // A usage error: says `message` in one line on stderr, and gives the status 2.
     int Misuse(const std::string& message) const;
     // Whole number in [low, high] from option `longName`; false (after Misuse) otherwise.
     bool Number(const std::string& longName, long low, long high, long& value, int& status) const;
 
 private:
+    // The unknown `option` met in `word`, with the known one the word most likely meant.
+    int Unknown(const std::string& word, const std::string& option) const;
     const OptionSpec* FindLong(const std::string& name) const;
     const OptionSpec* FindShort(char name) const;
 
@@ -46,3 +48,7 @@ private:
     std::map<std::string, std::string> m_values;
     Arguments m_operands;
 };
+
+// The one of `known` that `typed` most likely misspells (a unique prefix, or a few letters
+// wrong); empty when none is close.
+std::string ClosestName(const std::string& typed, const std::vector<std::string>& known);

@@ -4,10 +4,13 @@
 #include <cstdio>
 #include <string>
 
+#include <sys/stat.h>
+
 #include "CommandLine.h"
 #include "Json.h"
 #include "SoundComparison.h"
 #include "Spectrogram.h"
+#include "api/TqOVIXUtility.h"
 
 namespace {
 
@@ -16,10 +19,31 @@ constexpr const char* kUsage =
     "  measures what processing did to SRC's sound in DST: per AF interval the level before\n"
     "  and after and the reduction, elsewhere how many frames differ (PCM: none should) or\n"
     "  the largest difference (AAC), and DST's offset against SRC in frames; --png draws both\n"
-    "  spectrograms with the AF intervals and the level difference over time\n"
-    "  exit status: 0 compared, 1 DST is not the processed form of SRC (its sound differs in\n"
-    "  rate, channels or length, or does not match), either sound stops short of what its tables\n"
+    "  spectrograms with the AF intervals and the level difference over time; -q prints only\n"
+    "  why a comparison fails\n"
+    "  exit status: 0 compared, 1 DST is not the processed form of SRC (the same file, its AF\n"
+    "  information not marked processed, or its sound differs in rate, channels or length, or\n"
+    "  does not match), either sound stops short of what its tables\n"
     "  promise, or a file is unreadable; 2 usage\n";
+
+bool SameFile(const std::string& a, const std::string& b)
+{
+    struct stat one {};
+    struct stat other {};
+    return stat(a.c_str(), &one) == 0 && stat(b.c_str(), &other) == 0 && one.st_dev == other.st_dev &&
+           one.st_ino == other.st_ino;
+}
+
+// The library's word on whether a movie's AF information is marked processed.
+bool MarkedProcessed(const std::string& path)
+{
+    if (TqInitializeOVIX() != 0) {
+        return false;
+    }
+    const int answer = TqGetPropertyOVIX(path.c_str());
+    TqCloseOVIX();
+    return answer == 20;
+}
 
 double Seconds(uint64_t frame, uint32_t rate) { return static_cast<double>(frame) / rate; }
 
@@ -94,6 +118,9 @@ int CompareCommand(const Arguments& arguments)
         }
         return 1;
     };
+    if (SameFile(paths[0], paths[1])) {
+        return refuse("same-file", "SRC and DST are the same file: a movie is compared with its processed form");
+    }
     // The picture needs the sound's shape before the first block: open it once to learn it.
     Spectrogram picture;
     bool drawing = false;
@@ -118,12 +145,19 @@ int CompareCommand(const Arguments& arguments)
     if (!why.empty()) {
         return refuse(comparison.reason, why);
     }
+    // Sound alike throughout is no proof: a copy of SRC has it too.
+    if (!MarkedProcessed(paths[1])) {
+        return refuse("not-processed", paths[1] + ": not the processed form of " + paths[0] +
+                                           ": its AF information is not marked processed");
+    }
     if (drawing) {
         if (const std::string failed = picture.Save(png); !failed.empty()) {
             std::fprintf(stderr, "tqovix compare: %s\n", failed.c_str());
             return 1;
         }
     }
-    (json ? PrintJson : PrintText)(paths[0], paths[1], comparison, png);
+    if (json || !line.Quiet()) {
+        (json ? PrintJson : PrintText)(paths[0], paths[1], comparison, png);
+    }
     return 0;
 }

@@ -31,6 +31,25 @@ TqovixPayload Payload(const CTqovixAtom* parent, const std::string& types)
     return data == nullptr ? TqovixPayload{} : TqovixPayload{data, static_cast<size_t>(parent->GetDataSize())};
 }
 
+// The movie header's duration in seconds; negative without a readable one.
+double MovieSeconds(const TqovixAtomList& atoms)
+{
+    for (const auto& top : atoms) {
+        if (top->GetType() != TqovixAtom::kMoov) {
+            continue;
+        }
+        const TqovixPayload mvhd = Payload(top.get(), "mvhd");
+        const bool wide = mvhd.size() >= 1 && mvhd.data()[0] == 1;
+        if (mvhd.size() < (wide ? 32u : 20u)) {
+            return -1;
+        }
+        const uint32_t scale = TqovixReadBE32(mvhd.data() + (wide ? 20 : 12));
+        const uint64_t duration = wide ? TqovixReadBE64(mvhd.data() + 24) : TqovixReadBE32(mvhd.data() + 16);
+        return scale == 0 ? -1 : static_cast<double>(duration) / scale;
+    }
+    return -1;
+}
+
 std::vector<InspectedTrack> CollectTracks(const CTqovixAtomControl& tree, const TqovixAtomList& atoms)
 {
     std::vector<InspectedTrack> tracks;
@@ -92,6 +111,9 @@ Inspection Inspect(const std::string& path)
     Inspection inspection;
     inspection.path = path;
     inspection.structure = ScanStructure(path);
+    if (!inspection.structure.atomic) {
+        inspection.kind = NonMovieKind(path);
+    }
     int answer = TqInitializeOVIX();
     if (answer == 0) {
         answer = TqGetPropertyOVIX(path.c_str());
@@ -107,6 +129,7 @@ Inspection Inspect(const std::string& path)
     TqovixAtomList atoms;
     tree.GetAtoms(atoms);
     inspection.tracks = CollectTracks(tree, atoms);
+    inspection.seconds = MovieSeconds(atoms);
     CTqovixTrimInformationVisitor trim;
     if (tree.Analyze(trim) == eTqovixSuccess) {
         inspection.trim = InspectedTrim{trim.GetRemovedFrameForward(), trim.GetRemovedFrameBackward(),

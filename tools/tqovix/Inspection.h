@@ -33,6 +33,8 @@ struct InspectedTrim {
 struct Inspection {
     std::string path;
     Structure structure;
+    std::string kind;      // what a file that is no movie seems to be ("a JPEG image"); empty otherwise
+    double seconds = -1;   // the movie header's duration; negative when unknown
     bool parsed = false;  // the library's parser read the tree: tracks and tags below
     std::vector<InspectedTrack> tracks;
     std::optional<InspectedTrim> trim;
@@ -42,5 +44,7 @@ struct Inspection {
 };
 
 Inspection Inspect(const std::string& path);
-void PrintInspectionText(const Inspection& inspection);
-void PrintInspectionJson(const Inspection& inspection);
+// Duration, tracks and the library's verdict; then, unless `summaryOnly`, the atoms and the rest.
+void PrintInspectionText(const Inspection& inspection, bool summaryOnly);
+// One object; `report` makes it a whole report, with the format's version first.
+std::string InspectionJson(const Inspection& inspection, bool report);

@@ -27,10 +27,22 @@ std::string TrackJson(const InspectedTrack& t)
 
 }  // namespace
 
-void PrintInspectionJson(const Inspection& in)
+std::string InspectionJson(const Inspection& in, bool whole)
 {
-    JsonObject report = JsonObject::Report();
+    JsonObject report = whole ? JsonObject::Report() : JsonObject();
     report.Add("file", in.path);
+    if (in.structure.atomic) {
+        report.Add("kind", "movie");
+    } else if (in.kind.empty()) {
+        report.Add("kind", "unknown");
+    } else {
+        report.Add("kind", in.kind);
+    }
+    if (in.seconds >= 0) {
+        report.Add("seconds", in.seconds);
+    } else {
+        report.AddNull("seconds");
+    }
     std::vector<std::string> atoms;
     for (const ScannedAtom& a : in.structure.atoms) {
         atoms.push_back(JsonObject().Add("offset", a.offset).Add("size", a.size).Add("type", a.type).Add("depth", a.depth).Text());
@@ -69,12 +81,46 @@ void PrintInspectionJson(const Inspection& in)
     } else {
         report.Add("message", in.verdict.text);
     }
-    std::printf("%s\n", report.Text().c_str());
+    return report.Text();
 }
 
-void PrintInspectionText(const Inspection& in)
+void PrintInspectionText(const Inspection& in, bool summaryOnly)
 {
-    std::printf("%s\n%12s %12s  %s\n", in.path.c_str(), "offset", "size", "type");
+    if (in.structure.atomic) {
+        std::printf("%s: QuickTime/ISO movie", in.path.c_str());
+        if (!in.structure.brand.empty()) {
+            std::printf(", brand '%s'", in.structure.brand.c_str());
+        }
+        if (in.seconds >= 0) {
+            std::printf(", %.3f s", in.seconds);
+        }
+        std::printf("\n");
+    } else {
+        std::printf("%s: %s\n", in.path.c_str(), in.kind.empty() ? "not a movie" : (in.kind + ", not a movie").c_str());
+    }
+    if (!in.tracks.empty()) {
+        std::printf("  tracks:");
+        for (size_t i = 0; i < in.tracks.size(); ++i) {
+            const InspectedTrack& t = in.tracks[i];
+            const bool sound = t.handler == "soun";
+            std::printf("%s %s %s %.*f %s", i ? "," : "", t.handler.c_str(), t.codec.c_str(), sound ? 0 : 3, t.rate,
+                        sound ? "Hz" : "fps");
+            if (sound) {
+                std::printf(" %u ch", t.channels);
+            }
+        }
+        std::printf("\n");
+    }
+    const char* processed = Processed(in.verdict);
+    std::printf("  AF information processed: %s\n", processed != nullptr ? processed : "unknown");
+    if (in.verdict.reason != Reason::None && in.verdict.reason != Reason::AlreadyProcessed) {
+        std::printf("  the library would refuse it: %s\n", in.verdict.text.c_str());
+    }
+    // The atoms of a still or a note are noise.
+    if (summaryOnly || (!in.structure.atomic && in.structure.atoms.empty())) {
+        return;
+    }
+    std::printf("\n%12s %12s  %s\n", "offset", "size", "type");
     for (const ScannedAtom& a : in.structure.atoms) {
         std::printf("%12" PRIu64 " %12" PRIu64 "  %*s%s\n", a.offset, a.size, a.depth * 2, "", a.type.c_str());
     }
@@ -105,10 +151,5 @@ void PrintInspectionText(const Inspection& in)
         std::printf("AF information: %s\n", in.afBytes ? (std::to_string(in.afBytes) + " bytes").c_str() : "none");
         std::printf("audio level information: %s\n",
                     in.levelBytes ? (std::to_string(in.levelBytes) + " bytes").c_str() : "none");
-    }
-    const char* processed = Processed(in.verdict);
-    std::printf("AF information processed: %s\n", processed != nullptr ? processed : "unknown");
-    if (in.verdict.reason != Reason::None && in.verdict.reason != Reason::AlreadyProcessed) {
-        std::printf("the library would refuse it: %s\n", in.verdict.text.c_str());
     }
 }

@@ -10,6 +10,7 @@
 #include "CommandLine.h"
 #include <sys/stat.h>
 #include "Movie.h"
+#include "codec/AACEncoder.h"
 #include "MoviePlan.h"
 #include "Pattern.h"
 
@@ -17,15 +18,17 @@ namespace {
 
 constexpr const char* kUsage =
     "usage: tqovix make-sample [--pcm|--aac] [--seconds N] [--size-gib N] [--little-endian] [-f] DST\n"
-    "  writes a 30 fps camera-style movie with 48 kHz stereo sound, AF information, audio\n"
+    "  writes a 29.97 fps camera-style movie with 48 kHz stereo sound, AF information, audio\n"
     "  level information and trim tags\n"
     "  --pcm             16-bit PCM sound: a tone, with a motor's whine and hiss while the AF motor runs\n"
     "                    (the default; movies over 20 minutes get the tone alone)\n"
-    "  --aac             an AAC sound track (silent packets)\n"
+    "  --aac             AAC sound: the same tone and motor, encoded (over 20 minutes, silent packets)\n"
     "  --seconds N       length of the movie (default 10)\n"
-    "  --size-gib N      pad the video frames so that the file reaches about N GiB\n"
+    "  --size-gib N      pad the video frames so that the file reaches about N GiB (a warning\n"
+    "                    says when the movie's length makes it larger)\n"
     "  --little-endian   store PCM sound as \"sowt\" instead of \"twos\"\n"
     "  -f, --force       replace an existing DST\n"
+    "  -q, --quiet       no line about what was written\n"
     "  exit status: 0 written, 1 DST exists or cannot be written, 2 usage error\n";
 
 constexpr uint32_t kSampleRate = 48000;
@@ -69,6 +72,41 @@ std::vector<int16_t> ToneWithMotorNoise(uint64_t frames, const std::vector<movie
     return samples;
 }
 
+// The sound as a camera records it in AAC: through the encoder jobs use, whose packets decode
+// to one packet of priming and then the sound, which the movie's edit skips. `packets` of them.
+bool EncodeAac(std::vector<int16_t> pcm, uint64_t packets, std::vector<moviekit::Bytes>& out)
+{
+    struct Collected {
+        std::vector<moviekit::Bytes>* packets;
+        uint64_t wanted;
+    } collected{&out, packets};
+    ACEncoderStream stream;
+    stream.userData = &collected;
+    stream.resultProc = [](void* self, unsigned char* data, unsigned int size) {
+        auto* into = static_cast<Collected*>(static_cast<ACEncoderStream*>(self)->userData);
+        if (into->packets->size() < into->wanted) {
+            into->packets->emplace_back(data, data + size);
+        }
+        return eTqovixSuccess;
+    };
+    constexpr uint32_t kFrameBytes = 2 * kChannels;
+    const ACFormat aac{kSampleRate, ACFormatAAC, 0, 0, 1024, 0, kChannels, 0};
+    const ACFormat linear{kSampleRate, ACFormatLinearPCM, 12, kFrameBytes, 1, kFrameBytes, kChannels, 16};
+    AACEncoder encoder;
+    if (encoder.Initialize(linear, aac, 128000, &stream) != eConverterSuccess) {
+        return false;
+    }
+    // Pushed a second at a time: one push is limited to what an unsigned int counts.
+    constexpr size_t kPush = kSampleRate * kChannels;
+    for (size_t at = 0; at < pcm.size(); at += kPush) {
+        const size_t count = std::min(kPush, pcm.size() - at);
+        if (encoder.Encode(pcm.data() + at, static_cast<unsigned int>(count * sizeof(int16_t))) != eConverterSuccess) {
+            return false;
+        }
+    }
+    return encoder.EncodeDone() == eConverterSuccess && out.size() == packets;
+}
+
 }  // namespace
 
 int MakeSampleCommand(const Arguments& arguments)
@@ -83,6 +121,9 @@ int MakeSampleCommand(const Arguments& arguments)
         return line.Misuse("one DST is needed");
     }
     const std::string destination = line.Operands()[0];
+    if (destination == "-") {
+        return line.Misuse("'-' is not a file: a movie cannot be written to standard output");
+    }
     long seconds = 10;
     int status = 2;
     if (!line.Number("seconds", 1, 24 * 3600, seconds, status)) {
@@ -121,8 +162,13 @@ int MakeSampleCommand(const Arguments& arguments)
     const uint64_t n = aac ? moviekit::DivCeil(frames, 1024) * 1024 : frames;
     const std::vector<moviekit::AfInterval> intervals = {{n / 4, n / 4 + n / 10, 800}, {n / 2, n / 2 + n / 8, 500}};
     recipe.maker.afIntervals = intervals;
-    if (!aac && static_cast<unsigned long>(seconds) <= kMaxExplicitSoundSeconds) {
-        recipe.sound.pcm = ToneWithMotorNoise(frames, intervals);
+    if (static_cast<unsigned long>(seconds) <= kMaxExplicitSoundSeconds) {
+        if (!aac) {
+            recipe.sound.pcm = ToneWithMotorNoise(frames, intervals);
+        } else if (!EncodeAac(ToneWithMotorNoise(n, intervals), n / 1024, recipe.sound.aacPackets)) {
+            std::fprintf(stderr, "tqovix make-sample: the AAC encoder is not available (libavcodec)\n");
+            return 1;
+        }
     }
     if (sizeGib > 0) {
         // Sound and the atoms besides the frames are small beside the video: the frames take the rest.
@@ -142,6 +188,17 @@ int MakeSampleCommand(const Arguments& arguments)
         std::fprintf(stderr, "tqovix: %s\n", error.c_str());
         std::remove(destination.c_str());
         return 1;
+    }
+    // Frames are never cut below their natural size: a short target is overshot, and said so.
+    const double written = static_cast<double>(layout.fileSize) / (1ULL << 30);
+    if (sizeGib > 0 && std::abs(written - sizeGib) > sizeGib / 100) {
+        std::fprintf(stderr,
+                     "tqovix make-sample: warning: the movie is %.3f GiB, not the %g GiB asked: its %ld seconds "
+                     "need more; give fewer --seconds\n",
+                     written, sizeGib, seconds);
+    }
+    if (line.Quiet()) {
+        return 0;
     }
     std::printf("%s: %llu bytes, %zu video chunks, %zu sound chunks (%s)\n", destination.c_str(),
                 static_cast<unsigned long long>(layout.fileSize), layout.videoChunks.size(),

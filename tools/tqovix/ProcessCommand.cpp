@@ -23,7 +23,8 @@ namespace {
 
 constexpr const char* kUsage =
     "usage: tqovix process [OPTIONS] SRC DST\n"
-    "  removes the AF noise from the sound of SRC and writes the result to DST\n"
+    "  removes the AF noise from the sound of SRC and writes the result to DST; a DST that is\n"
+    "  a folder (or ends in '/') gets SRC's file name. Neither may be \"-\": movies are files.\n"
     "  -f, --force         replace an existing DST (only by a complete movie)\n"
     "  -n, --no-overwrite  refuse an existing DST (the default)\n"
     "  -q, --quiet         no progress and no \"done\" line\n"
@@ -38,6 +39,7 @@ constexpr const char* kUsage =
 // is redrawn less often.
 constexpr auto kPollInterval = std::chrono::milliseconds(2);
 constexpr double kRedrawSeconds = 0.05;
+constexpr double kFirstShowSeconds = 1;
 // How long an abort may take before the library is closed under the job. A stop lands within
 // a piece of any copy, so this is for a library that hangs.
 constexpr double kAbortGraceSeconds = 30;
@@ -74,7 +76,9 @@ public:
 
     void Show(double fraction, double elapsed)
     {
-        if (m_quiet) {
+        // A job the library refuses ends within its first moment, before any progress: it
+        // should print its reason alone.
+        if (m_quiet || (fraction <= 0 && elapsed < kFirstShowSeconds)) {
             return;
         }
         const int percent = static_cast<int>(fraction * 100);
@@ -185,6 +189,19 @@ bool SameEntry(const DirectoryEntry& a, const DirectoryEntry& b)
                                                   a.changed.tv_nsec == b.changed.tv_nsec));
 }
 
+// A folder as the destination stands for the source's name in it.
+std::string IntoFolder(const std::string& source, const std::string& destination)
+{
+    struct stat status {};
+    const bool folder = destination.ends_with('/') || (stat(destination.c_str(), &status) == 0 && S_ISDIR(status.st_mode));
+    const size_t slash = source.rfind('/');
+    const std::string name = slash == std::string::npos ? source : source.substr(slash + 1);
+    if (!folder || name.empty() || name == "." || name == "..") {
+        return destination;
+    }
+    return destination + (destination.ends_with('/') ? "" : "/") + name;
+}
+
 // Not a code the library gives: the job was closed under before it ended.
 constexpr int kClosedUnderJob = -1;
 
@@ -221,7 +238,13 @@ int ProcessCommand(const Arguments& arguments)
     if (line.Operands().size() != 2) {
         return line.Misuse("SRC and DST are needed");
     }
-    Options options{line.Operands()[0], line.Operands()[1], line.Has("force") && !line.Has("no-overwrite"),
+    for (const std::string& path : line.Operands()) {
+        if (path == "-") {
+            return line.Misuse("'-' is not a file: SRC and DST must be files, not standard input or output");
+        }
+    }
+    const std::string& source = line.Operands()[0];
+    Options options{source, IntoFolder(source, line.Operands()[1]), line.Has("force") && !line.Has("no-overwrite"),
                     line.Quiet(), line.Has("json"), line.Has("sync"), line.Has("progress")};
     RemoveStalePartials(options.destination);
     if (const Verdict refusal = CheckDestination(options.source, options.destination, options.force);

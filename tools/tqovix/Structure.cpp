@@ -173,3 +173,38 @@ bool StartsLikeMovie(const std::string& path)
     return file != nullptr && std::fread(header, 1, sizeof header, file.get()) == sizeof header &&
            IsTopLevelType(AtomTypeText(header + 4));
 }
+
+std::string NonMovieKind(const std::string& path)
+{
+    const std::unique_ptr<FILE, FileCloser> file(std::fopen(path.c_str(), "rb"));
+    unsigned char head[512];
+    const size_t count = file == nullptr ? 0 : std::fread(head, 1, sizeof head, file.get());
+    const auto starts = [&](const char* magic, size_t length) {
+        return count >= length && std::memcmp(head, magic, length) == 0;
+    };
+    if (starts("\xFF\xD8\xFF", 3)) {
+        return "a JPEG image";
+    }
+    if (starts("\x89PNG\r\n\x1A\n", 8)) {
+        return "a PNG image";
+    }
+    // Most raw stills are TIFF underneath; the 16-bit magic is 42, or 43 for BigTIFF.
+    if (starts("II*\0", 4) || starts("MM\0*", 4) || starts("II+\0", 4) || starts("MM\0+", 4)) {
+        return "a TIFF image or raw still";
+    }
+    const size_t bom = starts("\xEF\xBB\xBF", 3) ? 3 : 0;
+    if (count >= bom + 5 && std::memcmp(head + bom, "<?xml", 5) == 0) {
+        return "an XML file (a sidecar)";
+    }
+    if (count == 0) {
+        return {};
+    }
+    // Text: no control bytes besides white space. Bytes from 0x80 up are let pass, for UTF-8.
+    for (size_t i = bom; i < count; ++i) {
+        const unsigned char c = head[i];
+        if (c < 0x20 && c != '\t' && c != '\n' && c != '\r' && c != '\f') {
+            return {};
+        }
+    }
+    return "plain text";
+}

@@ -29,5 +29,8 @@ Structure ScanStructure(const std::string& path);
 // Whether the file begins as a QuickTime or ISO movie does (its first atom's type), read
 // from its first bytes only.
 bool StartsLikeMovie(const std::string& path);
+// What a file that is no movie most likely is, by its first bytes ("a JPEG image", "an
+// XML file", ...); empty when they say nothing known.
+std::string NonMovieKind(const std::string& path);
 // Four type bytes as text a terminal and JSON can carry.
 std::string AtomTypeText(const unsigned char type[4]);

@@ -3,6 +3,7 @@
 #include <cstring>
 #include <string>
 
+#include "CommandLine.h"
 #include "Commands.h"
 #include "LibavHandles.h"
 
@@ -12,20 +13,20 @@ constexpr const char* kUsage =
     "usage: tqovix COMMAND [OPTIONS] [ARGS]\n"
     "\n"
     "commands:\n"
-    "  check FILE...              tell whether each movie can be processed, or why not\n"
-    "  process SRC DST            remove the AF noise of SRC's sound, writing DST\n"
+    "  check PATH...              tell whether each movie can be processed, or why not\n"
+    "  process SRC DST            remove the AF noise of SRC's sound, writing DST (a file or a folder)\n"
     "  batch -o OUTDIR PATH...    process many movies or folders of them, several at a time\n"
-    "  inspect FILE               atom tree, tracks, trim tags and maker data of a file\n"
+    "  inspect PATH...            summary, atom tree, tracks, trim tags and maker data of files\n"
     "  make-sample DST            write a camera-style movie to try the others on\n"
     "  compare SRC DST            measure and draw what processing did to the sound\n"
     "\n"
-    "  tqovix COMMAND -h          the options of a command\n"
+    "  tqovix COMMAND -h          the options of a command (or: tqovix help COMMAND)\n"
     "  -h, --help                 this text\n"
     "  --version                  the versions of tqovix, the library and libavcodec\n"
     "\n"
-    "Every command takes -q/--quiet and -v, and \"--\" to end its options; results go to\n"
-    "stdout, messages to stderr. Exit status: 0 done, 1 failed or refused, 2 usage error,\n"
-    "130 interrupted.\n";
+    "Every command takes -q/--quiet and -v, and \"--\" to end its options; options may stand\n"
+    "before the command too (tqovix -q check FILE). Results go to stdout, messages to stderr.\n"
+    "Exit status: 0 done, 1 failed or refused, 2 usage error, 130 interrupted.\n";
 
 void PrintVersions()
 {
@@ -44,6 +45,34 @@ struct Command {
     int (*run)(const Arguments&);
 };
 
+constexpr Command kCommands[] = {
+    {"check", CheckCommand},     {"process", ProcessCommand},         {"batch", BatchCommand},
+    {"inspect", InspectCommand}, {"make-sample", MakeSampleCommand}, {"compare", CompareCommand},
+};
+
+const Command* FindCommand(const std::string& name)
+{
+    for (const Command& command : kCommands) {
+        if (name == command.name) {
+            return &command;
+        }
+    }
+    return nullptr;
+}
+
+int UnknownCommand(const std::string& name)
+{
+    std::vector<std::string> names;
+    for (const Command& command : kCommands) {
+        names.push_back(command.name);
+    }
+    names.push_back("help");
+    const std::string meant = ClosestName(name, names);
+    std::fprintf(stderr, "tqovix: unknown command '%s'%s (tqovix -h lists the commands)\n", name.c_str(),
+                 meant.empty() ? "" : ("; did you mean '" + meant + "'?").c_str());
+    return 2;
+}
+
 }  // namespace
 
 int main(int argc, char** argv)
@@ -52,24 +81,39 @@ int main(int argc, char** argv)
         std::fputs(kUsage, stderr);
         return 2;
     }
-    const std::string first = argv[1];
-    if (first == "--help" || first == "-h") {
-        std::fputs(kUsage, stdout);
-        return 0;
-    }
-    if (first == "--version") {
-        PrintVersions();
-        return 0;
-    }
-    static constexpr Command kCommands[] = {
-        {"check", CheckCommand},     {"process", ProcessCommand},         {"batch", BatchCommand},
-        {"inspect", InspectCommand}, {"make-sample", MakeSampleCommand}, {"compare", CompareCommand},
-    };
-    for (const Command& command : kCommands) {
-        if (first == command.name) {
-            return command.run(Arguments(argv + 2, argv + argc));
+    // Options before the command are the command's: "tqovix -q check" is "tqovix check -q".
+    Arguments leading;
+    int at = 1;
+    for (; at < argc && argv[at][0] == '-'; ++at) {
+        const std::string option = argv[at];
+        if (option == "--help" || option == "-h") {
+            std::fputs(kUsage, stdout);
+            return 0;
         }
+        if (option == "--version") {
+            PrintVersions();
+            return 0;
+        }
+        leading.push_back(option);
     }
-    std::fprintf(stderr, "tqovix: unknown command '%s'\n%s", argv[1], kUsage);
-    return 2;
+    if (at == argc) {
+        std::fputs("tqovix: no command given (tqovix -h lists the commands)\n", stderr);
+        return 2;
+    }
+    std::string name = argv[at];
+    Arguments arguments(argv + at + 1, argv + argc);
+    if (name == "help") {
+        if (arguments.empty()) {
+            std::fputs(kUsage, stdout);
+            return 0;
+        }
+        name = arguments[0];
+        arguments = {"--help"};
+    }
+    const Command* command = FindCommand(name);
+    if (command == nullptr) {
+        return UnknownCommand(name);
+    }
+    leading.insert(leading.end(), arguments.begin(), arguments.end());
+    return command->run(leading);
 }
