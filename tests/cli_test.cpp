@@ -328,7 +328,7 @@ TEST(CliTest, CheckAndInspectSearchFoldersAndNameOtherFiles)
     std::string named;
     for (const auto& [name, bytes] : others) {
         WriteText(card + "/" + name, bytes);
-        named += " " + Q(card + "/" + name);
+        named.append(" ").append(Q(card + "/" + name));
     }
     const Outcome flat = Tool("check " + Q(card));
     EXPECT_EQ(flat.status, 0) << flat.output;
