@@ -9,7 +9,7 @@ from dataclasses import dataclass
 
 import numpy as np
 
-from motors import KINDS
+from motors import HOLDOUT_KINDS, KINDS
 
 SECONDS = 8.0
 # (name, material kind, rate, channels)
@@ -22,6 +22,18 @@ MATERIALS = [
     ("speech-stereo", "speech", 48000, 2),
 ]
 SNRS = [0, 5, 10]
+# The held-out set (--holdout): material and motors never used while tuning, other seeds, wider
+# SNRs and interval lengths.  Its figures tell whether a change learned the kind of noise or
+# these clips.
+HOLDOUT_MATERIALS = [
+    ("piano-stereo", "piano", 48000, 2),
+    ("drums-mono", "drums", 48000, 1),
+    ("traffic-stereo", "traffic", 48000, 2),
+    ("birds-mono-44k", "birds", 44100, 1),
+    ("crowd-stereo", "crowd", 48000, 2),
+    ("speech-mono-44k", "speech", 44100, 1),
+]
+HOLDOUT_SNRS = [-5, 5, 15]
 
 
 @dataclass
@@ -39,11 +51,15 @@ class Case:
     motor_in: list       # per interval: whether the motor runs
 
 
-def _intervals(rate, rng, count):
-    """count intervals of 0.5-2 s, at least 0.35 s from each other and from the clip's ends."""
+def material_seed(name):
+    return [m[0] for m in MATERIALS + HOLDOUT_MATERIALS].index(name) + 1
+
+
+def _intervals(rate, rng, count, shortest=0.5, longest=2.0):
+    """count intervals of shortest-longest s, at least 0.35 s from each other and from the clip's ends."""
     frames = int(SECONDS * rate)
     while True:
-        lengths = rng.uniform(0.5, 2.0, count)
+        lengths = rng.uniform(shortest, longest, count)
         free = SECONDS - lengths.sum() - 0.35 * (count + 1)
         if free < 0:
             continue
@@ -77,3 +93,21 @@ def quick_cases():
     picks = [0, 7, 9, 11, 16, 20, 23, 28]
     every = all_cases()
     return [every[i] for i in picks]
+
+
+def holdout_cases():
+    cases = []
+    for m, (mname, kind, rate, channels) in enumerate(HOLDOUT_MATERIALS):
+        for k, motor in enumerate(HOLDOUT_KINDS):
+            index = m * len(HOLDOUT_KINDS) + k
+            snr = HOLDOUT_SNRS[(m + k) % 3]
+            codec = "aac" if index % 7 == 3 else ("sowt" if index % 3 == 1 else "twos")
+            rng = np.random.default_rng(5000 + index)
+            count = int(rng.integers(2, 5))
+            intervals = _intervals(rate, rng, count, 0.3, 6.0 / count)
+            motor_in = [True] * count
+            if index % 2 == 1:
+                motor_in[int(rng.integers(count))] = False
+            cases.append(Case(f"{mname}/{motor}/{snr}dB/{codec}", mname, kind, rate, channels, motor, snr, codec,
+                              5000 + index, intervals, motor_in))
+    return cases

@@ -207,11 +207,142 @@ def music(rate, channels, seconds, seed):
     return set_rms(out, -20)
 
 
+def piano(rate, channels, seconds, seed):
+    """Struck strings over the whole keyboard: hammer transients, inharmonic partials decaying
+    at their own rates, chords in the bass and runs in the treble."""
+    rng = np.random.default_rng(seed)
+    frames = int(seconds * rate)
+    out = np.zeros((frames, 2))
+    midi = lambda m: 440.0 * 2 ** ((m - 69) / 12)
+    at = 0.0
+    while at < seconds - 0.1:
+        low = rng.random() < 0.35
+        keys = rng.integers(28, 52, 3) if low else rng.integers(55, 96, 1 + int(rng.integers(2)))
+        s = int(at * rate)
+        n = min(int(rate * rng.uniform(0.8, 2.5)), frames - s)
+        t = np.arange(n) / rate
+        for key in keys:
+            f0 = midi(int(key))
+            note = np.zeros(n)
+            for k in range(1, 12):
+                fk = f0 * k * np.sqrt(1 + 0.0004 * k * k)
+                if fk > rate / 2 - 1000:
+                    break
+                note += np.sin(2 * np.pi * fk * t) * np.exp(-t * (1.5 + 0.6 * k) * (f0 / 260) ** 0.3) / k
+            hammer = rng.standard_normal(min(n, int(rate * 0.004))) * 0.3
+            note[:len(hammer)] += hammer
+            pan = (int(key) - 20) / 90
+            out[s:s + n, 0] += note * (1 - pan)
+            out[s:s + n, 1] += note * pan
+        at += rng.choice([0.125, 0.25, 0.25, 0.5])
+    out = out if channels == 2 else out.mean(axis=1, keepdims=True)
+    return set_rms(out, -20)
+
+
+def drums(rate, channels, seconds, seed):
+    """A kit: kick (a falling sine), snare (tone and noise), closed hats (short high noise) in a
+    groove with a bass line under it: transients a motor's ticks must not be confused with."""
+    rng = np.random.default_rng(seed)
+    frames = int(seconds * rate)
+    out = np.zeros(frames)
+    beat = 60 / rng.uniform(90, 130)
+    sixteenth = beat / 4
+    i = 0
+    while i * sixteenth < seconds:
+        s = int(i * sixteenth * rate)
+        if i % 8 in (0, 3) or (i % 16 == 10):
+            n = min(int(rate * 0.3), frames - s)
+            t = np.arange(n) / rate
+            out[s:s + n] += np.sin(2 * np.pi * (50 + 90 * np.exp(-t * 30)) * t) * np.exp(-t * 9)
+        if i % 8 == 4:
+            n = min(int(rate * 0.2), frames - s)
+            t = np.arange(n) / rate
+            noise = signal.sosfilt(signal.butter(2, [1500, 8000], "bandpass", fs=rate, output="sos"), rng.standard_normal(n))
+            out[s:s + n] += (0.5 * np.sin(2 * np.pi * 190 * t) + 0.8 * noise) * np.exp(-t * 22)
+        if i % 2 == 0:
+            n = min(int(rate * 0.05), frames - s)
+            t = np.arange(n) / rate
+            hat = signal.sosfilt(signal.butter(2, 7000, "highpass", fs=rate, output="sos"), rng.standard_normal(n))
+            out[s:s + n] += hat * np.exp(-t * 90) * rng.uniform(0.2, 0.4)
+        i += 1
+    bass = _note(55.0 * 2 ** (rng.integers(0, 5) / 12), frames, rate, [1, 0.5, 0.25], 0.1, 0.0, rng)
+    pump = 0.5 + 0.5 * np.abs(np.sin(np.pi * np.arange(frames) / rate / beat))
+    out += 0.35 * bass * pump
+    x = out[:, None] if channels == 1 else np.stack([out, 0.8 * out + 0.05 * rng.standard_normal(frames) * 0.01], 1)
+    return set_rms(x, -20)
+
+
+def traffic(rate, channels, seconds, seed):
+    """A street: low engine rumble of passing cars swelling and fading, tyre hiss, a far horn."""
+    rng = np.random.default_rng(seed)
+    frames = int(seconds * rate)
+    t = np.arange(frames) / rate
+    x = room_tone(frames, rate, channels, rng, -40)
+    for _ in range(int(seconds / 2.5) + 2):
+        centre = rng.uniform(-1, seconds + 1)
+        width = rng.uniform(0.8, 2.0)
+        env = np.exp(-((t - centre) / width) ** 2)
+        engine = 30 * rng.uniform(0.8, 1.6)
+        tone = sum(np.sin(2 * np.pi * engine * k * t * (1 - 0.03 * np.tanh((t - centre) / width)) + k) / k
+                   for k in range(1, 8))
+        rumble = signal.sosfilt(signal.butter(2, [40, 400], "bandpass", fs=rate, output="sos"), rng.standard_normal(frames))
+        hiss = signal.sosfilt(signal.butter(2, [800, 5000], "bandpass", fs=rate, output="sos"), rng.standard_normal(frames))
+        car = (0.3 * tone + rumble / max(np.std(rumble), 1e-12) + 0.4 * hiss / max(np.std(hiss), 1e-12)) * env
+        for c in range(channels):
+            x[:, c] += 0.05 * car * (0.6 + 0.4 * ((c + centre) % 2))
+    return set_rms(x, -26)
+
+
+def birds(rate, channels, seconds, seed):
+    """Birdsong in a quiet garden: fast chirps sweeping up and down between 2 and 8 kHz, trills,
+    over a faint breeze."""
+    rng = np.random.default_rng(seed)
+    frames = int(seconds * rate)
+    x = room_tone(frames, rate, channels, rng, -50)
+    at = rng.uniform(0, 0.3)
+    while at < seconds - 0.3:
+        s = int(at * rate)
+        calls = int(rng.integers(2, 9))
+        f_lo, f_hi = sorted(rng.uniform(2000, 8000, 2))
+        for j in range(calls):
+            n = int(rate * rng.uniform(0.03, 0.09))
+            t = np.arange(n) / rate
+            sweep = f_lo + (f_hi - f_lo) * (t / t[-1] if j % 2 == 0 else 1 - t / t[-1])
+            chirp = np.sin(2 * np.pi * np.cumsum(sweep) / rate) * np.hanning(n)
+            p = s + j * int(rate * rng.uniform(0.06, 0.12))
+            if p + n >= frames:
+                break
+            for c in range(channels):
+                x[p:p + n, c] += chirp * 0.05 * (1.0 if c == 0 else 0.6)
+        at += rng.uniform(0.5, 1.5)
+    return set_rms(x, -28)
+
+
+def crowd(rate, channels, seconds, seed):
+    """A room of people: four espeak-ng voices talking at once at different levels and places."""
+    rng = np.random.default_rng(seed)
+    frames = int(seconds * rate)
+    x = np.zeros((frames, channels))
+    for talker in range(4):
+        voice = speech_synthetic(rate, 1, seconds, seed * 7 + talker + 3)[:, 0]
+        voice = np.roll(voice, int(rng.integers(0, frames)))
+        level = 10 ** (-talker * 4 / 20)
+        for c in range(channels):
+            pan = (talker + 1) / 5
+            x[:, c] += voice * level * (pan if c == 0 else 1 - pan)
+    return set_rms(x + room_tone(frames, rate, channels, rng, -50), -24)
+
+
 MATERIALS = {
     "speech": speech_synthetic,
     "voice": speech_recorded,
     "music": music,
     "ambience": ambience,
+    "piano": piano,
+    "drums": drums,
+    "traffic": traffic,
+    "birds": birds,
+    "crowd": crowd,
 }
 
 

@@ -14,6 +14,7 @@ LABELS = {"ours": "ours (tqovix process)", "afftdn": "ffmpeg afftdn (blind)", "a
           "webrtc": "WebRTC NS, GStreamer webrtcdsp (blind)", "rnnoise": "RNNoise, npm wasm (blind)",
           "sox": "sox noisered, true motor profile", "irm": "ideal ratio mask (oracle ceiling)"}
 SECTION = "## Sound quality"
+HOLDOUT_SECTION = "## Sound quality, held-out material and motors"
 
 
 def _version(cmd, pattern=None):
@@ -107,9 +108,9 @@ def _quiet_text(s):
     return text
 
 
-def render(entries, methods, total_seconds, quick, tool, rnnoise_module):
+def render(entries, methods, total_seconds, quick, tool, rnnoise_module, section=SECTION):
     summaries = {m: summarise(entries, m) for m in ["input"] + methods}
-    lines = [SECTION, ""]
+    lines = [section, ""]
     lines.append(f"Run {datetime.datetime.now().strftime('%Y-%m-%d %H:%M')} on {machine()}; "
                  f"{'quick set, ' if quick else ''}{len(entries)} cases, whole run {total_seconds:.0f} s.")
     lines.append(f"Versions: {versions(tool, rnnoise_module)}.")
@@ -202,10 +203,11 @@ def goals_of(summaries, methods):
 
 
 def replace_section(path, text):
-    """Replaces the Sound quality section (up to the next heading of its level or above), or appends it."""
+    """Replaces the section `text` heads (up to the next heading of its level or above), or appends it."""
+    heading = text.splitlines()[0]
     old = open(path).read() if os.path.exists(path) else "# Benchmark results\n"
     lines = old.splitlines(keepends=True)
-    start = next((i for i, l in enumerate(lines) if l.rstrip() == SECTION), None)
+    start = next((i for i, l in enumerate(lines) if l.rstrip() == heading), None)
     if start is None:
         body = old.rstrip("\n") + "\n\n" + text
     else:

@@ -30,7 +30,7 @@ METHODS = ["ours"] + anchors.ALL
 def build_sound(case, clean_cache):
     key = (case.material, case.rate)
     if key not in clean_cache:
-        seed = [m[0] for m in casebook.MATERIALS].index(case.material) + 1
+        seed = casebook.material_seed(case.material)
         clean_cache[key] = material.make(case.kind, case.rate, case.channels, casebook.SECONDS, seed)
     clean = clean_cache[key].copy()
     lens = motors.Lens(case.motor, case.rate, case.seed)
@@ -108,20 +108,27 @@ def main():
     parser.add_argument("--rnnoise-module", required=True)
     parser.add_argument("--results", required=True, help="bench/results.md, whose Sound quality section is replaced")
     parser.add_argument("--quick", action="store_true")
+    parser.add_argument("--holdout", action="store_true",
+                        help="the held-out material and motors; its own section of the results")
     parser.add_argument("--only", default="", help="comma-separated methods (default all)")
     parser.add_argument("--strict", action="store_true", help="exit 1 when a goal is not met")
+    parser.add_argument("--no-results", action="store_true", help="print the tables, leave bench/results.md")
     parser.add_argument("--report-only", action="store_true", help="render the last run's results.json again")
     args = parser.parse_args()
+    saved_path = os.path.join(args.work, "results-holdout.json" if args.holdout else "results.json")
+    section = report.HOLDOUT_SECTION if args.holdout else report.SECTION
     if args.report_only:
-        with open(os.path.join(args.work, "results.json")) as f:
+        with open(saved_path) as f:
             saved = json.load(f)
         methods = list(saved["entries"][0]["methods"]) if saved["entries"] else []
         text, passed = report.render(saved["entries"], methods, saved["seconds"], saved["quick"], args.tool,
-                                     args.rnnoise_module)
+                                     args.rnnoise_module, section)
         print(text)
-        report.replace_section(args.results, text)
+        if not args.no_results:
+            report.replace_section(args.results, text)
         return 1 if args.strict and not passed else 0
-    chosen = casebook.quick_cases() if args.quick else casebook.all_cases()
+    chosen = casebook.holdout_cases() if args.holdout else (
+        casebook.quick_cases() if args.quick else casebook.all_cases())
     methods = [m for m in METHODS if not args.only or m in args.only.split(",")]
     ctx = {"rnnoise_module": args.rnnoise_module}
     clean_cache, entries = {}, []
@@ -139,11 +146,12 @@ def main():
               file=sys.stderr, flush=True)
         shutil.rmtree(work, ignore_errors=True)
     total = time.perf_counter() - started
-    with open(os.path.join(args.work, "results.json"), "w") as f:
+    with open(saved_path, "w") as f:
         json.dump({"entries": entries, "seconds": total, "quick": args.quick}, f, indent=1, default=float)
-    text, passed = report.render(entries, methods, total, args.quick, args.tool, args.rnnoise_module)
+    text, passed = report.render(entries, methods, total, args.quick, args.tool, args.rnnoise_module, section)
     print(text)
-    report.replace_section(args.results, text)
+    if not args.no_results:
+        report.replace_section(args.results, text)
     return 1 if args.strict and not passed else 0
 
 

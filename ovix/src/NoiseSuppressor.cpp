@@ -58,6 +58,7 @@ NoiseSuppressor::NoiseSuppressor(uint64_t rateHz, unsigned channels, uint64_t fr
 void NoiseSuppressor::SetSpans(std::vector<DriveSpan> spans)
 {
     m_spans = std::move(spans);
+    m_spanShares.assign(m_spans.size(), 0.0);
     m_next = 0;
     m_segmentAt = m_spans.empty() ? 0 : m_spans.front().start;
 }
@@ -261,6 +262,7 @@ void NoiseSuppressor::ProcessSegment(const Segment& segment)
         m_roles[m_power.Rows() - 1] = role;
     }
     m_lastShare = m_estimator.Estimate(m_power, m_roles.data(), m_noise);
+    m_spanShares[m_next] = m_lastShare;
     if (m_lastShare < kAudibleShare) {
         return;
     }

@@ -49,6 +49,8 @@ public:
     const SuppressorParameters& Parameters() const { return m_parameters; }
     // The motor share the last processed segment was judged by; for the bench and tests.
     double LastMotorShare() const { return m_lastShare; }
+    // Per span, the share its last segment was judged by (0: left as it came).
+    const std::vector<double>& SpanShares() const { return m_spanShares; }
 
 private:
     struct Segment {
@@ -98,6 +100,7 @@ private:
     MotorEstimator m_estimator;
     GainRule m_gainRule;
     double m_lastShare = 0.0;
+    std::vector<double> m_spanShares;
 };
 
 }  // namespace ovix
