@@ -73,8 +73,10 @@ def main():
     clean_cache = {}
     for label, chosen in sets:
         chosen = [c for c in chosen if args.cases in c.name]
+        if not chosen:
+            continue
         sounds = [sound_of(c, clean_cache) for c in chosen]
-        with ThreadPoolExecutor(1 if os.environ.get('OVIX_DEBUG') else 2) as pool:
+        with ThreadPoolExecutor(2) as pool:
             scores = list(pool.map(lambda a: run(args.probe, *a), [(c, *s) for c, s in zip(chosen, sounds)]))
         means, worst, quiet, lsd, lsd_in = [], [], [], [], []
         for case, score in zip(chosen, scores):

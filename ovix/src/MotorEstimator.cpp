@@ -32,15 +32,15 @@ constexpr int kMinHarmonics = 3;
 constexpr double kTrackSeconds = 0.25;  // each side: longer than a syllable or a short note
 constexpr double kTrackOctaves = 1.0 / 6.0;
 constexpr float kLobeSide = 0.4f;  // a partial's power one bin off its centre, under this window
-// What shows a motor in an interval: the smaller of its two end steps carries this share of
-// the sound at that end, or what rises far above the surroundings this share of its power.
-constexpr double kClearStep = 0.065;
-constexpr double kClearRise = 0.045;
-// And that evidence looks like the lens heard in earlier intervals: this share of its power in
-// bands where theirs was. Unrelated spectra share a few percent, a chord under a whine's sweep
-// over a tenth.
-constexpr double kLikeLens = 0.2;
-constexpr double kBandsPerOctave = 4.0;
+// Bins whose ends step more than twice as far as the wanted sound does on its own count as weak
+// evidence; the motor's spectrum is taken from bins that step beyond it at all.
+constexpr float kWeakScore = 2.5f;
+constexpr float kSpectrumScore = 0.0f;
+// Also weak evidence: a bin that even in the interval's quiet moments is louder than the
+// surroundings on both sides are most of the time.
+constexpr double kQuietInside = 0.25;
+constexpr double kUsualAround = 0.5;
+constexpr double kLoudAround = 0.8;
 // Enough bins to judge a frame by, few enough to judge every frame quickly.
 constexpr size_t kMaxMotorBins = 64;
 
@@ -48,6 +48,7 @@ constexpr size_t kMaxMotorBins = 64;
 
 MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
     : m_bins(parameters.bins),
+      m_detector(parameters),
       m_windowRows(std::max<size_t>(kMinRows, static_cast<size_t>(kWindowSeconds * static_cast<double>(parameters.rateHz)) /
                                                   parameters.hop)),
       m_floor(m_bins),
@@ -56,19 +57,12 @@ MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
       m_outside(m_bins),
       m_step(m_bins),
       m_motor(m_bins),
-      m_history(kRemembered * m_bins)
+      m_usualBefore(m_bins),
+      m_usualAfter(m_bins),
+      m_loudBefore(m_bins),
+      m_loudAfter(m_bins)
 {
     m_motorBins.reserve(m_bins);
-    m_band.resize(m_bins);
-    for (size_t k = 1; k < m_bins; ++k) {
-        m_band[k] = static_cast<uint8_t>(kBandsPerOctave * std::log2(static_cast<double>(k)));
-    }
-    m_band[0] = m_band[1];
-    m_bands = static_cast<size_t>(m_band[m_bins - 1]) + 1;
-    m_stepBands.resize(m_bands);
-    m_riseBands.resize(m_bands);
-    m_templateBands.resize(m_bands);
-    m_riseHistory.resize(kRemembered * m_bands);
     m_base.resize(m_bins);
     m_salience.resize(m_bins);
     m_spread.resize(m_bins);
@@ -88,7 +82,7 @@ MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
         }
     }
     const size_t rows = (parameters.segmentFrames + parameters.fftSize + 2 * parameters.rampFrames) / parameters.hop + 8;
-    m_column.resize(std::max({rows, parameters.contextFrames * 2 / parameters.hop + 8, m_bins, kRemembered}));
+    m_column.resize(std::max({rows, parameters.contextFrames * 2 / parameters.hop + 8, m_bins}));
     m_activation.resize(m_column.size());
     m_risenBins.resize(m_column.size());
     // A tick shows in the frames whose window reaches it.
@@ -124,38 +118,64 @@ void MotorEstimator::SetSurroundings(const SpectralFrames& around, size_t before
     m_before = std::min(before, around.Rows());
     m_bFirst = first;
     m_bLast = last;
+    m_detector.Calibrate(around, m_before);
     if (around.Rows() >= kMinRows) {
         Quantile(around, 0, around.Rows(), kFloorQuantile, m_floor);
-        std::fill(m_ceiling.begin(), m_ceiling.end(), 0.0f);
-        for (size_t row = 0; row < around.Rows(); ++row) {
-            const float* p = around.Row(row);
-            for (size_t k = 0; k < m_bins; ++k) {
-                m_ceiling[k] = std::max(m_ceiling[k], p[k]);
-            }
-        }
-        // A bin's ceiling is the loudest of it and its neighbours: a voice's harmonics move with
-        // its pitch, and one louder syllable a bin away is no motor.
-        std::copy(m_ceiling.begin(), m_ceiling.end(), m_inside.begin());
-        for (size_t k = 0; k < m_bins; ++k) {
-            const size_t from = k > kCeilingSpread ? k - kCeilingSpread : 0;
-            const size_t to = std::min(m_bins, k + kCeilingSpread + 1);
-            m_ceiling[k] = *std::max_element(m_inside.begin() + static_cast<ptrdiff_t>(from),
-                                             m_inside.begin() + static_cast<ptrdiff_t>(to));
-        }
+        Ceiling(around, 0, around.Rows(), m_ceiling);
     }
     // Otherwise what was heard around earlier intervals stands.
 }
 
-bool MotorEstimator::StepSpectrum(const SpectralFrames& power, const FrameRole* roles)
+// A bin's ceiling is the loudest of it and its neighbours: a voice's harmonics move with its
+// pitch, and one louder syllable a bin away is no motor.
+void MotorEstimator::Ceiling(const SpectralFrames& frames, size_t from, size_t to, std::vector<float>& out)
 {
-    size_t firstCore = power.Rows();
-    size_t endCore = 0;
-    for (size_t row = 0; row < power.Rows(); ++row) {
+    std::fill(m_inside.begin(), m_inside.end(), 0.0f);
+    for (size_t row = from; row < to; ++row) {
+        const float* p = frames.Row(row);
+        for (size_t k = 0; k < m_bins; ++k) {
+            m_inside[k] = std::max(m_inside[k], p[k]);
+        }
+    }
+    for (size_t k = 0; k < m_bins; ++k) {
+        const size_t low = k > kCeilingSpread ? k - kCeilingSpread : 0;
+        const size_t high = std::min(m_bins, k + kCeilingSpread + 1);
+        out[k] = *std::max_element(m_inside.begin() + static_cast<ptrdiff_t>(low),
+                                   m_inside.begin() + static_cast<ptrdiff_t>(high));
+    }
+}
+
+// The share of rows [from, to) of `frames` in which a whine stands above `base`.
+double MotorEstimator::WhineShare(const SpectralFrames& frames, size_t from, size_t to, const std::vector<float>& base,
+                                  float* pitches)
+{
+    std::copy(base.begin(), base.end(), m_base.begin());
+    size_t found = 0;
+    for (size_t row = from; row < to; ++row) {
+        const double f0 = DetectWhine(frames.Row(row));
+        found += f0 > 0.0 ? 1 : 0;
+        if (f0 > 0.0 && pitches != nullptr) {
+            const auto band = static_cast<size_t>(IntervalEvidence::kPitchBandsPerOctave * std::log2(f0 / kMinWhineHz));
+            pitches[std::min(band, IntervalEvidence::kPitchBands - 1)] += 1.0f;
+        }
+    }
+    return to > from ? static_cast<double>(found) / static_cast<double>(to - from) : 0.0;
+}
+
+void MotorEstimator::CoreRows(const FrameRole* roles, size_t rows, size_t& firstCore, size_t& endCore) const
+{
+    firstCore = rows;
+    endCore = 0;
+    for (size_t row = 0; row < rows; ++row) {
         if (roles[row] == FrameRole::kCore) {
             firstCore = std::min(firstCore, row);
             endCore = row + 1;
         }
     }
+}
+
+bool MotorEstimator::StepSpectrum(const SpectralFrames& power, size_t firstCore, size_t endCore)
+{
     if (firstCore >= endCore || endCore - firstCore < kMinRows) {
         return false;
     }
@@ -180,60 +200,6 @@ bool MotorEstimator::StepSpectrum(const SpectralFrames& power, const FrameRole* 
         any = true;
     }
     return any;
-}
-
-void MotorEstimator::Remember(const float* spectrum, size_t width, std::vector<float>& history, size_t& count,
-                              size_t& next)
-{
-    std::copy(spectrum, spectrum + width, history.begin() + static_cast<ptrdiff_t>(next * width));
-    next = (next + 1) % kRemembered;
-    count = std::min(count + 1, kRemembered);
-}
-
-void MotorEstimator::Template(bool withStep)
-{
-    const size_t rows = m_historyCount + (withStep ? 1 : 0);
-    for (size_t k = 0; k < m_bins; ++k) {
-        for (size_t i = 0; i < m_historyCount; ++i) {
-            m_column[i] = m_history[i * m_bins + k];
-        }
-        if (withStep) {
-            m_column[m_historyCount] = m_step[k];
-        }
-        const size_t middle = rows / 2;
-        std::nth_element(m_column.begin(), m_column.begin() + static_cast<ptrdiff_t>(middle),
-                         m_column.begin() + static_cast<ptrdiff_t>(rows));
-        m_motor[k] = m_column[middle];
-    }
-}
-
-void MotorEstimator::ToBands(const float* spectrum, std::vector<float>& bands) const
-{
-    std::fill(bands.begin(), bands.end(), 0.0f);
-    double sum = 0.0;
-    for (size_t k = 0; k < m_bins; ++k) {
-        bands[m_band[k]] += spectrum[k];
-        sum += spectrum[k];
-    }
-    for (float& band : bands) {
-        band = sum > 0.0 ? static_cast<float>(band / sum) : 0.0f;
-    }
-}
-
-double MotorEstimator::Likeness(const std::vector<float>& spectrum, const std::vector<float>& history, size_t count) const
-{
-    if (count == 0) {
-        return 1.0;  // nothing heard yet to compare with
-    }
-    double best = 0.0;
-    for (size_t i = 0; i < count; ++i) {
-        double shared = 0.0;
-        for (size_t b = 0; b < m_bands; ++b) {
-            shared += std::min(spectrum[b], history[i * m_bands + b]);
-        }
-        best = std::max(best, shared);
-    }
-    return best;
 }
 
 // The bins where the motor is strongest: above its mean, at most kMaxMotorBins of them.
@@ -355,47 +321,73 @@ void MotorEstimator::FollowWhine(const FrameRole* roles, size_t rows)
     std::copy(m_track.begin(), m_track.begin() + static_cast<ptrdiff_t>(rows), m_whine.begin());
 }
 
-double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* roles, SpectralFrames& noise)
+void MotorEstimator::Survey(const SpectralFrames& power, const FrameRole* roles, IntervalEvidence& evidence)
+{
+    size_t firstCore = 0;
+    size_t endCore = 0;
+    CoreRows(roles, power.Rows(), firstCore, endCore);
+    if (firstCore >= endCore) {
+        return;
+    }
+    std::copy(m_ceiling.begin(), m_ceiling.end(), evidence.ceiling.begin());
+    evidence.standing = m_detector.Judge(power, firstCore, endCore, m_bFirst, m_bLast);
+    evidence.judged = m_detector.Judged();
+    if (!evidence.judged || !StepSpectrum(power, firstCore, endCore)) {
+        return;
+    }
+    // A whine found in the interval far more often than the wanted sound alone makes one: judged
+    // on each side against the other side's ceiling, where no motor ran either (against the
+    // other half of the one side a long drive's segment has).
+    const size_t after = m_around->Rows() - m_before;
+    const bool both = m_bFirst && m_bLast && m_before >= kMinRows && after >= kMinRows;
+    const size_t sideFrom = m_bFirst ? 0 : m_before;
+    const size_t sideTo = m_bFirst ? m_before : m_around->Rows();
+    const size_t cut = both ? m_before : (sideFrom + sideTo) / 2;
+    if (both || sideTo - sideFrom >= 2 * kMinRows) {
+        evidence.whine = WhineShare(power, firstCore, endCore, m_ceiling, evidence.pitches.data());
+        Ceiling(*m_around, sideFrom, cut, m_outside);
+        const double later = WhineShare(*m_around, cut, both ? m_around->Rows() : sideTo, m_outside);
+        Ceiling(*m_around, cut, both ? m_around->Rows() : sideTo, m_outside);
+        evidence.whineNull = std::max(later, WhineShare(*m_around, sideFrom, cut, m_outside));
+    }
+    // A motor runs through the drive: a bin whose quiet moments inside are not even as loud as
+    // the surroundings usually are was stepped by wanted sound that came and went (a note struck
+    // as the drive began), whatever its ends show. A bin quiet inside at least as loud as the
+    // surroundings at their loudest is weak evidence of its own.
+    const bool before = m_bFirst && m_before >= kMinRows;
+    const bool later = m_bLast && after >= kMinRows;
+    Quantile(power, firstCore, endCore, kQuietInside, m_inside);
+    if (before) {
+        Quantile(*m_around, 0, m_before, kUsualAround, m_usualBefore);
+        Quantile(*m_around, 0, m_before, kLoudAround, m_loudBefore);
+    }
+    if (later) {
+        Quantile(*m_around, m_before, m_around->Rows(), kUsualAround, m_usualAfter);
+        Quantile(*m_around, m_before, m_around->Rows(), kLoudAround, m_loudAfter);
+    }
+    evidence.standing = 0;
+    double sum = 0.0;
+    for (size_t k = 0; k < m_bins; ++k) {
+        const bool persists = (!before || m_inside[k] > m_usualBefore[k]) && (!later || m_inside[k] > m_usualAfter[k]);
+        evidence.score[k] = persists ? m_detector.Score(k) : std::min(m_detector.Score(k), 0.0f);
+        evidence.standing += evidence.score[k] > m_detector.Bar() ? 1 : 0;
+        const bool louder = both && m_inside[k] > m_loudBefore[k] && m_inside[k] > m_loudAfter[k];
+        evidence.weak[k] = evidence.score[k] > kWeakScore || louder ? 1 : 0;
+        evidence.step[k] = evidence.score[k] > kSpectrumScore ? m_step[k] : 0.0f;
+        sum += evidence.step[k];
+    }
+    for (float& value : evidence.step) {
+        value = sum > 0.0 ? static_cast<float>(value / sum) : 0.0f;
+    }
+}
+
+double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* roles, const std::vector<float>& lens,
+                                bool whine, SpectralFrames& noise)
 {
     noise.Clear();
-    // The interval shows its own motor by a step at its ends or by a strong rise above the
-    // surroundings, either like the lens heard before; only such an interval teaches what the
-    // lens sounds like.
-    double stepShare = 0.0;
-    double stepLikeness = 0.0;
-    bool stepped = StepSpectrum(power, roles);
-    if (stepped) {
-        double step = 0.0;
-        double inside = 0.0;
-        for (size_t k = 0; k < m_bins; ++k) {
-            step += m_step[k];
-            inside += m_inside[k];
-        }
-        stepShare = inside > 0.0 ? step / inside : 0.0;
-        stepped = step > 0.0;
-        for (float& value : m_step) {
-            value = stepped ? static_cast<float>(value / step) : 0.0f;
-        }
-        if (stepped && m_historyCount > 0) {
-            Template(false);
-            ToBands(m_motor.data(), m_templateBands);
-            ToBands(m_step.data(), m_stepBands);
-            stepLikeness = Likeness(m_stepBands, m_templateBands, 1);
-        } else {
-            stepLikeness = 1.0;
-        }
-    }
-    if (m_historyCount == 0 && !stepped) {
-        for (size_t row = 0; row < power.Rows(); ++row) {
-            noise.AddRow();
-        }
-        return 0.0;
-    }
-    Template(stepped);
+    std::copy(lens.begin(), lens.end(), m_motor.begin());
     SelectMotorBins();
     std::fill(m_risenRows.begin(), m_risenRows.end(), 0u);
-    std::fill(m_inside.begin(), m_inside.end(), 0.0f);  // from here: what rose, per bin
-    double rise = 0.0;
     for (size_t row = 0; row < power.Rows(); ++row) {
         const float* p = power.Row(row);
         float* n = noise.AddRow();
@@ -421,14 +413,9 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
             m_base[k] = ceiling;
             m_risenRows[k] += rises ? 1u : 0u;
             risen += rises ? 1u : 0u;
-            if (roles[row] == FrameRole::kCore) {
-                const float above = n[k] - std::min(p[k], steady);
-                rise += above;
-                m_inside[k] += above;
-            }
         }
         m_risenBins[row] = risen;
-        m_whine[row] = DetectWhine(p);
+        m_whine[row] = whine ? DetectWhine(p) : 0.0;
     }
     // What rises only now and then in a bin, in frames that do not rise across the spectrum, is
     // wanted sound (a whine's sweep, passing through each bin briefly, is followed below).
@@ -492,27 +479,7 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
             }
         }
     }
-    if (total <= 0.0) {
-        return 0.0;
-    }
-    ToBands(m_inside.data(), m_riseBands);
-    const bool rose = rise / total >= kClearRise && Likeness(m_riseBands, m_riseHistory, m_riseCount) >= kLikeLens;
-    bool shown = (stepShare >= kClearStep && stepLikeness >= kLikeLens) || rose;
-    // A long drive's middle has no ends: it goes with what its start showed.
-    if (!m_bFirst && !m_bLast) {
-        shown = m_bShown;
-    } else if (!m_bFirst) {
-        shown = shown || m_bShown;
-    }
-    m_bShown = shown;
-    // Only a motor shown teaches what the lens sounds like.
-    if (shown && stepped) {
-        Remember(m_step.data(), m_bins, m_history, m_historyCount, m_historyNext);
-    }
-    if (shown && rise > 0.0) {
-        Remember(m_riseBands.data(), m_bands, m_riseHistory, m_riseCount, m_riseNext);
-    }
-    return shown ? motor / total : 0.0;
+    return total > 0.0 ? motor / total : 0.0;
 }
 
 }  // namespace ovix

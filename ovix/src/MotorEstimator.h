@@ -1,27 +1,23 @@
 // Estimates the lens motor's noise power in every frame of an AF interval from what the
 // camera tells us: the motor runs exactly inside the interval and is silent around it.
-// - Its spectrum: what the sound gains where the drive starts and loses where it stops,
-//   compared with the sound just outside (medians over short windows). Wanted sound seldom
-//   changes in the same bins at both ends, so the smaller of the two steps is the motor's.
-// - Across intervals (one lens, one noise): the spectra of recent intervals, each scaled to
-//   unit power, and a median across them, so one interval's music or speech does not pass
-//   for the motor; an interval with no ends of its own (a long drive's middle) uses them alone.
+// - What the interval's ends show (Survey): where the sound steps up as the drive starts and
+//   down as it stops, in units of how far the wanted sound steps on its own (StepDetector), and
+//   the motor's spectrum as the smaller of the two steps. Whether that shows the lens and which
+//   spectrum the lens has is decided across intervals (LensModel).
 // - Per frame, how strongly the motor runs (it accelerates, brakes, is driven in bursts): a
 //   low quantile over the motor's bins of the frame's power beyond the wanted sound's floor,
 //   relative to the motor's spectrum. Wanted sound only raises some bins, so it passes.
 // - Ticks and the drive's start and stop transients: what rises far above anything the
-//   surroundings reached (the edges are kept out of the end steps' windows), in bins where the
-//   motor keeps rising or across the spectrum for a moment; what rises in a bin only now and
-//   then is a syllable or a note.
-// - Whether the interval shows a motor at all: a clear step at its ends or a clear rise, each
-//   looking like what the lens made in earlier intervals that showed one (wanted sound that
-//   happens to start and stop with a drive does not).
+//   surroundings reached, in bins where the motor keeps rising or across the spectrum for a
+//   moment; what rises in a bin only now and then is a syllable or a note.
 // - A stepping motor's whine sweeps with its speed: per frame the fundamental whose harmonics
 //   stand out, held to the pitch track around it (a voice's syllable is not the whine), and its
 //   harmonics hidden under the wanted sound given the power of those shown.
 #pragma once
 
+#include "LensModel.h"
 #include "SpectralFrames.h"
+#include "StepDetector.h"
 #include "SuppressorParameters.h"
 
 #include <cstdint>
@@ -42,41 +38,50 @@ public:
     // Rows heard around the interval: [0, before) before it, the rest after it. `first` and
     // `last` say whether the segment to estimate holds the interval's start and end.
     void SetSurroundings(const SpectralFrames& around, size_t before, bool first, bool last);
-    // Fills `noise` (same rows as `power`) and answers the motor's share of the power in the
-    // interval's frames: 0 when the interval does not show a motor (a quiet lens).
-    double Estimate(const SpectralFrames& power, const FrameRole* roles, SpectralFrames& noise);
+    // What the segment's ends show of a motor, for the lens model.
+    void Survey(const SpectralFrames& power, const FrameRole* roles, IntervalEvidence& evidence);
+    // Fills `noise` (same rows as `power`) for a motor of spectrum `lens` and answers the
+    // motor's share of the power in the interval's frames.
+    // The wanted sound's ceiling in use, to be raised to what it reached around other intervals.
+    std::vector<float>& WantedCeiling() { return m_ceiling; }
+    // `whine`: the lens whines (a stepping motor), so a whine is tracked and its harmonics filled in.
+    double Estimate(const SpectralFrames& power, const FrameRole* roles, const std::vector<float>& lens, bool whine,
+                    SpectralFrames& noise);
 
 private:
     // Per-bin quantile over rows [from, to) of `frames`.
     void Quantile(const SpectralFrames& frames, size_t from, size_t to, double q, std::vector<float>& out);
     // The motor's spectrum from this interval's ends; false when it has no usable end.
-    bool StepSpectrum(const SpectralFrames& power, const FrameRole* roles);
-    // Adds `spectrum` (unit power) to the rows of `history`, a ring of kRemembered rows.
-    static void Remember(const float* spectrum, size_t width, std::vector<float>& history, size_t& count, size_t& next);
-    // The motor's spectrum: per bin, the median over remembered intervals and this one's step.
-    void Template(bool withStep);
-    // How much of `spectrum`'s power (unit power, in bands) falls where a remembered one's does.
-    double Likeness(const std::vector<float>& spectrum, const std::vector<float>& history, size_t count) const;
-    void ToBands(const float* spectrum, std::vector<float>& bands) const;
+    bool StepSpectrum(const SpectralFrames& power, size_t firstCore, size_t endCore);
+    void CoreRows(const FrameRole* roles, size_t rows, size_t& firstCore, size_t& endCore) const;
     void SelectMotorBins();
+    void Ceiling(const SpectralFrames& frames, size_t from, size_t to, std::vector<float>& out);
+    // The share of rows [from, to) of `frames` in which a whine stands above `base`; counts the
+    // frames by the whine's pitch into `pitches` (IntervalEvidence::kPitchBands) when given.
+    double WhineShare(const SpectralFrames& frames, size_t from, size_t to, const std::vector<float>& base,
+                      float* pitches = nullptr);
     size_t Salience(const float* p);
     double DetectWhine(const float* p);
     void FillWhine(const float* p, float* n, double f0);
     void FollowWhine(const FrameRole* roles, size_t rows);
 
     size_t m_bins;
+    StepDetector m_detector;
     size_t m_windowRows;  // rows on each side of a drive's start or stop
     const SpectralFrames* m_around = nullptr;
     size_t m_before = 0;
     bool m_bFirst = false;
     bool m_bLast = false;
-    bool m_bShown = false;  // whether the interval's earlier segments showed a motor
     std::vector<float> m_floor;  // the wanted sound's floor around the interval
     std::vector<float> m_ceiling;  // and the most it reached
     std::vector<float> m_inside;
     std::vector<float> m_outside;
     std::vector<float> m_step;
     std::vector<float> m_motor;  // the motor's spectrum used for this interval
+    std::vector<float> m_usualBefore;  // how loud the surroundings usually are, and at their loudest
+    std::vector<float> m_usualAfter;
+    std::vector<float> m_loudBefore;
+    std::vector<float> m_loudAfter;
     std::vector<size_t> m_motorBins;
     std::vector<float> m_base;  // per frame: the wanted sound's ceiling plus the steady motor
     std::vector<float> m_salience;
@@ -99,20 +104,6 @@ private:
     size_t m_trackRows = 0;  // frames each side that a frame's whine is judged with
     double m_binHz = 1.0;
     std::vector<float> m_column;  // scratch: one bin across rows, or one row across bins
-    static constexpr size_t kRemembered = 5;
-    std::vector<float> m_history;  // unit-power spectra of recent intervals, kRemembered rows
-    size_t m_historyCount = 0;
-    size_t m_historyNext = 0;
-    // The same lens rises the same way in every interval: what rose above the surroundings in
-    // recent intervals that showed a motor, in quarter-octave bands of unit power.
-    std::vector<uint8_t> m_band;  // per bin
-    size_t m_bands = 0;
-    std::vector<float> m_stepBands;
-    std::vector<float> m_riseBands;
-    std::vector<float> m_templateBands;
-    std::vector<float> m_riseHistory;
-    size_t m_riseCount = 0;
-    size_t m_riseNext = 0;
 };
 
 }  // namespace ovix

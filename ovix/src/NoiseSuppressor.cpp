@@ -42,6 +42,8 @@ NoiseSuppressor::NoiseSuppressor(uint64_t rateHz, unsigned channels, uint64_t fr
       m_noise(SegmentRows(m_parameters), m_parameters.bins),
       m_around(2 * m_parameters.contextFrames / m_parameters.hop + 4, m_parameters.bins),
       m_estimator(m_parameters),
+      m_lens(m_parameters.bins, m_parameters.intervalsAhead),
+      m_motor(m_parameters.bins),
       m_gainRule(m_parameters.bins)
 {
     const size_t n = m_parameters.fftSize;
@@ -61,6 +63,24 @@ void NoiseSuppressor::SetSpans(std::vector<DriveSpan> spans)
     m_spanShares.assign(m_spans.size(), 0.0);
     m_next = 0;
     m_segmentAt = m_spans.empty() ? 0 : m_spans.front().start;
+    m_surveyed = 0;
+    m_lens.Reset();
+}
+
+NoiseSuppressor::Segment NoiseSuppressor::FirstSegment(size_t index, uint64_t at) const
+{
+    const DriveSpan& span = m_spans[index];
+    const uint64_t ramp = m_parameters.rampFrames;
+    Segment segment;
+    segment.span = &span;
+    segment.index = index;
+    segment.coreStart = at;
+    segment.coreEnd = std::min(span.end, SaturatingAdd(at, m_parameters.segmentFrames));
+    segment.first = at == span.start;
+    segment.last = segment.coreEnd == span.end;
+    segment.writeStart = segment.first ? (span.start > ramp ? span.start - ramp : 0) : segment.coreStart;
+    segment.writeEnd = std::min(m_total, segment.last ? SaturatingAdd(span.end, ramp) : segment.coreEnd);
+    return segment;
 }
 
 bool NoiseSuppressor::PendingSegment(Segment& segment) const
@@ -68,16 +88,30 @@ bool NoiseSuppressor::PendingSegment(Segment& segment) const
     if (m_next >= m_spans.size()) {
         return false;
     }
-    const DriveSpan& span = m_spans[m_next];
-    const uint64_t ramp = m_parameters.rampFrames;
-    segment.span = &span;
-    segment.coreStart = m_segmentAt;
-    segment.coreEnd = std::min(span.end, SaturatingAdd(m_segmentAt, m_parameters.segmentFrames));
-    segment.first = m_segmentAt == span.start;
-    segment.last = segment.coreEnd == span.end;
-    segment.writeStart = segment.first ? (span.start > ramp ? span.start - ramp : 0) : segment.coreStart;
-    segment.writeEnd = std::min(m_total, segment.last ? SaturatingAdd(span.end, ramp) : segment.coreEnd);
+    segment = FirstSegment(m_next, m_segmentAt);
     return true;
+}
+
+bool NoiseSuppressor::IsWhole(size_t index) const
+{
+    return m_spans[index].end - m_spans[index].start <= m_parameters.segmentFrames;
+}
+
+size_t NoiseSuppressor::LastAhead(size_t index) const
+{
+    if (!IsWhole(index)) {
+        return index;
+    }
+    const uint64_t from = NeededFrom(FirstSegment(index, m_spans[index].start));
+    size_t last = index;
+    for (size_t next = index + 1; next < m_spans.size() && next <= index + m_parameters.intervalsAhead; ++next) {
+        if (!IsWhole(next) ||
+            NeededUntil(FirstSegment(next, m_spans[next].start)) - from + kBlockFrames > m_parameters.capacityFrames) {
+            break;
+        }
+        last = next;
+    }
+    return last;
 }
 
 // The first frame a segment reads: its analysis windows and, for an interval's first
@@ -148,7 +182,23 @@ void NoiseSuppressor::Read(uint64_t firstFrame, size_t frames, int16_t* out) con
 void NoiseSuppressor::ProcessComplete()
 {
     Segment segment;
-    while (PendingSegment(segment) && m_end >= NeededUntil(segment)) {
+    while (PendingSegment(segment)) {
+        // Spans are surveyed in order, none beyond what the pending decision waits for: a span's
+        // survey then sees the same sound however the sound was delivered.
+        const size_t lastAhead = LastAhead(segment.index);
+        while (m_surveyed <= lastAhead && m_surveyed < m_spans.size()) {
+            if (IsWhole(m_surveyed)) {
+                const Segment whole = FirstSegment(m_surveyed, m_spans[m_surveyed].start);
+                if (m_end < NeededUntil(whole)) {
+                    break;
+                }
+                Survey(m_surveyed);
+            }
+            ++m_surveyed;
+        }
+        if (m_end < NeededUntil(segment) || (IsWhole(segment.index) && m_surveyed <= lastAhead)) {
+            return;
+        }
         if (segment.writeStart < segment.writeEnd) {
             ProcessSegment(segment);
         }
@@ -214,38 +264,39 @@ void NoiseSuppressor::AddSurroundings(uint64_t from, uint64_t to)
     }
 }
 
-void NoiseSuppressor::ProcessSegment(const Segment& segment)
+// The spectra a segment is judged by: its surroundings (before the interval, back to the
+// previous interval's ramp, when it begins; after it, up to the next one's ramp, when it ends)
+// and every analysis frame reaching into what it writes.
+void NoiseSuppressor::Analyse(const Segment& segment)
 {
     const DriveSpan& span = *segment.span;
     const uint64_t ramp = m_parameters.rampFrames;
     const int64_t hop = static_cast<int64_t>(m_parameters.hop);
     const int64_t size = static_cast<int64_t>(m_parameters.fftSize);
-
-    // The surroundings: before the interval (back to the previous interval's ramp) when it
-    // begins, after it (up to the next one's ramp) when it ends.
+    const size_t index = segment.index;
     if (segment.first) {
         m_around.Clear();
         uint64_t from = segment.writeStart > m_parameters.contextFrames ? segment.writeStart - m_parameters.contextFrames : 0;
-        if (m_next > 0) {
-            from = std::max(from, SaturatingAdd(m_spans[m_next - 1].end, ramp));
+        if (index > 0) {
+            from = std::max(from, SaturatingAdd(m_spans[index - 1].end, ramp));
         }
         AddSurroundings(from, segment.writeStart);
         m_aroundBefore = m_around.Rows();
     }
     if (segment.last) {
         uint64_t to = std::min(m_end, SaturatingAdd(segment.writeEnd, m_parameters.contextFrames));
-        if (m_next + 1 < m_spans.size()) {
-            const uint64_t next = m_spans[m_next + 1].start;
+        if (index + 1 < m_spans.size()) {
+            const uint64_t next = m_spans[index + 1].start;
             to = std::min(to, next > ramp ? next - ramp : 0);
         }
         AddSurroundings(segment.writeEnd, to);
     }
     m_estimator.SetSurroundings(m_around, m_aroundBefore, segment.first, segment.last);
 
-    const int64_t firstRow = FloorDiv(static_cast<int64_t>(segment.writeStart) - size, hop) + 1;
+    m_firstRow = FloorDiv(static_cast<int64_t>(segment.writeStart) - size, hop) + 1;
     const int64_t lastRow = FloorDiv(static_cast<int64_t>(segment.writeEnd) - 1, hop);
     m_power.Clear();
-    for (int64_t j = firstRow; j <= lastRow; ++j) {
+    for (int64_t j = m_firstRow; j <= lastRow; ++j) {
         float* row = m_power.AddRow();
         if (row == nullptr) {
             break;  // cannot happen with the sizes the parameters give
@@ -261,12 +312,41 @@ void NoiseSuppressor::ProcessSegment(const Segment& segment)
         }
         m_roles[m_power.Rows() - 1] = role;
     }
-    m_lastShare = m_estimator.Estimate(m_power, m_roles.data(), m_noise);
-    m_spanShares[m_next] = m_lastShare;
+}
+
+void NoiseSuppressor::Survey(size_t index)
+{
+    const Segment segment = FirstSegment(index, m_spans[index].start);
+    Analyse(segment);
+    m_estimator.Survey(m_power, m_roles.data(), m_lens.Record(index));
+}
+
+void NoiseSuppressor::ProcessSegment(const Segment& segment)
+{
+    const size_t index = segment.index;
+    Analyse(segment);
+    // A long interval is judged by its start, with the intervals before it.
+    if (!IsWhole(index) && segment.first) {
+        m_estimator.Survey(m_power, m_roles.data(), m_lens.Record(index));
+    }
+    const size_t lastAhead = std::min(LastAhead(index), m_surveyed > 0 ? m_surveyed - 1 : 0);
+    if (segment.first && !m_lens.Decide(index, lastAhead)) {
+        m_lastShare = 0.0;
+        return;
+    }
+    if (!segment.first && !m_lens.Shown(index)) {
+        return;
+    }
+    m_lens.Spectrum(index, lastAhead, m_motor);
+    // Wanted sound louder than anything heard around this interval may have been heard around
+    // the others: only what rises above all of that can be the motor's.
+    m_lens.Ceiling(index, lastAhead, m_estimator.WantedCeiling());
+    m_lastShare = m_estimator.Estimate(m_power, m_roles.data(), m_motor, m_lens.Whines(index, lastAhead), m_noise);
     if (m_lastShare < kAudibleShare) {
         return;
     }
-    Resynthesise(segment, firstRow, lastRow);
+    m_spanShares[index] = m_lastShare;
+    Resynthesise(segment, m_firstRow, m_firstRow + static_cast<int64_t>(m_power.Rows()) - 1);
 }
 
 float NoiseSuppressor::RampWeight(const DriveSpan& span, uint64_t frame) const

@@ -1,16 +1,19 @@
 // Removes the lens motor's noise inside AF drive intervals and nothing else.
-// Sound is appended as the session pulls it and read back once final. An interval is
-// processed when its sound and the sound after it are all held (look-ahead), in segments for
-// long intervals; frames before the first pending interval are final at once. Per segment:
-// power spectra of the interval and its surroundings, the motor's noise per frame
+// Sound is appended as the session pulls it and read back once final. Each interval is first
+// surveyed once its sound and surroundings are held: what its ends show of a motor goes to the
+// lens model. It is processed once the intervals that follow it (as many as the look-ahead
+// holds) are surveyed too, so that it is judged beside them; long intervals go in segments,
+// judged by their start. Frames before the first pending interval are final at once. Per
+// segment: power spectra of the interval and its surroundings, the motor's noise per frame
 // (MotorEstimator), a spectral gain (GainRule), and the removed part resynthesised and
 // subtracted under 10 ms raised-cosine ramps. Where nothing is removed the sound leaves
-// bit-exact; an interval whose motor is not audible is left untouched.
+// bit-exact; an interval that does not show the lens's motor is left untouched.
 // Everything is allocated by the constructor and SetSpans; blocks allocate nothing.
 #pragma once
 
 #include "AfInformation.h"
 #include "GainRule.h"
+#include "LensModel.h"
 #include "MotorEstimator.h"
 #include "RealFft.h"
 #include "SpectralFrames.h"
@@ -55,6 +58,7 @@ public:
 private:
     struct Segment {
         const DriveSpan* span = nullptr;
+        size_t index = 0;
         uint64_t coreStart = 0;  // this segment's share of the interval
         uint64_t coreEnd = 0;
         uint64_t writeStart = 0;  // with the ramps at the interval's ends
@@ -64,9 +68,16 @@ private:
     };
 
     bool PendingSegment(Segment& segment) const;
+    // The first segment of span `index`.
+    Segment FirstSegment(size_t index, uint64_t at) const;
+    bool IsWhole(size_t index) const;  // the span is processed in one segment
     uint64_t NeededFrom(const Segment& segment) const;
     uint64_t NeededUntil(const Segment& segment) const;
+    // The last span that the decision about span `index` waits for.
+    size_t LastAhead(size_t index) const;
     void ProcessComplete();
+    void Survey(size_t index);
+    void Analyse(const Segment& segment);
     void ProcessSegment(const Segment& segment);
     void AddSurroundings(uint64_t from, uint64_t to);
     void Analyse(int64_t frame, float* power);
@@ -86,6 +97,7 @@ private:
     std::vector<DriveSpan> m_spans;
     size_t m_next = 0;  // first span not fully processed
     uint64_t m_segmentAt = 0;  // where its next segment begins
+    size_t m_surveyed = 0;  // spans before this one are surveyed (or are processed by segments)
 
     RealFft m_fft;
     std::vector<float> m_window;  // square root of a periodic Hann: analysis and synthesis
@@ -97,7 +109,10 @@ private:
     SpectralFrames m_noise;
     SpectralFrames m_around;
     size_t m_aroundBefore = 0;  // rows of m_around heard before the interval
+    int64_t m_firstRow = 0;  // the analysis frame of m_power's first row
     MotorEstimator m_estimator;
+    LensModel m_lens;
+    std::vector<float> m_motor;  // the lens's spectrum for the interval being processed
     GainRule m_gainRule;
     double m_lastShare = 0.0;
     std::vector<double> m_spanShares;

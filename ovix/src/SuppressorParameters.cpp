@@ -14,6 +14,9 @@ constexpr uint64_t kRampsPerSecond = 100;  // 10 ms
 constexpr uint64_t kEdgesPerSecond = 25;  // 40 ms
 constexpr double kContextSeconds = 1.0;
 constexpr double kLongestSegmentSeconds = 10.0;
+// Sound held beyond one segment so that an interval is judged beside the ones that follow it.
+constexpr double kLookAheadSeconds = 30.0;
+constexpr size_t kIntervalsAhead = 2;
 
 }  // namespace
 
@@ -32,12 +35,14 @@ SuppressorParameters::SuppressorParameters(uint64_t rate, unsigned channelCount)
     // reach past it and a pulled block at either end.
     const uint64_t margin = 2 * (fftSize + rampFrames + kBlockFrames);
     const uint64_t byBudget = kMaxHeldBytes / (uint64_t{channels} * sizeof(int16_t));
-    const uint64_t wanted10s = static_cast<uint64_t>(kLongestSegmentSeconds * static_cast<double>(rateHz)) +
-                               2 * static_cast<uint64_t>(kContextSeconds * static_cast<double>(rateHz)) + margin;
-    capacityFrames = std::max(std::min(byBudget, wanted10s), 8 * margin);
-    contextFrames = std::min<uint64_t>(static_cast<uint64_t>(kContextSeconds * static_cast<double>(rateHz)),
-                                       capacityFrames / 6);
-    segmentFrames = std::max<uint64_t>(capacityFrames - 2 * contextFrames - margin, fftSize);
+    const auto seconds = [this](double s) { return static_cast<uint64_t>(s * static_cast<double>(rateHz)); };
+    const uint64_t wantedFrames = seconds(kLongestSegmentSeconds) + 2 * seconds(kContextSeconds) + margin +
+                            seconds(kLookAheadSeconds);
+    capacityFrames = std::max(std::min(byBudget, wantedFrames), 8 * margin);
+    contextFrames = std::min<uint64_t>(seconds(kContextSeconds), capacityFrames / 6);
+    segmentFrames = std::max<uint64_t>(
+        std::min(capacityFrames - 2 * contextFrames - margin, seconds(kLongestSegmentSeconds)), fftSize);
+    intervalsAhead = kIntervalsAhead;
 }
 
 }  // namespace ovix

@@ -25,6 +25,7 @@ struct SuppressorParameters {
     uint64_t contextFrames;  // sound heard on each side of an interval, where the motor is silent
     uint64_t capacityFrames;  // the look-ahead's whole store
     uint64_t segmentFrames;  // the longest stretch of an interval processed at once
+    size_t intervalsAhead;  // later intervals a decision about one waits for, when the store holds them
 };
 
 }  // namespace ovix
