@@ -72,20 +72,20 @@ def _intervals(rate, rng, count, shortest=0.5, longest=2.0):
         return out
 
 
-def all_cases():
+def all_cases(seed_base=1000):
     cases = []
     for m, (mname, kind, rate, channels) in enumerate(MATERIALS):
         for k, motor in enumerate(KINDS):
             index = m * len(KINDS) + k
             snr = SNRS[(m + k) % 3]
             codec = "aac" if index % 6 == 5 else ("sowt" if index % 4 == 1 else "twos")
-            rng = np.random.default_rng(1000 + index)
+            rng = np.random.default_rng(seed_base + index)
             intervals = _intervals(rate, rng, 3)
             motor_in = [True, True, True]
             if index % 2 == 0:
                 motor_in[int(rng.integers(3))] = False
             cases.append(Case(f"{mname}/{motor}/{snr}dB/{codec}", mname, kind, rate, channels, motor, snr, codec,
-                              1000 + index, intervals, motor_in))
+                              seed_base + index, intervals, motor_in))
     return cases
 
 
@@ -95,19 +95,19 @@ def quick_cases():
     return [every[i] for i in picks]
 
 
-def holdout_cases():
+def holdout_cases(seed_base=5000):
     cases = []
     for m, (mname, kind, rate, channels) in enumerate(HOLDOUT_MATERIALS):
         for k, motor in enumerate(HOLDOUT_KINDS):
             index = m * len(HOLDOUT_KINDS) + k
             snr = HOLDOUT_SNRS[(m + k) % 3]
             codec = "aac" if index % 7 == 3 else ("sowt" if index % 3 == 1 else "twos")
-            rng = np.random.default_rng(5000 + index)
+            rng = np.random.default_rng(seed_base + index)
             count = int(rng.integers(2, 5))
             intervals = _intervals(rate, rng, count, 0.3, 6.0 / count)
             motor_in = [True] * count
             if index % 2 == 1:
                 motor_in[int(rng.integers(count))] = False
             cases.append(Case(f"{mname}/{motor}/{snr}dB/{codec}", mname, kind, rate, channels, motor, snr, codec,
-                              5000 + index, intervals, motor_in))
+                              seed_base + index, intervals, motor_in))
     return cases

@@ -24,7 +24,7 @@ CACHE = os.path.join(os.path.dirname(__file__), "..", "..", "build", "quality", 
 
 
 def sound_of(case, clean_cache):
-    path = os.path.join(CACHE, case.name.replace("/", "_") + ".npz")
+    path = os.path.join(CACHE, f"{case.seed}-" + case.name.replace("/", "_") + ".npz")
     if os.path.exists(path):
         data = np.load(path)
         return data["clean"], data["motor"]
@@ -61,7 +61,9 @@ def run(probe, case, clean, motor):
 def main():
     parser = argparse.ArgumentParser()
     parser.add_argument("probe")
-    parser.add_argument("--set", default="all", choices=["main", "holdout", "all"])
+    # fresh: both sets' material and motors again with other lenses, intervals and SNR rotation
+    # (other seeds), for a last look at a change tuned on the other two.
+    parser.add_argument("--set", default="all", choices=["main", "holdout", "all", "fresh"])
     parser.add_argument("--cases", default="")
     parser.add_argument("-v", action="store_true", help="a line per case")
     args = parser.parse_args()
@@ -70,6 +72,8 @@ def main():
         sets.append(("main", casebook.all_cases()))
     if args.set in ("holdout", "all"):
         sets.append(("holdout", casebook.holdout_cases()))
+    if args.set == "fresh":
+        sets.append(("fresh", casebook.all_cases(7000) + casebook.holdout_cases(9000)))
     clean_cache = {}
     for label, chosen in sets:
         chosen = [c for c in chosen if args.cases in c.name]

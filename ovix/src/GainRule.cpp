@@ -8,7 +8,7 @@ namespace {
 
 // Weight of the previous frame in the a-priori SNR: high, so that what remains is steady.
 constexpr float kSmoothing = 0.98f;
-constexpr float kFloor = 0.05f;  // -26 dB: the motor's rest stays under the wanted sound
+constexpr float kFloor = 0.03f;  // -30 dB: the motor's rest stays under the wanted sound
 constexpr float kTiny = 1e-20f;
 
 }  // namespace

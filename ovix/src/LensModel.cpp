@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cmath>
+#include <limits>
 
 namespace ovix {
 namespace {
@@ -71,6 +72,7 @@ IntervalEvidence& LensModel::Record(size_t span)
     std::fill(evidence.weak.begin(), evidence.weak.end(), uint8_t{0});
     std::fill(evidence.ceiling.begin(), evidence.ceiling.end(), 0.0f);
     std::fill(evidence.pitches.begin(), evidence.pitches.end(), 0.0f);
+    std::fill(evidence.rises.begin(), evidence.rises.end(), 0.0f);
     return evidence;
 }
 
@@ -165,6 +167,40 @@ bool LensModel::Decide(size_t span, size_t lastAhead)
         own->shown = recurring >= kRecurringOctaves || matched >= kMatched || ShowsWhine(*own);
     }
     return own->shown;
+}
+
+void LensModel::Rises(size_t span, size_t lastAhead, std::vector<float>& rises, std::vector<float>& loud)
+{
+    const size_t first = span > kRemembered ? span - kRemembered : 0;
+    const size_t last = std::min(lastAhead, span + m_ahead);
+    m_chosen.clear();
+    for (size_t other = first; other <= last; ++other) {
+        const IntervalEvidence* evidence = other != span ? Find(other) : nullptr;
+        if (evidence != nullptr && evidence->judged &&
+            (evidence->decided ? evidence->shown : evidence->standing >= kStrong)) {
+            m_chosen.push_back(evidence);
+        }
+    }
+    if (m_chosen.empty()) {
+        std::fill(rises.begin(), rises.end(), 1.0f);
+        std::fill(loud.begin(), loud.end(), std::numeric_limits<float>::max());
+        return;
+    }
+    const size_t middle = m_chosen.size() / 2;
+    for (size_t k = 0; k < m_bins; ++k) {
+        for (size_t i = 0; i < m_chosen.size(); ++i) {
+            m_column[i] = m_chosen[i]->rises[k];
+        }
+        std::nth_element(m_column.begin(), m_column.begin() + static_cast<ptrdiff_t>(middle),
+                         m_column.begin() + static_cast<ptrdiff_t>(m_chosen.size()));
+        rises[k] = m_column[middle];
+        for (size_t i = 0; i < m_chosen.size(); ++i) {
+            m_column[i] = m_chosen[i]->loud[k];
+        }
+        std::nth_element(m_column.begin(), m_column.begin() + static_cast<ptrdiff_t>(middle),
+                         m_column.begin() + static_cast<ptrdiff_t>(m_chosen.size()));
+        loud[k] = m_column[middle];
+    }
 }
 
 void LensModel::Ceiling(size_t span, size_t lastAhead, std::vector<float>& ceiling) const

@@ -13,7 +13,10 @@ namespace ovix {
 
 // What one interval's ends show.
 struct IntervalEvidence {
-    explicit IntervalEvidence(size_t bins) : step(bins), score(bins), weak(bins), ceiling(bins), pitches(kPitchBands) {}
+    explicit IntervalEvidence(size_t bins)
+        : step(bins), score(bins), weak(bins), ceiling(bins), rises(bins), loud(bins), pitches(kPitchBands)
+    {
+    }
 
     // A whine's pitch is counted in sixth-octave bands from 100 Hz up (past 2.5 kHz).
     static constexpr double kPitchBandsPerOctave = 6.0;
@@ -23,6 +26,8 @@ struct IntervalEvidence {
     std::vector<float> score;  // per bin, the step in units of the wanted sound's own steps
     std::vector<uint8_t> weak;  // bins that step more than the wanted sound usually does
     std::vector<float> ceiling;  // the loudest the wanted sound got around the interval, per bin
+    std::vector<float> rises;  // per bin, the share of the interval's frames rising far above that
+    std::vector<float> loud;  // per bin, how loud the interval gets (a high quantile over its frames)
     size_t standing = 0;  // bins that step far more than the wanted sound does
     double whine = 0.0;  // the share of the interval's frames in which a whine stands out
     double whineNull = 0.0;  // the same share in the surroundings, where no motor ran
@@ -48,6 +53,9 @@ public:
     bool Decide(size_t span, size_t lastAhead);
     // Whether interval `span` or one showing the same lens whines: a stepping motor.
     bool Whines(size_t span, size_t lastAhead) const;
+    // Per bin, how often the sound rises far above its surroundings in the other intervals near
+    // `span` that show the lens (median); 1 where there are none.
+    void Rises(size_t span, size_t lastAhead, std::vector<float>& rises, std::vector<float>& loud);
     // Per bin, the loudest the wanted sound got around the intervals near `span`.
     void Ceiling(size_t span, size_t lastAhead, std::vector<float>& ceiling) const;
     // The decision made about interval `span`.

@@ -13,12 +13,17 @@ constexpr size_t kCeilingSpread = 2;
 // Over the motor's bins, the share that wanted sound may raise without raising the estimate.
 constexpr double kActivationQuantile = 0.3;
 // How far above the surroundings' ceiling a cell must rise to be taken for motor.
-constexpr float kRise = 2.0f;
+constexpr float kRise = 1.5f;
 // A motor keeps making its noise: a bin that rises so in fewer of the interval's frames is a
 // syllable or a note, unless its frame rises across this share of the spectrum for no longer
 // than a tick lasts (a loud syllable rises as broadly, for longer).
 constexpr double kRecurring = 0.2;
 constexpr double kBroadband = 0.2;
+// And it rises in the same bins in the lens's other drives, if not as often, and no louder than
+// twice what those drives reach there at their loudest (a bird singing in one drive is no motor).
+constexpr float kLensRecurring = 0.1f;
+constexpr float kLensLoudness = 2.0f;
+constexpr double kLoudInside = 0.9;
 constexpr double kTickSeconds = 0.01;
 // Each side of a drive's start or stop: long enough for medians to pass over syllables.
 constexpr double kWindowSeconds = 0.3;
@@ -330,6 +335,16 @@ void MotorEstimator::Survey(const SpectralFrames& power, const FrameRole* roles,
         return;
     }
     std::copy(m_ceiling.begin(), m_ceiling.end(), evidence.ceiling.begin());
+    for (size_t row = firstCore; row < endCore; ++row) {
+        const float* p = power.Row(row);
+        for (size_t k = 0; k < m_bins; ++k) {
+            evidence.rises[k] += p[k] > kRise * m_ceiling[k] ? 1.0f : 0.0f;
+        }
+    }
+    for (float& rises : evidence.rises) {
+        rises /= static_cast<float>(endCore - firstCore);
+    }
+    Quantile(power, firstCore, endCore, kLoudInside, evidence.loud);
     evidence.standing = m_detector.Judge(power, firstCore, endCore, m_bFirst, m_bLast);
     evidence.judged = m_detector.Judged();
     if (!evidence.judged || !StepSpectrum(power, firstCore, endCore)) {
@@ -381,11 +396,11 @@ void MotorEstimator::Survey(const SpectralFrames& power, const FrameRole* roles,
     }
 }
 
-double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* roles, const std::vector<float>& lens,
-                                bool whine, SpectralFrames& noise)
+double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* roles, const LensView& lens,
+                                SpectralFrames& noise)
 {
     noise.Clear();
-    std::copy(lens.begin(), lens.end(), m_motor.begin());
+    std::copy(lens.spectrum.begin(), lens.spectrum.end(), m_motor.begin());
     SelectMotorBins();
     std::fill(m_risenRows.begin(), m_risenRows.end(), 0u);
     for (size_t row = 0; row < power.Rows(); ++row) {
@@ -415,7 +430,7 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
             risen += rises ? 1u : 0u;
         }
         m_risenBins[row] = risen;
-        m_whine[row] = whine ? DetectWhine(p) : 0.0;
+        m_whine[row] = lens.whine ? DetectWhine(p) : 0.0;
     }
     // What rises only now and then in a bin, in frames that do not rise across the spectrum, is
     // wanted sound (a whine's sweep, passing through each bin briefly, is followed below).
@@ -441,8 +456,10 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
         const bool tick = m_risenBins[row] != 0u;
         for (size_t k = 0; k < m_bins; ++k) {
             const float steady = std::min(p[k], m_activation[row] * m_motor[k]);
-            if (!tick && m_risenRows[k] < recurring) {
+            if (!tick && (m_risenRows[k] < recurring || lens.rises[k] < kLensRecurring)) {
                 n[k] = steady;
+            } else if (!tick) {
+                n[k] = std::min(n[k], kLensLoudness * lens.loud[k]);
             }
         }
     }

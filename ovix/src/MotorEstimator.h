@@ -25,6 +25,14 @@
 
 namespace ovix {
 
+// What the lens model tells the estimate of one interval.
+struct LensView {
+    const std::vector<float>& spectrum;  // the motor's steady spectrum
+    const std::vector<float>& rises;  // how often each bin rises far in the lens's other drives
+    const std::vector<float>& loud;  // and how loud it gets there
+    bool whine = false;  // a stepping motor: its whine is tracked and its hidden harmonics filled in
+};
+
 enum class FrameRole : uint8_t {
     kAround,  // outside the interval: the ramps and the analysis windows reaching past it
     kEdge,  // where the drive starts or stops
@@ -44,9 +52,7 @@ public:
     // motor's share of the power in the interval's frames.
     // The wanted sound's ceiling in use, to be raised to what it reached around other intervals.
     std::vector<float>& WantedCeiling() { return m_ceiling; }
-    // `whine`: the lens whines (a stepping motor), so a whine is tracked and its harmonics filled in.
-    double Estimate(const SpectralFrames& power, const FrameRole* roles, const std::vector<float>& lens, bool whine,
-                    SpectralFrames& noise);
+    double Estimate(const SpectralFrames& power, const FrameRole* roles, const LensView& lens, SpectralFrames& noise);
 
 private:
     // Per-bin quantile over rows [from, to) of `frames`.

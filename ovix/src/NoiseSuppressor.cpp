@@ -44,6 +44,8 @@ NoiseSuppressor::NoiseSuppressor(uint64_t rateHz, unsigned channels, uint64_t fr
       m_estimator(m_parameters),
       m_lens(m_parameters.bins, m_parameters.intervalsAhead),
       m_motor(m_parameters.bins),
+      m_rises(m_parameters.bins),
+      m_loud(m_parameters.bins),
       m_gainRule(m_parameters.bins)
 {
     const size_t n = m_parameters.fftSize;
@@ -341,7 +343,9 @@ void NoiseSuppressor::ProcessSegment(const Segment& segment)
     // Wanted sound louder than anything heard around this interval may have been heard around
     // the others: only what rises above all of that can be the motor's.
     m_lens.Ceiling(index, lastAhead, m_estimator.WantedCeiling());
-    m_lastShare = m_estimator.Estimate(m_power, m_roles.data(), m_motor, m_lens.Whines(index, lastAhead), m_noise);
+    m_lens.Rises(index, lastAhead, m_rises, m_loud);
+    m_lastShare =
+        m_estimator.Estimate(m_power, m_roles.data(), {m_motor, m_rises, m_loud, m_lens.Whines(index, lastAhead)}, m_noise);
     if (m_lastShare < kAudibleShare) {
         return;
     }

@@ -113,6 +113,8 @@ private:
     MotorEstimator m_estimator;
     LensModel m_lens;
     std::vector<float> m_motor;  // the lens's spectrum for the interval being processed
+    std::vector<float> m_rises;  // and how often its bins rise in the lens's other drives
+    std::vector<float> m_loud;  // and how loud they get there
     GainRule m_gainRule;
     double m_lastShare = 0.0;
     std::vector<double> m_spanShares;
