@@ -22,14 +22,14 @@ constexpr double kMatched = 1.0;
 constexpr double kMinLensOctaves = 0.2;
 constexpr size_t kNone = SIZE_MAX;
 constexpr float kLoneScore = 1.0f;
-// A whine in this share of an interval's frames, and several times as often as the wanted
-// sound alone makes one, is a stepping motor's.
+// A whine in this share more of an interval's frames than the wanted sound alone makes one in
+// (and in twice as many) is a stepping motor's.
 constexpr double kWhineShare = 0.2;
-constexpr double kWhineOverWanted = 3.0;
+constexpr double kWhineOverWanted = 2.0;
 
 bool ShowsWhine(const IntervalEvidence& evidence)
 {
-    return evidence.whine >= kWhineShare && evidence.whine >= kWhineOverWanted * evidence.whineNull;
+    return evidence.whine - evidence.whineNull >= kWhineShare && evidence.whine >= kWhineOverWanted * evidence.whineNull;
 }
 
 }  // namespace
@@ -70,6 +70,7 @@ IntervalEvidence& LensModel::Record(size_t span)
     std::fill(evidence.step.begin(), evidence.step.end(), 0.0f);
     std::fill(evidence.score.begin(), evidence.score.end(), 0.0f);
     std::fill(evidence.weak.begin(), evidence.weak.end(), uint8_t{0});
+    std::fill(evidence.floor.begin(), evidence.floor.end(), 0.0f);
     std::fill(evidence.ceiling.begin(), evidence.ceiling.end(), 0.0f);
     std::fill(evidence.pitches.begin(), evidence.pitches.end(), 0.0f);
     std::fill(evidence.rises.begin(), evidence.rises.end(), 0.0f);
@@ -94,7 +95,7 @@ double LensModel::Likeness(const IntervalEvidence& evidence, const IntervalEvide
     for (size_t b = 0; b < m_ownBands.size(); ++b) {
         shared += std::min(m_ownBands[b], m_lensBands[b]);
     }
-    if (ShowsWhine(evidence) && ShowsWhine(lens)) {
+    if (evidence.whine >= kWhineShare && lens.whine >= kWhineShare) {
         // A stepping motor sweeps its whine, each drive over its own stretch of the spectrum.
         double own = 0.0;
         double theirs = 0.0;

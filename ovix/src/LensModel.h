@@ -14,7 +14,7 @@ namespace ovix {
 // What one interval's ends show.
 struct IntervalEvidence {
     explicit IntervalEvidence(size_t bins)
-        : step(bins), score(bins), weak(bins), ceiling(bins), rises(bins), loud(bins), pitches(kPitchBands)
+        : step(bins), score(bins), weak(bins), floor(bins), ceiling(bins), rises(bins), loud(bins), pitches(kPitchBands)
     {
     }
 
@@ -25,6 +25,7 @@ struct IntervalEvidence {
     std::vector<float> step;  // the step into the interval where it stands out, unit power; 0 elsewhere
     std::vector<float> score;  // per bin, the step in units of the wanted sound's own steps
     std::vector<uint8_t> weak;  // bins that step more than the wanted sound usually does
+    std::vector<float> floor;  // the wanted sound's usual level around the interval, per bin
     std::vector<float> ceiling;  // the loudest the wanted sound got around the interval, per bin
     std::vector<float> rises;  // per bin, the share of the interval's frames rising far above that
     std::vector<float> loud;  // per bin, how loud the interval gets (a high quantile over its frames)
@@ -58,6 +59,8 @@ public:
     void Rises(size_t span, size_t lastAhead, std::vector<float>& rises, std::vector<float>& loud);
     // Per bin, the loudest the wanted sound got around the intervals near `span`.
     void Ceiling(size_t span, size_t lastAhead, std::vector<float>& ceiling) const;
+    // The survey of interval `span`, if it is still held.
+    const IntervalEvidence* Evidence(size_t span) const { return Find(span); }
     // The decision made about interval `span`.
     bool Shown(size_t span) const
     {

@@ -1,5 +1,7 @@
 #include "MotorEstimator.h"
 
+#include "FastLog.h"
+
 #include <algorithm>
 #include <cmath>
 
@@ -25,8 +27,6 @@ constexpr float kLensRecurring = 0.1f;
 constexpr float kLensLoudness = 2.0f;
 constexpr double kLoudInside = 0.9;
 constexpr double kTickSeconds = 0.01;
-// Each side of a drive's start or stop: long enough for medians to pass over syllables.
-constexpr double kWindowSeconds = 0.3;
 constexpr size_t kMinRows = 8;
 // A stepping motor's whine: fundamentals searched in 1/48-octave steps, eight harmonics.
 constexpr double kMinWhineHz = 100.0;
@@ -54,13 +54,10 @@ constexpr size_t kMaxMotorBins = 64;
 MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
     : m_bins(parameters.bins),
       m_detector(parameters),
-      m_windowRows(std::max<size_t>(kMinRows, static_cast<size_t>(kWindowSeconds * static_cast<double>(parameters.rateHz)) /
-                                                  parameters.hop)),
       m_floor(m_bins),
       m_ceiling(m_bins),
       m_inside(m_bins),
       m_outside(m_bins),
-      m_step(m_bins),
       m_motor(m_bins),
       m_usualBefore(m_bins),
       m_usualAfter(m_bins),
@@ -88,6 +85,7 @@ MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
     }
     const size_t rows = (parameters.segmentFrames + parameters.fftSize + 2 * parameters.rampFrames) / parameters.hop + 8;
     m_column.resize(std::max({rows, parameters.contextFrames * 2 / parameters.hop + 8, m_bins}));
+    m_quantiles = ColumnQuantiles(m_column.size(), m_bins);
     m_activation.resize(m_column.size());
     m_risenBins.resize(m_column.size());
     // A tick shows in the frames whose window reaches it.
@@ -99,33 +97,24 @@ MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
     m_window.resize(2 * m_trackRows + 1);
 }
 
-void MotorEstimator::Quantile(const SpectralFrames& frames, size_t from, size_t to, double q, std::vector<float>& out)
-{
-    const size_t n = std::min(to, frames.Rows()) - std::min(from, frames.Rows());
-    for (size_t k = 0; k < m_bins; ++k) {
-        if (n == 0) {
-            out[k] = 0.0f;
-            continue;
-        }
-        for (size_t i = 0; i < n; ++i) {
-            m_column[i] = frames.Row(from + i)[k];
-        }
-        const size_t at = std::min(n - 1, static_cast<size_t>(q * static_cast<double>(n)));
-        std::nth_element(m_column.begin(), m_column.begin() + static_cast<ptrdiff_t>(at),
-                         m_column.begin() + static_cast<ptrdiff_t>(n));
-        out[k] = m_column[at];
-    }
-}
-
-void MotorEstimator::SetSurroundings(const SpectralFrames& around, size_t before, bool first, bool last)
+void MotorEstimator::SetSurroundings(const SpectralFrames& around, size_t before, bool first, bool last,
+                                     const IntervalEvidence* surveyed)
 {
     m_around = &around;
     m_before = std::min(before, around.Rows());
     m_bFirst = first;
     m_bLast = last;
+    if (surveyed != nullptr) {
+        std::copy(surveyed->floor.begin(), surveyed->floor.end(), m_floor.begin());
+        std::copy(surveyed->ceiling.begin(), surveyed->ceiling.end(), m_ceiling.begin());
+        return;
+    }
     m_detector.Calibrate(around, m_before);
     if (around.Rows() >= kMinRows) {
-        Quantile(around, 0, around.Rows(), kFloorQuantile, m_floor);
+        // Neighbouring frames overlap by three quarters: every second one tells the levels.
+        const double quantiles[] = {kFloorQuantile};
+        std::vector<float>* const outs[] = {&m_floor};
+        m_quantiles.Compute(around, 0, around.Rows(), 2, quantiles, outs);
         Ceiling(around, 0, around.Rows(), m_ceiling);
     }
     // Otherwise what was heard around earlier intervals stands.
@@ -156,7 +145,9 @@ double MotorEstimator::WhineShare(const SpectralFrames& frames, size_t from, siz
 {
     std::copy(base.begin(), base.end(), m_base.begin());
     size_t found = 0;
-    for (size_t row = from; row < to; ++row) {
+    size_t looked = 0;
+    // Every second frame: neighbours overlap by three quarters.
+    for (size_t row = from; row < to; row += 2, ++looked) {
         const double f0 = DetectWhine(frames.Row(row));
         found += f0 > 0.0 ? 1 : 0;
         if (f0 > 0.0 && pitches != nullptr) {
@@ -164,7 +155,7 @@ double MotorEstimator::WhineShare(const SpectralFrames& frames, size_t from, siz
             pitches[std::min(band, IntervalEvidence::kPitchBands - 1)] += 1.0f;
         }
     }
-    return to > from ? static_cast<double>(found) / static_cast<double>(to - from) : 0.0;
+    return looked > 0 ? static_cast<double>(found) / static_cast<double>(looked) : 0.0;
 }
 
 void MotorEstimator::CoreRows(const FrameRole* roles, size_t rows, size_t& firstCore, size_t& endCore) const
@@ -177,34 +168,6 @@ void MotorEstimator::CoreRows(const FrameRole* roles, size_t rows, size_t& first
             endCore = row + 1;
         }
     }
-}
-
-bool MotorEstimator::StepSpectrum(const SpectralFrames& power, size_t firstCore, size_t endCore)
-{
-    if (firstCore >= endCore || endCore - firstCore < kMinRows) {
-        return false;
-    }
-    const size_t window = std::min(m_windowRows, endCore - firstCore);
-    const size_t after = m_around->Rows() - m_before;
-    bool any = false;
-    if (m_bFirst && m_before >= kMinRows) {
-        Quantile(power, firstCore, firstCore + window, 0.5, m_inside);
-        Quantile(*m_around, m_before - std::min(m_before, m_windowRows), m_before, 0.5, m_outside);
-        for (size_t k = 0; k < m_bins; ++k) {
-            m_step[k] = std::max(0.0f, m_inside[k] - m_outside[k]);
-        }
-        any = true;
-    }
-    if (m_bLast && after >= kMinRows) {
-        Quantile(power, endCore - window, endCore, 0.5, m_inside);
-        Quantile(*m_around, m_before, m_before + std::min(after, m_windowRows), 0.5, m_outside);
-        for (size_t k = 0; k < m_bins; ++k) {
-            const float step = std::max(0.0f, m_inside[k] - m_outside[k]);
-            m_step[k] = any ? std::min(m_step[k], step) : step;
-        }
-        any = true;
-    }
-    return any;
 }
 
 // The bins where the motor is strongest: above its mean, at most kMaxMotorBins of them.
@@ -235,7 +198,7 @@ size_t MotorEstimator::Salience(const float* p)
     size_t standing = 0;
     for (size_t k = 0; k < m_bins; ++k) {
         const bool stands = p[k] > kRise * m_base[k] && m_base[k] > 0.0f;
-        m_salience[k] = stands ? std::log(p[k] / m_base[k]) : 0.0f;
+        m_salience[k] = stands ? FastLog2(p[k] / m_base[k]) : 0.0f;
         standing += stands ? 1 : 0;
     }
     return standing;
@@ -334,6 +297,7 @@ void MotorEstimator::Survey(const SpectralFrames& power, const FrameRole* roles,
     if (firstCore >= endCore) {
         return;
     }
+    std::copy(m_floor.begin(), m_floor.end(), evidence.floor.begin());
     std::copy(m_ceiling.begin(), m_ceiling.end(), evidence.ceiling.begin());
     for (size_t row = firstCore; row < endCore; ++row) {
         const float* p = power.Row(row);
@@ -344,10 +308,10 @@ void MotorEstimator::Survey(const SpectralFrames& power, const FrameRole* roles,
     for (float& rises : evidence.rises) {
         rises /= static_cast<float>(endCore - firstCore);
     }
-    Quantile(power, firstCore, endCore, kLoudInside, evidence.loud);
+
     evidence.standing = m_detector.Judge(power, firstCore, endCore, m_bFirst, m_bLast);
     evidence.judged = m_detector.Judged();
-    if (!evidence.judged || !StepSpectrum(power, firstCore, endCore)) {
+    if (!evidence.judged) {
         return;
     }
     // A whine found in the interval far more often than the wanted sound alone makes one: judged
@@ -371,14 +335,17 @@ void MotorEstimator::Survey(const SpectralFrames& power, const FrameRole* roles,
     // surroundings at their loudest is weak evidence of its own.
     const bool before = m_bFirst && m_before >= kMinRows;
     const bool later = m_bLast && after >= kMinRows;
-    Quantile(power, firstCore, endCore, kQuietInside, m_inside);
+    const double inside[] = {kQuietInside, kLoudInside};
+    std::vector<float>* const insideOuts[] = {&m_inside, &evidence.loud};
+    m_quantiles.Compute(power, firstCore, endCore, 2, inside, insideOuts);
+    const double around[] = {kUsualAround, kLoudAround};
     if (before) {
-        Quantile(*m_around, 0, m_before, kUsualAround, m_usualBefore);
-        Quantile(*m_around, 0, m_before, kLoudAround, m_loudBefore);
+        std::vector<float>* const outs[] = {&m_usualBefore, &m_loudBefore};
+        m_quantiles.Compute(*m_around, 0, m_before, 2, around, outs);
     }
     if (later) {
-        Quantile(*m_around, m_before, m_around->Rows(), kUsualAround, m_usualAfter);
-        Quantile(*m_around, m_before, m_around->Rows(), kLoudAround, m_loudAfter);
+        std::vector<float>* const outs[] = {&m_usualAfter, &m_loudAfter};
+        m_quantiles.Compute(*m_around, m_before, m_around->Rows(), 2, around, outs);
     }
     evidence.standing = 0;
     double sum = 0.0;
@@ -388,7 +355,7 @@ void MotorEstimator::Survey(const SpectralFrames& power, const FrameRole* roles,
         evidence.standing += evidence.score[k] > m_detector.Bar() ? 1 : 0;
         const bool louder = both && m_inside[k] > m_loudBefore[k] && m_inside[k] > m_loudAfter[k];
         evidence.weak[k] = evidence.score[k] > kWeakScore || louder ? 1 : 0;
-        evidence.step[k] = evidence.score[k] > kSpectrumScore ? m_step[k] : 0.0f;
+        evidence.step[k] = evidence.score[k] > kSpectrumScore ? m_detector.Step()[k] : 0.0f;
         sum += evidence.step[k];
     }
     for (float& value : evidence.step) {

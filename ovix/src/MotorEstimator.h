@@ -15,6 +15,7 @@
 //   harmonics hidden under the wanted sound given the power of those shown.
 #pragma once
 
+#include "ColumnQuantiles.h"
 #include "LensModel.h"
 #include "SpectralFrames.h"
 #include "StepDetector.h"
@@ -44,8 +45,10 @@ public:
     explicit MotorEstimator(const SuppressorParameters& parameters);
 
     // Rows heard around the interval: [0, before) before it, the rest after it. `first` and
-    // `last` say whether the segment to estimate holds the interval's start and end.
-    void SetSurroundings(const SpectralFrames& around, size_t before, bool first, bool last);
+    // `last` say whether the segment to estimate holds the interval's start and end. The levels
+    // a survey of the interval found there are taken over rather than measured again.
+    void SetSurroundings(const SpectralFrames& around, size_t before, bool first, bool last,
+                         const IntervalEvidence* surveyed = nullptr);
     // What the segment's ends show of a motor, for the lens model.
     void Survey(const SpectralFrames& power, const FrameRole* roles, IntervalEvidence& evidence);
     // Fills `noise` (same rows as `power`) for a motor of spectrum `lens` and answers the
@@ -55,10 +58,6 @@ public:
     double Estimate(const SpectralFrames& power, const FrameRole* roles, const LensView& lens, SpectralFrames& noise);
 
 private:
-    // Per-bin quantile over rows [from, to) of `frames`.
-    void Quantile(const SpectralFrames& frames, size_t from, size_t to, double q, std::vector<float>& out);
-    // The motor's spectrum from this interval's ends; false when it has no usable end.
-    bool StepSpectrum(const SpectralFrames& power, size_t firstCore, size_t endCore);
     void CoreRows(const FrameRole* roles, size_t rows, size_t& firstCore, size_t& endCore) const;
     void SelectMotorBins();
     void Ceiling(const SpectralFrames& frames, size_t from, size_t to, std::vector<float>& out);
@@ -73,7 +72,6 @@ private:
 
     size_t m_bins;
     StepDetector m_detector;
-    size_t m_windowRows;  // rows on each side of a drive's start or stop
     const SpectralFrames* m_around = nullptr;
     size_t m_before = 0;
     bool m_bFirst = false;
@@ -82,7 +80,6 @@ private:
     std::vector<float> m_ceiling;  // and the most it reached
     std::vector<float> m_inside;
     std::vector<float> m_outside;
-    std::vector<float> m_step;
     std::vector<float> m_motor;  // the motor's spectrum used for this interval
     std::vector<float> m_usualBefore;  // how loud the surroundings usually are, and at their loudest
     std::vector<float> m_usualAfter;
@@ -110,6 +107,7 @@ private:
     size_t m_trackRows = 0;  // frames each side that a frame's whine is judged with
     double m_binHz = 1.0;
     std::vector<float> m_column;  // scratch: one bin across rows, or one row across bins
+    ColumnQuantiles m_quantiles{0, 0};
 };
 
 }  // namespace ovix

@@ -269,7 +269,7 @@ void NoiseSuppressor::AddSurroundings(uint64_t from, uint64_t to)
 // The spectra a segment is judged by: its surroundings (before the interval, back to the
 // previous interval's ramp, when it begins; after it, up to the next one's ramp, when it ends)
 // and every analysis frame reaching into what it writes.
-void NoiseSuppressor::Analyse(const Segment& segment)
+void NoiseSuppressor::Analyse(const Segment& segment, const IntervalEvidence* surveyed)
 {
     const DriveSpan& span = *segment.span;
     const uint64_t ramp = m_parameters.rampFrames;
@@ -293,7 +293,7 @@ void NoiseSuppressor::Analyse(const Segment& segment)
         }
         AddSurroundings(segment.writeEnd, to);
     }
-    m_estimator.SetSurroundings(m_around, m_aroundBefore, segment.first, segment.last);
+    m_estimator.SetSurroundings(m_around, m_aroundBefore, segment.first, segment.last, surveyed);
 
     m_firstRow = FloorDiv(static_cast<int64_t>(segment.writeStart) - size, hop) + 1;
     const int64_t lastRow = FloorDiv(static_cast<int64_t>(segment.writeEnd) - 1, hop);
@@ -326,7 +326,7 @@ void NoiseSuppressor::Survey(size_t index)
 void NoiseSuppressor::ProcessSegment(const Segment& segment)
 {
     const size_t index = segment.index;
-    Analyse(segment);
+    Analyse(segment, IsWhole(index) ? m_lens.Evidence(index) : nullptr);
     // A long interval is judged by its start, with the intervals before it.
     if (!IsWhole(index) && segment.first) {
         m_estimator.Survey(m_power, m_roles.data(), m_lens.Record(index));

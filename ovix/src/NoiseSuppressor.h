@@ -77,7 +77,7 @@ private:
     size_t LastAhead(size_t index) const;
     void ProcessComplete();
     void Survey(size_t index);
-    void Analyse(const Segment& segment);
+    void Analyse(const Segment& segment, const IntervalEvidence* surveyed = nullptr);
     void ProcessSegment(const Segment& segment);
     void AddSurroundings(uint64_t from, uint64_t to);
     void Analyse(int64_t frame, float* power);

@@ -1,7 +1,8 @@
 #include "StepDetector.h"
 
+#include "FastLog.h"
+
 #include <algorithm>
-#include <bit>
 #include <cmath>
 #include <cstdint>
 
@@ -17,19 +18,10 @@ constexpr size_t kMinPositions = 4;
 constexpr size_t kSpreadBins = 3;  // each side: neighbouring bins share how much they move
 constexpr float kMinSpread = 0.33f;  // 1 dB in log2 units
 constexpr float kUnknownSpread = 2.0f;  // 6 dB: before anything was heard, only clear steps count
-constexpr float kTiny = 1e-12f;
 // Powers count from this far under the surroundings' mean bin: digital silence between words
 // would otherwise make every word a step of a hundred decibels.
 constexpr float kFloorBelowMean = 1e-5f;
 
-// log2 to a few hundredths: steps are judged in decibels, not to the last digit.
-float FastLog2(float x)
-{
-    const auto bits = std::bit_cast<uint32_t>(std::max(x, kTiny));
-    const float exponent = static_cast<float>(static_cast<int>(bits >> 23) - 127);
-    const float m = std::bit_cast<float>((bits & 0x007fffffu) | 0x3f800000u) - 1.0f;
-    return exponent + m * (1.4425449f + m * (-0.7181452f + m * 0.2742f));
-}
 
 }  // namespace
 
@@ -39,7 +31,8 @@ StepDetector::StepDetector(const SuppressorParameters& parameters)
       m_sessionSpread(m_bins, kUnknownSpread),
       m_a(m_bins),
       m_b(m_bins),
-      m_score(m_bins)
+      m_score(m_bins),
+      m_step(m_bins)
 {
     const double rowsPerSecond = static_cast<double>(parameters.rateHz) / static_cast<double>(parameters.hop);
     m_standardWidth = std::max<size_t>(4, static_cast<size_t>(kWindowSeconds * rowsPerSecond));
@@ -157,6 +150,7 @@ void StepDetector::Calibrate(const SpectralFrames& around, size_t before)
 size_t StepDetector::Judge(const SpectralFrames& power, size_t firstCore, size_t endCore, bool first, bool last)
 {
     std::fill(m_score.begin(), m_score.end(), 0.0f);
+    std::fill(m_step.begin(), m_step.end(), 0.0f);
     m_bar = kBar;
     m_bJudged = false;
     if (m_around == nullptr || endCore < firstCore + m_width) {
@@ -177,6 +171,7 @@ size_t StepDetector::Judge(const SpectralFrames& power, size_t firstCore, size_t
         MeanOf(m_logsBefore, m_before - m_width, m_a.data());
         for (size_t k = 0; k < m_bins; ++k) {
             m_score[k] = (m_b[k] - m_a[k]) / m_spread[k];
+            m_step[k] = std::max(0.0f, std::exp2(m_b[k]) - std::exp2(m_a[k]));
         }
         any = true;
     }
@@ -186,7 +181,9 @@ size_t StepDetector::Judge(const SpectralFrames& power, size_t firstCore, size_t
         MeanOf(m_logsAfter, 0, m_a.data());
         for (size_t k = 0; k < m_bins; ++k) {
             const float score = (m_b[k] - m_a[k]) / m_spread[k];
+            const float step = std::max(0.0f, std::exp2(m_b[k]) - std::exp2(m_a[k]));
             m_score[k] = any ? std::min(m_score[k], score) : score;
+            m_step[k] = any ? std::min(m_step[k], step) : step;
         }
     }
     size_t standing = 0;

@@ -28,6 +28,9 @@ public:
     float Score(size_t bin) const { return m_score[bin]; }
     // How far beyond the wanted sound's own steps a bin must step to stand out.
     float Bar() const { return m_bar; }
+    // Per bin, the power the sound gained into the interval (geometric means of the windows at an
+    // end, the smaller gain of the two ends).
+    const std::vector<float>& Step() const { return m_step; }
     // Whether the last judgement could compare an end with its surroundings.
     bool Judged() const { return m_bJudged; }
     size_t Bins() const { return m_bins; }
@@ -58,6 +61,7 @@ private:
     std::vector<float> m_a;
     std::vector<float> m_b;
     std::vector<float> m_score;
+    std::vector<float> m_step;
 };
 
 }  // namespace ovix
