@@ -397,7 +397,12 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
             risen += rises ? 1u : 0u;
         }
         m_risenBins[row] = risen;
-        m_whine[row] = lens.whine ? DetectWhine(p) : 0.0;
+        // Every second frame: the pitch track is followed over a quarter second anyway.
+        if (lens.whine && row % 2 == 0) {
+            m_whine[row] = DetectWhine(p);
+        } else {
+            m_whine[row] = lens.whine ? m_whine[row - 1] : 0.0;
+        }
     }
     // What rises only now and then in a bin, in frames that do not rise across the spectrum, is
     // wanted sound (a whine's sweep, passing through each bin briefly, is followed below).

@@ -21,10 +21,22 @@ uint64_t SaturatingAdd(uint64_t a, uint64_t b)
     return a > UINT64_MAX - b ? UINT64_MAX : a + b;
 }
 
-size_t SegmentRows(const SuppressorParameters& p)
+// Intervals up to this long (most AF drives) keep their survey's spectra for their processing.
+constexpr double kKeptSurveySeconds = 4.0;
+
+size_t RowsFor(const SuppressorParameters& p, uint64_t frames)
 {
-    return (p.segmentFrames + 2 * p.rampFrames + p.fftSize) / p.hop + 2;
+    return (frames + 2 * p.rampFrames + p.fftSize) / p.hop + 2;
 }
+
+size_t SegmentRows(const SuppressorParameters& p) { return RowsFor(p, p.segmentFrames); }
+
+size_t KeptRows(const SuppressorParameters& p)
+{
+    return std::min(SegmentRows(p), RowsFor(p, static_cast<uint64_t>(kKeptSurveySeconds * static_cast<double>(p.rateHz))));
+}
+
+size_t AroundRows(const SuppressorParameters& p) { return 2 * p.contextFrames / p.hop + 4; }
 
 }  // namespace
 
@@ -37,10 +49,8 @@ NoiseSuppressor::NoiseSuppressor(uint64_t rateHz, unsigned channels, uint64_t fr
       m_ramp(m_parameters.rampFrames),
       m_overlap(m_parameters.fftSize * m_parameters.channels),
       m_gain(m_parameters.bins),
-      m_roles(SegmentRows(m_parameters)),
-      m_power(SegmentRows(m_parameters), m_parameters.bins),
+      m_work(SegmentRows(m_parameters), AroundRows(m_parameters), m_parameters.bins),
       m_noise(SegmentRows(m_parameters), m_parameters.bins),
-      m_around(2 * m_parameters.contextFrames / m_parameters.hop + 4, m_parameters.bins),
       m_estimator(m_parameters),
       m_lens(m_parameters.bins, m_parameters.intervalsAhead),
       m_motor(m_parameters.bins),
@@ -52,6 +62,10 @@ NoiseSuppressor::NoiseSuppressor(uint64_t rateHz, unsigned channels, uint64_t fr
     for (size_t i = 0; i < n; ++i) {
         m_window[i] = static_cast<float>(
             std::sqrt(0.5 - 0.5 * std::cos(2.0 * std::numbers::pi * static_cast<double>(i) / static_cast<double>(n))));
+    }
+    m_surveys.reserve(m_parameters.intervalsAhead + 1);
+    for (size_t i = 0; i <= m_parameters.intervalsAhead; ++i) {
+        m_surveys.emplace_back(KeptRows(m_parameters), AroundRows(m_parameters), m_parameters.bins);
     }
     const double steps = static_cast<double>(m_ramp.size() + 1);
     for (size_t k = 0; k < m_ramp.size(); ++k) {
@@ -67,6 +81,9 @@ void NoiseSuppressor::SetSpans(std::vector<DriveSpan> spans)
     m_segmentAt = m_spans.empty() ? 0 : m_spans.front().start;
     m_surveyed = 0;
     m_lens.Reset();
+    for (SegmentSpectra& survey : m_surveys) {
+        survey.span = SIZE_MAX;
+    }
 }
 
 NoiseSuppressor::Segment NoiseSuppressor::FirstSegment(size_t index, uint64_t at) const
@@ -252,13 +269,13 @@ void NoiseSuppressor::Analyse(int64_t frame, float* power)
 }
 
 // Analysis frames lying wholly within [from, to).
-void NoiseSuppressor::AddSurroundings(uint64_t from, uint64_t to)
+void NoiseSuppressor::AddSurroundings(uint64_t from, uint64_t to, SpectralFrames& around)
 {
     const int64_t hop = static_cast<int64_t>(m_parameters.hop);
     const int64_t size = static_cast<int64_t>(m_parameters.fftSize);
     for (int64_t j = FloorDiv(static_cast<int64_t>(from) + hop - 1, hop); j * hop + size <= static_cast<int64_t>(to);
          ++j) {
-        float* row = m_around.AddRow();
+        float* row = around.AddRow();
         if (row == nullptr) {
             return;
         }
@@ -269,21 +286,22 @@ void NoiseSuppressor::AddSurroundings(uint64_t from, uint64_t to)
 // The spectra a segment is judged by: its surroundings (before the interval, back to the
 // previous interval's ramp, when it begins; after it, up to the next one's ramp, when it ends)
 // and every analysis frame reaching into what it writes.
-void NoiseSuppressor::Analyse(const Segment& segment, const IntervalEvidence* surveyed)
+void NoiseSuppressor::Analyse(const Segment& segment, SegmentSpectra& spectra)
 {
     const DriveSpan& span = *segment.span;
     const uint64_t ramp = m_parameters.rampFrames;
     const int64_t hop = static_cast<int64_t>(m_parameters.hop);
     const int64_t size = static_cast<int64_t>(m_parameters.fftSize);
     const size_t index = segment.index;
+    spectra.span = SIZE_MAX;
     if (segment.first) {
-        m_around.Clear();
+        spectra.around.Clear();
         uint64_t from = segment.writeStart > m_parameters.contextFrames ? segment.writeStart - m_parameters.contextFrames : 0;
         if (index > 0) {
             from = std::max(from, SaturatingAdd(m_spans[index - 1].end, ramp));
         }
-        AddSurroundings(from, segment.writeStart);
-        m_aroundBefore = m_around.Rows();
+        AddSurroundings(from, segment.writeStart, spectra.around);
+        spectra.before = spectra.around.Rows();
     }
     if (segment.last) {
         uint64_t to = std::min(m_end, SaturatingAdd(segment.writeEnd, m_parameters.contextFrames));
@@ -291,15 +309,13 @@ void NoiseSuppressor::Analyse(const Segment& segment, const IntervalEvidence* su
             const uint64_t next = m_spans[index + 1].start;
             to = std::min(to, next > ramp ? next - ramp : 0);
         }
-        AddSurroundings(segment.writeEnd, to);
+        AddSurroundings(segment.writeEnd, to, spectra.around);
     }
-    m_estimator.SetSurroundings(m_around, m_aroundBefore, segment.first, segment.last, surveyed);
-
-    m_firstRow = FloorDiv(static_cast<int64_t>(segment.writeStart) - size, hop) + 1;
+    spectra.firstRow = FloorDiv(static_cast<int64_t>(segment.writeStart) - size, hop) + 1;
     const int64_t lastRow = FloorDiv(static_cast<int64_t>(segment.writeEnd) - 1, hop);
-    m_power.Clear();
-    for (int64_t j = m_firstRow; j <= lastRow; ++j) {
-        float* row = m_power.AddRow();
+    spectra.power.Clear();
+    for (int64_t j = spectra.firstRow; j <= lastRow; ++j) {
+        float* row = spectra.power.AddRow();
         if (row == nullptr) {
             break;  // cannot happen with the sizes the parameters give
         }
@@ -312,24 +328,35 @@ void NoiseSuppressor::Analyse(const Segment& segment, const IntervalEvidence* su
         if (centre >= start && centre < end) {
             role = (centre < start + edge || centre >= end - edge) ? FrameRole::kEdge : FrameRole::kCore;
         }
-        m_roles[m_power.Rows() - 1] = role;
+        spectra.roles[spectra.power.Rows() - 1] = role;
     }
 }
 
 void NoiseSuppressor::Survey(size_t index)
 {
     const Segment segment = FirstSegment(index, m_spans[index].start);
-    Analyse(segment);
-    m_estimator.Survey(m_power, m_roles.data(), m_lens.Record(index));
+    SegmentSpectra& kept = m_surveys[index % m_surveys.size()];
+    const bool keep = segment.writeEnd - segment.writeStart <= kKeptSurveySeconds * static_cast<double>(m_parameters.rateHz);
+    SegmentSpectra& spectra = keep ? kept : m_work;
+    Analyse(segment, spectra);
+    spectra.span = keep ? index : SIZE_MAX;
+    m_estimator.SetSurroundings(spectra.around, spectra.before, segment.first, segment.last);
+    m_estimator.Survey(spectra.power, spectra.roles.data(), m_lens.Record(index));
 }
 
 void NoiseSuppressor::ProcessSegment(const Segment& segment)
 {
     const size_t index = segment.index;
-    Analyse(segment, IsWhole(index) ? m_lens.Evidence(index) : nullptr);
+    SegmentSpectra& kept = m_surveys[index % m_surveys.size()];
+    SegmentSpectra& spectra = IsWhole(index) && kept.span == index ? kept : m_work;
+    if (&spectra == &m_work) {
+        Analyse(segment, m_work);
+    }
+    m_estimator.SetSurroundings(spectra.around, spectra.before, segment.first, segment.last,
+                                IsWhole(index) ? m_lens.Evidence(index) : nullptr);
     // A long interval is judged by its start, with the intervals before it.
     if (!IsWhole(index) && segment.first) {
-        m_estimator.Survey(m_power, m_roles.data(), m_lens.Record(index));
+        m_estimator.Survey(spectra.power, spectra.roles.data(), m_lens.Record(index));
     }
     const size_t lastAhead = std::min(LastAhead(index), m_surveyed > 0 ? m_surveyed - 1 : 0);
     if (segment.first && !m_lens.Decide(index, lastAhead)) {
@@ -344,13 +371,13 @@ void NoiseSuppressor::ProcessSegment(const Segment& segment)
     // the others: only what rises above all of that can be the motor's.
     m_lens.Ceiling(index, lastAhead, m_estimator.WantedCeiling());
     m_lens.Rises(index, lastAhead, m_rises, m_loud);
-    m_lastShare =
-        m_estimator.Estimate(m_power, m_roles.data(), {m_motor, m_rises, m_loud, m_lens.Whines(index, lastAhead)}, m_noise);
+    m_lastShare = m_estimator.Estimate(spectra.power, spectra.roles.data(),
+                                       {m_motor, m_rises, m_loud, m_lens.Whines(index, lastAhead)}, m_noise);
     if (m_lastShare < kAudibleShare) {
         return;
     }
     m_spanShares[index] = m_lastShare;
-    Resynthesise(segment, m_firstRow, m_firstRow + static_cast<int64_t>(m_power.Rows()) - 1);
+    Resynthesise(segment, spectra);
 }
 
 float NoiseSuppressor::RampWeight(const DriveSpan& span, uint64_t frame) const
@@ -367,8 +394,10 @@ float NoiseSuppressor::RampWeight(const DriveSpan& span, uint64_t frame) const
 
 // Overlap-adds the removed part frame by frame; a frame's first hop is complete once the
 // frame is added, since the next frame starts after it.
-void NoiseSuppressor::Resynthesise(const Segment& segment, int64_t firstRow, int64_t lastRow)
+void NoiseSuppressor::Resynthesise(const Segment& segment, const SegmentSpectra& spectra)
 {
+    const int64_t firstRow = spectra.firstRow;
+    const int64_t lastRow = spectra.firstRow + static_cast<int64_t>(spectra.power.Rows()) - 1;
     const unsigned channels = m_parameters.channels;
     const size_t size = m_parameters.fftSize;
     const int64_t hop = static_cast<int64_t>(m_parameters.hop);
@@ -378,7 +407,7 @@ void NoiseSuppressor::Resynthesise(const Segment& segment, int64_t firstRow, int
     m_gainRule.Reset();
     for (int64_t j = firstRow; j <= lastRow; ++j) {
         const size_t row = static_cast<size_t>(j - firstRow);
-        m_gainRule.Compute(m_power.Row(row), m_noise.Row(row), segment.span->strength, m_gain.data());
+        m_gainRule.Compute(spectra.power.Row(row), m_noise.Row(row), segment.span->strength, m_gain.data());
         bool touched = false;
         for (size_t k = 0; k < m_parameters.bins && !touched; ++k) {
             touched = m_gain[k] < 1.0f;

@@ -21,6 +21,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <cstddef>
 #include <vector>
 
 namespace ovix {
@@ -56,6 +57,17 @@ public:
     const std::vector<double>& SpanShares() const { return m_spanShares; }
 
 private:
+    // The spectra one segment is judged and processed by.
+    struct SegmentSpectra {
+        SegmentSpectra(size_t rows, size_t aroundRows, size_t bins) : power(rows, bins), around(aroundRows, bins), roles(rows) {}
+        SpectralFrames power;  // every analysis frame reaching into what the segment writes
+        SpectralFrames around;  // its surroundings: rows [0, before) before it, the rest after it
+        std::vector<FrameRole> roles;
+        size_t before = 0;
+        int64_t firstRow = 0;  // the analysis frame of power's first row
+        size_t span = SIZE_MAX;  // the interval whose survey they hold
+    };
+
     struct Segment {
         const DriveSpan* span = nullptr;
         size_t index = 0;
@@ -77,12 +89,12 @@ private:
     size_t LastAhead(size_t index) const;
     void ProcessComplete();
     void Survey(size_t index);
-    void Analyse(const Segment& segment, const IntervalEvidence* surveyed = nullptr);
+    void Analyse(const Segment& segment, SegmentSpectra& spectra);
     void ProcessSegment(const Segment& segment);
-    void AddSurroundings(uint64_t from, uint64_t to);
+    void AddSurroundings(uint64_t from, uint64_t to, SpectralFrames& around);
     void Analyse(int64_t frame, float* power);
     void LoadFrame(int64_t frame, unsigned channel);
-    void Resynthesise(const Segment& segment, int64_t firstRow, int64_t lastRow);
+    void Resynthesise(const Segment& segment, const SegmentSpectra& spectra);
     float RampWeight(const DriveSpan& span, uint64_t frame) const;
     int16_t Held(uint64_t frame, unsigned channel) const
     {
@@ -104,12 +116,10 @@ private:
     std::vector<float> m_ramp;  // rising half of a raised cosine, strictly between 0 and 1
     std::vector<float> m_overlap;  // removed sound being overlap-added, fftSize frames
     std::vector<float> m_gain;
-    std::vector<FrameRole> m_roles;
-    SpectralFrames m_power;
+    SegmentSpectra m_work;  // long intervals, and intervals whose survey is no longer held
+    // The surveys of the intervals a decision waits for, kept for their processing.
+    std::vector<SegmentSpectra> m_surveys;
     SpectralFrames m_noise;
-    SpectralFrames m_around;
-    size_t m_aroundBefore = 0;  // rows of m_around heard before the interval
-    int64_t m_firstRow = 0;  // the analysis frame of m_power's first row
     MotorEstimator m_estimator;
     LensModel m_lens;
     std::vector<float> m_motor;  // the lens's spectrum for the interval being processed
