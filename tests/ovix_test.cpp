@@ -354,8 +354,9 @@ void PrintTo(const UntouchedRow& row, std::ostream* os) { *os << row.name; }
 
 class OvixUntouchedTest : public OvixTest, public ::testing::WithParamInterface<UntouchedRow> {};
 
-// What the intervals hold is what their surroundings hold (or the motor is to be kept): the
-// suppressor alone and the whole session give back every sample as it came.
+// Nothing in the intervals is a motor to remove (what they hold is what their surroundings hold,
+// however much that changes, or the motor is to be kept): the suppressor alone and the whole
+// session give back every sample as it came.
 TEST_P(OvixUntouchedTest, IntervalsWithoutAMotorToRemoveLeaveBitExact)
 {
     const UntouchedRow& row = GetParam();
@@ -392,6 +393,27 @@ std::vector<double> ChordOverNoise(uint64_t frames, unsigned channels, uint32_t 
     return testsupport::Sum(testsupport::Chord(frames, channels, rate, 1500.0),
                             testsupport::Ambience(frames, channels, 1200.0));
 }
+// A talker: bursts of band-limited noise 80 to 250 ms long with pauses between them, far louder
+// than the room; its steps at a drive's ends are larger than a quiet motor's would be.
+std::vector<double> SyllablesThroughout(uint64_t frames, unsigned channels, uint32_t rate, const std::vector<MotorSpan>&)
+{
+    std::vector<double> out = testsupport::Ambience(frames, channels, 30.0);
+    testsupport::WhiteNoise noise(11), timing(12);
+    testsupport::BandPass voice(900.0, 0.7, rate);
+    bool talking = true;
+    uint64_t left = 0;
+    for (uint64_t f = 0; f < frames; ++f) {
+        if (left-- == 0) {
+            talking = !talking;
+            left = static_cast<uint64_t>((0.165 + 0.085 * timing.Next()) * rate);
+        }
+        const double value = voice.Step(noise.Next()) * (talking ? 6000.0 : 0.0);
+        for (unsigned c = 0; c < channels; ++c) {
+            out[f * channels + c] += value;
+        }
+    }
+    return out;
+}
 std::vector<double> LoudMotor(uint64_t frames, unsigned channels, uint32_t rate, const std::vector<MotorSpan>& spans)
 {
     return testsupport::Sum(testsupport::Ambience(frames, channels, 60.0),
@@ -404,6 +426,7 @@ INSTANTIATE_TEST_SUITE_P(
                       UntouchedRow{"QuietNoiseThroughoutMono44k", 44100, 1, QuietNoiseThroughout, 1000},
                       UntouchedRow{"ChordThroughoutStereo48k", 48000, 2, ChordThroughout, 1000},
                       UntouchedRow{"ChordOverNoiseSixChannels48k", 48000, 6, ChordOverNoise, 1000},
+                      UntouchedRow{"SyllablesThroughoutMono48k", 48000, 1, SyllablesThroughout, 1000},
                       UntouchedRow{"LoudMotorAtStrengthZero", 48000, 2, LoudMotor, 0}),
     [](const ::testing::TestParamInfo<UntouchedRow>& info) { return std::string(info.param.name); });
 
@@ -491,6 +514,62 @@ INSTANTIATE_TEST_SUITE_P(
                       MotorRow{"SoftMotorInQuietSixChannels48k", 48000, 6, 0.0, 800.0},
                       MotorRow{"LoudMotorOverChordMono44k", 44100, 1, 1000.0, 3000.0}),
     [](const ::testing::TestParamInfo<MotorRow>& info) { return std::string(info.param.name); });
+
+// --- One lens, one noise: what the drives show is judged together.
+
+// What a drive's ends could show: `score` (the step in units of the wanted sound's own) over
+// bins [from, to), nothing elsewhere.
+ovix::IntervalEvidence& Shows(ovix::LensModel& lens, size_t span, size_t from, size_t to, float score)
+{
+    ovix::IntervalEvidence& evidence = lens.Record(span);
+    evidence.judged = true;
+    for (size_t k = from; k < to; ++k) {
+        evidence.score[k] = score;
+        evidence.weak[k] = score > 2.5f ? 1 : 0;
+        evidence.step[k] = 1.0f / static_cast<float>(to - from);
+        evidence.standing += score > 3.0f ? 1 : 0;
+    }
+    return evidence;
+}
+
+// A drive is believed on clear evidence of its own unless it is unlike what the lens made in an
+// earlier drive; weaker evidence only where the lens showed itself in the same bins, in a drive
+// before or after it; a drive with nothing around it to judge it by goes with the lens.
+TEST(OvixLensModelTest, DrivesAreJudgedTogether)
+{
+    constexpr size_t kBins = 64;
+    ovix::LensModel lens(kBins, 2);
+    Shows(lens, 0, 10, 20, 5.0f);
+    EXPECT_TRUE(lens.Decide(0, 0)) << "clear evidence alone";
+
+    lens.Reset();
+    Shows(lens, 0, 10, 20, 2.7f);
+    EXPECT_FALSE(lens.Decide(0, 0)) << "weak evidence alone";
+    lens.Reset();
+    Shows(lens, 0, 10, 20, 2.7f);
+    Shows(lens, 1, 12, 24, 5.0f);
+    EXPECT_TRUE(lens.Decide(0, 1)) << "weak evidence where a later drive shows the lens";
+    EXPECT_TRUE(lens.Decide(1, 1));
+    lens.Reset();
+    Shows(lens, 0, 10, 20, 2.7f);
+    Shows(lens, 1, 40, 50, 5.0f);
+    EXPECT_FALSE(lens.Decide(0, 1)) << "weak evidence where the lens shows nothing";
+
+    lens.Reset();
+    Shows(lens, 0, 10, 20, 5.0f);
+    Shows(lens, 1, 40, 50, 5.0f);
+    EXPECT_TRUE(lens.Decide(0, 1));
+    EXPECT_FALSE(lens.Decide(1, 1)) << "clear evidence unlike the lens before";
+
+    lens.Reset();
+    Shows(lens, 0, 10, 20, 5.0f);
+    lens.Record(1);
+    EXPECT_TRUE(lens.Decide(0, 1));
+    EXPECT_TRUE(lens.Decide(1, 1)) << "no surroundings, beside a drive that showed the lens";
+    lens.Reset();
+    lens.Record(0);
+    EXPECT_FALSE(lens.Decide(0, 0)) << "no surroundings and no lens";
+}
 
 // --- Outside the intervals and their ramps nothing changes, wherever the intervals lie.
 

@@ -8,8 +8,17 @@ namespace ovix {
 namespace {
 
 // An interval shows the motor on its own when this many bins step far beyond the wanted
-// sound's own steps at both its ends (about 300 Hz of spectrum).
+// sound's own steps at both its ends (about 300 Hz of spectrum), or fewer that carry this share
+// of its power (a low rumble fills a handful of bins).
 constexpr size_t kStrong = 6;
+constexpr size_t kStrongFew = 2;
+constexpr double kStrongShare = 0.1;
+
+bool Strong(const IntervalEvidence& evidence)
+{
+    return evidence.judged && (evidence.standing >= kStrong ||
+                               (evidence.standing >= kStrongFew && evidence.standingShare >= kStrongShare));
+}
 // Strong evidence is believed when this share of its power (in quarter-octave bands) falls where
 // another interval's that showed the lens does. Unrelated spectra share a few percent.
 constexpr double kLikeLens = 0.2;
@@ -18,7 +27,7 @@ constexpr double kBandsPerOctave = 4.0;
 // when, over the bins where the lens showed itself elsewhere, the interval's ends step by this
 // many times the wanted sound's own steps on average (many bins together tell what one cannot).
 constexpr double kRecurringOctaves = 0.2;
-constexpr double kMatched = 1.0;
+constexpr double kMatched = 0.75;
 constexpr double kMinLensOctaves = 0.2;
 constexpr size_t kNone = SIZE_MAX;
 constexpr float kLoneScore = 1.0f;
@@ -43,6 +52,7 @@ LensModel::LensModel(size_t bins, size_t ahead)
     }
     m_chosen.reserve(m_spanOf.size());
     m_lensBins.resize(bins);
+    m_lensPower.resize(bins);
     m_column.resize(m_spanOf.size());
     m_band.resize(bins);
     for (size_t k = 0; k < bins; ++k) {
@@ -62,6 +72,7 @@ IntervalEvidence& LensModel::Record(size_t span)
     m_spanOf[slot] = span;
     IntervalEvidence& evidence = m_records[slot];
     evidence.standing = 0;
+    evidence.standingShare = 0.0;
     evidence.whine = 0.0;
     evidence.whineNull = 0.0;
     evidence.judged = false;
@@ -70,6 +81,8 @@ IntervalEvidence& LensModel::Record(size_t span)
     std::fill(evidence.step.begin(), evidence.step.end(), 0.0f);
     std::fill(evidence.score.begin(), evidence.score.end(), 0.0f);
     std::fill(evidence.weak.begin(), evidence.weak.end(), uint8_t{0});
+    std::fill(evidence.covered.begin(), evidence.covered.end(), 0.0f);
+    std::fill(evidence.coveredLoud.begin(), evidence.coveredLoud.end(), 0.0f);
     std::fill(evidence.floor.begin(), evidence.floor.end(), 0.0f);
     std::fill(evidence.ceiling.begin(), evidence.ceiling.end(), 0.0f);
     std::fill(evidence.pitches.begin(), evidence.pitches.end(), 0.0f);
@@ -121,24 +134,26 @@ bool LensModel::Decide(size_t span, size_t lastAhead)
     own->decided = true;
     const size_t first = span > kRemembered ? span - kRemembered : 0;
     const size_t last = std::min(lastAhead, span + m_ahead);
-    const bool strong = own->judged && own->standing >= kStrong;
+    const bool strong = Strong(*own);
     bool lensSeen = false;
     bool lensBefore = false;  // an earlier interval was found to show the lens
     double like = 0.0;
     double recurring = 0.0;
     std::fill(m_lensBins.begin(), m_lensBins.end(), uint8_t{0});
+    std::fill(m_lensPower.begin(), m_lensPower.end(), 0.0f);
     for (size_t other = first; other <= last; ++other) {
         const IntervalEvidence* evidence = other != span ? Find(other) : nullptr;
         if (evidence == nullptr) {
             continue;
         }
-        const bool showsLens = evidence->decided ? evidence->shown : evidence->judged && evidence->standing >= kStrong;
+        const bool showsLens = evidence->decided ? evidence->shown : Strong(*evidence);
         if (showsLens) {
             lensSeen = true;
             lensBefore = lensBefore || other < span;
             like = std::max(like, Likeness(*own, *evidence));
             for (size_t k = 0; k < m_bins; ++k) {
                 m_lensBins[k] |= evidence->weak[k];
+                m_lensPower[k] += evidence->step[k];
             }
         }
         double octaves = 0.0;
@@ -147,15 +162,18 @@ bool LensModel::Decide(size_t span, size_t lastAhead)
         }
         recurring = std::max(recurring, octaves);
     }
+    // Over the lens's bins, weighted by how much of its power each carries.
     double lensOctaves = 0.0;
+    double lensPower = 0.0;
     double matched = 0.0;
     for (size_t k = 0; k < m_bins; ++k) {
         if (m_lensBins[k] != 0) {
             lensOctaves += m_octaves[k];
-            matched += m_octaves[k] * own->score[k];
+            lensPower += m_lensPower[k];
+            matched += m_lensPower[k] * own->score[k];
         }
     }
-    matched = lensOctaves >= kMinLensOctaves ? matched / lensOctaves : 0.0;
+    matched = lensOctaves >= kMinLensOctaves && lensPower > 0.0 ? matched / lensPower : 0.0;
     if (!own->judged) {
         // No surroundings to judge it by (drives back to back): it goes with the lens.
         own->shown = lensSeen;
@@ -178,7 +196,7 @@ void LensModel::Rises(size_t span, size_t lastAhead, std::vector<float>& rises, 
     for (size_t other = first; other <= last; ++other) {
         const IntervalEvidence* evidence = other != span ? Find(other) : nullptr;
         if (evidence != nullptr && evidence->judged &&
-            (evidence->decided ? evidence->shown : evidence->standing >= kStrong)) {
+            (evidence->decided ? evidence->shown : Strong(*evidence))) {
             m_chosen.push_back(evidence);
         }
     }
@@ -241,7 +259,7 @@ void LensModel::Spectrum(size_t span, size_t lastAhead, std::vector<float>& moto
         if (evidence == nullptr || !evidence->judged) {
             continue;
         }
-        const bool showsLens = evidence->decided ? evidence->shown : evidence->standing >= kStrong;
+        const bool showsLens = evidence->decided ? evidence->shown : Strong(*evidence);
         if (other == span || showsLens) {
             m_chosen.push_back(evidence);
         }

@@ -14,7 +14,16 @@ namespace ovix {
 // What one interval's ends show.
 struct IntervalEvidence {
     explicit IntervalEvidence(size_t bins)
-        : step(bins), score(bins), weak(bins), floor(bins), ceiling(bins), rises(bins), loud(bins), pitches(kPitchBands)
+        : step(bins),
+          score(bins),
+          weak(bins),
+          covered(bins),
+          coveredLoud(bins),
+          floor(bins),
+          ceiling(bins),
+          rises(bins),
+          loud(bins),
+          pitches(kPitchBands)
     {
     }
 
@@ -25,11 +34,16 @@ struct IntervalEvidence {
     std::vector<float> step;  // the step into the interval where it stands out, unit power; 0 elsewhere
     std::vector<float> score;  // per bin, the step in units of the wanted sound's own steps
     std::vector<uint8_t> weak;  // bins that step more than the wanted sound usually does
+    // Per bin the motor covers (even its quiet moments louder than the surroundings' loud ones),
+    // how loud the wanted sound usually is there; 0 elsewhere.
+    std::vector<float> covered;
+    std::vector<float> coveredLoud;  // and the most of a frame there that is the motor's
     std::vector<float> floor;  // the wanted sound's usual level around the interval, per bin
     std::vector<float> ceiling;  // the loudest the wanted sound got around the interval, per bin
     std::vector<float> rises;  // per bin, the share of the interval's frames rising far above that
     std::vector<float> loud;  // per bin, how loud the interval gets (a high quantile over its frames)
     size_t standing = 0;  // bins that step far more than the wanted sound does
+    double standingShare = 0.0;  // their step's share of the interval's power
     double whine = 0.0;  // the share of the interval's frames in which a whine stands out
     double whineNull = 0.0;  // the same share in the surroundings, where no motor ran
     std::vector<float> pitches;  // frames with a whine, by its pitch
@@ -87,6 +101,7 @@ private:
     std::vector<float> m_lensBands;
     std::vector<const IntervalEvidence*> m_chosen;
     std::vector<uint8_t> m_lensBins;  // where the intervals that show the lens are weak
+    std::vector<float> m_lensPower;  // and their steps' power there
     std::vector<float> m_column;
 };
 

@@ -46,6 +46,9 @@ constexpr float kSpectrumScore = 0.0f;
 constexpr double kQuietInside = 0.25;
 constexpr double kUsualAround = 0.5;
 constexpr double kLoudAround = 0.8;
+// Where the motor covers the wanted sound, a frame up to this many times the drive's usual
+// level there is the motor's doing (tones beating under a bin swing so far), louder is not.
+constexpr float kCoveredLoud = 4.0f;
 // Enough bins to judge a frame by, few enough to judge every frame quickly.
 constexpr size_t kMaxMotorBins = 64;
 
@@ -59,6 +62,7 @@ MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
       m_inside(m_bins),
       m_outside(m_bins),
       m_motor(m_bins),
+      m_usualInside(m_bins),
       m_usualBefore(m_bins),
       m_usualAfter(m_bins),
       m_loudBefore(m_bins),
@@ -94,6 +98,7 @@ MotorEstimator::MotorEstimator(const SuppressorParameters& parameters)
     m_whine.resize(m_column.size());
     m_track.resize(m_column.size());
     m_trackRows = static_cast<size_t>(kTrackSeconds * static_cast<double>(parameters.rateHz)) / parameters.hop;
+    m_guardRows = parameters.edgeFrames / parameters.hop;
     m_window.resize(2 * m_trackRows + 1);
 }
 
@@ -115,17 +120,22 @@ void MotorEstimator::SetSurroundings(const SpectralFrames& around, size_t before
         const double quantiles[] = {kFloorQuantile};
         std::vector<float>* const outs[] = {&m_floor};
         m_quantiles.Compute(around, 0, around.Rows(), 2, quantiles, outs);
-        Ceiling(around, 0, around.Rows(), m_ceiling);
+        // A drive's noise may begin a moment before the camera marks it and end a moment after:
+        // the frames next to the interval do not tell how loud the wanted sound gets.
+        const size_t skipFrom = m_before > m_guardRows ? m_before - m_guardRows : m_before;
+        const size_t skipTo = around.Rows() - m_before > m_guardRows ? m_before + m_guardRows : m_before;
+        Ceiling(around, 0, around.Rows(), m_ceiling, skipFrom, skipTo);
     }
     // Otherwise what was heard around earlier intervals stands.
 }
 
 // A bin's ceiling is the loudest of it and its neighbours: a voice's harmonics move with its
 // pitch, and one louder syllable a bin away is no motor.
-void MotorEstimator::Ceiling(const SpectralFrames& frames, size_t from, size_t to, std::vector<float>& out)
+void MotorEstimator::Ceiling(const SpectralFrames& frames, size_t from, size_t to, std::vector<float>& out,
+                             size_t skipFrom, size_t skipTo)
 {
     std::fill(m_inside.begin(), m_inside.end(), 0.0f);
-    for (size_t row = from; row < to; ++row) {
+    for (size_t row = from; row < to; row = row + 1 == skipFrom ? std::max(skipTo, row + 1) : row + 1) {
         const float* p = frames.Row(row);
         for (size_t k = 0; k < m_bins; ++k) {
             m_inside[k] = std::max(m_inside[k], p[k]);
@@ -299,10 +309,12 @@ void MotorEstimator::Survey(const SpectralFrames& power, const FrameRole* roles,
     }
     std::copy(m_floor.begin(), m_floor.end(), evidence.floor.begin());
     std::copy(m_ceiling.begin(), m_ceiling.end(), evidence.ceiling.begin());
+    double insidePower = 0.0;  // the interval's power, summed over its core frames
     for (size_t row = firstCore; row < endCore; ++row) {
         const float* p = power.Row(row);
         for (size_t k = 0; k < m_bins; ++k) {
             evidence.rises[k] += p[k] > kRise * m_ceiling[k] ? 1.0f : 0.0f;
+            insidePower += p[k];
         }
     }
     for (float& rises : evidence.rises) {
@@ -335,8 +347,8 @@ void MotorEstimator::Survey(const SpectralFrames& power, const FrameRole* roles,
     // surroundings at their loudest is weak evidence of its own.
     const bool before = m_bFirst && m_before >= kMinRows;
     const bool later = m_bLast && after >= kMinRows;
-    const double inside[] = {kQuietInside, kLoudInside};
-    std::vector<float>* const insideOuts[] = {&m_inside, &evidence.loud};
+    const double inside[] = {kQuietInside, kUsualAround, kLoudInside};
+    std::vector<float>* const insideOuts[] = {&m_inside, &m_usualInside, &evidence.loud};
     m_quantiles.Compute(power, firstCore, endCore, 2, inside, insideOuts);
     const double around[] = {kUsualAround, kLoudAround};
     if (before) {
@@ -348,19 +360,27 @@ void MotorEstimator::Survey(const SpectralFrames& power, const FrameRole* roles,
         m_quantiles.Compute(*m_around, m_before, m_around->Rows(), 2, around, outs);
     }
     evidence.standing = 0;
+    double standingPower = 0.0;
     double sum = 0.0;
     for (size_t k = 0; k < m_bins; ++k) {
         const bool persists = (!before || m_inside[k] > m_usualBefore[k]) && (!later || m_inside[k] > m_usualAfter[k]);
         evidence.score[k] = persists ? m_detector.Score(k) : std::min(m_detector.Score(k), 0.0f);
-        evidence.standing += evidence.score[k] > m_detector.Bar() ? 1 : 0;
+        const bool stands = evidence.score[k] > m_detector.Bar();
+        evidence.standing += stands ? 1 : 0;
+        standingPower += stands ? m_detector.Step()[k] : 0.0f;
         const bool louder = both && m_inside[k] > m_loudBefore[k] && m_inside[k] > m_loudAfter[k];
         evidence.weak[k] = evidence.score[k] > kWeakScore || louder ? 1 : 0;
+        const bool covers = louder && evidence.score[k] > kWeakScore;
+        evidence.covered[k] = covers ? std::max(m_usualBefore[k], m_usualAfter[k]) : 0.0f;
+        evidence.coveredLoud[k] = covers ? std::min(evidence.loud[k], kCoveredLoud * m_usualInside[k]) : 0.0f;
         evidence.step[k] = evidence.score[k] > kSpectrumScore ? m_detector.Step()[k] : 0.0f;
         sum += evidence.step[k];
     }
     for (float& value : evidence.step) {
         value = sum > 0.0 ? static_cast<float>(value / sum) : 0.0f;
     }
+    const double frames = static_cast<double>(endCore - firstCore);
+    evidence.standingShare = insidePower > 0.0 ? standingPower * frames / insidePower : 0.0;
 }
 
 double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* roles, const LensView& lens,
@@ -446,6 +466,18 @@ double MotorEstimator::Estimate(const SpectralFrames& power, const FrameRole* ro
             m_base[k] = m_ceiling[k] + m_activation[row] * m_motor[k];
         }
         FillWhine(power.Row(row), noise.Row(row), m_whine[row]);
+    }
+    // Where the motor covers the wanted sound, all but the wanted sound's usual level is the
+    // motor's, however it moves from frame to frame (tones beating under one bin), up to how loud
+    // the drive gets there (a bird's call louder than that stays the bird's).
+    for (size_t row = 0; row < power.Rows(); ++row) {
+        const float* p = power.Row(row);
+        float* n = noise.Row(row);
+        for (size_t k = 0; k < m_bins; ++k) {
+            if (lens.covered[k] > 0.0f) {
+                n[k] = std::max(n[k], std::min(p[k], lens.coveredLoud[k]) - lens.covered[k]);
+            }
+        }
     }
     // Never below the wanted sound's usual level around the interval: what a bin holds up to
     // that level is taken for wanted sound, whatever the motor's estimate says.

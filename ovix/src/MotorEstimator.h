@@ -31,6 +31,8 @@ struct LensView {
     const std::vector<float>& spectrum;  // the motor's steady spectrum
     const std::vector<float>& rises;  // how often each bin rises far in the lens's other drives
     const std::vector<float>& loud;  // and how loud it gets there
+    const std::vector<float>& covered;  // in this drive, where the motor covers the wanted sound
+    const std::vector<float>& coveredLoud;  // and how loud the drive gets there
     bool whine = false;  // a stepping motor: its whine is tracked and its hidden harmonics filled in
 };
 
@@ -60,7 +62,9 @@ public:
 private:
     void CoreRows(const FrameRole* roles, size_t rows, size_t& firstCore, size_t& endCore) const;
     void SelectMotorBins();
-    void Ceiling(const SpectralFrames& frames, size_t from, size_t to, std::vector<float>& out);
+    // Per bin, the loudest of rows [from, to) but [skipFrom, skipTo), spread over neighbouring bins.
+    void Ceiling(const SpectralFrames& frames, size_t from, size_t to, std::vector<float>& out, size_t skipFrom = 0,
+                 size_t skipTo = 0);
     // The share of rows [from, to) of `frames` in which a whine stands above `base`; counts the
     // frames by the whine's pitch into `pitches` (IntervalEvidence::kPitchBands) when given.
     double WhineShare(const SpectralFrames& frames, size_t from, size_t to, const std::vector<float>& base,
@@ -81,6 +85,7 @@ private:
     std::vector<float> m_inside;
     std::vector<float> m_outside;
     std::vector<float> m_motor;  // the motor's spectrum used for this interval
+    std::vector<float> m_usualInside;  // how loud the interval usually is
     std::vector<float> m_usualBefore;  // how loud the surroundings usually are, and at their loudest
     std::vector<float> m_usualAfter;
     std::vector<float> m_loudBefore;
@@ -105,6 +110,7 @@ private:
     std::vector<double> m_track;
     std::vector<double> m_window;
     size_t m_trackRows = 0;  // frames each side that a frame's whine is judged with
+    size_t m_guardRows = 0;  // frames next to the interval left out of the wanted sound's ceiling
     double m_binHz = 1.0;
     std::vector<float> m_column;  // scratch: one bin across rows, or one row across bins
     ColumnQuantiles m_quantiles{0, 0};

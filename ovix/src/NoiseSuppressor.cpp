@@ -56,6 +56,7 @@ NoiseSuppressor::NoiseSuppressor(uint64_t rateHz, unsigned channels, uint64_t fr
       m_motor(m_parameters.bins),
       m_rises(m_parameters.bins),
       m_loud(m_parameters.bins),
+      m_noCover(m_parameters.bins),
       m_gainRule(m_parameters.bins)
 {
     const size_t n = m_parameters.fftSize;
@@ -371,8 +372,11 @@ void NoiseSuppressor::ProcessSegment(const Segment& segment)
     // the others: only what rises above all of that can be the motor's.
     m_lens.Ceiling(index, lastAhead, m_estimator.WantedCeiling());
     m_lens.Rises(index, lastAhead, m_rises, m_loud);
+    const IntervalEvidence* own = m_lens.Evidence(index);
     m_lastShare = m_estimator.Estimate(spectra.power, spectra.roles.data(),
-                                       {m_motor, m_rises, m_loud, m_lens.Whines(index, lastAhead)}, m_noise);
+                                       {m_motor, m_rises, m_loud, own != nullptr ? own->covered : m_noCover,
+                                        own != nullptr ? own->coveredLoud : m_noCover, m_lens.Whines(index, lastAhead)},
+                                       m_noise);
     if (m_lastShare < kAudibleShare) {
         return;
     }

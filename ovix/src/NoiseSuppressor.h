@@ -125,6 +125,7 @@ private:
     std::vector<float> m_motor;  // the lens's spectrum for the interval being processed
     std::vector<float> m_rises;  // and how often its bins rise in the lens's other drives
     std::vector<float> m_loud;  // and how loud they get there
+    const std::vector<float> m_noCover;
     GainRule m_gainRule;
     double m_lastShare = 0.0;
     std::vector<double> m_spanShares;
