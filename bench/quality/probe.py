@@ -20,6 +20,7 @@ import scoring
 from run import build_sound
 from wavio import from_int16, to_int16
 
+SHIFT_MS = 0.0
 CACHE = os.path.join(os.path.dirname(__file__), "..", "..", "build", "quality", "probe")
 
 
@@ -39,7 +40,9 @@ def run(probe, case, clean, motor):
     with tempfile.TemporaryDirectory() as tmp:
         src, dst = os.path.join(tmp, "in.raw"), os.path.join(tmp, "out.raw")
         noisy_pcm.astype("<i2").tofile(src)
-        spans = [f"{s}:{e}" for s, e in case.intervals]
+        # --shift: the camera's intervals off from where the motor ran, as clocks drift.
+        shift = int(SHIFT_MS * case.rate / 1000)
+        spans = [f"{max(s + shift, 0)}:{max(e + shift, 0)}" for s, e in case.intervals]
         done = subprocess.run([probe, str(case.rate), str(case.channels), src, dst] + spans,
                               capture_output=True, text=True, check=True)
         out = np.fromfile(dst, dtype="<i2").reshape(-1, case.channels)
@@ -65,8 +68,11 @@ def main():
     # (other seeds), for a last look at a change tuned on the other two.
     parser.add_argument("--set", default="all", choices=["main", "holdout", "all", "fresh"])
     parser.add_argument("--cases", default="")
+    parser.add_argument("--shift", type=float, default=0.0, help="move the intervals by this many ms")
     parser.add_argument("-v", action="store_true", help="a line per case")
     args = parser.parse_args()
+    global SHIFT_MS
+    SHIFT_MS = args.shift
     sets = []
     if args.set in ("main", "all"):
         sets.append(("main", casebook.all_cases()))

@@ -46,6 +46,8 @@ constexpr float kSpectrumScore = 0.0f;
 constexpr double kQuietInside = 0.25;
 constexpr double kUsualAround = 0.5;
 constexpr double kLoudAround = 0.8;
+// Levels are read from every fourth frame: frames a window apart, so none is counted twice.
+constexpr size_t kLevelStride = 4;
 // Where the motor covers the wanted sound, a frame up to this many times the drive's usual
 // level there is the motor's doing (tones beating under a bin swing so far), louder is not.
 constexpr float kCoveredLoud = 4.0f;
@@ -116,10 +118,9 @@ void MotorEstimator::SetSurroundings(const SpectralFrames& around, size_t before
     }
     m_detector.Calibrate(around, m_before);
     if (around.Rows() >= kMinRows) {
-        // Neighbouring frames overlap by three quarters: every second one tells the levels.
         const double quantiles[] = {kFloorQuantile};
         std::vector<float>* const outs[] = {&m_floor};
-        m_quantiles.Compute(around, 0, around.Rows(), 2, quantiles, outs);
+        m_quantiles.Compute(around, 0, around.Rows(), kLevelStride, quantiles, outs);
         // A drive's noise may begin a moment before the camera marks it and end a moment after:
         // the frames next to the interval do not tell how loud the wanted sound gets.
         const size_t skipFrom = m_before > m_guardRows ? m_before - m_guardRows : m_before;
@@ -349,15 +350,15 @@ void MotorEstimator::Survey(const SpectralFrames& power, const FrameRole* roles,
     const bool later = m_bLast && after >= kMinRows;
     const double inside[] = {kQuietInside, kUsualAround, kLoudInside};
     std::vector<float>* const insideOuts[] = {&m_inside, &m_usualInside, &evidence.loud};
-    m_quantiles.Compute(power, firstCore, endCore, 2, inside, insideOuts);
+    m_quantiles.Compute(power, firstCore, endCore, kLevelStride, inside, insideOuts);
     const double around[] = {kUsualAround, kLoudAround};
     if (before) {
         std::vector<float>* const outs[] = {&m_usualBefore, &m_loudBefore};
-        m_quantiles.Compute(*m_around, 0, m_before, 2, around, outs);
+        m_quantiles.Compute(*m_around, 0, m_before, kLevelStride, around, outs);
     }
     if (later) {
         std::vector<float>* const outs[] = {&m_usualAfter, &m_loudAfter};
-        m_quantiles.Compute(*m_around, m_before, m_around->Rows(), 2, around, outs);
+        m_quantiles.Compute(*m_around, m_before, m_around->Rows(), kLevelStride, around, outs);
     }
     evidence.standing = 0;
     double standingPower = 0.0;
