@@ -534,7 +534,8 @@ ovix::IntervalEvidence& Shows(ovix::LensModel& lens, size_t span, size_t from, s
 
 // A drive is believed on clear evidence of its own unless it is unlike what the lens made in an
 // earlier drive; weaker evidence only where the lens showed itself in the same bins, in a drive
-// before or after it; a drive with nothing around it to judge it by goes with the lens.
+// before or after it; a drive with nothing around it to judge it by goes with the lens when it
+// runs on from a drive that showed it.
 TEST(OvixLensModelTest, DrivesAreJudgedTogether)
 {
     constexpr size_t kBins = 64;
@@ -563,11 +564,16 @@ TEST(OvixLensModelTest, DrivesAreJudgedTogether)
 
     lens.Reset();
     Shows(lens, 0, 10, 20, 5.0f);
+    lens.Record(1).adjoins = true;
+    EXPECT_TRUE(lens.Decide(0, 1));
+    EXPECT_TRUE(lens.Decide(1, 1)) << "no surroundings, running on from a drive that showed the lens";
+    lens.Reset();
+    Shows(lens, 0, 10, 20, 5.0f);
     lens.Record(1);
     EXPECT_TRUE(lens.Decide(0, 1));
-    EXPECT_TRUE(lens.Decide(1, 1)) << "no surroundings, beside a drive that showed the lens";
+    EXPECT_FALSE(lens.Decide(1, 1)) << "no surroundings, apart from the drive that showed the lens";
     lens.Reset();
-    lens.Record(0);
+    lens.Record(0).adjoins = true;
     EXPECT_FALSE(lens.Decide(0, 0)) << "no surroundings and no lens";
 }
 

@@ -35,10 +35,14 @@ constexpr float kLoneScore = 1.0f;
 // (and in twice as many) is a stepping motor's.
 constexpr double kWhineShare = 0.2;
 constexpr double kWhineOverWanted = 2.0;
+// Short surroundings may happen to hold no whine of the wanted sound's: it makes one in at least
+// this share of frames for all they tell.
+constexpr double kLeastWantedWhine = 0.1;
 
 bool ShowsWhine(const IntervalEvidence& evidence)
 {
-    return evidence.whine - evidence.whineNull >= kWhineShare && evidence.whine >= kWhineOverWanted * evidence.whineNull;
+    const double wanted = std::max(evidence.whineNull, kLeastWantedWhine);
+    return evidence.whine - wanted >= kWhineShare && evidence.whine >= kWhineOverWanted * wanted;
 }
 
 }  // namespace
@@ -76,6 +80,7 @@ IntervalEvidence& LensModel::Record(size_t span)
     evidence.whine = 0.0;
     evidence.whineNull = 0.0;
     evidence.judged = false;
+    evidence.adjoins = false;
     evidence.shown = false;
     evidence.decided = false;
     std::fill(evidence.step.begin(), evidence.step.end(), 0.0f);
@@ -175,8 +180,9 @@ bool LensModel::Decide(size_t span, size_t lastAhead)
     }
     matched = lensOctaves >= kMinLensOctaves && lensPower > 0.0 ? matched / lensPower : 0.0;
     if (!own->judged) {
-        // No surroundings to judge it by (drives back to back): it goes with the lens.
-        own->shown = lensSeen;
+        // No surroundings to judge it by: a drive that runs on from or into one showing the lens
+        // goes with it.
+        own->shown = lensSeen && own->adjoins;
     } else if (strong) {
         // Wanted sound that happens to start and stop with a drive can step as clearly as a
         // motor; unlike what the lens made before, and like nothing the lens makes later, it is

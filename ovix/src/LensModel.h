@@ -48,6 +48,7 @@ struct IntervalEvidence {
     double whineNull = 0.0;  // the same share in the surroundings, where no motor ran
     std::vector<float> pitches;  // frames with a whine, by its pitch
     bool judged = false;  // at least one end could be compared with its surroundings
+    bool adjoins = false;  // the drive runs on from, or into, the one beside it
     bool shown = false;  // the decision, once made
     bool decided = false;
 };

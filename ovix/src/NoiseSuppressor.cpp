@@ -342,7 +342,17 @@ void NoiseSuppressor::Survey(size_t index)
     Analyse(segment, spectra);
     spectra.span = keep ? index : SIZE_MAX;
     m_estimator.SetSurroundings(spectra.around, spectra.before, segment.first, segment.last);
-    m_estimator.Survey(spectra.power, spectra.roles.data(), m_lens.Record(index));
+    IntervalEvidence& evidence = m_lens.Record(index);
+    m_estimator.Survey(spectra.power, spectra.roles.data(), evidence);
+    evidence.adjoins = Adjoins(index);
+}
+
+bool NoiseSuppressor::Adjoins(size_t index) const
+{
+    const uint64_t touching = 2 * m_parameters.rampFrames;
+    const DriveSpan& span = m_spans[index];
+    return (index > 0 && span.start <= SaturatingAdd(m_spans[index - 1].end, touching)) ||
+           (index + 1 < m_spans.size() && m_spans[index + 1].start <= SaturatingAdd(span.end, touching));
 }
 
 void NoiseSuppressor::ProcessSegment(const Segment& segment)
@@ -357,7 +367,9 @@ void NoiseSuppressor::ProcessSegment(const Segment& segment)
                                 IsWhole(index) ? m_lens.Evidence(index) : nullptr);
     // A long interval is judged by its start, with the intervals before it.
     if (!IsWhole(index) && segment.first) {
-        m_estimator.Survey(spectra.power, spectra.roles.data(), m_lens.Record(index));
+        IntervalEvidence& evidence = m_lens.Record(index);
+        m_estimator.Survey(spectra.power, spectra.roles.data(), evidence);
+        evidence.adjoins = Adjoins(index);
     }
     const size_t lastAhead = std::min(LastAhead(index), m_surveyed > 0 ? m_surveyed - 1 : 0);
     if (segment.first && !m_lens.Decide(index, lastAhead)) {

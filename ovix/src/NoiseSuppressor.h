@@ -83,6 +83,7 @@ private:
     // The first segment of span `index`.
     Segment FirstSegment(size_t index, uint64_t at) const;
     bool IsWhole(size_t index) const;  // the span is processed in one segment
+    bool Adjoins(size_t index) const;  // the span runs on from, or into, the one beside it
     uint64_t NeededFrom(const Segment& segment) const;
     uint64_t NeededUntil(const Segment& segment) const;
     // The last span that the decision about span `index` waits for.

@@ -37,6 +37,8 @@ StepDetector::StepDetector(const SuppressorParameters& parameters)
     const double rowsPerSecond = static_cast<double>(parameters.rateHz) / static_cast<double>(parameters.hop);
     m_standardWidth = std::max<size_t>(4, static_cast<size_t>(kWindowSeconds * rowsPerSecond));
     m_width = m_standardWidth;
+    m_shortestWidth = std::max<size_t>(
+        4, static_cast<size_t>(kShortestWindowSeconds / kWindowSeconds * static_cast<double>(m_standardWidth)));
     // From the last frame wholly before the ramp to the first frame centred past the edge.
     m_gap = (parameters.rampFrames + parameters.edgeFrames + parameters.fftSize) / parameters.hop;
     const size_t aroundRows = 2 * parameters.contextFrames / parameters.hop + 4;
@@ -58,16 +60,17 @@ void StepDetector::LogRows(const SpectralFrames& frames, size_t from, size_t to,
     }
 }
 
-void StepDetector::MeanOf(const std::vector<float>& logs, size_t from, float* out) const
+void StepDetector::MeanOf(const std::vector<float>& logs, size_t from, float* out, size_t width) const
 {
+    width = width == 0 ? m_width : width;
     std::fill(out, out + m_bins, 0.0f);
-    for (size_t row = from; row < from + m_width; ++row) {
+    for (size_t row = from; row < from + width; ++row) {
         const float* l = logs.data() + row * m_bins;
         for (size_t k = 0; k < m_bins; ++k) {
             out[k] += l[k];
         }
     }
-    const float scale = 1.0f / static_cast<float>(m_width);
+    const float scale = 1.0f / static_cast<float>(width);
     for (size_t k = 0; k < m_bins; ++k) {
         out[k] *= scale;
     }
@@ -91,9 +94,7 @@ void StepDetector::Calibrate(const SpectralFrames& around, size_t before)
     // Windows as long as the longer side allows, so that short surroundings still say something.
     const size_t longest = std::max(m_before, after);
     const size_t fits = longest > m_gap ? (longest - m_gap) / 2 : 0;
-    const size_t shortest = std::max<size_t>(4, static_cast<size_t>(kShortestWindowSeconds / kWindowSeconds *
-                                                                    static_cast<double>(m_standardWidth)));
-    m_width = std::clamp(fits, shortest, m_standardWidth);
+    m_width = std::clamp(fits, m_shortestWidth, m_standardWidth);
     LogRows(around, 0, m_before, m_logsBefore);
     LogRows(around, m_before, around.Rows(), m_logsAfter);
     const size_t stride = std::max<size_t>(1, m_width / 4);
@@ -153,12 +154,16 @@ size_t StepDetector::Judge(const SpectralFrames& power, size_t firstCore, size_t
     std::fill(m_step.begin(), m_step.end(), 0.0f);
     m_bar = kBar;
     m_bJudged = false;
-    if (m_around == nullptr || endCore < firstCore + m_width) {
+    // A drive shorter than the windows is judged on windows as long as it, whose means wander
+    // more than the surroundings' longer ones did.
+    const size_t width = std::min(m_width, endCore > firstCore ? endCore - firstCore : 0);
+    if (m_around == nullptr || width < m_shortestWidth) {
         return 0;
     }
+    const float wander = std::sqrt(static_cast<float>(m_width) / static_cast<float>(width));
     const size_t after = m_around->Rows() - m_before;
-    const bool atStart = first && m_before >= m_width;
-    const bool atEnd = last && after >= m_width;
+    const bool atStart = first && m_before >= width;
+    const bool atEnd = last && after >= width;
     if (!atStart && !atEnd) {
         return 0;
     }
@@ -166,21 +171,21 @@ size_t StepDetector::Judge(const SpectralFrames& power, size_t firstCore, size_t
     m_bJudged = true;
     bool any = false;
     if (atStart) {
-        LogRows(power, firstCore, firstCore + m_width, m_logsInside);
-        MeanOf(m_logsInside, 0, m_b.data());
-        MeanOf(m_logsBefore, m_before - m_width, m_a.data());
+        LogRows(power, firstCore, firstCore + width, m_logsInside);
+        MeanOf(m_logsInside, 0, m_b.data(), width);
+        MeanOf(m_logsBefore, m_before - width, m_a.data(), width);
         for (size_t k = 0; k < m_bins; ++k) {
-            m_score[k] = (m_b[k] - m_a[k]) / m_spread[k];
+            m_score[k] = (m_b[k] - m_a[k]) / (wander * m_spread[k]);
             m_step[k] = std::max(0.0f, std::exp2(m_b[k]) - std::exp2(m_a[k]));
         }
         any = true;
     }
     if (atEnd) {
-        LogRows(power, endCore - m_width, endCore, m_logsInside);
-        MeanOf(m_logsInside, 0, m_b.data());
-        MeanOf(m_logsAfter, 0, m_a.data());
+        LogRows(power, endCore - width, endCore, m_logsInside);
+        MeanOf(m_logsInside, 0, m_b.data(), width);
+        MeanOf(m_logsAfter, 0, m_a.data(), width);
         for (size_t k = 0; k < m_bins; ++k) {
-            const float score = (m_b[k] - m_a[k]) / m_spread[k];
+            const float score = (m_b[k] - m_a[k]) / (wander * m_spread[k]);
             const float step = std::max(0.0f, std::exp2(m_b[k]) - std::exp2(m_a[k]));
             m_score[k] = any ? std::min(m_score[k], score) : score;
             m_step[k] = any ? std::min(m_step[k], step) : step;

@@ -38,13 +38,14 @@ public:
 private:
     static constexpr float kTinyPower = 1e-12f;
     void LogRows(const SpectralFrames& frames, size_t from, size_t to, std::vector<float>& out) const;
-    // Mean over rows [from, from + m_width) of logs held in `logs` (rows of m_bins).
-    void MeanOf(const std::vector<float>& logs, size_t from, float* out) const;
+    // Mean over rows [from, from + width) of logs held in `logs` (rows of m_bins); width 0 is m_width.
+    void MeanOf(const std::vector<float>& logs, size_t from, float* out, size_t width = 0) const;
 
     size_t m_bins;
     size_t m_width;  // rows of each window
     size_t m_gap;  // rows between the outside and the inside window at an end
     size_t m_standardWidth;
+    size_t m_shortestWidth;
     const SpectralFrames* m_around = nullptr;
     size_t m_before = 0;
     float m_bar = 0.0f;
