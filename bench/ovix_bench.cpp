@@ -180,7 +180,7 @@ double TimeSession(const std::vector<int16_t>& source, double share)
     TqovixSetCallbackInputAudio(InputAudio);
     TqovixSetCallbackOutputAudio(OutputAudio);
     TqovixSetCallbackNotifyProgress(NotifyProgress);
-    const TqovixAudioInformation audio{sizeof(TqovixAudioInformation), kRate / 1000, kChannels, 16, kFrames, 0, 0};
+    const TqovixAudioInformation audio{sizeof(TqovixAudioInformation), kRate / 1000, kChannels, 16, kFrames, 0, 0, 0, 0};
     const TqovixTrimInformation trim{sizeof(TqovixTrimInformation), 30000, 1001, 0, 0};
     const auto start = Clock::now();
     double seconds = -1.0;
