@@ -103,7 +103,7 @@ private:
     // bytes and a new moov at `moovOffset`.
     bool CanPatch(const TqovixAtomList& atoms, uint64_t& moovOffset) const;
     eTqovixErrorCode BeginPatching(bool& started);
-    // Writes processed PCM over the copy at `offset`, and only where it differs from the source.
+    // Writes processed PCM over the copy at `offset`, and only the samples that differ from the source.
     eTqovixErrorCode PatchSound(uint64_t offset, const uint8_t* data, uint32_t size, bool swap);
     eTqovixErrorCode WriteMovieAtom();
     void KeepServedSound(eTqovixErrorCode served, const void* buffer, const unsigned long* delivered) const;
@@ -141,6 +141,9 @@ private:
     std::vector<std::pair<uint32_t, size_t>> m_carriedTracks;
     uint32_t m_soundTrackIndex = 0;
     uint32_t m_frameBytes = 0;  // PCM: bytes per frame of the sound track
+    uint32_t m_sampleBits = 16;  // what the processing library is served
+    uint32_t m_sampleBytes = 2;
+    bool m_bFloatingPoint = false;
     std::string m_refusal;
     eTqovixRefusal m_refusalKind = eTqovixRefusal::None;
     std::vector<TqovixChunkInformation> m_outputAudioChunks;
@@ -158,7 +161,9 @@ private:
     bool m_bLargeMediaDataHeader = false;  // the mdat header written has a 64-bit size field
     bool m_bFinishPending = false;
     bool m_bDestinationComplete = false;
-    int m_carriedByte = -1;  // big-endian PCM: the odd byte of a piece waits for its pair
+    // Big-endian PCM: the start of a sample that a piece ends in waits for the rest.
+    uint8_t m_carried[8] = {};
+    uint32_t m_carriedBytes = 0;
     std::vector<uint8_t> m_copyBuffer;  // reused for swapped PCM and video chunks the kernel cannot copy
     bool m_bPatching = false;
     bool m_bPatchCandidate = false;        // the layout allows it: the served sound is kept
