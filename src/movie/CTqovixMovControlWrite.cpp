@@ -18,7 +18,6 @@ constexpr uint64_t kCopyPiece = 1 << 20;
 constexpr uint64_t kStopPiece = 64 << 20;
 constexpr uint64_t kMax32 = CTqovixAtom::kMaxCompactAtomSize;
 
-
 }  // namespace
 
 eTqovixErrorCode CTqovixMovControl::SetMovieMetaData(const void* data, unsigned long size)
