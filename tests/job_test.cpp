@@ -265,6 +265,8 @@ const Layout kLayouts[] = {
          r.sound.floatingPoint = true;
          r.mdatCount = 3;
      }},
+    // A rate that is no whole number of kHz: the library is told it exactly.
+    {"Twos47952", SoundCodec::Twos, [](moviekit::MovieRecipe& r) { r.sound.sampleRate = 47952; }},
     {"Fl64LittleEndian44100", SoundCodec::Sowt,
      [](moviekit::MovieRecipe& r) {
          r.sound.bits = 64;
