@@ -100,6 +100,21 @@ void LoadRun(const uint8_t* first, size_t stride, size_t count, const float* win
     }
 }
 
+// One 32-bit load a sample: its three bytes and the next sample's first, which lies inside the
+// run for every sample but the last. The top 24 bits then hold the sample times 256.
+template <>
+void LoadRun<S24>(const uint8_t* first, size_t stride, size_t count, const float* window, float* out)
+{
+    size_t i = 0;
+    for (; i + 1 < count; ++i) {
+        const uint32_t word = Get<uint32_t>(first + i * stride);
+        out[i] = window[i] * (static_cast<float>(static_cast<int32_t>(word << 8)) * (1.0f / 65536.0f));
+    }
+    for (; i < count; ++i) {
+        out[i] = window[i] * S24::Level(first + i * stride);
+    }
+}
+
 template <typename Format, size_t kBytes>
 void SubtractRun(uint8_t* frame, unsigned channels, const float* removed, float weight)
 {
