@@ -65,6 +65,7 @@ struct WriterRow {
     std::function<Source(const testsupport::TempDir&)> make;  // writes the source
     bool patched;  // the layout lets the copy be taken
     bool motor = false;  // the interval holds a motor, so the job changes samples there
+    uint64_t servedLimit = 0;  // if set, the served sound kept to compare with; past it the file is read
 };
 void PrintTo(const WriterRow& row, std::ostream* out) { *out << row.name; }
 
@@ -128,7 +129,11 @@ std::function<Source(const testsupport::TempDir&)> Ffmpeg(std::string sound)
 
 class WriterTest : public ::testing::TestWithParam<WriterRow> {
 protected:
-    void TearDown() override { CTqovixMovControl::SetPatchWriting(true); }
+    void TearDown() override
+    {
+        CTqovixMovControl::SetPatchWriting(true);
+        CTqovixMovControl::SetServedSoundLimit(0);
+    }
     testsupport::TempDir m_dir;
 };
 
@@ -138,6 +143,7 @@ TEST_P(WriterTest, BothWritersGiveTheSameBytes)
     const std::string& source = made.path;
     const std::string copied = m_dir.File("copied.mov");
     const std::string laidOut = m_dir.File("laid-out.mov");
+    CTqovixMovControl::SetServedSoundLimit(GetParam().servedLimit);
     CTqovixMovControl::SetPatchWriting(true);
     const long copiedWrites = RunJob(source, copied);
     CTqovixMovControl::SetPatchWriting(false);
@@ -175,6 +181,9 @@ INSTANTIATE_TEST_SUITE_P(
         // Every width, either byte order: changed samples written whole, nothing else.
         WriterRow{"In24LittleEndianMotor", Kit([](Recipe& r) { DeepWithMotor(r, 24, 48000); r.sound.codec = SoundCodec::Sowt; }), true, true},
         WriterRow{"Lpcm24Bit96kMotor", Kit([](Recipe& r) { DeepWithMotor(r, 24, 96000); }), true, true},
+        // What was served is gone: the copy compares with the file, reversed sample by sample.
+        WriterRow{"Lpcm24Bit96kMotorComparedWithTheFile", Kit([](Recipe& r) { DeepWithMotor(r, 24, 96000); }), true, true,
+                  64 << 10},
         WriterRow{"In32UnevenChunksMotor", Kit([](Recipe& r) { DeepWithMotor(r, 32, 48000); r.sound.chunkSampleCounts = {1, 7001, 20000, 3, 68995}; }), true, true},
         WriterRow{"Fl32Motor", Kit([](Recipe& r) { DeepWithMotor(r, 32, 48000, true); }), true, true},
         WriterRow{"Fl64LittleEndianMotor", Kit([](Recipe& r) { DeepWithMotor(r, 64, 44100, true); r.sound.codec = SoundCodec::Sowt; }), true, true},

@@ -81,6 +81,9 @@ public:
     // system can) with only changed sound and the new moov written over it. The result is
     // byte for byte what the general writer gives. Tests turn it off to compare the two.
     static void SetPatchWriting(bool enabled);
+    // How much served sound is kept to compare with what comes back before the file is read
+    // instead; 0 restores the default. Tests make it small to compare with the file.
+    static void SetServedSoundLimit(uint64_t bytes);
     bool IsPatching() const { return m_bPatching; }
     // Asked between the pieces of long copies (the patching copy, large carried chunks) with
     // the bytes copied and in all: a failure code stops the job with it. The engine answers

@@ -15,14 +15,18 @@ namespace {
 constexpr uint64_t kComparePiece = 1 << 20;
 constexpr unsigned long long kFirstCopy = 64 << 10;
 // A processing library that pulls this far ahead of what it hands back is compared with the
-// file instead: the served sound is not held without bound.
-constexpr uint64_t kMaxServedBytes = 4 << 20;
+// file instead: the served sound is not held without bound. Ours holds up to its 32 MiB
+// look-ahead (24-bit 96 kHz stereo fills 7 MiB of it) and a block or two more.
+constexpr uint64_t kMaxServedBytes = 33 << 20;
 
 std::atomic<bool> g_bPatchWriting{true};
+std::atomic<uint64_t> g_maxServedBytes{kMaxServedBytes};
 
 }  // namespace
 
 void CTqovixMovControl::SetPatchWriting(bool enabled) { g_bPatchWriting = enabled; }
+
+void CTqovixMovControl::SetServedSoundLimit(uint64_t bytes) { g_maxServedBytes = bytes != 0 ? bytes : kMaxServedBytes; }
 
 bool CTqovixMovControl::CanPatch(const TqovixAtomList& atoms, uint64_t& moovOffset) const
 {
@@ -127,7 +131,7 @@ void CTqovixMovControl::KeepServedSound(eTqovixErrorCode served, const void* buf
     if (!m_bPatchCandidate || m_bServedOverflow || TqovixFailed(served) || delivered == nullptr || *delivered == 0) {
         return;
     }
-    if (m_servedSound.Size() + *delivered > kMaxServedBytes ||
+    if (m_servedSound.Size() + *delivered > g_maxServedBytes ||
         TqovixFailed(m_servedSound.Push(buffer, *delivered))) {
         m_bServedOverflow = true;
         m_servedSound.Clear();
