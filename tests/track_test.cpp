@@ -157,12 +157,15 @@ std::string Entry(const Bytes& stsdAtom)
     return Shown(se::Parse(payload), [](const se::Entry& e) {
         std::string why;
         const std::optional<se::PcmLayout> layout = se::ReadPcmLayout(e, why);
-        const std::string samples = !layout ? why
-                                            : (layout->floating ? "f" : "s") + std::to_string(layout->bits) +
-                                                  (layout->littleEndian ? "le" : "be");
-        return TqovixAtomTypeName(e.format) + " v" + std::to_string(e.version) + " " + std::to_string(e.channels) +
-               "ch " + std::to_string(e.bitsPerChannel) + "bit " + std::to_string(e.sampleRateHz) + "Hz frame " +
-               std::to_string(se::FrameBytes(e)) + " " + samples;
+        std::ostringstream out;
+        out << TqovixAtomTypeName(e.format) << " v" << e.version << " " << e.channels << "ch " << e.bitsPerChannel
+            << "bit " << e.sampleRateHz << "Hz frame " << se::FrameBytes(e) << " ";
+        if (layout) {
+            out << (layout->floating ? "f" : "s") << layout->bits << (layout->littleEndian ? "le" : "be");
+        } else {
+            out << why;
+        }
+        return out.str();
     });
 }
 

@@ -2,6 +2,8 @@
 
 #include <cstdio>
 #include <cstring>
+#include <initializer_list>
+#include <string_view>
 
 #include "atom/TqovixByteReader.h"
 
@@ -150,7 +152,16 @@ bool EndaTurns(const Entry& entry)
            (entry.format == kLpcm && !FlagsDescribe(entry));
 }
 
-std::string Named(eTqovixAtomType format) { return "'" + TqovixAtomTypeName(format) + "'"; }
+// Words are appended piece by piece: `"text" + std::string` trips a false -Werror=restrict in
+// some optimising compilers.
+std::string Words(std::initializer_list<std::string_view> pieces)
+{
+    std::string text;
+    for (std::string_view piece : pieces) {
+        text.append(piece);
+    }
+    return text;
+}
 
 }  // namespace
 
@@ -265,35 +276,35 @@ std::optional<PcmLayout> ReadPcmLayout(const Entry& entry, std::string& why)
     layout.bits = entry.bitsPerChannel;
     layout.littleEndian = IsLittleEndianPcm(entry);
     layout.floating = entry.format == kFl32 || entry.format == kFl64;
-    const std::string name = Named(entry.format);
-    const std::string processed = "; 16, 24 and 32-bit integer and 32 and 64-bit float PCM are processed";
+    const std::string name = Words({"'", TqovixAtomTypeName(entry.format), "'"});
+    const std::string_view processed = "; 16, 24 and 32-bit integer and 32 and 64-bit float PCM are processed";
     if (FlagsDescribe(entry)) {
         const uint32_t flags = entry.formatFlags;
         layout.floating = (flags & kFlagFloat) != 0;
         const bool signedInteger = (flags & kFlagSignedInteger) != 0;
         if ((flags & kFlagNonInterleaved) != 0) {
-            why = "sound " + name + " keeps each channel apart (non-interleaved PCM); only interleaved PCM is processed";
+            why = Words({"sound ", name, " keeps each channel apart (non-interleaved PCM); only interleaved PCM is processed"});
             return std::nullopt;
         }
         if (layout.floating == signedInteger) {
             char hex[16];
             std::snprintf(hex, sizeof hex, "0x%X", flags);
-            why = "sound " + name + " has flags " + hex + (layout.floating ? ", both float and integer" : ", unsigned integers") +
-                  processed;
+            why = Words({"sound ", name, " has flags ", hex, layout.floating ? ", both float and integer" : ", unsigned integers",
+                         processed});
             return std::nullopt;
         }
     }
-    const std::string kind = layout.floating ? "-bit float PCM" : "-bit PCM";
     const bool width = layout.floating ? (layout.bits == 32 || layout.bits == 64)
                                        : (layout.bits == 16 || layout.bits == 24 || layout.bits == 32);
     if (!width) {
-        why = "sound " + name + " is " + std::to_string(layout.bits) + kind + processed;
+        why = Words({"sound ", name, " is ", std::to_string(layout.bits), layout.floating ? "-bit float PCM" : "-bit PCM",
+                     processed});
         return std::nullopt;
     }
     const uint32_t frame = FrameBytes(entry);
     if (entry.channels != 0 && frame != uint64_t{entry.channels} * layout.SampleBytes()) {
-        why = "the sound description's frame of " + std::to_string(frame) + " bytes does not hold " +
-              std::to_string(entry.channels) + " samples of " + std::to_string(layout.bits) + " bits";
+        why = Words({"the sound description's frame of ", std::to_string(frame), " bytes does not hold ",
+                     std::to_string(entry.channels), " samples of ", std::to_string(layout.bits), " bits"});
         return std::nullopt;
     }
     return layout;
