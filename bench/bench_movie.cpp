@@ -1,5 +1,6 @@
 // Writes the benchmark movies: a 1280×720 camera movie with video chunks of realistic
-// size and 48 kHz stereo sound, PCM or AAC, of a chosen length or file size.
+// size and stereo sound, 48 kHz 16-bit PCM or AAC, or 96 kHz 24-bit PCM as current cameras
+// record it, of a chosen length or file size.
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -10,10 +11,11 @@
 int main(int argc, char** argv)
 {
     if (argc < 3) {
-        std::fprintf(stderr, "usage: bench_movie DST pcm|aac [SECONDS] [FRAME_BYTES]\n");
+        std::fprintf(stderr, "usage: bench_movie DST pcm|pcm24-96k|aac [SECONDS] [FRAME_BYTES]\n");
         return 2;
     }
     const bool aac = std::strcmp(argv[2], "aac") == 0;
+    const bool deep = std::strcmp(argv[2], "pcm24-96k") == 0;
     const unsigned long seconds = argc > 3 ? std::strtoul(argv[3], nullptr, 10) : 60;
     // About 140 MB a minute: what a camera's 1280×720 stream at ~18 Mbit/s comes to.
     const unsigned long frameBytes = argc > 4 ? std::strtoul(argv[4], nullptr, 10) : 77800;
@@ -26,6 +28,10 @@ int main(int argc, char** argv)
     recipe.video.frameSize = static_cast<uint32_t>(frameBytes);
     recipe.video.framesPerChunk = 15;
     recipe.sound.codec = aac ? moviekit::SoundCodec::Aac : moviekit::SoundCodec::Twos;
+    if (deep) {
+        recipe.sound.bits = 24;
+        recipe.sound.sampleRate = 96000;
+    }
     if (aac) {
         recipe.sound.esds.averageBitRate = 256000;
         recipe.sound.esds.maxBitRate = 256000;

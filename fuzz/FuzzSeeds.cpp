@@ -54,6 +54,18 @@ int main(int argc, char** argv)
     seeds.emplace_back("two-mdat-large-header", small());
     seeds.back().second.mdatCount = 2;
     seeds.back().second.largeMdatHeader = true;
+    // Deeper sound: "in24" whose "wave" holds an "enda", and version-2 "lpcm" past 65535 Hz.
+    seeds.emplace_back("in24-enda", small());
+    seeds.back().second.sound.codec = moviekit::SoundCodec::Sowt;
+    seeds.back().second.sound.bits = 24;
+    seeds.emplace_back("lpcm-float-96k", small());
+    seeds.back().second.sound.bits = 32;
+    seeds.back().second.sound.floatingPoint = true;
+    seeds.back().second.sound.sampleRate = 96000;
+    seeds.back().second.sound.sampleCount = 4800;
+    seeds.emplace_back("fl64", small());
+    seeds.back().second.sound.bits = 64;
+    seeds.back().second.sound.floatingPoint = true;
     for (const auto& [name, recipe] : seeds) {
         std::string error;
         if (!moviekit::WriteMovie(directory / "movie" / (name + ".mov"), recipe, nullptr, &error)) {
@@ -89,7 +101,18 @@ int main(int argc, char** argv)
                                              moviekit::Bytes(6, 0), {0, 2, 0, 16, 0xFF, 0xFE, 0, 0},
                                              words({48000u << 16, 1024, 0, 4, 2}),
                                              moviekit::Container("wave", {moviekit::Atom("frma", {'m', 'p', '4', 'a'}), esds})});
+    const moviekit::Bytes enda = moviekit::Container(
+        "wave", {moviekit::Atom("frma", {'i', 'n', '2', '4'}), moviekit::Atom("enda", {0, 1}), moviekit::Bytes(8, 0)});
+    const moviekit::Bytes in24 = moviekit::Concat({{'i', 'n', '2', '4'}, moviekit::Bytes(6, 0), {0, 1, 0, 1},
+                                                   moviekit::Bytes(6, 0), {0, 2, 0, 16, 0, 0, 0, 0},
+                                                   words({48000u << 16, 1, 3, 6, 2}), enda});
+    // 96 kHz as a double, 24-bit signed little-endian packed, six bytes a frame.
+    const moviekit::Bytes lpcm = moviekit::Concat({{'l', 'p', 'c', 'm'}, moviekit::Bytes(6, 0), {0, 1, 0, 2},
+                                                   moviekit::Bytes(6, 0), {0, 3, 0, 16, 0xFF, 0xFE, 0, 0},
+                                                   words({0x10000, 72, 0x40F77000, 0, 2, 0x7F000000, 24, 0xC, 6, 1})});
     const std::pair<const char*, moviekit::Bytes> tables[] = {
+        {"stsd-in24-enda.bin", moviekit::Concat({words({0, 1, static_cast<uint32_t>(in24.size() + 4)}), in24})},
+        {"stsd-lpcm-v2.bin", moviekit::Concat({words({0, 1, static_cast<uint32_t>(lpcm.size() + 4)}), lpcm})},
         {"stco.bin", words({0, 3, 8, 4096, 70000})},
         {"co64.bin", words({0, 2, 1, 0, 0, 64})},
         {"stsc.bin", words({0, 2, 1, 1024, 1, 3, 512, 1})},

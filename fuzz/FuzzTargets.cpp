@@ -280,6 +280,17 @@ int TrackAtoms(const uint8_t* data, size_t size)
         if (const auto esds = TqovixSoundEntry::FindEsds(entry->children)) {
             TqovixSoundEntry::ParseEsds(*esds);
         }
+        // A layout it accepts is one the library takes: a whole frame of whole samples.
+        std::string why;
+        if (const auto layout = TqovixSoundEntry::ReadPcmLayout(*entry, why)) {
+            const uint32_t width = layout->SampleBytes();
+            if ((width != 2 && width != 3 && width != 4 && width != 8) || (layout->floating && width < 4) ||
+                (entry->channels != 0 && TqovixSoundEntry::FrameBytes(*entry) != uint64_t{entry->channels} * width)) {
+                std::abort();
+            }
+        } else if (why.empty()) {
+            std::abort();
+        }
     }
     if (const auto esds = TqovixSoundEntry::FindEsds(payload)) {
         TqovixSoundEntry::ParseEsds(*esds);

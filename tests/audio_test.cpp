@@ -101,8 +101,28 @@ struct DrainRow {
     unsigned long request;
     eTqovixErrorCode result;
     Bytes delivered;
+    unsigned sampleBytes = 2;
 };
 void PrintTo(const DrainRow& row, std::ostream* os) { *os << row.name; }
+
+// Bytes that differ everywhere, and the same with each `width`-byte sample reversed.
+Bytes Pattern(size_t size)
+{
+    Bytes bytes(size);
+    for (size_t k = 0; k < size; ++k) {
+        bytes[k] = static_cast<uint8_t>(k * 7 % 251);
+    }
+    return bytes;
+}
+Bytes Reversed(Bytes bytes, size_t width)
+{
+    for (size_t k = 0; k + width <= bytes.size(); k += width) {
+        std::reverse(bytes.begin() + static_cast<std::ptrdiff_t>(k), bytes.begin() + static_cast<std::ptrdiff_t>(k + width));
+    }
+    return bytes;
+}
+// Just over the 1 MiB a read takes, which no 3-byte sample divides.
+constexpr uint32_t kPastAPiece = 3 * 349530;
 
 class AudioDrainTest : public AudioFileTest, public ::testing::WithParamInterface<DrainRow> {};
 
@@ -113,7 +133,7 @@ TEST_P(AudioDrainTest, DeliversInTheTrackByteOrderOrFails)
     Open(row.file);
     FakeAacControl control;
     control.aac = row.aac;
-    ASSERT_EQ(control.Initialize(m_file, row.table, true), eTqovixSuccess);
+    ASSERT_EQ(control.Initialize(m_file, row.table, true, row.sampleBytes), eTqovixSuccess);
     const Drained drained = Drain(control, row.request);
     EXPECT_EQ(drained.result, row.result);
     EXPECT_EQ(drained.data, row.delivered);
@@ -126,6 +146,12 @@ INSTANTIATE_TEST_SUITE_P(
         // An empty chunk in the middle, an odd byte last.
         DrainRow{"BigEndian", {0x12, 0x34, 0x56, 0x78, 0xAB, 0xCD, 0xEF}, {{0, 4, {}}, {4, 0, {}}, {4, 3, {}}}, false,
                  64, eTqovixSuccess, {0x34, 0x12, 0x78, 0x56, 0xCD, 0xAB, 0xEF}},
+        // Every width a sample may have, across the pieces the file is read in.
+        DrainRow{"BigEndian24BitPastAPiece", Pattern(kPastAPiece), {{0, kPastAPiece - 6, {}}, {kPastAPiece - 6, 6, {}}},
+                 false, 1 << 16, eTqovixSuccess, Reversed(Pattern(kPastAPiece), 3), 3},
+        DrainRow{"BigEndian32Bit", Pattern(40), {{0, 16, {}}, {16, 24, {}}}, false, 12, eTqovixSuccess,
+                 Reversed(Pattern(40), 4), 4},
+        DrainRow{"BigEndian64Bit", Pattern(48), {{0, 48, {}}}, false, 20, eTqovixSuccess, Reversed(Pattern(48), 8), 8},
         DrainRow{"ChunkEndsPastTheFile", Bytes(100, 7), {{0, 60, {}}, {80, 40, {}}}, false, 20, kFail, Bytes(80, 7)},
         DrainRow{"AacPacketsShortOfTheChunk", Bytes(64, 9), {{0, 8, {3, 3}}}, true, 16, kFail, {}},
         DrainRow{"AacPacketsPastTheChunk", Bytes(64, 9), {{0, 8, {10, 10}}}, true, 16, kFail, {}}),

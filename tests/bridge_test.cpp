@@ -55,13 +55,14 @@ TEST(BridgeTrampoline, NothingRegisteredGives190)
 TEST(BridgeRecords, LibraryFormsCarryTheirSizeAndFieldsInOrder)
 {
     constexpr uint64_t kOne = 0x1111111111111111;
-    const auto audio = TC::MakeLibraryRecord(Audio{kOne, 2 * kOne, 3 * kOne, 4 * kOne, 0x55667788});
+    const auto audio = TC::MakeLibraryRecord(Audio{kOne, 2 * kOne, 3 * kOne, 4 * kOne, 0x55667788, 5 * kOne, true});
     const auto trim = TC::MakeLibraryRecord(TC::TqovixTrimInformation{6 * kOne, 7 * kOne, 8 * kOne, 9 * kOne});
-    std::vector<uint64_t> words(11);  // audio's six (the last: start offset, zero padding), trim's five
-    std::memcpy(words.data(), &audio, 48);
-    std::memcpy(words.data() + 6, &trim, 40);
-    EXPECT_EQ(words, (std::vector<uint64_t>{48, kOne, 2 * kOne, 3 * kOne, 4 * kOne, 0x55667788, 40, 6 * kOne,
-                                            7 * kOne, 8 * kOne, 9 * kOne}));
+    // audio's eight (the sixth: start offset, zero padding; then the exact rate and the float flag), trim's five
+    std::vector<uint64_t> words(13);
+    std::memcpy(words.data(), &audio, 64);
+    std::memcpy(words.data() + 8, &trim, 40);
+    EXPECT_EQ(words, (std::vector<uint64_t>{64, kOne, 2 * kOne, 3 * kOne, 4 * kOne, 0x55667788, 5 * kOne, 1, 40,
+                                            6 * kOne, 7 * kOne, 8 * kOne, 9 * kOne}));
 }
 
 Bytes AfBlock(std::vector<moviekit::AfInterval> intervals, bool processed = false, const char* type = "OP01")
@@ -99,7 +100,7 @@ protected:
 TEST_F(BridgeSession, CallsOutOfTurnAreGeneralFailures)
 {
     EXPECT_EQ(TC::TqovixLibraryInitialize(), eTqovixErrorGeneral) << "already initialised";
-    EXPECT_EQ(TC::TqovixOpenSession(Audio{48, 2, 24, 100}, {}), eTqovixErrorGeneral);
+    EXPECT_EQ(TC::TqovixOpenSession(Audio{48, 2, 20, 100}, {}), eTqovixErrorGeneral);
     EXPECT_EQ(TC::TqovixIsSessionFinished(), eTqovixErrorGeneral);
     uint8_t out[16];
     UL count = 0;

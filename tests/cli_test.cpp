@@ -189,6 +189,10 @@ TEST(CliTest, ArgumentForms)
         {"batch -o " + Q(out) + " -j", 2},
         {"process -z -- " + Q(source) + " x.mov", 2},
         {"compare --png", 2},
+        {"make-sample --bits 20 " + Q(dir.File("s.mov")), 2},
+        {"make-sample --aac --bits 24 " + Q(dir.File("s.mov")), 2},
+        {"make-sample --aac --rate 96000 " + Q(dir.File("s.mov")), 2},
+        {"make-sample --rate 7999 " + Q(dir.File("s.mov")), 2},
     };
     for (const Form& form : forms) {
         const Outcome outcome = Tool(form.arguments);
@@ -1077,6 +1081,69 @@ TEST(CliCompareTest, MeasuresDrawsAndRefuses)
     EXPECT_EQ(none.status, 1);
     EXPECT_NE(none.output.find("notes.txt: not a movie"), std::string::npos) << none.output;
 }
+
+// Every depth and kind of PCM is measured and drawn alike: a motor taken out of both intervals,
+// not a byte moved elsewhere, no offset, the sound's format said, and the picture's marks over the
+// intervals; inspect names the same format.
+struct DepthRow {
+    const char* name;
+    std::string options;  // make-sample's
+    std::string format;   // compare's JSON
+    std::string track;    // inspect's JSON of the sound track
+};
+void PrintTo(const DepthRow& row, std::ostream* out) { *out << row.name; }
+
+class CliCompareDepthTest : public ::testing::TestWithParam<DepthRow> {};
+
+TEST_P(CliCompareDepthTest, MeasuresAndDrawsEveryDepth)
+{
+    const DepthRow& row = GetParam();
+    TempDir dir;
+    const std::string source = dir.File("src.mov");
+    const std::string processed = dir.File("dst.mov");
+    ASSERT_EQ(Tool("make-sample -q --seconds 3 " + row.options + " " + Q(source)).status, 0);
+    const Outcome inspected = Tool("inspect --json " + Q(source));
+    EXPECT_NE(inspected.output.find(row.track), std::string::npos) << inspected.output;
+    ASSERT_EQ(Tool("process -q " + Q(source) + " " + Q(processed)).status, 0);
+    const std::string picture = dir.File("picture.png");
+    const Outcome measured = Tool("compare --json --png " + Q(picture) + " " + Q(source) + " " + Q(processed));
+    ASSERT_EQ(measured.status, 0) << measured.output;
+    EXPECT_NE(measured.output.find(row.format), std::string::npos) << measured.output;
+    const std::vector<double> reductions = Numbers(measured.output, "reductionDb");
+    ASSERT_EQ(reductions.size(), 2u) << measured.output;
+    for (double reduction : reductions) {
+        EXPECT_GT(reduction, 0.5) << measured.output;
+    }
+    EXPECT_EQ(Numbers(measured.output, "differingFrames"), std::vector<double>{0});
+    EXPECT_EQ(Numbers(measured.output, "largestDifference"), std::vector<double>{0});
+    EXPECT_EQ(Numbers(measured.output, "offsetFrames"), std::vector<double>{0});
+
+    const std::string raw = dir.File("picture.rgb");
+    std::string said;
+    ASSERT_EQ(testsupport::RunCommand("ffmpeg -v error -nostdin -i " + Q(picture) + " -f rawvideo -pix_fmt rgb24 " + Q(raw),
+                                      &said),
+              0)
+        << said;
+    const std::vector<uint8_t> pixels = testsupport::ReadFile(raw);
+    ASSERT_EQ(pixels.size(), 1600u * 900u * 3u);
+    const double perColumn = std::ceil(Numbers(measured.output, "frames").at(0) / 1400);
+    const std::vector<double> starts = Numbers(measured.output, "startFrame");
+    const std::vector<double> ends = Numbers(measured.output, "endFrame");
+    ASSERT_EQ(starts.size(), 2u);
+    for (size_t i = 0; i < starts.size(); ++i) {
+        const size_t x = 90 + static_cast<size_t>((starts[i] + ends[i]) / 2 / perColumn);
+        const uint8_t* mark = pixels.data() + ((40 - 8 + 2) * 1600 + x) * 3;
+        EXPECT_TRUE(mark[0] == 0x40 && mark[1] == 0xC0 && mark[2] == 0xFF) << "interval " << i;
+    }
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Depths, CliCompareDepthTest,
+    ::testing::Values(DepthRow{"Int24At96k", "--bits 24 --rate 96000", "\"bits\":24,\"float\":false",
+                               "\"codec\":\"lpcm\",\"timeScale\":96000"},
+                      DepthRow{"Int32LittleEndian", "--bits 32 --little-endian", "\"bits\":32,\"float\":false",
+                               "\"bits\":32,\"aac\":false,\"float\":false,\"littleEndian\":true"}),
+    [](const ::testing::TestParamInfo<DepthRow>& info) { return std::string(info.param.name); });
 
 // The AAC sample carries the PCM sample's tone and motor, so that a job's work can be measured.
 TEST(CliCompareTest, AacSampleHasSoundToMeasure)

@@ -49,8 +49,17 @@ TEST(FuzzReplayTest, MutatedMoviesRunCleanly)
     moviekit::MovieRecipe aac = pcm;
     aac.sound.codec = moviekit::SoundCodec::Aac;
     aac.sound.sampleCount = 4;
+    // Deeper sound in the two descriptions that carry it: "in24" with "enda", version-2 "lpcm".
+    moviekit::MovieRecipe in24 = pcm;
+    in24.sound.bits = 24;
+    in24.sound.codec = moviekit::SoundCodec::Sowt;
+    moviekit::MovieRecipe lpcm = pcm;
+    lpcm.sound.bits = 32;
+    lpcm.sound.floatingPoint = true;
+    lpcm.sound.sampleRate = 96000;
+    lpcm.sound.sampleCount = 4800;
     std::mt19937 random(7);
-    for (const moviekit::MovieRecipe& recipe : {pcm, aac}) {
+    for (const moviekit::MovieRecipe& recipe : {pcm, aac, in24, lpcm}) {
         const std::vector<uint8_t> movie = moviekit::BuildMovie(recipe);
         ASSERT_FALSE(movie.empty());
         for (int k = 0; k < 120; ++k) {

@@ -122,16 +122,21 @@ protected:
     void ExpectPcmExactOutside(const std::string& source, const std::string& destination, const Writer& w,
                                const std::vector<AfInterval>& intervals)
     {
-        std::vector<int16_t> before;
-        std::vector<int16_t> after;
-        ASSERT_TRUE(jobtest::DecodeSound(source, before));
-        ASSERT_TRUE(jobtest::DecodeSound(destination, after));
+        // Decoded as doubles, which hold every sample of every depth exactly.
+        std::vector<double> exactBefore;
+        std::vector<double> exactAfter;
+        ASSERT_TRUE(jobtest::DecodeSound(source, exactBefore));
+        ASSERT_TRUE(jobtest::DecodeSound(destination, exactAfter));
         // Outside each interval widened by the library's 10 ms ramp: bit-exact, with no other slack.
         const uint64_t ramp = w.rate / 100;
-        EXPECT_EQ(jobtest::CheckPcmChangedOnlyInside(before, after, w.channels, intervals, ramp), "");
+        EXPECT_EQ(jobtest::CheckPcmChangedOnlyInside(exactBefore, exactAfter, w.channels, intervals, ramp), "");
         // At 44.1 and 48 kHz the ramp's first weights (1e-5) cannot move a sample by one step; at
         // low rates they can, so there processing must begin and end where the ramps do.
         if (w.rate < 20000) {
+            std::vector<int16_t> before;
+            std::vector<int16_t> after;
+            ASSERT_TRUE(jobtest::DecodeSound(source, before));
+            ASSERT_TRUE(jobtest::DecodeSound(destination, after));
             EXPECT_EQ(testsupport::CheckProcessedRegions(before, after, w.channels, Spans(intervals), ramp), "");
         }
     }
@@ -221,10 +226,21 @@ INSTANTIATE_TEST_SUITE_P(
                       Writer{"AacStereo44kMp4", "aac", 44100, 2, ".mp4", kMp42, 0, Sound::Aac},
                       Writer{"TimecodeTrack", "pcm_s16le", 48000, 2, ".mov", kTimecode, 0},
                       Writer{"TwoSoundTracks", "pcm_s16be", 48000, 2, ".mov", kSecondSound, 0},
-                      Writer{"Pcm24Bit", "pcm_s24le", 48000, 2, ".mov", "", kRefused, Sound::Pcm,
-                             "unsupported sound: sound is 24-bit PCM; only 16-bit is processed"},
-                      Writer{"PcmFloat", "pcm_f32le", 48000, 2, ".mov", "", kRefused, Sound::Pcm,
-                             "unsupported sound: sound is floating-point PCM"},
+                      // Deeper samples: "in24", "in32", "fl32", "fl64" with "enda" in "wave", and past
+                      // 65535 Hz the version-2 "lpcm" with its flags.
+                      Writer{"Pcm24BitBigEndian", "pcm_s24be", 48000, 2, ".mov", "", 0},
+                      Writer{"Pcm24BitLittleEndian", "pcm_s24le", 48000, 2, ".mov", "", 0},
+                      Writer{"Pcm32BitLittleEndian", "pcm_s32le", 48000, 2, ".mov", "", 0},
+                      Writer{"PcmFloatBigEndian", "pcm_f32be", 48000, 2, ".mov", "", 0},
+                      Writer{"PcmFloatLittleEndian", "pcm_f32le", 48000, 2, ".mov", "", 0},
+                      Writer{"PcmDoubleLittleEndian44k", "pcm_f64le", 44100, 1, ".mov", "", 0},
+                      Writer{"Pcm24Bit96kStereo", "pcm_s24le", 96000, 2, ".mov", "", 0},
+                      Writer{"Pcm24BitFourChannels", "pcm_s24be", 48000, 4, ".mov", "", 0},
+                      Writer{"Pcm8Bit", "pcm_s8", 48000, 2, ".mov", "", kRefused, Sound::Pcm,
+                             "unsupported sound: sound 'sowt' is 8-bit PCM; 16, 24 and 32-bit integer and 32 and "
+                             "64-bit float PCM are processed"},
+                      Writer{"PcmUnsigned8Bit", "pcm_u8", 48000, 1, ".mov", "", kRefused, Sound::Pcm,
+                             "unsupported sound: sound 'raw ' is 8-bit PCM"},
                       Writer{"Fragmented", "aac", 48000, 2, ".mov", "-movflags frag_keyframe+empty_moov",
                              kRefused, Sound::Aac, "fragmented movie"}),
     [](const ::testing::TestParamInfo<Writer>& info) { return std::string(info.param.name); });

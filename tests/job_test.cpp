@@ -133,12 +133,16 @@ protected:
     void ExpectPcmProcessedOnlyInside(const std::string& source, const std::string& destination,
                                       const std::vector<AfInterval>& intervals, uint32_t channels, uint32_t rate)
     {
-        std::vector<int16_t> before;
-        std::vector<int16_t> after;
-        ASSERT_TRUE(jobtest::DecodeSound(source, before));
-        ASSERT_TRUE(jobtest::DecodeSound(destination, after));
-        EXPECT_EQ(jobtest::CheckPcmChangedOnlyInside(before, after, channels, intervals, rate / 100), "");
+        std::vector<double> exactBefore;
+        std::vector<double> exactAfter;
+        ASSERT_TRUE(jobtest::DecodeSound(source, exactBefore));
+        ASSERT_TRUE(jobtest::DecodeSound(destination, exactAfter));
+        EXPECT_EQ(jobtest::CheckPcmChangedOnlyInside(exactBefore, exactAfter, channels, intervals, rate / 100), "");
         if (rate < 20000) {
+            std::vector<int16_t> before;
+            std::vector<int16_t> after;
+            ASSERT_TRUE(jobtest::DecodeSound(source, before));
+            ASSERT_TRUE(jobtest::DecodeSound(destination, after));
             EXPECT_EQ(testsupport::CheckProcessedRegions(before, after, channels, Spans(intervals), rate / 100), "");
         }
     }
@@ -240,6 +244,34 @@ const Layout kLayouts[] = {
          r.sound.sampleRate = 11025;
          r.sound.channels = 6;
          r.sound.chunkSampleCounts = {1, 1837, 4000, 3, 5195};
+     }},
+    // Deeper samples, in both writers and both byte orders; past 65535 Hz the intervals land on
+    // frames of the track's own rate.
+    {"In24LittleEndianEditedIn", SoundCodec::Sowt,
+     [](moviekit::MovieRecipe& r) {
+         r.sound.bits = 24;
+         r.sound.mediaTime = 960;
+     }},
+    {"Lpcm24Bit96kSixChannels", SoundCodec::Twos,
+     [](moviekit::MovieRecipe& r) {
+         r.sound.bits = 24;
+         r.sound.sampleRate = 96000;
+         r.sound.channels = 6;
+     }},
+    {"In32Co64", SoundCodec::Twos, [](moviekit::MovieRecipe& r) { r.sound.bits = 32; r.co64 = true; }},
+    {"Fl32ThreeMdats", SoundCodec::Twos,
+     [](moviekit::MovieRecipe& r) {
+         r.sound.bits = 32;
+         r.sound.floatingPoint = true;
+         r.mdatCount = 3;
+     }},
+    // A rate that is no whole number of kHz: the library is told it exactly.
+    {"Twos47952", SoundCodec::Twos, [](moviekit::MovieRecipe& r) { r.sound.sampleRate = 47952; }},
+    {"Fl64LittleEndian44100", SoundCodec::Sowt,
+     [](moviekit::MovieRecipe& r) {
+         r.sound.bits = 64;
+         r.sound.floatingPoint = true;
+         r.sound.sampleRate = 44100;
      }},
     {"AacMdatSize64ThreeMdats", SoundCodec::Aac,
      [](moviekit::MovieRecipe& r) {

@@ -116,7 +116,9 @@ INSTANTIATE_TEST_SUITE_P(
     MovieKit, InvalidRecipeTest,
     testing::Values(
         InvalidRecipe{"NoChannels", [](Recipe& r) { r.sound.channels = 0; }},
-        InvalidRecipe{"RateBeyond16_16", [](Recipe& r) { r.sound.sampleRate = 96000; }},
+        InvalidRecipe{"AacRateBeyond16_16", [](Recipe& r) { r.sound.codec = moviekit::SoundCodec::Aac; r.sound.sampleRate = 96000; }},
+        InvalidRecipe{"PcmOf20Bits", [](Recipe& r) { r.sound.bits = 20; }},
+        InvalidRecipe{"FloatOf16Bits", [](Recipe& r) { r.sound.floatingPoint = true; }},
         InvalidRecipe{"RaggedPcm", [](Recipe& r) { r.sound.pcm = {1, 2, 3}; }},
         InvalidRecipe{"PcmAndCountDisagree", [](Recipe& r) { r.sound.pcm = {1, 2}; r.sound.sampleCount = 5; }},
         InvalidRecipe{"EmptyChunk", [](Recipe& r) { r.sound.chunkSampleCounts = {5, 0}; }},

@@ -13,6 +13,7 @@
 #include <atomic>
 #include <cmath>
 #include <cstdlib>
+#include <cstring>
 #include <functional>
 #include <new>
 #include <numbers>
@@ -79,7 +80,7 @@ Bytes Patched(Bytes block, size_t at, const Bytes& bytes)
 
 TqovixAudioInformation Audio(unsigned long channels, unsigned long count)
 {
-    return {sizeof(TqovixAudioInformation), 48, channels, 16, count, 0, 0};
+    return {sizeof(TqovixAudioInformation), 48, channels, 16, count, 0, 0, 0, 0};
 }
 
 
@@ -224,9 +225,11 @@ TEST_F(OvixTest, RefusalsAbortAndTwoClosesFromOtherThreads)
     using A = TqovixAudioInformation;
     EXPECT_EQ(TqovixLibraryInitialize(), ovix::kFailure);
     Harness& harness = m_harness.emplace(Script{.afBlock = AfBlock({}), .zerosAfterEnd = true, .holdAt = {'O', 1}});
+    // Widths and kinds of sample it does not take, and an exact rate that its own kHz contradict.
     const std::pair<unsigned long A::*, unsigned long> spoilt[] = {
-        {&A::size, 40}, {&A::channels, 0}, {&A::channels, 9}, {&A::bitsPerSample, 24},
-        {&A::sampleRate, 0}, {&A::sampleRate, 1ul << 40}, {&A::sampleCount, 0}};
+        {&A::size, 40}, {&A::size, 56}, {&A::channels, 0}, {&A::channels, 9}, {&A::bitsPerSample, 8},
+        {&A::bitsPerSample, 20}, {&A::bitsPerSample, 64}, {&A::floatingPoint, 1}, {&A::floatingPoint, 2},
+        {&A::sampleRateHz, 47000}, {&A::sampleRate, 0}, {&A::sampleRate, 1ul << 40}, {&A::sampleCount, 0}};
     for (const auto& [field, value] : spoilt) {
         A audio = Audio(2, 100);
         audio.*field = value;
@@ -369,7 +372,7 @@ TEST_P(OvixUntouchedTest, IntervalsWithoutAMotorToRemoveLeaveBitExact)
     EXPECT_TRUE(out == input) << testsupport::Decibels(testsupport::DifferenceEnergy(out, input, row.channels, 0, frames),
                                                        testsupport::Energy(input, row.channels, 0, frames))
                               << " dB of change";
-    const TqovixAudioInformation audio{sizeof(TqovixAudioInformation), row.rate / 1000, row.channels, 16, frames, 0, 0};
+    const TqovixAudioInformation audio{sizeof(TqovixAudioInformation), row.rate / 1000, row.channels, 16, frames, 0, 0, 0, 0};
     ASSERT_EQ(Run({.afBlock = AfBlock(Intervals(spans, row.strength), row.rate), .pcm = input, .channels = row.channels},
                   audio),
               ovix::kSessionFinished);
@@ -618,7 +621,7 @@ TEST_P(OvixPlacementTest, OutsideTheRampsBitExactInsideMotorRemoved)
         testsupport::Sum(testsupport::Ambience(frames, row.channels, 50.0),
                          testsupport::MotorNoise(frames, row.channels, row.rate, spans, 3000.0)));
     const TqovixAudioInformation audio{sizeof(TqovixAudioInformation), row.kiloHertz, row.channels, 16, frames,
-                                       static_cast<unsigned>(row.startOffset), 0};
+                                       static_cast<unsigned>(row.startOffset), 0, 0, 0};
     ASSERT_EQ(Run({.afBlock = AfBlock(intervals, recordRate), .pcm = input, .channels = row.channels}, audio),
               ovix::kSessionFinished);
     const std::vector<int16_t>& out = m_harness->pushed;
@@ -656,6 +659,194 @@ INSTANTIATE_TEST_SUITE_P(
         PlacementRow{"ShiftedLaterStereo44k", 44, 44100, 2, 3.0, {{0.7, 1.2}, {2.0, 2.4}}, 333},
         PlacementRow{"ShiftedEarlierRecordAt48kMono44k", 44, 44100, 1, 3.0, {{0.7, 1.2}, {2.0, 2.4}}, -250, 48000}),
     [](const ::testing::TestParamInfo<PlacementRow>& info) { return std::string(info.param.name); });
+
+// --- Every format the track may hold: 16, 24 and 32-bit integers, 32 and 64-bit floats.
+
+struct FormatRow {
+    const char* name;
+    unsigned bits;
+    bool floating;
+    double perStep;  // the format's own value of one 16-bit step
+};
+void PrintTo(const FormatRow& row, std::ostream* os) { *os << row.name; }
+
+// A value in the format's own units, little-endian.
+void PutSample(const FormatRow& f, uint8_t* at, double value)
+{
+    if (f.floating && f.bits == 32) {
+        const auto v = static_cast<float>(value);
+        std::memcpy(at, &v, 4);
+    } else if (f.floating) {
+        std::memcpy(at, &value, 8);
+    } else {
+        const auto v = static_cast<uint64_t>(std::llround(value));
+        for (unsigned b = 0; b < f.bits / 8; ++b) {
+            at[b] = static_cast<uint8_t>(v >> (8 * b));
+        }
+    }
+}
+
+double GetSample(const FormatRow& f, const uint8_t* at)
+{
+    if (f.floating && f.bits == 32) {
+        float v;
+        std::memcpy(&v, at, 4);
+        return v;
+    }
+    if (f.floating) {
+        double v;
+        std::memcpy(&v, at, 8);
+        return v;
+    }
+    uint64_t v = 0;
+    for (unsigned b = 0; b < f.bits / 8; ++b) {
+        v |= uint64_t{at[b]} << (8 * b);
+    }
+    const unsigned shift = 64 - f.bits;
+    return static_cast<double>(static_cast<int64_t>(v << shift) >> shift);
+}
+
+Bytes Encoded(const FormatRow& f, const std::vector<int16_t>& samples)
+{
+    Bytes bytes(samples.size() * f.bits / 8);
+    for (size_t k = 0; k < samples.size(); ++k) {
+        PutSample(f, bytes.data() + k * f.bits / 8, samples[k] * f.perStep);
+    }
+    return bytes;
+}
+
+class OvixFormatTest : public OvixTest, public ::testing::WithParamInterface<FormatRow> {};
+
+const FormatRow kFormats[] = {{"Int16", 16, false, 1.0}, {"Int24", 24, false, 256.0}, {"Int32", 32, false, 65536.0},
+                              {"Float32", 32, true, 1.0 / 32768}, {"Float64", 64, true, 1.0 / 32768}};
+
+// One sample at a time: levels on the 16-bit scale; integers rounded to nearest and held at
+// full scale, floats never clipped; a sample nothing is taken from keeps its bytes, a NaN
+// among them included, and is heard as silence.
+TEST_P(OvixFormatTest, SamplesConvertRoundAndClipAsTheirFormatSays)
+{
+    const FormatRow& f = GetParam();
+    const std::optional<ovix::SampleFormat> format = ovix::SampleFormat::Of(f.bits, f.floating);
+    ASSERT_TRUE(format);
+    const size_t width = f.bits / 8;
+    const double top = f.floating ? 1.0 : std::ldexp(1.0, static_cast<int>(f.bits) - 1) - 1;
+    const double bottom = f.floating ? -1.0 : -top - 1;
+    Bytes frame(3 * width);
+    const double values[] = {top, bottom, 10 * f.perStep};
+    for (size_t c = 0; c < 3; ++c) {
+        PutSample(f, frame.data() + c * width, values[c]);
+    }
+    const float window[] = {1.0f, 0.5f, 1.0f};
+    float levels[3];
+    format->LoadWindowed(frame.data(), width, 3, window, levels);
+    EXPECT_NEAR(levels[0], top / f.perStep, 1e-3);
+    EXPECT_NEAR(levels[1], 0.5 * bottom / f.perStep, 1e-3);
+    EXPECT_NEAR(levels[2], 10.0, 1e-6);
+
+    // 1000 steps added to full scale, 0.4 and 0.6 steps taken from 10 steps.
+    const float removed[] = {-1000.0f, 1000.0f, 0.4f};
+    Bytes out = frame;
+    format->SubtractFromFrame(out.data(), 3, removed, 1.0f);
+    const double rounded = f.floating ? 9.6 * f.perStep : std::round(9.6 * f.perStep);
+    const double louder = top + 1000 * f.perStep;
+    EXPECT_EQ(GetSample(f, out.data()), !f.floating ? top : f.bits == 32 ? static_cast<double>(static_cast<float>(louder)) : louder);
+    EXPECT_LT(GetSample(f, out.data() + width), f.floating ? -1.0 : bottom + 1);
+    EXPECT_GE(GetSample(f, out.data() + width), f.floating ? -2.0 : bottom);
+    EXPECT_NEAR(GetSample(f, out.data() + 2 * width), rounded, f.floating ? 1e-6 * f.perStep : 0.0);
+    const float more[] = {0.0f, 0.0f, 0.6f};
+    out = frame;
+    format->SubtractFromFrame(out.data(), 3, more, 1.0f);
+    EXPECT_EQ(Bytes(out.begin(), out.begin() + 2 * static_cast<long>(width)), Bytes(frame.begin(), frame.begin() + 2 * static_cast<long>(width)));
+    EXPECT_NEAR(GetSample(f, out.data() + 2 * width), f.floating ? 9.4 * f.perStep : std::round(9.4 * f.perStep),
+                f.floating ? 1e-6 * f.perStep : 0.0);
+    if (f.floating) {
+        PutSample(f, frame.data(), std::nan(""));
+        PutSample(f, frame.data() + width, -1e300);
+        format->LoadWindowed(frame.data(), width, 2, window, levels);
+        EXPECT_EQ(levels[0], 0.0f);
+        EXPECT_TRUE(std::isfinite(levels[1]) && levels[1] < -32768.0f);
+        out = frame;
+        format->SubtractFromFrame(out.data(), 3, more, 1.0f);
+        EXPECT_EQ(Bytes(out.begin(), out.begin() + static_cast<long>(width)), Bytes(frame.begin(), frame.begin() + static_cast<long>(width)));
+    }
+}
+
+// The same sound in every format, through the whole session: outside the intervals and their
+// ramps, and inside an interval of strength 0, every byte as it came; inside the others the
+// 16-bit result to within half a 16-bit step, written back in the session's own format. The
+// 16-bit row sends a record of the first layout, which ends before the float flag.
+TEST_P(OvixFormatTest, EveryFormatGivesTheSixteenBitResultAtItsOwnPrecision)
+{
+    const FormatRow& f = GetParam();
+    const uint64_t frames = 3 * kRate;
+    const std::vector<MotorSpan> spans = At(kRate, {{0.5, 1.1}, {1.5, 1.9}, {2.2, 2.7}});
+    const std::vector<int16_t> input = testsupport::ToPcm(testsupport::Sum(
+        testsupport::Sum(testsupport::Chord(frames, 2, kRate, 500.0), testsupport::Ambience(frames, 2, 60.0)),
+        testsupport::MotorNoise(frames, 2, kRate, spans, 2500.0)));
+    std::vector<moviekit::AfInterval> intervals = Intervals(spans, 1000);
+    intervals[1].strength = 0;
+    // A drive of strength 0 is still the lens's drive: it is surveyed, only left as it came.
+    std::vector<ovix::DriveSpan> drives = Drives(spans, 1.0f);
+    drives[1].strength = 0.0f;
+    const std::vector<int16_t> reference = Suppress(input, kRate, 2, drives);
+
+    const Bytes sound = Encoded(f, input);
+    const size_t width = f.bits / 8;
+    TqovixAudioInformation audio = Audio(2, frames);
+    audio.bitsPerSample = f.bits;
+    audio.floatingPoint = f.floating ? 1 : 0;
+    audio.sampleRateHz = kRate;
+    if (f.bits == 16 && !f.floating) {
+        audio.size = kOvixFirstAudioRecordSize;
+    }
+    ASSERT_EQ(Run({.afBlock = AfBlock(intervals), .channels = 2, .sound = sound, .frameBytes = 2 * width}, audio),
+              ovix::kSessionFinished);
+    const Bytes& out = m_harness->pushedSound;
+    ASSERT_EQ(out.size(), sound.size());
+    const uint64_t ramp = kRate / 100;
+    uint64_t strays = 0, changed = 0, farOff = 0;
+    for (uint64_t f0 = 0; f0 < frames; ++f0) {
+        const bool processed = f0 + ramp >= spans[0].start && f0 < spans[0].end + ramp;
+        const bool other = f0 + ramp >= spans[2].start && f0 < spans[2].end + ramp;
+        for (size_t k = 2 * f0; k < 2 * f0 + 2; ++k) {
+            const bool same = std::equal(out.begin() + static_cast<long>(k * width), out.begin() + static_cast<long>((k + 1) * width),
+                                         sound.begin() + static_cast<long>(k * width));
+            if (!processed && !other) {
+                strays += same ? 0 : 1;
+                continue;
+            }
+            changed += same ? 0 : 1;
+            farOff += std::abs(GetSample(f, out.data() + k * width) / f.perStep - reference[k]) > (f.bits == 16 ? 0.0 : 0.51);
+        }
+    }
+    EXPECT_EQ(strays, 0u) << "samples changed outside the processed intervals and their ramps";
+    EXPECT_GT(changed, (spans[0].end - spans[0].start) / 2) << "the motor was not processed";
+    EXPECT_EQ(farOff, 0u) << "samples further than half a 16-bit step from the 16-bit result";
+}
+
+INSTANTIATE_TEST_SUITE_P(Formats, OvixFormatTest, ::testing::ValuesIn(kFormats),
+                         [](const ::testing::TestParamInfo<FormatRow>& info) { return std::string(info.param.name); });
+
+// The look-ahead holds at most 32 MiB of the track's own bytes in every format; where that is
+// not what binds, a deeper format holds as many frames as 16 bits do. Widths and kinds it does
+// not know are no format.
+TEST(OvixFormatBudget, DeeperSamplesKeepTheStoreWithinItsBudget)
+{
+    for (const FormatRow& f : kFormats) {
+        for (const auto& [rate, channels] : {std::pair<uint64_t, unsigned>{48000, 2}, {192000, 8}}) {
+            const ovix::NoiseSuppressor deep(rate, channels, rate, *ovix::SampleFormat::Of(f.bits, f.floating));
+            const ovix::NoiseSuppressor shallow(rate, channels, rate);
+            const uint64_t capacity = deep.Parameters().capacityFrames;
+            EXPECT_LE(capacity * channels * f.bits / 8, 32u << 20) << f.name << " " << rate << " Hz " << channels;
+            if (shallow.Parameters().capacityFrames * channels * f.bits / 8 <= (32u << 20)) {
+                EXPECT_EQ(capacity, shallow.Parameters().capacityFrames) << f.name << " " << rate << " Hz " << channels;
+            }
+        }
+    }
+    for (const auto& [bits, floating] : {std::pair{8u, false}, {20u, false}, {64u, false}, {16u, true}, {24u, true}}) {
+        EXPECT_FALSE(ovix::SampleFormat::Of(bits, floating)) << bits << (floating ? " float" : "");
+    }
+}
 
 // --- The same bytes however the sound is delivered.
 

@@ -2,7 +2,9 @@
 // tables, per-track decisions of the visitors, and table rewrites for the destination.
 #include <gtest/gtest.h>
 
+#include <cmath>
 #include <cstdint>
+#include <cstring>
 #include <fstream>
 #include <functional>
 #include <sstream>
@@ -67,8 +69,15 @@ Bytes Table(const char* type, uint32_t count, const Bytes& entries)
     return Atom(type, moviekit::Concat({U32s({0, count}), entries}));
 }
 
-// A 16-bit PCM sound description of the given version (1 adds the per-packet fields).
-Bytes PcmDescription(const char* format, uint16_t channels, uint16_t version = 0, uint32_t bytesPerFrame = 0)
+Bytes Described(const Bytes& entry)
+{
+    return Table("stsd", 1, moviekit::Concat({U32s({static_cast<uint32_t>(entry.size() + 4)}), entry}));
+}
+
+// A PCM sound description of the given version (1 adds the per-packet fields) whose sample size
+// field says 16, as QuickTime keeps it, with extension atoms after the fields.
+Bytes PcmDescription(const char* format, uint16_t channels, uint16_t version = 0, uint32_t bytesPerFrame = 0,
+                     const Bytes& extensions = {})
 {
     Bytes entry = moviekit::Concat({Text(format), Bytes(6, 0), Bytes{0, 1}});
     moviekit::PutU16(entry, version);
@@ -78,9 +87,29 @@ Bytes PcmDescription(const char* format, uint16_t channels, uint16_t version = 0
     entry.insert(entry.end(), 4, 0);
     moviekit::PutU32(entry, 48000u << 16);
     if (version == 1) {
-        entry = moviekit::Concat({entry, U32s({1, 2, bytesPerFrame, 2})});
+        entry = moviekit::Concat({entry, U32s({1, bytesPerFrame / channels, bytesPerFrame, 2})});
     }
-    return Table("stsd", 1, moviekit::Concat({U32s({static_cast<uint32_t>(entry.size() + 4)}), entry}));
+    return Described(moviekit::Concat({entry, extensions}));
+}
+
+// QuickTime's byte-order atom inside the "wave" that older sound descriptions carry.
+Bytes WaveEnda(const char* format, uint16_t little)
+{
+    return Container("wave", {Atom("frma", Text(format)), Atom("enda", Bytes{static_cast<uint8_t>(little >> 8), static_cast<uint8_t>(little)}),
+                              Bytes(8, 0)});
+}
+
+// A version-2 description: the rate as a double, the linear PCM flags and the bytes a packet of one frame takes.
+Bytes Version2Description(const char* format, uint32_t channels, uint32_t bits, uint32_t flags, double rate,
+                          uint32_t bytesPerPacket)
+{
+    Bytes entry = moviekit::Concat({Text(format), Bytes(6, 0), Bytes{0, 1}, Bytes{0, 2}, Bytes(6, 0), Bytes{0, 3, 0, 16, 0xFF, 0xFE, 0, 0},
+                                    U32s({0x10000, 72})});
+    uint64_t rateBits = 0;
+    std::memcpy(&rateBits, &rate, sizeof rateBits);
+    moviekit::PutU32(entry, static_cast<uint32_t>(rateBits >> 32));
+    moviekit::PutU32(entry, static_cast<uint32_t>(rateBits));
+    return Described(moviekit::Concat({entry, U32s({channels, 0x7F000000, bits, flags, bytesPerPacket, 1})}));
 }
 
 // ---- Typed readers: each row reads a payload and shows what it understood ----
@@ -121,13 +150,22 @@ std::string Offsets(const Bytes& payload, bool wide)
     });
 }
 
+// The entry as read, then how its samples are stored ("s24le", "f32be") or why they are not processed.
 std::string Entry(const Bytes& stsdAtom)
 {
     const Bytes payload(stsdAtom.begin() + 8, stsdAtom.end());
     return Shown(se::Parse(payload), [](const se::Entry& e) {
-        return TqovixAtomTypeName(e.format) + " v" + std::to_string(e.version) + " " + std::to_string(e.channels) +
-               "ch " + std::to_string(e.bitsPerChannel) + "bit " + std::to_string(e.sampleRateHz) + "Hz frame " +
-               std::to_string(se::FrameBytes(e));
+        std::string why;
+        const std::optional<se::PcmLayout> layout = se::ReadPcmLayout(e, why);
+        std::ostringstream out;
+        out << TqovixAtomTypeName(e.format) << " v" << e.version << " " << e.channels << "ch " << e.bitsPerChannel
+            << "bit " << e.sampleRateHz << "Hz frame " << se::FrameBytes(e) << " ";
+        if (layout) {
+            out << (layout->floating ? "f" : "s") << layout->bits << (layout->littleEndian ? "le" : "be");
+        } else {
+            out << why;
+        }
+        return out.str();
     });
 }
 
@@ -192,8 +230,34 @@ INSTANTIATE_TEST_SUITE_P(
         ReaderRow{"TimeToSampleHalfEntry", [] { return ta::ParseSampleTotal(U32s({0, 3, 3, 1, 4, 1, 777})) ? "read" : "refused"; }, "refused"},
         ReaderRow{"DataInFile", [] { return Shown(ta::ParseDataInFile(moviekit::Concat({U32s({0, 1, 12}), Text("url "), U32s({1})})), [](bool in) { return in ? "here" : "elsewhere"; }); }, "here"},
         ReaderRow{"DataElsewhere", [] { return Shown(ta::ParseDataInFile(moviekit::Concat({U32s({0, 1, 16}), Text("alis"), U32s({0, 7})})), [](bool in) { return in ? "here" : "elsewhere"; }); }, "elsewhere"},
-        ReaderRow{"SoundEntryVersion0", [] { return Entry(PcmDescription("twos", 2)); }, "twos v0 2ch 16bit 48000Hz frame 4"},
-        ReaderRow{"SoundEntryVersion1FrameField", [] { return Entry(PcmDescription("sowt", 6, 1, 12)); }, "sowt v1 6ch 16bit 48000Hz frame 12"},
+        ReaderRow{"SoundEntryVersion0", [] { return Entry(PcmDescription("twos", 2)); }, "twos v0 2ch 16bit 48000Hz frame 4 s16be"},
+        ReaderRow{"SoundEntryVersion1FrameField", [] { return Entry(PcmDescription("sowt", 6, 1, 12)); }, "sowt v1 6ch 16bit 48000Hz frame 12 s16le"},
+        // The format says the width, "enda" (in "wave" or among the extensions) the byte order.
+        ReaderRow{"SoundEntryIn24Version0", [] { return Entry(PcmDescription("in24", 2)); }, "in24 v0 2ch 24bit 48000Hz frame 6 s24be"},
+        ReaderRow{"SoundEntryIn24EndaLittle", [] { return Entry(PcmDescription("in24", 2, 1, 6, WaveEnda("in24", 1))); }, "in24 v1 2ch 24bit 48000Hz frame 6 s24le"},
+        ReaderRow{"SoundEntryIn32EndaBig", [] { return Entry(PcmDescription("in32", 4, 1, 16, WaveEnda("in32", 0))); }, "in32 v1 4ch 32bit 48000Hz frame 16 s32be"},
+        ReaderRow{"SoundEntryFl32EndaLittle", [] { return Entry(PcmDescription("fl32", 2, 1, 8, WaveEnda("fl32", 1))); }, "fl32 v1 2ch 32bit 48000Hz frame 8 f32le"},
+        ReaderRow{"SoundEntryFl64EndaOutsideWave", [] { return Entry(PcmDescription("fl64", 1, 1, 8, Atom("enda", Bytes{0, 1}))); }, "fl64 v1 1ch 64bit 48000Hz frame 8 f64le"},
+        ReaderRow{"SoundEntryTwosKeepsItsByteOrder", [] { return Entry(PcmDescription("twos", 2, 1, 4, WaveEnda("twos", 1))); }, "twos v1 2ch 16bit 48000Hz frame 4 s16be"},
+        ReaderRow{"SoundEntryTwos8Bit", [] { return Entry(PcmDescription("twos", 2, 1, 2)); },
+                  "twos v1 2ch 8bit 48000Hz frame 2 sound 'twos' is 8-bit PCM; 16, 24 and 32-bit integer and 32 and 64-bit float PCM are processed"},
+        ReaderRow{"SoundEntryFrameSizeDisagrees", [] { return Entry(PcmDescription("in24", 2, 1, 8)); },
+                  "in24 v1 2ch 24bit 48000Hz frame 8 the sound description's frame of 8 bytes does not hold 2 samples of 24 bits"},
+        // Version 2: a rate past the 16.16 field, the flags for kind and byte order.
+        ReaderRow{"SoundEntryLpcm24Bit96k", [] { return Entry(Version2Description("lpcm", 2, 24, 0xC, 96000.0, 6)); }, "lpcm v2 2ch 24bit 96000Hz frame 6 s24le"},
+        ReaderRow{"SoundEntryLpcmFloatBigEndian192k", [] { return Entry(Version2Description("lpcm", 4, 32, 0xB, 192000.0, 16)); }, "lpcm v2 4ch 32bit 192000Hz frame 16 f32be"},
+        ReaderRow{"SoundEntryLpcmRateRounded", [] { return Entry(Version2Description("lpcm", 2, 16, 0xE, 44099.99999, 4)); }, "lpcm v2 2ch 16bit 44100Hz frame 4 s16be"},
+        ReaderRow{"SoundEntryLpcmHighAlignedIn4Bytes", [] { return Entry(Version2Description("lpcm", 2, 24, 0x14, 48000.0, 8)); },
+                  "lpcm v2 2ch 24bit 48000Hz frame 8 the sound description's frame of 8 bytes does not hold 2 samples of 24 bits"},
+        ReaderRow{"SoundEntryLpcmNonInterleaved", [] { return Entry(Version2Description("lpcm", 2, 32, 0x29, 48000.0, 4)); },
+                  "lpcm v2 2ch 32bit 48000Hz frame 4 sound 'lpcm' keeps each channel apart (non-interleaved PCM); only interleaved PCM is processed"},
+        ReaderRow{"SoundEntryLpcmFloatAndInteger", [] { return Entry(Version2Description("lpcm", 2, 32, 0xF, 48000.0, 8)); },
+                  "lpcm v2 2ch 32bit 48000Hz frame 8 sound 'lpcm' has flags 0xF, both float and integer; 16, 24 and 32-bit integer and 32 and 64-bit float PCM are processed"},
+        ReaderRow{"SoundEntryLpcmUnsigned", [] { return Entry(Version2Description("lpcm", 1, 8, 0x8, 48000.0, 1)); },
+                  "lpcm v2 1ch 8bit 48000Hz frame 1 sound 'lpcm' has flags 0x8, unsigned integers; 16, 24 and 32-bit integer and 32 and 64-bit float PCM are processed"},
+        ReaderRow{"SoundEntryLpcmHalfFloat", [] { return Entry(Version2Description("lpcm", 2, 16, 0x9, 48000.0, 4)); },
+                  "lpcm v2 2ch 16bit 48000Hz frame 4 sound 'lpcm' is 16-bit float PCM; 16, 24 and 32-bit integer and 32 and 64-bit float PCM are processed"},
+        ReaderRow{"SoundEntryVersion2RateNotANumber", [] { return Entry(Version2Description("lpcm", 2, 16, 0xC, std::nan(""), 4)); }, "lpcm v2 2ch 16bit 0Hz frame 4 s16le"},
         ReaderRow{"SoundEntryVersion1Cut", [] { Bytes d = PcmDescription("sowt", 2, 1, 4); d.resize(d.size() > 8 ? d.size() - 8 : 0); return Entry(d); }, "refused"},
         ReaderRow{"SoundEntryVersion3", [] { return Entry(PcmDescription("twos", 2, 3)); }, "refused"},
         ReaderRow{"EsdsDirect", [] { return Esds(Atom("esds", kEsdsPayload)); }, "rate 2 config 2"},

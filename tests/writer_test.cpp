@@ -3,8 +3,10 @@
 // must be taken whenever the layout allows it, and the general writer everywhere else.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <cmath>
 #include <filesystem>
 #include <string>
 #include <thread>
@@ -15,6 +17,7 @@
 #include "file/CTqovixFile.h"
 #include "movie/CTqovixBackgroundCopy.h"
 #include "movie/CTqovixMovControl.h"
+#include "support/MotorSound.h"
 #include "support/TestSupport.h"
 
 namespace {
@@ -52,17 +55,24 @@ long RunJob(const std::string& source, const std::string& destination)
     return done ? g_writes.load() : -1;
 }
 
+struct Source {
+    std::string path;
+    uint64_t mediaEnd = 0;  // where the source's media data ends: before it, only processed sound may change
+};
+
 struct WriterRow {
     const char* name;
-    std::function<std::string(const testsupport::TempDir&)> make;  // writes the source, gives its path
+    std::function<Source(const testsupport::TempDir&)> make;  // writes the source
     bool patched;  // the layout lets the copy be taken
+    bool motor = false;  // the interval holds a motor, so the job changes samples there
+    uint64_t servedLimit = 0;  // if set, the served sound kept to compare with; past it the file is read
 };
 void PrintTo(const WriterRow& row, std::ostream* out) { *out << row.name; }
 
 // One short interval: most sound leaves as it came, as in a real movie.
 const std::vector<moviekit::AfInterval> kInterval = {{12000, 14000, 1000}};
 
-std::function<std::string(const testsupport::TempDir&)> Kit(std::function<void(Recipe&)> shape)
+std::function<Source(const testsupport::TempDir&)> Kit(std::function<void(Recipe&)> shape)
 {
     return [shape](const testsupport::TempDir& dir) {
         Recipe recipe;
@@ -70,13 +80,34 @@ std::function<std::string(const testsupport::TempDir&)> Kit(std::function<void(R
         shape(recipe);
         const std::string path = dir.File("source.mov");
         std::string error;
-        EXPECT_TRUE(moviekit::WriteMovie(path, recipe, nullptr, &error)) << error;
-        return path;
+        moviekit::MovieLayout layout;
+        EXPECT_TRUE(moviekit::WriteMovie(path, recipe, &layout, &error)) << error;
+        return Source{path, layout.moovOffset};
     };
 }
 
+// Two seconds of samples of `bits` bits at `rate`: ambience, and a lens motor over an interval
+// long enough to be heard.
+void DeepWithMotor(Recipe& r, uint16_t bits, uint32_t rate, bool floatingPoint = false)
+{
+    const uint64_t frames = 2 * uint64_t{rate};
+    const uint64_t start = rate / 2;
+    const uint64_t end = rate * 6 / 5;
+    const std::vector<double> sound = testsupport::Sum(testsupport::Ambience(frames, 2, 40.0),
+                                                       testsupport::MotorNoise(frames, 2, rate, {{start, end}}, 4000.0));
+    r.sound.widePcm.resize(sound.size());
+    for (size_t k = 0; k < sound.size(); ++k) {
+        r.sound.widePcm[k] = static_cast<int32_t>(std::llround(sound[k] * 65536.0));
+    }
+    r.sound.bits = bits;
+    r.sound.floatingPoint = floatingPoint;
+    r.sound.sampleRate = rate;
+    r.maker.afIntervals = {{start, end, 1000}};
+    r.video.frameCount = 60;
+}
+
 // A movie the ffmpeg command writes, given the maker atoms.
-std::function<std::string(const testsupport::TempDir&)> Ffmpeg(std::string sound)
+std::function<Source(const testsupport::TempDir&)> Ffmpeg(std::string sound)
 {
     return [sound](const testsupport::TempDir& dir) {
         const std::string path = dir.File("source.mov");
@@ -92,21 +123,27 @@ std::function<std::string(const testsupport::TempDir&)> Ffmpeg(std::string sound
         recipe.maker.afIntervals = kInterval;
         std::string error;
         EXPECT_TRUE(moviekit::AddMakerData(path, recipe, 48000, &error)) << error;
-        return path;
+        return Source{path};
     };
 }
 
 class WriterTest : public ::testing::TestWithParam<WriterRow> {
 protected:
-    void TearDown() override { CTqovixMovControl::SetPatchWriting(true); }
+    void TearDown() override
+    {
+        CTqovixMovControl::SetPatchWriting(true);
+        CTqovixMovControl::SetServedSoundLimit(0);
+    }
     testsupport::TempDir m_dir;
 };
 
 TEST_P(WriterTest, BothWritersGiveTheSameBytes)
 {
-    const std::string source = GetParam().make(m_dir);
+    const Source made = GetParam().make(m_dir);
+    const std::string& source = made.path;
     const std::string copied = m_dir.File("copied.mov");
     const std::string laidOut = m_dir.File("laid-out.mov");
+    CTqovixMovControl::SetServedSoundLimit(GetParam().servedLimit);
     CTqovixMovControl::SetPatchWriting(true);
     const long copiedWrites = RunJob(source, copied);
     CTqovixMovControl::SetPatchWriting(false);
@@ -116,6 +153,13 @@ TEST_P(WriterTest, BothWritersGiveTheSameBytes)
     const std::vector<uint8_t> a = testsupport::ReadFile(copied);
     ASSERT_FALSE(a.empty());
     EXPECT_TRUE(a == testsupport::ReadFile(laidOut)) << "the two writers disagree";
+    if (GetParam().motor) {
+        // The media data keeps its place, so the sound the job changed shows against the source.
+        const std::vector<uint8_t> before = testsupport::ReadFile(source);
+        ASSERT_TRUE(made.mediaEnd != 0 && made.mediaEnd <= std::min(a.size(), before.size()));
+        EXPECT_FALSE(std::equal(before.begin(), before.begin() + static_cast<std::ptrdiff_t>(made.mediaEnd), a.begin()))
+            << "the job changed no sound: the writers were not put to the test";
+    }
     // The copy writes only the changed sound and the movie atom; the general writer every chunk.
     if (GetParam().patched) {
         EXPECT_LT(copiedWrites, laidOutWrites);
@@ -134,6 +178,17 @@ INSTANTIATE_TEST_SUITE_P(
         WriterRow{"Twos44100Mono", Kit([](Recipe& r) { r.sound.sampleRate = 44100; r.sound.channels = 1; }), true},
         WriterRow{"FfmpegBigEndianWithTimecode", Ffmpeg("-c:a pcm_s16be -timecode 10:00:00:00"), true},
         WriterRow{"FfmpegLittleEndianMono", Ffmpeg("-c:a pcm_s16le -ac 1"), true},
+        // Every width, either byte order: changed samples written whole, nothing else.
+        WriterRow{"In24LittleEndianMotor", Kit([](Recipe& r) { DeepWithMotor(r, 24, 48000); r.sound.codec = SoundCodec::Sowt; }), true, true},
+        WriterRow{"Lpcm24Bit96kMotor", Kit([](Recipe& r) { DeepWithMotor(r, 24, 96000); }), true, true},
+        // What was served is gone: the copy compares with the file, reversed sample by sample.
+        WriterRow{"Lpcm24Bit96kMotorComparedWithTheFile", Kit([](Recipe& r) { DeepWithMotor(r, 24, 96000); }), true, true,
+                  64 << 10},
+        WriterRow{"In32UnevenChunksMotor", Kit([](Recipe& r) { DeepWithMotor(r, 32, 48000); r.sound.chunkSampleCounts = {1, 7001, 20000, 3, 68995}; }), true, true},
+        WriterRow{"Fl32Motor", Kit([](Recipe& r) { DeepWithMotor(r, 32, 48000, true); }), true, true},
+        WriterRow{"Fl64LittleEndianMotor", Kit([](Recipe& r) { DeepWithMotor(r, 64, 44100, true); r.sound.codec = SoundCodec::Sowt; }), true, true},
+        WriterRow{"FfmpegFloatBigEndian", Ffmpeg("-c:a pcm_f32be"), true},
+        WriterRow{"In24MotorMoovFirst", Kit([](Recipe& r) { DeepWithMotor(r, 24, 48000); r.moovBeforeMdat = true; }), false},
         // Layouts the general writer changes: the copy would not be its result.
         WriterRow{"MoovFirst", Kit([](Recipe& r) { r.moovBeforeMdat = true; }), false},
         WriterRow{"ThreeMdats", Kit([](Recipe& r) { r.mdatCount = 3; }), false},

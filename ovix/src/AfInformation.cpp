@@ -106,7 +106,9 @@ std::vector<DriveSpan> AfInformation::Spans(const SessionTimeline& timeline) con
         const uint16_t strength = std::min(Be16(entry + 16), kStrengthFull);
         const uint64_t start = MapPosition(Be64(entry), recordRate, timeline, false);
         const uint64_t end = MapPosition(Be64(entry + 8), recordRate, timeline, true);
-        if (start < end && strength > 0) {
+        // A drive of strength 0 is left as it came, but it is still the lens's: it tells how the
+        // motor sounds, and its sound is no wanted sound's surroundings.
+        if (start < end) {
             spans.push_back({start, end, static_cast<float>(strength) / kStrengthFull});
         }
     }

@@ -3,10 +3,12 @@
 #include "Session.h"
 #include "ovix/Ovix.h"
 
+#include <algorithm>
 #include <condition_variable>
 #include <memory>
 #include <mutex>
 #include <new>
+#include <optional>
 #include <system_error>
 #include <thread>
 
@@ -87,11 +89,28 @@ uint64_t SessionRateHz(unsigned long kiloHertz)
     }
 }
 
-bool Acceptable(const TqovixAudioInformation& audio, const TqovixTrimInformation& trim)
+// The session's format, or nullopt for a record it cannot serve. A record of the first layout
+// ends before the exact rate and the float flag: it says 16-bit integers, and the rate in kHz.
+std::optional<SessionFormat> FormatOf(const TqovixAudioInformation& audio, const TqovixTrimInformation& trim)
 {
-    return audio.size == sizeof(TqovixAudioInformation) && trim.size == sizeof(TqovixTrimInformation) &&
-           audio.channels >= 1 && audio.channels <= kMaxChannels && audio.bitsPerSample == 16 &&
-           audio.sampleRate != 0 && audio.sampleRate <= kMaxRateKiloHertz && audio.sampleCount != 0;
+    const bool first = audio.size == kOvixFirstAudioRecordSize;
+    if ((!first && audio.size != sizeof(TqovixAudioInformation)) || trim.size != sizeof(TqovixTrimInformation) ||
+        audio.channels < 1 || audio.channels > kMaxChannels || audio.sampleRate == 0 ||
+        audio.sampleRate > kMaxRateKiloHertz || audio.sampleCount == 0) {
+        return std::nullopt;
+    }
+    const unsigned long rateHz = first || audio.sampleRateHz == 0 ? SessionRateHz(audio.sampleRate) : audio.sampleRateHz;
+    if (!first && (audio.floatingPoint > 1 || rateHz / 1000 != audio.sampleRate)) {
+        return std::nullopt;  // a rate that contradicts its own kHz is no record to trust
+    }
+    const std::optional<SampleFormat> sample =
+        first ? (audio.bitsPerSample == 16 ? std::optional(SampleFormat::Int16()) : std::nullopt)
+              : SampleFormat::Of(static_cast<unsigned>(std::min(audio.bitsPerSample, 256ul)), audio.floatingPoint == 1);
+    if (!sample) {
+        return std::nullopt;
+    }
+    return SessionFormat{rateHz, static_cast<unsigned>(audio.channels), audio.sampleCount,
+                         static_cast<int32_t>(audio.startOffset), *sample};
 }
 
 }  // namespace
@@ -134,14 +153,13 @@ unsigned long TqovixOpenSession(const TqovixAudioInformation& audio, const Tqovi
 {
     LibraryState& state = State();
     std::lock_guard lock(state.mutex);
-    if (!state.initialized || state.open || !Acceptable(audio, trim)) {
+    const std::optional<SessionFormat> format = FormatOf(audio, trim);
+    if (!state.initialized || state.open || !format) {
         return kFailure;
     }
-    const SessionFormat format{SessionRateHz(audio.sampleRate), static_cast<unsigned>(audio.channels),
-                               audio.sampleCount, static_cast<int32_t>(audio.startOffset)};
     try {
         auto open = std::make_unique<OpenSession>();
-        open->session = std::make_shared<Session>(format, state.callbacks);
+        open->session = std::make_shared<Session>(*format, state.callbacks);
         open->worker = std::thread([session = open->session] { session->Run(); });
         open->workerId = open->worker.get_id();
         state.open = std::move(open);

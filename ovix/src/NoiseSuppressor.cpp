@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cmath>
+#include <cstring>
 #include <numbers>
 
 namespace ovix {
@@ -40,10 +41,12 @@ size_t AroundRows(const SuppressorParameters& p) { return 2 * p.contextFrames / 
 
 }  // namespace
 
-NoiseSuppressor::NoiseSuppressor(uint64_t rateHz, unsigned channels, uint64_t frameCount)
-    : m_parameters(rateHz, std::clamp(channels, 1u, kMaxChannels)),
+NoiseSuppressor::NoiseSuppressor(uint64_t rateHz, unsigned channels, uint64_t frameCount, SampleFormat format)
+    : m_format(format),
+      m_parameters(rateHz, std::clamp(channels, 1u, kMaxChannels), m_format.Bytes()),
+      m_frameBytes(size_t{m_parameters.channels} * m_format.Bytes()),
       m_total(frameCount),
-      m_ring(m_parameters.capacityFrames * m_parameters.channels),
+      m_ring(m_parameters.capacityFrames * m_frameBytes),
       m_fft(m_parameters.fftSize),
       m_window(m_parameters.fftSize),
       m_ramp(m_parameters.rampFrames),
@@ -164,12 +167,14 @@ uint64_t NoiseSuppressor::Room() const
     return m_parameters.capacityFrames - (m_end - base);
 }
 
-void NoiseSuppressor::Append(const int16_t* samples, size_t frames)
+void NoiseSuppressor::Append(const void* samples, size_t frames)
 {
-    const unsigned channels = m_parameters.channels;
-    for (size_t f = 0; f < frames; ++f) {
-        std::copy_n(samples + f * channels, channels,
-                    m_ring.begin() + static_cast<ptrdiff_t>(((m_end + f) % m_parameters.capacityFrames) * channels));
+    const auto* from = static_cast<const uint8_t*>(samples);
+    for (size_t f = 0; f < frames;) {
+        const uint64_t at = (m_end + f) % m_parameters.capacityFrames;
+        const size_t run = static_cast<size_t>(std::min<uint64_t>(frames - f, m_parameters.capacityFrames - at));
+        std::memcpy(m_ring.data() + at * m_frameBytes, from + f * m_frameBytes, run * m_frameBytes);
+        f += run;
     }
     m_end += frames;
     ProcessComplete();
@@ -190,12 +195,14 @@ uint64_t NoiseSuppressor::Ready() const
     return m_end;
 }
 
-void NoiseSuppressor::Read(uint64_t firstFrame, size_t frames, int16_t* out) const
+void NoiseSuppressor::Read(uint64_t firstFrame, size_t frames, void* out) const
 {
-    const unsigned channels = m_parameters.channels;
-    for (size_t f = 0; f < frames; ++f) {
-        const int16_t* frame = m_ring.data() + ((firstFrame + f) % m_parameters.capacityFrames) * channels;
-        std::copy_n(frame, channels, out + f * channels);
+    auto* to = static_cast<uint8_t*>(out);
+    for (size_t f = 0; f < frames;) {
+        const uint64_t at = (firstFrame + f) % m_parameters.capacityFrames;
+        const size_t run = static_cast<size_t>(std::min<uint64_t>(frames - f, m_parameters.capacityFrames - at));
+        std::memcpy(to + f * m_frameBytes, m_ring.data() + at * m_frameBytes, run * m_frameBytes);
+        f += run;
     }
 }
 
@@ -244,14 +251,14 @@ void NoiseSuppressor::LoadFrame(int64_t frame, unsigned channel)
                                                               static_cast<int64_t>(size)));
     std::fill(time, time + from, 0.0f);
     std::fill(time + to, time + size, 0.0f);
-    const unsigned channels = m_parameters.channels;
     const uint64_t capacity = m_parameters.capacityFrames;
+    const uint8_t* samples = m_ring.data() + size_t{channel} * m_format.Bytes();
     uint64_t at = static_cast<uint64_t>(start + static_cast<int64_t>(from)) % capacity;
-    for (size_t i = from; i < to; ++i) {
-        time[i] = m_window[i] * static_cast<float>(m_ring[at * channels + channel]);
-        if (++at == capacity) {
-            at = 0;
-        }
+    // At most two runs: up to the ring's end, then on from its start.
+    for (size_t i = from; i < to; at = 0) {
+        const size_t run = static_cast<size_t>(std::min<uint64_t>(to - i, capacity - at));
+        m_format.LoadWindowed(samples + at * m_frameBytes, m_frameBytes, run, m_window.data() + i, time + i);
+        i += run;
     }
     m_fft.Forward();
 }
@@ -376,7 +383,7 @@ void NoiseSuppressor::ProcessSegment(const Segment& segment)
         m_lastShare = 0.0;
         return;
     }
-    if (!segment.first && !m_lens.Shown(index)) {
+    if ((!segment.first && !m_lens.Shown(index)) || segment.span->strength <= 0.0f) {
         return;
     }
     m_lens.Spectrum(index, lastAhead, m_motor);
@@ -453,14 +460,7 @@ void NoiseSuppressor::Resynthesise(const Segment& segment, const SegmentSpectra&
             const uint64_t slot = (frame % size) * channels;
             if (frame >= segment.writeStart && frame < segment.writeEnd) {
                 const float weight = RampWeight(*segment.span, frame);
-                int16_t* out = m_ring.data() + (frame % m_parameters.capacityFrames) * channels;
-                for (unsigned c = 0; c < channels; ++c) {
-                    const float removed = m_overlap[slot + c];
-                    if (removed != 0.0f) {
-                        const long value = std::lrint(static_cast<float>(out[c]) - weight * removed);
-                        out[c] = static_cast<int16_t>(std::clamp<long>(value, INT16_MIN, INT16_MAX));
-                    }
-                }
+                m_format.SubtractFromFrame(HeldFrame(frame), channels, m_overlap.data() + slot, weight);
             }
             std::fill_n(m_overlap.begin() + static_cast<ptrdiff_t>(slot), channels, 0.0f);
         }

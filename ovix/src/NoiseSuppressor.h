@@ -16,6 +16,7 @@
 #include "LensModel.h"
 #include "MotorEstimator.h"
 #include "RealFft.h"
+#include "SampleFormat.h"
 #include "SpectralFrames.h"
 #include "SuppressorParameters.h"
 
@@ -32,21 +33,23 @@ public:
     static constexpr size_t kBlockFrames = SuppressorParameters::kBlockFrames;
 
     // `frameCount` bounds the sound (it may end earlier, see Finish). May throw std::bad_alloc.
-    NoiseSuppressor(uint64_t rateHz, unsigned channels, uint64_t frameCount);
+    NoiseSuppressor(uint64_t rateHz, unsigned channels, uint64_t frameCount,
+                    SampleFormat format = SampleFormat::Int16());
 
     // Sorted spans as AfInformation::Spans gives them; before the first frame.
     void SetSpans(std::vector<DriveSpan> spans);
 
     // Frames the look-ahead can take now; at least kBlockFrames once Ready() frames are released.
     uint64_t Room() const;
-    // Appends interleaved frames (at most Room()) and processes what they complete.
-    void Append(const int16_t* samples, size_t frames);
+    // Appends interleaved frames in the session's format (at most Room()) and processes what
+    // they complete.
+    void Append(const void* samples, size_t frames);
     // No more sound: pending intervals are processed with what there is.
     void Finish();
     // Frames [0, Ready()) are final.
     uint64_t Ready() const;
-    // Copies final frames that are still held (from Released() on).
-    void Read(uint64_t firstFrame, size_t frames, int16_t* out) const;
+    // Copies final frames that are still held (from Released() on), in the session's format.
+    void Read(uint64_t firstFrame, size_t frames, void* out) const;
     // Frames before `frame` are no longer needed by the reader.
     void Release(uint64_t frame) { m_released = frame; }
 
@@ -97,16 +100,15 @@ private:
     void LoadFrame(int64_t frame, unsigned channel);
     void Resynthesise(const Segment& segment, const SegmentSpectra& spectra);
     float RampWeight(const DriveSpan& span, uint64_t frame) const;
-    int16_t Held(uint64_t frame, unsigned channel) const
-    {
-        return m_ring[(frame % m_parameters.capacityFrames) * m_parameters.channels + channel];
-    }
+    uint8_t* HeldFrame(uint64_t frame) { return m_ring.data() + (frame % m_parameters.capacityFrames) * m_frameBytes; }
 
+    const SampleFormat m_format;
     const SuppressorParameters m_parameters;
+    const size_t m_frameBytes;
     uint64_t m_total;
     uint64_t m_end = 0;  // frames appended
     uint64_t m_released = 0;
-    std::vector<int16_t> m_ring;
+    std::vector<uint8_t> m_ring;  // the track's own bytes: untouched frames leave as they came
     std::vector<DriveSpan> m_spans;
     size_t m_next = 0;  // first span not fully processed
     uint64_t m_segmentAt = 0;  // where its next segment begins

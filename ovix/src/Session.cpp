@@ -11,8 +11,8 @@ namespace ovix {
 Session::Session(const SessionFormat& format, const SessionCallbacks& callbacks)
     : m_format(format),
       m_callbacks(callbacks),
-      m_block((NoiseSuppressor::kBlockFrames + 1) * format.channels),
-      m_suppressor(format.rateHz, format.channels, format.sampleCount),
+      m_block((NoiseSuppressor::kBlockFrames + 1) * format.FrameBytes()),
+      m_suppressor(format.rateHz, format.channels, format.sampleCount, format.sample),
       // Blocks of one frame at worst.
       m_blocks(m_suppressor.Parameters().capacityFrames + 1)
 {
@@ -156,7 +156,7 @@ unsigned long Session::ProcessAudio()
     if (m_callbacks.inputAudio == nullptr || m_callbacks.outputAudio == nullptr) {
         return kFailure;
     }
-    const uint64_t frameBytes = uint64_t{m_format.channels} * sizeof(int16_t);
+    const uint64_t frameBytes = m_format.FrameBytes();
     bool ended = false;
     while (!ended) {
         const uint64_t frames = std::min<uint64_t>(NoiseSuppressor::kBlockFrames, m_format.sampleCount - m_framesPulled);
@@ -184,8 +184,8 @@ unsigned long Session::ProcessAudio()
         m_blocks[(m_blocksHead + m_blocksCount++) % m_blocks.size()] = static_cast<uint16_t>(whole);
         m_framesPulled += whole;
         if (ended) {
-            std::memcpy(m_block.data() + NoiseSuppressor::kBlockFrames * m_format.channels,
-                        reinterpret_cast<const uint8_t*>(m_block.data()) + whole * frameBytes, m_tailBytes);
+            std::memcpy(m_block.data() + NoiseSuppressor::kBlockFrames * frameBytes, m_block.data() + whole * frameBytes,
+                        m_tailBytes);
         }
         m_suppressor.Append(m_block.data(), whole);
         const unsigned long result = PushReady(false);
@@ -200,7 +200,7 @@ unsigned long Session::ProcessAudio()
 
 unsigned long Session::PushReady(bool ended)
 {
-    const uint64_t frameBytes = uint64_t{m_format.channels} * sizeof(int16_t);
+    const uint64_t frameBytes = m_format.FrameBytes();
     while (m_blocksCount > 0) {
         const uint64_t frames = m_blocks[m_blocksHead];
         if (m_framesDone + frames > m_suppressor.Ready()) {
@@ -209,8 +209,7 @@ unsigned long Session::PushReady(bool ended)
         m_suppressor.Read(m_framesDone, frames, m_block.data());
         unsigned long bytes = frames * frameBytes;
         if (ended && m_blocksCount == 1 && m_tailBytes != 0) {
-            std::memmove(reinterpret_cast<uint8_t*>(m_block.data()) + bytes,
-                         m_block.data() + NoiseSuppressor::kBlockFrames * m_format.channels, m_tailBytes);
+            std::memmove(m_block.data() + bytes, m_block.data() + NoiseSuppressor::kBlockFrames * frameBytes, m_tailBytes);
             bytes += m_tailBytes;
         }
         if (Stopped()) {

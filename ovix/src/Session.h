@@ -27,6 +27,9 @@ struct SessionFormat {
     unsigned channels = 0;
     uint64_t sampleCount = 0;
     int64_t startShift = 0;
+    SampleFormat sample = SampleFormat::Int16();
+
+    uint64_t FrameBytes() const { return uint64_t{channels} * sample.Bytes(); }
 };
 
 class Session {
@@ -61,7 +64,7 @@ private:
     std::atomic<unsigned long> m_state{kRunning};
     uint64_t m_framesDone = 0;  // pushed; worker only
     uint64_t m_framesPulled = 0;
-    std::vector<int16_t> m_block;  // one block and the piece of a frame a truncated stream ends in
+    std::vector<uint8_t> m_block;  // one block and the piece of a frame a truncated stream ends in
     NoiseSuppressor m_suppressor;
     // Frames of each pulled block not yet pushed, oldest first: pushes mirror the pulls.
     std::vector<uint16_t> m_blocks;

@@ -20,7 +20,7 @@ constexpr size_t kIntervalsAhead = 2;
 
 }  // namespace
 
-SuppressorParameters::SuppressorParameters(uint64_t rate, unsigned channelCount)
+SuppressorParameters::SuppressorParameters(uint64_t rate, unsigned channelCount, unsigned bytesPerSample)
     : rateHz(std::max<uint64_t>(rate, 1)), channels(std::max(channelCount, 1u))
 {
     const double wanted = kWindowSeconds * static_cast<double>(rateHz);
@@ -34,7 +34,7 @@ SuppressorParameters::SuppressorParameters(uint64_t rate, unsigned channelCount)
     // Room for a whole segment with its context on both sides, the analysis windows that
     // reach past it and a pulled block at either end.
     const uint64_t margin = 2 * (fftSize + rampFrames + kBlockFrames);
-    const uint64_t byBudget = kMaxHeldBytes / (uint64_t{channels} * sizeof(int16_t));
+    const uint64_t byBudget = kMaxHeldBytes / (uint64_t{channels} * std::max(bytesPerSample, 1u));
     const auto seconds = [this](double s) { return static_cast<uint64_t>(s * static_cast<double>(rateHz)); };
     const uint64_t wantedFrames = seconds(kLongestSegmentSeconds) + 2 * seconds(kContextSeconds) + margin +
                             seconds(kLookAheadSeconds);

@@ -9,7 +9,8 @@
 namespace ovix {
 
 struct SuppressorParameters {
-    SuppressorParameters(uint64_t rateHz, unsigned channels);
+    // `bytesPerSample`: as the track holds them, which is what the look-ahead's budget counts.
+    SuppressorParameters(uint64_t rateHz, unsigned channels, unsigned bytesPerSample = 2);
 
     // Most sound the look-ahead may hold, whatever the format.
     static constexpr uint64_t kMaxHeldBytes = 32ull << 20;

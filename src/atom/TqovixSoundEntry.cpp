@@ -1,6 +1,9 @@
 #include "atom/TqovixSoundEntry.h"
 
+#include <cstdio>
 #include <cstring>
+#include <initializer_list>
+#include <string_view>
 
 #include "atom/TqovixByteReader.h"
 
@@ -12,7 +15,20 @@ constexpr uint8_t kESDescrTag = 3;
 constexpr uint8_t kDecoderConfigDescrTag = 4;
 constexpr uint8_t kDecSpecificInfoTag = 5;
 constexpr eTqovixAtomType kEsds = TqovixMakeAtomType("esds");
+constexpr eTqovixAtomType kEnda = TqovixMakeAtomType("enda");
 constexpr eTqovixAtomType kWave = TqovixMakeAtomType("wave");
+constexpr eTqovixAtomType kLpcm = TqovixMakeAtomType("lpcm");
+constexpr eTqovixAtomType kSowt = TqovixMakeAtomType("sowt");
+constexpr eTqovixAtomType kIn24 = TqovixMakeAtomType("in24");
+constexpr eTqovixAtomType kIn32 = TqovixMakeAtomType("in32");
+constexpr eTqovixAtomType kFl32 = TqovixMakeAtomType("fl32");
+constexpr eTqovixAtomType kFl64 = TqovixMakeAtomType("fl64");
+
+// The version-2 linear PCM flags.
+constexpr uint32_t kFlagFloat = 1;
+constexpr uint32_t kFlagBigEndian = 2;
+constexpr uint32_t kFlagSignedInteger = 4;
+constexpr uint32_t kFlagNonInterleaved = 0x20;
 // A "wave" holds a handful of small atoms; nesting deeper than this is not a sound description.
 constexpr int kMaxWaveDepth = 2;
 
@@ -97,7 +113,8 @@ std::optional<DecoderConfig> ParseEsDescriptor(std::span<const uint8_t> body)
     return config;
 }
 
-std::optional<std::span<const uint8_t>> FindEsdsAt(std::span<const uint8_t> children, int depth)
+std::optional<std::span<const uint8_t>> FindChildAt(std::span<const uint8_t> children, eTqovixAtomType wanted,
+                                                    int depth)
 {
     TqovixByteReader reader(children);
     // Trailing bytes too short for an atom (QuickTime's 4-byte terminator) end the list.
@@ -112,17 +129,38 @@ std::optional<std::span<const uint8_t>> FindEsdsAt(std::span<const uint8_t> chil
         }
         eTqovixAtomType type;
         std::memcpy(&type, typeBytes.data(), 4);
-        if (type == kEsds) {
+        if (type == wanted) {
             return payload;
         }
         if (type == kWave && depth < kMaxWaveDepth) {
-            const auto inner = FindEsdsAt(payload, depth + 1);
+            const auto inner = FindChildAt(payload, wanted, depth + 1);
             if (inner) {
                 return inner;
             }
         }
     }
     return std::nullopt;
+}
+
+// Whether the version-2 flags describe the samples: only "lpcm" carries them.
+bool FlagsDescribe(const Entry& entry) { return entry.version == 2 && entry.format == kLpcm; }
+
+// Formats whose byte order an "enda" sets; "twos" is big-endian and "sowt" little whatever follows.
+bool EndaTurns(const Entry& entry)
+{
+    return entry.format == kIn24 || entry.format == kIn32 || entry.format == kFl32 || entry.format == kFl64 ||
+           (entry.format == kLpcm && !FlagsDescribe(entry));
+}
+
+// Words are appended piece by piece: `"text" + std::string` trips a false -Werror=restrict in
+// some optimising compilers.
+std::string Words(std::initializer_list<std::string_view> pieces)
+{
+    std::string text;
+    for (std::string_view piece : pieces) {
+        text.append(piece);
+    }
+    return text;
 }
 
 }  // namespace
@@ -171,13 +209,18 @@ std::optional<Entry> Parse(std::span<const uint8_t> stsd)
         }
         double hz = 0;
         std::memcpy(&hz, &rateBits, sizeof hz);
-        entry.sampleRateHz = hz > 0 && hz < 4294967296.0 ? static_cast<uint32_t>(hz) : 0;
+        // Rounded: a rate written as 44099.99999 is 44100 Hz. NaN fails both tests.
+        entry.sampleRateHz = hz >= 0.5 && hz < 4294967295.0 ? static_cast<uint32_t>(hz + 0.5) : 0;
         entry.samplesPerPacket = framesPerPacket;
         entry.bytesPerFrame = framesPerPacket == 1 ? entry.bytesPerPacket : 0;
     } else if (entry.version != 0) {
         return std::nullopt;
     }
     entry.children = reader.Rest();
+    if (const auto enda = FindChildAt(entry.children, kEnda, 0); enda && enda->size() >= 2) {
+        // The flag is the low byte of a 16-bit field: 1 for little-endian.
+        entry.littleEndianAtom = (*enda)[1] != 0;
+    }
     // QuickTime keeps 16 in the sample size field of versions 0 and 1 whatever the samples are:
     // the format, or the bytes a frame takes, say what they really are.
     if (entry.version != 2 && IsPcmFormat(entry)) {
@@ -219,13 +262,59 @@ bool IsPcmFormat(const Entry& entry)
     return false;
 }
 
-bool IsLittleEndianPcm(const Entry& entry) { return entry.format == TqovixMakeAtomType("sowt"); }
+bool IsLittleEndianPcm(const Entry& entry)
+{
+    if (FlagsDescribe(entry)) {
+        return (entry.formatFlags & kFlagBigEndian) == 0;
+    }
+    return entry.format == kSowt || (EndaTurns(entry) && entry.littleEndianAtom.value_or(false));
+}
+
+std::optional<PcmLayout> ReadPcmLayout(const Entry& entry, std::string& why)
+{
+    PcmLayout layout;
+    layout.bits = entry.bitsPerChannel;
+    layout.littleEndian = IsLittleEndianPcm(entry);
+    layout.floating = entry.format == kFl32 || entry.format == kFl64;
+    const std::string name = Words({"'", TqovixAtomTypeName(entry.format), "'"});
+    const std::string_view processed = "; 16, 24 and 32-bit integer and 32 and 64-bit float PCM are processed";
+    if (FlagsDescribe(entry)) {
+        const uint32_t flags = entry.formatFlags;
+        layout.floating = (flags & kFlagFloat) != 0;
+        const bool signedInteger = (flags & kFlagSignedInteger) != 0;
+        if ((flags & kFlagNonInterleaved) != 0) {
+            why = Words({"sound ", name, " keeps each channel apart (non-interleaved PCM); only interleaved PCM is processed"});
+            return std::nullopt;
+        }
+        if (layout.floating == signedInteger) {
+            char hex[16];
+            std::snprintf(hex, sizeof hex, "0x%X", flags);
+            why = Words({"sound ", name, " has flags ", hex, layout.floating ? ", both float and integer" : ", unsigned integers",
+                         processed});
+            return std::nullopt;
+        }
+    }
+    const bool width = layout.floating ? (layout.bits == 32 || layout.bits == 64)
+                                       : (layout.bits == 16 || layout.bits == 24 || layout.bits == 32);
+    if (!width) {
+        why = Words({"sound ", name, " is ", std::to_string(layout.bits), layout.floating ? "-bit float PCM" : "-bit PCM",
+                     processed});
+        return std::nullopt;
+    }
+    const uint32_t frame = FrameBytes(entry);
+    if (entry.channels != 0 && frame != uint64_t{entry.channels} * layout.SampleBytes()) {
+        why = Words({"the sound description's frame of ", std::to_string(frame), " bytes does not hold ",
+                     std::to_string(entry.channels), " samples of ", std::to_string(layout.bits), " bits"});
+        return std::nullopt;
+    }
+    return layout;
+}
 
 bool IsAac(const Entry& entry) { return entry.format == TqovixMakeAtomType("mp4a"); }
 
 std::optional<std::span<const uint8_t>> FindEsds(std::span<const uint8_t> children)
 {
-    return FindEsdsAt(children, 0);
+    return FindChildAt(children, kEsds, 0);
 }
 
 std::optional<DecoderConfig> ParseEsds(std::span<const uint8_t> esds)

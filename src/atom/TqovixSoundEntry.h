@@ -7,6 +7,7 @@
 #include <cstdint>
 #include <optional>
 #include <span>
+#include <string>
 #include <vector>
 
 #include "atom/TqovixAtomType.h"
@@ -25,8 +26,18 @@ struct Entry {
     uint32_t bytesPerFrame = 0;
     // Version 2: the linear PCM flags (float, big-endian, signed, ...).
     uint32_t formatFlags = 0;
+    // An "enda" among the extension atoms (or in their "wave"): the samples' byte order.
+    std::optional<bool> littleEndianAtom;
     // Extension atoms after the fixed fields, inside the payload the entry was read from.
     std::span<const uint8_t> children;
+};
+
+// How the samples of uncompressed sound are stored.
+struct PcmLayout {
+    uint32_t bits = 0;
+    bool floating = false;
+    bool littleEndian = false;
+    uint32_t SampleBytes() const { return bits / 8; }
 };
 
 // The first sample entry of an "stsd" payload.
@@ -36,11 +47,17 @@ std::optional<Entry> Parse(std::span<const uint8_t> stsd);
 // leaves it to channels × bits.
 uint32_t FrameBytes(const Entry& entry);
 
-// Formats whose samples are frames of integer PCM, and which of them are
-// 16-bit little-endian ("sowt") or big-endian.
+// Formats whose samples are frames of uncompressed PCM, and which of them are stored
+// little-endian: "sowt", the version-2 "lpcm" without its big-endian flag, and the formats
+// an "enda" may turn ("in24", "in32", "fl32", "fl64", "lpcm" of the older versions).
 bool IsPcmFormat(const Entry& entry);
 bool IsLittleEndianPcm(const Entry& entry);
 bool IsAac(const Entry& entry);
+
+// The layout of uncompressed sound we process: interleaved, packed 16, 24 or 32-bit signed
+// integers or 32 or 64-bit floats, in either byte order, one frame being as many bytes as the
+// description says. Otherwise nullopt, and `why` says what the sound is, in words.
+std::optional<PcmLayout> ReadPcmLayout(const Entry& entry, std::string& why);
 
 struct DecoderConfig {
     uint8_t objectType = 0;

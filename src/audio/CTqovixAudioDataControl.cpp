@@ -5,16 +5,11 @@
 #include <new>
 #include <stdexcept>
 
+#include "atom/TqovixEndian.h"
 #include "file/CTqovixFile.h"
 
 namespace {
 
-void SwapWords(uint8_t* bytes, size_t size)
-{
-    for (size_t i = 0; i + 1 < size; i += 2) {
-        std::swap(bytes[i], bytes[i + 1]);
-    }
-}
 
 // Grows a scratch buffer without value-initialising what is overwritten anyway.
 eTqovixErrorCode Reserve(std::vector<uint8_t>& buffer, size_t size)
@@ -36,9 +31,9 @@ eTqovixErrorCode Reserve(std::vector<uint8_t>& buffer, size_t size)
 CTqovixAudioDataControl::~CTqovixAudioDataControl() = default;
 
 eTqovixErrorCode CTqovixAudioDataControl::Initialize(CTqovixFile& file, const std::vector<TqovixChunkInformation>& chunks,
-                                                     bool bigEndian)
+                                                     bool bigEndian, unsigned int sampleBytes)
 {
-    if (chunks.empty()) {
+    if (chunks.empty() || sampleBytes == 0 || sampleBytes > kMaxSampleBytes) {
         return eTqovixErrorInternal;
     }
     m_chunks.resize(chunks.size());
@@ -55,6 +50,7 @@ eTqovixErrorCode CTqovixAudioDataControl::Initialize(CTqovixFile& file, const st
         return result;
     }
     m_bBigEndian = bigEndian;
+    m_sampleBytes = sampleBytes;
     return eTqovixSuccess;
 }
 
@@ -73,6 +69,7 @@ eTqovixErrorCode CTqovixAudioDataControl::Close()
     m_inputChunkIndex = 0;
     m_outputChunkIndex = 0;
     m_bBigEndian = true;
+    m_sampleBytes = 2;
     std::vector<uint8_t>().swap(m_scratch);
     m_scratchHead = 0;
     m_scratchFill = 0;
@@ -92,7 +89,9 @@ void CTqovixAudioDataControl::NextChunk()
 
 eTqovixErrorCode CTqovixAudioDataControl::ServePcmPiece(CTqovixAudioChunk& chunk)
 {
-    const auto size = static_cast<unsigned int>(std::min<uint64_t>(chunk.GetInputDataSize(), kReadPieceBytes));
+    // Whole samples a piece, so that none straddles two of them.
+    const unsigned int piece = kReadPieceBytes - kReadPieceBytes % m_sampleBytes;
+    const auto size = static_cast<unsigned int>(std::min<uint64_t>(chunk.GetInputDataSize(), piece));
     eTqovixErrorCode result = Reserve(m_scratch, size);
     if (TqovixFailed(result)) {
         return result;
@@ -105,9 +104,8 @@ eTqovixErrorCode CTqovixAudioDataControl::ServePcmPiece(CTqovixAudioChunk& chunk
     if (got == 0) {
         return eTqovixErrorInternal;  // the file ends before this chunk
     }
-    // Pieces are even-sized, so a sample's two bytes never straddle two of them.
     if (m_bBigEndian) {
-        SwapWords(m_scratch.data(), got);
+        TqovixSwapSamples(m_scratch.data(), got, m_sampleBytes);
     }
     return TqovixFailed(m_decodedPool->PushDecodedData(m_scratch.data(), got)) ? eTqovixErrorInternal
                                                                              : eTqovixSuccess;

@@ -22,11 +22,14 @@ public:
     // What one read from the file takes at most; whatever a chunk's size, no more is held
     // (a source packet larger than this is no sound packet).
     static constexpr unsigned int kReadPieceBytes = 1 << 20;
+    // The widest PCM sample served: a 64-bit float.
+    static constexpr unsigned int kMaxSampleBytes = 8;
 
     virtual ~CTqovixAudioDataControl();
 
+    // Big-endian PCM is served reversed in units of `sampleBytes`, the width of one sample.
     virtual eTqovixErrorCode Initialize(CTqovixFile& file, const std::vector<TqovixChunkInformation>& chunks,
-                                        bool bigEndian);
+                                        bool bigEndian, unsigned int sampleBytes = 2);
     virtual eTqovixErrorCode Close();
     virtual eTqovixErrorCode PopAudioData(void* buffer, unsigned long* size, unsigned long requested);
     virtual eTqovixErrorCode PushAudioData(const void* data, unsigned long size);
@@ -60,6 +63,7 @@ private:
     std::vector<std::shared_ptr<CTqovixAudioChunk>> m_chunks;
     std::shared_ptr<CTqovixAudioChunk> m_decodedPool;
     bool m_bBigEndian = true;
+    unsigned int m_sampleBytes = 2;
     uint32_t m_inputChunkIndex = 0;
     uint32_t m_outputChunkIndex = 0;
     // At most one piece of the current chunk's bytes, read ahead of the decoder; a chunk's

@@ -160,6 +160,8 @@ void NotifyProgressFunc(unsigned long first, unsigned long second)
     record.bitsPerSample = audio.bitsPerSample;
     record.sampleCount = audio.sampleCount;
     record.startOffset = audio.startOffset;
+    record.sampleRateHz = audio.sampleRateHz;
+    record.floatingPoint = audio.floatingPoint ? 1 : 0;
     return record;
 }
 

@@ -18,6 +18,9 @@ struct TqovixAudioInformation {
     uint64_t bitsPerSample = 0;
     uint64_t sampleCount = 0;  // PCM sample frames
     uint32_t startOffset = 0;  // frames
+    // Ours: what the kHz and the bits alone do not say.
+    uint64_t sampleRateHz = 0;  // the exact rate; 0 leaves it to sampleRate
+    bool floatingPoint = false;  // IEEE floats of bitsPerSample bits, else signed integers
 };
 
 struct TqovixTrimInformation {

@@ -155,6 +155,9 @@ void CTqovixMovControl::Close()
     m_carriedTracks.clear();
     m_soundTrackIndex = 0;
     m_frameBytes = 0;
+    m_sampleBits = 16;
+    m_sampleBytes = 2;
+    m_bFloatingPoint = false;
     m_audioChunks.clear();
     m_afInformationPosition = 0;
     m_audioLevelInformationPosition = 0;
@@ -166,7 +169,7 @@ void CTqovixMovControl::Close()
     m_bLargeMediaDataHeader = false;
     m_bFinishPending = false;
     m_bDestinationComplete = false;
-    m_carriedByte = -1;
+    m_carriedBytes = 0;
     std::vector<uint8_t>().swap(m_copyBuffer);
     m_bPatching = false;
     m_bPatchCandidate = false;
@@ -222,8 +225,11 @@ eTqovixErrorCode CTqovixMovControl::GetAudioInformation(TqovixInterfaceConvert::
         return result;
     }
     record.sampleRate = information.GetRate();
+    record.sampleRateHz = information.GetSampleRateHz();
     record.channels = information.GetChannel();
-    record.bitsPerSample = information.GetSize();
+    // What the library is served: the track's own samples, or the decoder's 16-bit integers.
+    record.bitsPerSample = m_sampleBits;
+    record.floatingPoint = m_bFloatingPoint;
     record.sampleCount = information.GetCount();
     record.startOffset = information.GetMediaTime() - information.GetPriming();
     if (information.GetAudioSpecificConfigSize() == 0) {

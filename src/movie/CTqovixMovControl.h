@@ -81,6 +81,9 @@ public:
     // system can) with only changed sound and the new moov written over it. The result is
     // byte for byte what the general writer gives. Tests turn it off to compare the two.
     static void SetPatchWriting(bool enabled);
+    // How much served sound is kept to compare with what comes back before the file is read
+    // instead; 0 restores the default. Tests make it small to compare with the file.
+    static void SetServedSoundLimit(uint64_t bytes);
     bool IsPatching() const { return m_bPatching; }
     // Asked between the pieces of long copies (the patching copy, large carried chunks) with
     // the bytes copied and in all: a failure code stops the job with it. The engine answers
@@ -103,7 +106,7 @@ private:
     // bytes and a new moov at `moovOffset`.
     bool CanPatch(const TqovixAtomList& atoms, uint64_t& moovOffset) const;
     eTqovixErrorCode BeginPatching(bool& started);
-    // Writes processed PCM over the copy at `offset`, and only where it differs from the source.
+    // Writes processed PCM over the copy at `offset`, and only the samples that differ from the source.
     eTqovixErrorCode PatchSound(uint64_t offset, const uint8_t* data, uint32_t size, bool swap);
     eTqovixErrorCode WriteMovieAtom();
     void KeepServedSound(eTqovixErrorCode served, const void* buffer, const unsigned long* delivered) const;
@@ -141,6 +144,9 @@ private:
     std::vector<std::pair<uint32_t, size_t>> m_carriedTracks;
     uint32_t m_soundTrackIndex = 0;
     uint32_t m_frameBytes = 0;  // PCM: bytes per frame of the sound track
+    uint32_t m_sampleBits = 16;  // what the processing library is served
+    uint32_t m_sampleBytes = 2;
+    bool m_bFloatingPoint = false;
     std::string m_refusal;
     eTqovixRefusal m_refusalKind = eTqovixRefusal::None;
     std::vector<TqovixChunkInformation> m_outputAudioChunks;
@@ -158,7 +164,9 @@ private:
     bool m_bLargeMediaDataHeader = false;  // the mdat header written has a 64-bit size field
     bool m_bFinishPending = false;
     bool m_bDestinationComplete = false;
-    int m_carriedByte = -1;  // big-endian PCM: the odd byte of a piece waits for its pair
+    // Big-endian PCM: the start of a sample that a piece ends in waits for the rest.
+    uint8_t m_carried[8] = {};
+    uint32_t m_carriedBytes = 0;
     std::vector<uint8_t> m_copyBuffer;  // reused for swapped PCM and video chunks the kernel cannot copy
     bool m_bPatching = false;
     bool m_bPatchCandidate = false;        // the layout allows it: the served sound is kept

@@ -7,6 +7,7 @@
 #include <new>
 
 #include "atom/CTqovixAtom.h"
+#include "atom/TqovixEndian.h"
 #include "movie/CTqovixMovControl.h"
 
 namespace {
@@ -14,21 +15,18 @@ namespace {
 constexpr uint64_t kComparePiece = 1 << 20;
 constexpr unsigned long long kFirstCopy = 64 << 10;
 // A processing library that pulls this far ahead of what it hands back is compared with the
-// file instead: the served sound is not held without bound.
-constexpr uint64_t kMaxServedBytes = 4 << 20;
+// file instead: the served sound is not held without bound. Ours holds up to its 32 MiB
+// look-ahead (24-bit 96 kHz stereo fills 7 MiB of it) and a block or two more.
+constexpr uint64_t kMaxServedBytes = 33 << 20;
 
 std::atomic<bool> g_bPatchWriting{true};
-
-void SwapPairs(uint8_t* bytes, uint64_t size)
-{
-    for (uint64_t k = 0; k + 1 < size; k += 2) {
-        std::swap(bytes[k], bytes[k + 1]);
-    }
-}
+std::atomic<uint64_t> g_maxServedBytes{kMaxServedBytes};
 
 }  // namespace
 
 void CTqovixMovControl::SetPatchWriting(bool enabled) { g_bPatchWriting = enabled; }
+
+void CTqovixMovControl::SetServedSoundLimit(uint64_t bytes) { g_maxServedBytes = bytes != 0 ? bytes : kMaxServedBytes; }
 
 bool CTqovixMovControl::CanPatch(const TqovixAtomList& atoms, uint64_t& moovOffset) const
 {
@@ -133,7 +131,7 @@ void CTqovixMovControl::KeepServedSound(eTqovixErrorCode served, const void* buf
     if (!m_bPatchCandidate || m_bServedOverflow || TqovixFailed(served) || delivered == nullptr || *delivered == 0) {
         return;
     }
-    if (m_servedSound.Size() + *delivered > kMaxServedBytes ||
+    if (m_servedSound.Size() + *delivered > g_maxServedBytes ||
         TqovixFailed(m_servedSound.Push(buffer, *delivered))) {
         m_bServedOverflow = true;
         m_servedSound.Clear();
@@ -158,44 +156,59 @@ eTqovixErrorCode CTqovixMovControl::TakeServedSound(uint64_t offset, uint32_t si
         return eTqovixErrorInternal;  // the tables were checked against the file: it shrank
     }
     if (swapped) {
-        SwapPairs(m_compareBuffer.data(), size);
+        TqovixSwapSamples(m_compareBuffer.data(), size, m_sampleBytes);
     }
     return eTqovixSuccess;
 }
 
 eTqovixErrorCode CTqovixMovControl::PatchSound(uint64_t offset, const uint8_t* data, uint32_t size, bool swap)
 {
+    // Whole samples a piece, so that a changed sample is never cut in two.
+    const uint32_t width = m_sampleBytes;
+    const uint64_t limit = kComparePiece - kComparePiece % width;
     try {
-        const uint64_t piece = std::min<uint64_t>(std::max<uint32_t>(size, 2), kComparePiece);
+        const uint64_t piece = std::min<uint64_t>(std::max<uint32_t>(size, width), limit);
         m_copyBuffer.resize(std::max<uint64_t>(m_copyBuffer.size(), piece));
         m_compareBuffer.resize(std::max<uint64_t>(m_compareBuffer.size(), piece));
     } catch (const std::bad_alloc&) {
         return eTqovixErrorOutOfMemory;
     }
     for (uint32_t done = 0; done < size;) {
-        const auto piece = static_cast<unsigned int>(std::min<uint64_t>(size - done, m_copyBuffer.size()));
+        const auto piece = static_cast<unsigned int>(std::min<uint64_t>(size - done, limit));
         eTqovixErrorCode result = TakeServedSound(offset + done, piece, swap);
         if (TqovixFailed(result)) {
             return result;
         }
-        // Unchanged sound stays as copied, so the blocks it shares with the source stay shared.
-        if (std::memcmp(m_compareBuffer.data(), data + done, piece) != 0) {
-            const uint8_t* bytes = data + done;
+        // Unchanged sound stays as copied, so the blocks it shares with the source stay shared:
+        // only the samples from the first changed one to the last are written.
+        const uint8_t* served = m_compareBuffer.data();
+        const uint8_t* processed = data + done;
+        if (std::memcmp(served, processed, piece) != 0) {
+            const auto mismatch = std::mismatch(served, served + piece, processed);
+            uint32_t last = piece;
+            while (last > 0 && served[last - 1] == processed[last - 1]) {
+                --last;
+            }
+            const auto first = static_cast<uint32_t>(mismatch.first - served) / width * width;
+            last = (last + width - 1) / width * width;
+            const uint32_t count = last - first;
+            const uint64_t at = offset + done + first;
+            const uint8_t* bytes = processed + first;
             if (swap) {
-                std::memcpy(m_copyBuffer.data(), bytes, piece);
-                SwapPairs(m_copyBuffer.data(), piece);
+                std::memcpy(m_copyBuffer.data(), bytes, count);
+                TqovixSwapSamples(m_copyBuffer.data(), count, width);
                 bytes = m_copyBuffer.data();
             }
             // The copy must never write over it: claimed first, it is passed over.
-            result = m_copy.Claim(offset + done, piece);
+            result = m_copy.Claim(at, count);
             // Runs of changed sound go out through the stream's buffer: a seek would flush it.
-            if (!TqovixFailed(result) && m_patchEnd != offset + done) {
-                result = m_destinationFile.Seek(static_cast<long long>(offset + done), CTqovixFile::eTqovixSeekBegin);
+            if (!TqovixFailed(result) && m_patchEnd != at) {
+                result = m_destinationFile.Seek(static_cast<long long>(at), CTqovixFile::eTqovixSeekBegin);
             }
             if (!TqovixFailed(result)) {
-                result = m_destinationFile.Write(bytes, piece);
+                result = m_destinationFile.Write(bytes, count);
             }
-            m_patchEnd = TqovixFailed(result) ? UINT64_MAX : offset + done + piece;
+            m_patchEnd = TqovixFailed(result) ? UINT64_MAX : at + count;
             if (TqovixFailed(result)) {
                 return result;
             }

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <new>
 #include <numeric>
+#include <optional>
 #include <string_view>
 
 #include "atom/CTqovixContainerAtom.h"
@@ -123,7 +124,7 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
     if (!forJob) {
         // The property query sets the sound up as a job's start does, so that it refuses what
         // the start would.
-        return m_audioDataControl.Initialize(m_sourceFile, m_audioChunks, m_bBigEndian);
+        return m_audioDataControl.Initialize(m_sourceFile, m_audioChunks, m_bBigEndian, m_sampleBytes);
     }
     // Whether copying then patching will do, so that the sound served from now on is kept to
     // compare with; the writer decides for good when it starts.
@@ -134,7 +135,7 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
     uint64_t moovOffset = 0;
     m_bLargeMediaDataHeader = NeedsLargeMediaDataHeader(largeSource);
     m_bPatchCandidate = CanPatch(atoms, moovOffset);
-    return m_audioDataControl.Initialize(m_sourceFile, m_audioChunks, m_bBigEndian);
+    return m_audioDataControl.Initialize(m_sourceFile, m_audioChunks, m_bBigEndian, m_sampleBytes);
 }
 
 eTqovixErrorCode CTqovixMovControl::AnalyzeSoundFormat(const CTqovixAudioInformationVisitor& information)
@@ -160,31 +161,30 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeSoundFormat(const CTqovixAudioInforma
         }
         m_bPCM = false;
         m_bBigEndian = false;
-        m_frameBytes = 2 * channels;  // what the decoder gives: 16-bit frames
+        m_bFloatingPoint = false;
+        m_sampleBits = 16;  // what the decoder gives
+        m_sampleBytes = 2;
+        m_frameBytes = 2 * channels;
         return eTqovixSuccess;
     }
     if (!TqovixSoundEntry::IsPcmFormat(entry)) {
         return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound, Words({"sound format ", FourCC(entry.format), " is not processed"}));
     }
-    const bool floating = (entry.version == 2 && (entry.formatFlags & 1) != 0) ||
-                          entry.format == TqovixMakeAtomType("fl32") || entry.format == TqovixMakeAtomType("fl64");
-    if (floating) {
-        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound, "sound is floating-point PCM; only 16-bit is processed");
-    }
-    if (entry.bitsPerChannel != 16) {
-        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound,
-                      Words({"sound is ", std::to_string(entry.bitsPerChannel), "-bit PCM; only 16-bit is processed"}));
-    }
     if (channels == 0 || channels > kMaxPcmChannels) {
         return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound,
                       Words({"sound has ", std::to_string(channels), " channels; 1 to 8 are processed"}));
     }
-    if (TqovixSoundEntry::FrameBytes(entry) != 2 * channels) {
-        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound, "the sound description's frame size does not match 16-bit samples");
+    std::string why;
+    const std::optional<TqovixSoundEntry::PcmLayout> layout = TqovixSoundEntry::ReadPcmLayout(entry, why);
+    if (!layout) {
+        return Refuse(eTqovixErrorInvalidMovie, eTqovixRefusal::UnsupportedSound, std::move(why));
     }
     m_bPCM = true;
-    m_bBigEndian = information.IsBigEndianFormat();
-    m_frameBytes = 2 * channels;
+    m_bBigEndian = !layout->littleEndian;
+    m_bFloatingPoint = layout->floating;
+    m_sampleBits = layout->bits;
+    m_sampleBytes = layout->SampleBytes();
+    m_frameBytes = m_sampleBytes * channels;
     return eTqovixSuccess;
 }
 

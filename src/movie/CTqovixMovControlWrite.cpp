@@ -5,6 +5,7 @@
 #include <new>
 
 #include "atom/CTqovixAtom.h"
+#include "atom/TqovixEndian.h"
 #include "engine/CTqovixMainFrame.h"
 #include "movie/CTqovixMovControl.h"
 
@@ -16,13 +17,6 @@ constexpr uint64_t kCopyPiece = 1 << 20;
 // Carried chunks larger than this are copied in pieces with a look at whether to go on between.
 constexpr uint64_t kStopPiece = 64 << 20;
 constexpr uint64_t kMax32 = CTqovixAtom::kMaxCompactAtomSize;
-
-void SwapPairs(uint8_t* bytes, uint64_t size)
-{
-    for (uint64_t k = 0; k + 1 < size; k += 2) {
-        std::swap(bytes[k], bytes[k + 1]);
-    }
-}
 
 }  // namespace
 
@@ -54,20 +48,27 @@ eTqovixErrorCode CTqovixMovControl::SetMovieMetaData(const void* data, unsigned 
     }
     const auto* bytes = static_cast<const uint8_t*>(data);
     if (m_bBigEndian && size != 0) {
-        // Only whole 2-byte samples can be swapped: an odd byte waits for its partner.
-        if (m_carriedByte >= 0) {
-            const uint8_t pair[2] = {static_cast<uint8_t>(m_carriedByte), bytes[0]};
-            m_carriedByte = -1;
-            const eTqovixErrorCode result = WritePcm(pair, 2, true);
-            if (TqovixFailed(result)) {
-                return result;
+        // Only whole samples can be swapped: the start of one waits for the rest.
+        const uint32_t width = m_sampleBytes;
+        if (m_carriedBytes != 0) {
+            const auto take = static_cast<uint32_t>(std::min<uint64_t>(width - m_carriedBytes, size));
+            std::memcpy(m_carried + m_carriedBytes, bytes, take);
+            m_carriedBytes += take;
+            bytes += take;
+            size -= take;
+            if (m_carriedBytes == width) {
+                m_carriedBytes = 0;
+                const eTqovixErrorCode result = WritePcm(m_carried, width, true);
+                if (TqovixFailed(result)) {
+                    return result;
+                }
             }
-            ++bytes;
-            --size;
         }
-        if (size % 2 != 0) {
-            m_carriedByte = bytes[size - 1];
-            --size;
+        const auto rest = static_cast<uint32_t>(size % width);
+        if (rest != 0) {
+            std::memcpy(m_carried + m_carriedBytes, bytes + size - rest, rest);
+            m_carriedBytes += rest;
+            size -= rest;
         }
     }
     return WritePcm(bytes, size, m_bBigEndian);
@@ -200,15 +201,17 @@ eTqovixErrorCode CTqovixMovControl::WritePcm(const uint8_t* data, unsigned long 
 
 eTqovixErrorCode CTqovixMovControl::WriteSwapped(const uint8_t* data, unsigned long size)
 {
+    // Whole samples a piece: none is cut in two by the reused buffer.
+    const uint64_t limit = kCopyPiece - kCopyPiece % m_sampleBytes;
     try {
-        m_copyBuffer.resize(std::min<uint64_t>(std::max<uint64_t>(size, 2), kCopyPiece));
+        m_copyBuffer.resize(std::min<uint64_t>(std::max<uint64_t>(size, m_sampleBytes), limit));
     } catch (const std::bad_alloc&) {
         return eTqovixErrorOutOfMemory;
     }
     for (unsigned long done = 0; done < size;) {
-        const auto piece = static_cast<unsigned int>(std::min<uint64_t>(size - done, m_copyBuffer.size()));
+        const auto piece = static_cast<unsigned int>(std::min<uint64_t>(size - done, limit));
         std::memcpy(m_copyBuffer.data(), data + done, piece);
-        SwapPairs(m_copyBuffer.data(), piece);
+        TqovixSwapSamples(m_copyBuffer.data(), piece, m_sampleBytes);
         const eTqovixErrorCode result = m_destinationFile.Write(m_copyBuffer.data(), piece);
         if (TqovixFailed(result)) {
             return result;
@@ -372,7 +375,7 @@ eTqovixErrorCode CTqovixMovControl::CopySourceSoundTail()
     } catch (const std::bad_alloc&) {
         return eTqovixErrorOutOfMemory;
     }
-    m_carriedByte = -1;
+    m_carriedBytes = 0;
     while (m_outputAudioChunkIndex < m_audioChunks.size()) {
         const TqovixChunkInformation& chunk = m_audioChunks[m_outputAudioChunkIndex];
         const uint32_t left = chunk.size - m_bytesInOutputChunk;

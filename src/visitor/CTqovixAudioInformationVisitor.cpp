@@ -145,9 +145,6 @@ eTqovixErrorCode CTqovixAudioInformationVisitor::AnalyzeSampleDescription(std::s
     m_sampleRateHz = entry->sampleRateHz;
     m_rate = entry->sampleRateHz / 1000;
     m_bBigEndianPcm = !TqovixSoundEntry::IsLittleEndianPcm(*entry);
-    if (entry->version == 2 && TqovixSoundEntry::IsPcmFormat(*entry)) {
-        m_bBigEndianPcm = (entry->formatFlags & 2) != 0;  // the big-endian flag of linear PCM
-    }
     if (!TqovixSoundEntry::IsAac(*entry)) {
         m_entry.children = {};
         return eTqovixSuccess;

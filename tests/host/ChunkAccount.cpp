@@ -111,6 +111,8 @@ bool ReadTrack(const Bytes& b, const Box& trak, TrackChunks& track, bool& inFile
         frameBytes = Be(b, entry + 24, 2) * (Be(b, entry + 26, 2) / 8);
         if (version == 1) {
             frameBytes = Be(b, entry + 44, 4);
+        } else if (version == 2 && Be(b, entry + 68, 4) == 1) {
+            frameBytes = Be(b, entry + 64, 4);  // the bytes of a packet of one frame
         }
     }
     const uint64_t common = Be(b, stsz->begin + 4, 4);

@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <cmath>
+#include <cstring>
 #include <sstream>
 #include <thread>
 #include <utility>
@@ -125,6 +126,23 @@ bool DecodeSound(const std::string& path, std::vector<int16_t>& samples)
     return true;
 }
 
+bool DecodeSound(const std::string& path, std::vector<double>& samples)
+{
+    testsupport::TempDir scratch;
+    const std::string raw = scratch.File("sound.raw");
+    std::string output;
+    const int status = RunCommand("ffmpeg -v error -nostdin -xerror -i " + ShellQuote(path) +
+                                      " -map 0:a:0 -f f64le -acodec pcm_f64le " + ShellQuote(raw) + " 2>&1",
+                                  &output);
+    if (status != 0 || !output.empty()) {
+        return false;
+    }
+    const std::vector<uint8_t> bytes = testsupport::ReadFile(raw);
+    samples.resize(bytes.size() / sizeof(double));
+    std::memcpy(samples.data(), bytes.data(), samples.size() * sizeof(double));
+    return true;
+}
+
 std::string CheckReencodedSound(const std::vector<int16_t>& source, const std::vector<int16_t>& destination,
                                 unsigned channels, const std::vector<testsupport::FrameSpan>& spans, uint64_t margin,
                                 uint64_t leadIn, double keptDb, double changedDb)
@@ -211,7 +229,8 @@ bool NearInterval(uint64_t frame, const std::vector<moviekit::AfInterval>& inter
     });
 }
 
-std::string CheckPcmChangedOnlyInside(const std::vector<int16_t>& before, const std::vector<int16_t>& after,
+template <typename Sample>
+std::string CheckPcmChangedOnlyInside(const std::vector<Sample>& before, const std::vector<Sample>& after,
                                       unsigned channels, const std::vector<moviekit::AfInterval>& intervals,
                                       uint64_t ramp)
 {
@@ -224,7 +243,8 @@ std::string CheckPcmChangedOnlyInside(const std::vector<int16_t>& before, const 
     std::vector<uint64_t> changedInside(intervals.size());
     for (uint64_t f = 0; f < before.size() / channels; ++f) {
         const auto at = static_cast<std::ptrdiff_t>(f * channels);
-        const bool changed = !std::equal(before.begin() + at, before.begin() + at + channels, after.begin() + at);
+        // By their bits: a float's -0 is no 0.
+        const bool changed = std::memcmp(before.data() + at, after.data() + at, channels * sizeof(Sample)) != 0;
         if (changed && !NearInterval(f, intervals, ramp)) {
             firstStray = strays++ == 0 ? f : firstStray;
         }
@@ -248,6 +268,11 @@ std::string CheckPcmChangedOnlyInside(const std::vector<int16_t>& before, const 
     }
     return problems.str();
 }
+
+template std::string CheckPcmChangedOnlyInside(const std::vector<int16_t>&, const std::vector<int16_t>&, unsigned,
+                                               const std::vector<moviekit::AfInterval>&, uint64_t);
+template std::string CheckPcmChangedOnlyInside(const std::vector<double>&, const std::vector<double>&, unsigned,
+                                               const std::vector<moviekit::AfInterval>&, uint64_t);
 
 std::vector<uint8_t> ReadRange(const std::string& path, uint64_t offset, uint64_t size)
 {

@@ -40,6 +40,9 @@ std::string ProbeErrors(const std::string& path);
 uint64_t PacketCount(const std::string& path, const std::string& stream);
 // Decodes the first sound stream to interleaved s16; false when ffmpeg reports an error.
 bool DecodeSound(const std::string& path, std::vector<int16_t>& samples);
+// The same as doubles, which hold every sample of 16, 24 and 32-bit integers and of floats exactly
+// (integers scaled to ±1 by a power of two).
+bool DecodeSound(const std::string& path, std::vector<double>& samples);
 
 // Re-encoded sound against the source's decode, both from ffmpeg, channel by channel and frame
 // for frame (no lag allowed): outside the spans widened by `margin` (where coding smears an edge),
@@ -57,7 +60,9 @@ bool NearInterval(uint64_t frame, const std::vector<moviekit::AfInterval>& inter
 // PCM processed where it may be only: bit-exact outside every interval widened by `ramp` (the
 // library's 10 ms ramp, no other slack), and over half the frames changed inside each interval
 // shrunk by it. Empty when that holds, else what does not.
-std::string CheckPcmChangedOnlyInside(const std::vector<int16_t>& before, const std::vector<int16_t>& after,
+// Samples are int16_t or double.
+template <typename Sample>
+std::string CheckPcmChangedOnlyInside(const std::vector<Sample>& before, const std::vector<Sample>& after,
                                       unsigned channels, const std::vector<moviekit::AfInterval>& intervals,
                                       uint64_t ramp);
 

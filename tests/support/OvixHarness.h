@@ -43,6 +43,8 @@ struct Script {
     Bytes levelBlock = {};  // empty: the recording has no audio level
     std::vector<int16_t> pcm = {};  // interleaved
     unsigned channels = 2;
+    Bytes sound = {};  // if set, served instead of `pcm`: frames of `frameBytes` in any format
+    size_t frameBytes = 0;
     bool zerosAfterEnd = false;  // decoded AAC: the track is followed by zeros forever
     size_t infoPieceLimit = SIZE_MAX;
     size_t audioFrameLimit = SIZE_MAX / 64;
@@ -73,6 +75,8 @@ public:
         TqovixSetCallbackInputAudio(&Harness::InputAudio);
         TqovixSetCallbackOutputAudio([](void* data, unsigned long size) {
             Harness& h = *s_current;
+            const auto* bytes = static_cast<const uint8_t*>(data);
+            h.pushedSound.insert(h.pushedSound.end(), bytes, bytes + size);
             const int16_t* samples = static_cast<const int16_t*>(data);
             h.pushed.insert(h.pushed.end(), samples, samples + size / sizeof(int16_t));
             h.pushedBytes.push_back(size);
@@ -88,6 +92,7 @@ public:
     // Read only after the session is closed (its worker joined) or while it is held at the gate.
     std::string events;
     std::vector<int16_t> pushed;
+    Bytes pushedSound;  // everything pushed, as bytes
     std::vector<Note> notes;
     std::vector<size_t> pulledBytes, pushedBytes;  // every delivery and push, in order
     Gate gate;
@@ -136,13 +141,16 @@ private:
         if (!h.Enter('I')) {
             return ovix::kFailure;
         }
-        const size_t left = (s.pcm.size() - h.m_samplePosition) * sizeof(int16_t);
+        const bool raw = !s.sound.empty();
+        const auto* source = raw ? s.sound.data() : reinterpret_cast<const uint8_t*>(s.pcm.data());
+        const size_t left = (raw ? s.sound.size() : s.pcm.size() * sizeof(int16_t)) - h.m_bytePosition;
+        const size_t frameBytes = raw ? s.frameBytes : s.channels * sizeof(int16_t);
         const size_t limit = s.deliveryCycle.empty() ? s.audioFrameLimit
                                                      : s.deliveryCycle[h.pulledBytes.size() % s.deliveryCycle.size()];
-        size_t piece = std::min({size_t{size}, left, limit * s.channels * sizeof(int16_t)});
+        size_t piece = std::min({size_t{size}, left, limit * frameBytes});
         uint8_t* out = static_cast<uint8_t*>(buffer);
-        std::copy_n(reinterpret_cast<const uint8_t*>(s.pcm.data() + h.m_samplePosition), piece, out);
-        h.m_samplePosition += piece / sizeof(int16_t);
+        std::copy_n(source + h.m_bytePosition, piece, out);
+        h.m_bytePosition += piece;
         if (s.zerosAfterEnd && piece == left && piece < size) {
             piece = std::fill_n(out + piece, size - piece, 0) - out;
         }
@@ -152,7 +160,7 @@ private:
     }
 
     Script m_script;
-    size_t m_afPosition = 0, m_levelPosition = 0, m_samplePosition = 0;
+    size_t m_afPosition = 0, m_levelPosition = 0, m_bytePosition = 0;
     std::array<int, 256> m_calls = {};  // by event letter
 };
 

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cmath>
+#include <cstring>
 #include <numbers>
 
 namespace moviekit {
@@ -36,18 +37,38 @@ int16_t MediaSource::ToneSample(uint64_t frame, uint32_t channel) const
 
 void MediaSource::PcmFrames(uint64_t firstFrame, uint32_t frames, Bytes& out) const
 {
-    const uint32_t channels = m_recipe.sound.channels;
-    out.resize(uint64_t{frames} * channels * 2);
-    const std::vector<int16_t>& given = m_recipe.sound.pcm;
-    size_t pos = 0;
+    const SoundRecipe& sound = m_recipe.sound;
+    const uint32_t channels = sound.channels;
+    const uint32_t width = m_plan.sampleBytes;
+    out.resize(uint64_t{frames} * channels * width);
+    const std::vector<int16_t>& given = sound.pcm;
+    uint8_t* at = out.data();
     for (uint64_t f = firstFrame; f < firstFrame + frames; ++f) {
-        for (uint32_t c = 0; c < channels; ++c) {
-            const int16_t sample = given.empty() ? ToneSample(f, c) : given[f * channels + c];
-            const auto bits = static_cast<uint16_t>(sample);
-            const auto high = static_cast<uint8_t>(bits >> 8);
-            const auto low = static_cast<uint8_t>(bits);
-            out[pos++] = m_plan.littleEndianPcm ? low : high;
-            out[pos++] = m_plan.littleEndianPcm ? high : low;
+        for (uint32_t c = 0; c < channels; ++c, at += width) {
+            const int16_t narrow = given.empty() ? ToneSample(f, c) : given[f * channels + c];
+            uint64_t bits = static_cast<uint16_t>(narrow);
+            if (m_plan.deepPcm) {
+                // Full scale at 2^31; a tone made here gets low bits, as a deeper recording has.
+                int64_t wide = sound.widePcm.empty() ? int64_t{narrow} * 65536 : sound.widePcm[f * channels + c];
+                if (sound.widePcm.empty() && given.empty()) {
+                    wide += static_cast<int64_t>(SplitMix64(f * channels + c) % 65536);
+                }
+                if (sound.floatingPoint && width == 4) {
+                    uint32_t word = 0;
+                    const auto value = static_cast<float>(static_cast<double>(wide) / 2147483648.0);
+                    std::memcpy(&word, &value, 4);
+                    bits = word;
+                } else if (sound.floatingPoint) {
+                    const double value = static_cast<double>(wide) / 2147483648.0;
+                    std::memcpy(&bits, &value, 8);
+                } else {
+                    bits = static_cast<uint64_t>(wide >> (32 - sound.bits));
+                }
+            }
+            for (uint32_t b = 0; b < width; ++b) {
+                const auto byte = static_cast<uint8_t>(bits >> (8 * b));
+                at[m_plan.littleEndianPcm ? b : width - 1 - b] = byte;
+            }
         }
     }
 }

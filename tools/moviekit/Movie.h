@@ -33,8 +33,15 @@ struct SoundRecipe {
     bool present = true;
     SoundCodec codec = SoundCodec::Twos;
     std::string formatOverride;  // another four-cc for big-endian PCM, e.g. "lpcm"
-    uint32_t sampleRate = 48000;  // up to 65535: the description holds 16.16 Hz
+    // Rates past 65535 Hz do not fit the 16.16 field: they make a version-2 "lpcm" description.
+    uint32_t sampleRate = 48000;
     uint16_t channels = 2;
+    // PCM: 16, 24 or 32-bit integers, or with floatingPoint 32 or 64-bit floats. Deeper than 16
+    // bits is "in24", "in32", "fl32" or "fl64" in a version-1 description, whose "wave" holds
+    // an "enda" for little-endian samples (Sowt); or "lpcm" with version2Lpcm.
+    uint16_t bits = 16;
+    bool floatingPoint = false;
+    bool version2Lpcm = false;
     // 0 or 1 as cameras write; any other value is written into a version-0 layout.
     uint16_t descriptionVersion = 0;
     // Sound samples: PCM frames or AAC packets. 0: as long as the video (one second without).
@@ -42,7 +49,8 @@ struct SoundRecipe {
     // Samples per chunk; 0: one chunk per video chunk period. The last chunk takes the rest.
     uint32_t samplesPerChunk = 0;
     std::vector<uint32_t> chunkSampleCounts;  // explicit chunks; overrides samplesPerChunk
-    std::vector<int16_t> pcm;  // interleaved; empty: a deterministic tone
+    std::vector<int16_t> pcm;  // interleaved; empty: a deterministic tone (with low bits when deeper)
+    std::vector<int32_t> widePcm;  // interleaved, full scale at 2^31, for deeper samples; wins over pcm
     uint32_t toneHz = 1000;
     std::vector<Bytes> aacPackets;  // empty: silent packets of varying size
     EsdsRecipe esds;

@@ -21,6 +21,9 @@ struct MoviePlan {
     bool littleEndianPcm = false;
     std::string soundFormat;
     uint32_t bytesPerFrame = 0;  // PCM
+    uint32_t sampleBytes = 2;  // PCM
+    bool deepPcm = false;  // anything but 16-bit integers
+    bool version2Lpcm = false;
     uint64_t soundSamples = 0;   // PCM frames or AAC packets
     uint64_t soundFrames = 0;    // audio frames either way
     uint32_t soundMediaTime = 0;

@@ -1,6 +1,7 @@
 #include "SampleTables.h"
 
 #include <algorithm>
+#include <cstring>
 
 namespace moviekit {
 
@@ -94,26 +95,51 @@ Bytes VideoDescription(const VideoRecipe& video)
 
 Bytes SoundDescription(const SoundRecipe& sound, const MoviePlan& plan)
 {
-    const uint16_t version = sound.descriptionVersion;
+    // Deeper samples need the frame's size, which version 1 gives; rates past 16.16, version 2.
+    const uint16_t version = plan.version2Lpcm ? 2 : plan.deepPcm ? 1 : sound.descriptionVersion;
     Bytes e;
     e.insert(e.end(), 6, 0);
     PutU16(e, 1);
     PutU16(e, version);
     PutU16(e, 0);  // revision
     PutU32(e, 0);  // vendor
-    PutU16(e, sound.channels);
-    PutU16(e, 16);
-    PutU16(e, version == 1 && plan.aac ? 0xFFFE : 0);  // compression ID
-    PutU16(e, 0);  // packet size
-    PutU32(e, uint32_t{sound.sampleRate} << 16);
+    if (plan.version2Lpcm) {
+        PutU16(e, 3);
+        PutU16(e, 16);
+        PutU16(e, 0xFFFE);
+        PutU16(e, 0);
+        PutU32(e, 0x10000);
+        PutU32(e, 72);  // the fields' size
+        double rate = sound.sampleRate;
+        uint64_t rateBits = 0;
+        std::memcpy(&rateBits, &rate, sizeof rateBits);
+        PutU32(e, static_cast<uint32_t>(rateBits >> 32));
+        PutU32(e, static_cast<uint32_t>(rateBits));
+        PutU32(e, sound.channels);
+        PutU32(e, 0x7F000000);
+        PutU32(e, sound.bits);
+        // Float or signed integer, big-endian unless little, packed.
+        PutU32(e, (sound.floatingPoint ? 1U : 4U) | (plan.littleEndianPcm ? 0U : 2U) | 8U);
+        PutU32(e, plan.bytesPerFrame);  // bytes per packet of one frame
+        PutU32(e, 1);
+    } else {
+        PutU16(e, sound.channels);
+        PutU16(e, 16);
+        PutU16(e, version == 1 && plan.aac ? 0xFFFE : 0);  // compression ID
+        PutU16(e, 0);  // packet size
+        PutU32(e, uint32_t{sound.sampleRate} << 16);
+    }
     if (version == 1) {
         PutU32(e, plan.aac ? kAacFramesPerPacket : 1);  // frames per packet
-        PutU32(e, plan.aac ? 0 : 2);                    // bytes per packet, one channel
+        PutU32(e, plan.aac ? 0 : plan.sampleBytes);     // bytes per packet, one channel
         PutU32(e, plan.aac ? 0 : plan.bytesPerFrame);
-        PutU32(e, 2);  // bytes per sample
+        PutU32(e, 2);  // bytes per sample, as QuickTime keeps it
     }
     if (plan.aac) {
         PutBytes(e, Atom("esds", plan.esdsPayload));
+    } else if (plan.deepPcm && !plan.version2Lpcm && plan.littleEndianPcm) {
+        PutBytes(e, Container("wave", {Atom("frma", Bytes(plan.soundFormat.begin(), plan.soundFormat.end())),
+                                       Atom("enda", Bytes{0, 1}), Bytes(8, 0)}));
     }
     Bytes p;
     PutU32(p, 0);

@@ -17,14 +17,15 @@ bool ResolveSoundSamples(const MovieRecipe& recipe, MoviePlan& plan, std::vector
             return PlanFail(error, "sampleCount differs from the number of AAC packets given");
         }
         samples = sound.aacPackets.size();
-    } else if (!plan.aac && !sound.pcm.empty()) {
-        if (sound.pcm.size() % sound.channels != 0) {
+    } else if (!plan.aac && (!sound.pcm.empty() || !sound.widePcm.empty())) {
+        const size_t given = sound.widePcm.empty() ? sound.pcm.size() : sound.widePcm.size();
+        if (given % sound.channels != 0) {
             return PlanFail(error, "PCM sample count is not a multiple of the channel count");
         }
-        if (samples != 0 && samples != sound.pcm.size() / sound.channels) {
+        if (samples != 0 && samples != given / sound.channels) {
             return PlanFail(error, "sampleCount differs from the PCM frames given");
         }
-        samples = sound.pcm.size() / sound.channels;
+        samples = given / sound.channels;
     }
     if (!sound.chunkSampleCounts.empty()) {
         uint64_t sum = 0;
@@ -119,16 +120,29 @@ void ResolveAac(const MovieRecipe& recipe, MoviePlan& plan)
 bool PlanSound(const MovieRecipe& recipe, MoviePlan& plan, std::string* error)
 {
     const SoundRecipe& sound = recipe.sound;
-    if (sound.channels == 0 || sound.sampleRate == 0 || sound.sampleRate > 0xFFFF) {
-        return PlanFail(error, "sound needs 1 or more channels and a rate of 1 to 65535 Hz");
-    }
     plan.aac = sound.codec == SoundCodec::Aac;
+    if (sound.channels == 0 || sound.sampleRate == 0 || sound.sampleRate > (plan.aac ? 0xFFFF : 768000)) {
+        return PlanFail(error, "sound needs 1 or more channels and a rate of 1 to 65535 Hz (768 kHz for PCM)");
+    }
+    const bool widthKnown = sound.floatingPoint ? (sound.bits == 32 || sound.bits == 64)
+                                                : (sound.bits == 16 || sound.bits == 24 || sound.bits == 32);
+    if (!plan.aac && !widthKnown) {
+        return PlanFail(error, "PCM samples are 16, 24 or 32-bit integers or 32 or 64-bit floats");
+    }
     plan.littleEndianPcm = sound.codec == SoundCodec::Sowt;
-    plan.soundFormat = plan.aac ? "mp4a" : plan.littleEndianPcm ? "sowt" : "twos";
+    plan.deepPcm = !plan.aac && (sound.bits != 16 || sound.floatingPoint);
+    plan.version2Lpcm = !plan.aac && (sound.version2Lpcm || sound.sampleRate > 0xFFFF);
+    plan.sampleBytes = plan.aac ? 2 : sound.bits / 8U;
+    const char* deep = sound.floatingPoint ? (sound.bits == 32 ? "fl32" : "fl64") : (sound.bits == 24 ? "in24" : "in32");
+    plan.soundFormat = plan.aac                ? "mp4a"
+                       : plan.version2Lpcm     ? "lpcm"
+                       : plan.deepPcm          ? deep
+                       : plan.littleEndianPcm ? "sowt"
+                                               : "twos";
     if (!sound.formatOverride.empty()) {
         plan.soundFormat = sound.formatOverride;
     }
-    plan.bytesPerFrame = 2U * sound.channels;
+    plan.bytesPerFrame = plan.sampleBytes * sound.channels;
     if (plan.aac && sound.aacPackets.empty() && sound.channels > 2) {
         return PlanFail(error, "generated AAC packets are mono or stereo; give packets for more channels");
     }

@@ -17,14 +17,14 @@ namespace {
 constexpr const char* kUsage =
     "usage: tqovix compare [--png FILE] [--json] SRC DST\n"
     "  measures what processing did to SRC's sound in DST: per AF interval the level before\n"
-    "  and after and the reduction, elsewhere how many frames differ (PCM: none should) or\n"
-    "  the largest difference (AAC), and DST's offset against SRC in frames; --png draws both\n"
-    "  spectrograms with the AF intervals and the level difference over time; -q prints only\n"
-    "  why a comparison fails\n"
+    "  and after and the reduction, elsewhere how many frames differ (PCM of any depth: none\n"
+    "  should) or the largest difference (AAC, in 16-bit steps), and DST's offset against SRC\n"
+    "  in frames; --png draws both spectrograms with the AF intervals and the level difference\n"
+    "  over time; -q prints only why a comparison fails\n"
     "  exit status: 0 compared, 1 DST is not the processed form of SRC (the same file, its AF\n"
-    "  information not marked processed, or its sound differs in rate, channels or length, or\n"
-    "  does not match), either sound stops short of what its tables\n"
-    "  promise, or a file is unreadable; 2 usage\n";
+    "  information not marked processed, or its sound differs in rate, channels, sample format\n"
+    "  or length, or does not match), either sound stops short of what its tables promise, or\n"
+    "  a file is unreadable; 2 usage\n";
 
 bool SameFile(const std::string& a, const std::string& b)
 {
@@ -50,10 +50,11 @@ double Seconds(uint64_t frame, uint32_t rate) { return static_cast<double>(frame
 void PrintJson(const std::string& source, const std::string& destination, const SoundComparison& c,
                const std::string& png)
 {
+    const std::string bits = c.aac ? "null" : std::to_string(c.bits);
     std::printf("{\"version\":1,\"source\":%s,\"destination\":%s,\"compared\":true,\"rate\":%u,\"channels\":%u,\"frames\":%" PRIu64
-                ",\"codec\":\"%s\",\"intervals\":[",
+                ",\"codec\":\"%s\",\"bits\":%s,\"float\":%s,\"intervals\":[",
                 JsonString(source).c_str(), JsonString(destination).c_str(), c.rate, c.channels, c.frames,
-                c.aac ? "aac" : "pcm");
+                c.aac ? "aac" : "pcm", bits.c_str(), c.floatingPoint ? "true" : "false");
     for (size_t i = 0; i < c.intervals.size(); ++i) {
         const IntervalLevels& l = c.intervals[i];
         std::printf("%s{\"startFrame\":%" PRIu64 ",\"endFrame\":%" PRIu64
@@ -71,7 +72,7 @@ void PrintText(const std::string& source, const std::string& destination, const 
                const std::string& png)
 {
     std::printf("%s -> %s: %s, %u Hz, %u channels, %.3f s\n", source.c_str(), destination.c_str(),
-                c.aac ? "AAC" : "PCM", c.rate, c.channels, Seconds(c.frames, c.rate));
+                c.format.c_str(), c.rate, c.channels, Seconds(c.frames, c.rate));
     for (size_t i = 0; i < c.intervals.size(); ++i) {
         const IntervalLevels& l = c.intervals[i];
         std::printf("  AF interval %zu: %.3f-%.3f s  before %.1f dB  after %.1f dB  reduction %.1f dB\n", i + 1,
@@ -82,7 +83,8 @@ void PrintText(const std::string& source, const std::string& destination, const 
         std::printf("  no AF intervals\n");
     }
     if (c.aac) {
-        std::printf("  outside the intervals: largest difference %d (re-encoded)\n", c.largestDifference);
+        std::printf("  outside the intervals: largest difference %d (re-encoded, in 16-bit steps)\n",
+                    c.largestDifference);
     } else {
         std::printf("  outside the intervals: %" PRIu64 " frames differ\n", c.differingFrames);
     }
@@ -137,7 +139,7 @@ int CompareCommand(const Arguments& arguments)
     }
     SoundComparison comparison;
     const std::string why = CompareSounds(paths[0], paths[1], comparison,
-                                          [&](const int16_t* a, const int16_t* b, uint64_t first, uint64_t frames) {
+                                          [&](const double* a, const double* b, uint64_t first, uint64_t frames) {
                                               if (drawing) {
                                                   picture.Add(a, b, first, frames);
                                               }

@@ -84,6 +84,13 @@ std::vector<InspectedTrack> CollectTracks(const CTqovixAtomControl& tree, const 
                 track.channels = tables.soundEntry->channels;
                 track.bits = tables.soundEntry->bitsPerChannel;
                 track.aac = TqovixSoundEntry::IsAac(*tables.soundEntry);
+                std::string why;
+                const auto layout = TqovixSoundEntry::IsPcmFormat(*tables.soundEntry)
+                                        ? TqovixSoundEntry::ReadPcmLayout(*tables.soundEntry, why)
+                                        : std::nullopt;
+                track.pcmKnown = layout.has_value();
+                track.floatingPoint = layout && layout->floating;
+                track.littleEndian = layout && layout->littleEndian;
             }
             const uint32_t frameBytes = sound && tables.soundEntry && TqovixSoundEntry::IsPcmFormat(*tables.soundEntry)
                                             ? TqovixSoundEntry::FrameBytes(*tables.soundEntry)

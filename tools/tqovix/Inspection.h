@@ -19,6 +19,10 @@ struct InspectedTrack {
     bool aac = false;
     uint32_t channels = 0;
     uint32_t bits = 0;
+    // PCM as the description lays it out; unknown for a kind we do not process.
+    bool pcmKnown = false;
+    bool floatingPoint = false;
+    bool littleEndian = false;
     uint64_t samples = 0;
     size_t chunks = 0;
 };

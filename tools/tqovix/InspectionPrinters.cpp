@@ -21,6 +21,9 @@ std::string TrackJson(const InspectedTrack& t)
     track.Add("samples", t.samples).Add("chunks", static_cast<uint64_t>(t.chunks));
     if (t.handler == "soun") {
         track.Add("channels", t.channels).Add("bits", t.bits).Add("aac", t.aac);
+        if (t.pcmKnown) {
+            track.Add("float", t.floatingPoint).Add("littleEndian", t.littleEndian);
+        }
     }
     return track.Text();
 }
@@ -134,7 +137,11 @@ void PrintInspectionText(const Inspection& in, bool summaryOnly)
             std::printf("  %-4s  %-4s  %.*f %s", t.handler.c_str(), t.codec.c_str(), sound ? 0 : 3, t.rate,
                         sound ? "Hz" : "fps");
             if (sound) {
-                std::printf("  %u ch  %s", t.channels, t.aac ? "AAC" : (std::to_string(t.bits) + " bit").c_str());
+                const std::string kind = t.aac        ? "AAC"
+                                         : !t.pcmKnown ? std::to_string(t.bits) + " bit"
+                                                       : std::to_string(t.bits) + (t.floatingPoint ? " bit float" : " bit") +
+                                                             (t.littleEndian ? " little-endian" : " big-endian");
+                std::printf("  %u ch  %s", t.channels, kind.c_str());
             }
             if (t.known) {
                 std::printf("  %" PRIu64 " %s  %zu chunks", t.samples, t.aac ? "packets" : "samples", t.chunks);

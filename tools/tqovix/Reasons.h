@@ -1,6 +1,6 @@
 // Why a movie is refused or a job failed: one table of reasons, each worded once, used by
 // every command and by the JSON reports. The exported code says little (8 covers a text
-// file and a 24-bit movie alike); the reason is found from the paths and the file itself.
+// file and an 8-bit movie alike); the reason is found from the paths and the file itself.
 #pragma once
 
 #include <cstdint>

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cmath>
 #include <cstdio>
+#include <cstring>
 #include <utility>
 
 namespace {
@@ -40,21 +41,23 @@ std::string MeasureOffset(const std::string& sourcePath, const std::string& dest
         return "cannot be read twice";
     }
     const uint64_t length = std::min<uint64_t>(a.Frames(), kWindowFrames + 3 * kMaxOffset);
-    std::vector<int16_t> sa(length * a.Channels());
-    std::vector<int16_t> sb(length * b.Channels());
-    const uint64_t na = a.Read(sa.data(), length);
-    const uint64_t nb = b.Read(sb.data(), length);
-    const auto mono = [](const std::vector<int16_t>& s, uint32_t channels, uint64_t frames) {
+    const auto mono = [length](SoundStream& stream, uint64_t& frames) {
+        std::vector<uint8_t> raw(length * stream.FrameBytes());
+        frames = stream.Read(raw.data(), length);
+        std::vector<double> levels(frames * stream.Channels());
+        stream.Levels(raw.data(), frames, levels.data());
         std::vector<double> m(frames);
         for (uint64_t f = 0; f < frames; ++f) {
-            for (uint32_t c = 0; c < channels; ++c) {
-                m[f] += s[f * channels + c];
+            for (uint32_t c = 0; c < stream.Channels(); ++c) {
+                m[f] += levels[f * stream.Channels() + c];
             }
         }
         return m;
     };
-    const std::vector<double> ma = mono(sa, a.Channels(), na);
-    const std::vector<double> mb = mono(sb, b.Channels(), nb);
+    uint64_t na = 0;
+    uint64_t nb = 0;
+    const std::vector<double> ma = mono(a, na);
+    const std::vector<double> mb = mono(b, nb);
     // The encoder's lead-in is no part of the comparison: start a packet in.
     const auto from = static_cast<int64_t>(std::min<uint64_t>(na, kMaxOffset));
     const auto to = static_cast<int64_t>(na);
@@ -84,11 +87,11 @@ std::string MeasureOffset(const std::string& sourcePath, const std::string& dest
 
 // As many frames as asked, unless the sound ends: blocks of both sounds then cover the same
 // frames, however the stream happens to hand them out.
-uint64_t ReadBlock(SoundStream& stream, int16_t* samples, uint64_t frames)
+uint64_t ReadBlock(SoundStream& stream, uint8_t* samples, uint64_t frames)
 {
     uint64_t done = 0;
     while (done < frames) {
-        const uint64_t got = stream.Read(samples + done * stream.Channels(), frames - done);
+        const uint64_t got = stream.Read(samples + done * stream.FrameBytes(), frames - done);
         if (got == 0) {
             break;
         }
@@ -129,6 +132,10 @@ std::string CompareSounds(const std::string& sourcePath, const std::string& dest
         return different + "its sound differs in channels: " + std::to_string(destination.Channels()) +
                " against " + std::to_string(source.Channels()) + ")";
     }
+    if (source.Describe() != destination.Describe()) {
+        result.reason = "format-differs";
+        return different + "its sound is " + destination.Describe() + " against " + source.Describe() + ")";
+    }
     if (source.Frames() != destination.Frames()) {
         result.reason = "length-differs";
         return different + "its sound differs in length: " + std::to_string(destination.Frames()) + " frames (" +
@@ -140,42 +147,52 @@ std::string CompareSounds(const std::string& sourcePath, const std::string& dest
     result.channels = source.Channels();
     result.frames = source.Frames();
     result.aac = source.IsAac();
+    result.format = source.Describe();
+    result.bits = result.aac ? 0 : source.Bits();
+    result.floatingPoint = source.IsFloatingPoint();
     const uint64_t ramp = result.rate / 100;  // the processing library's ramps
     const std::vector<SoundInterval>& intervals = source.Intervals();
     std::vector<double> before(intervals.size());
     std::vector<double> after(intervals.size());
     std::vector<uint64_t> counted(intervals.size());
-    std::vector<int16_t> a(kBlockFrames * result.channels);
-    std::vector<int16_t> b(kBlockFrames * result.channels);
+    const uint64_t frameBytes = source.FrameBytes();
+    std::vector<uint8_t> rawA(kBlockFrames * frameBytes);
+    std::vector<uint8_t> rawB(kBlockFrames * frameBytes);
+    std::vector<double> a(kBlockFrames * result.channels);
+    std::vector<double> b(kBlockFrames * result.channels);
+    double largest = 0;
     uint64_t first = 0;
     while (first < result.frames) {
-        const uint64_t na = ReadBlock(source, a.data(), kBlockFrames);
-        const uint64_t nb = ReadBlock(destination, b.data(), kBlockFrames);
+        const uint64_t na = ReadBlock(source, rawA.data(), kBlockFrames);
+        const uint64_t nb = ReadBlock(destination, rawB.data(), kBlockFrames);
         const uint64_t n = std::min(na, nb);
         if (n == 0) {
             break;
         }
+        source.Levels(rawA.data(), n, a.data());
+        destination.Levels(rawB.data(), n, b.data());
         for (uint64_t f = 0; f < n; ++f) {
             const uint64_t frame = first + f;
-            const int16_t* x = a.data() + f * result.channels;
-            const int16_t* y = b.data() + f * result.channels;
+            const double* x = a.data() + f * result.channels;
+            const double* y = b.data() + f * result.channels;
             for (size_t i = 0; i < intervals.size(); ++i) {
                 if (frame >= intervals[i].start && frame < intervals[i].end) {
                     for (uint32_t c = 0; c < result.channels; ++c) {
-                        before[i] += static_cast<double>(x[c]) * x[c];
-                        after[i] += static_cast<double>(y[c]) * y[c];
+                        before[i] += x[c] * x[c];
+                        after[i] += y[c] * y[c];
                     }
                     counted[i] += result.channels;
                 }
             }
-            if (Outside(frame, intervals, ramp)) {
-                bool differs = false;
+            // Bytes decide whether a frame changed, as they do for the job, whatever floats make of them.
+            if (Outside(frame, intervals, ramp) &&
+                std::memcmp(rawA.data() + f * frameBytes, rawB.data() + f * frameBytes, frameBytes) != 0) {
+                ++result.differingFrames;
                 for (uint32_t c = 0; c < result.channels; ++c) {
-                    const int difference = std::abs(int{x[c]} - int{y[c]});
-                    result.largestDifference = std::max(result.largestDifference, difference);
-                    differs = differs || difference != 0;
+                    const double difference = std::abs(x[c] - y[c]);
+                    largest = difference > largest ? difference : largest;
                 }
-                result.differingFrames += differs ? 1 : 0;
+                largest = std::max(largest, 1e-300);  // a changed frame is never a difference of 0
             }
         }
         if (sink) {
@@ -197,6 +214,7 @@ std::string CompareSounds(const std::string& sourcePath, const std::string& dest
                Seconds(stopped.Position(), result.rate) + " of the " + Seconds(result.frames, result.rate) +
                " its tables promise";
     }
+    result.largestDifference = static_cast<int>(std::min(std::ceil(largest), 1e9));
     for (size_t i = 0; i < intervals.size(); ++i) {
         result.intervals.push_back({intervals[i], Decibels(before[i], counted[i]), Decibels(after[i], counted[i])});
     }

@@ -21,19 +21,26 @@ struct SoundComparison {
     uint32_t channels = 0;
     uint64_t frames = 0;
     bool aac = false;
+    std::string format;  // the source's sound in words: "24-bit little-endian PCM", "AAC"
+    uint32_t bits = 0;  // PCM: each sample's width
+    bool floatingPoint = false;
     std::vector<IntervalLevels> intervals;
-    uint64_t differingFrames = 0;  // outside the intervals and their ramps
-    int largestDifference = 0;     // of one sample, outside them
+    uint64_t differingFrames = 0;  // outside the intervals and their ramps, by their bytes
+    // Of one sample outside them, in 16-bit steps rounded up whatever the depth: 0 only when
+    // every sample there is as it was.
+    int largestDifference = 0;
     int64_t offset = 0;            // the destination's lag behind the source, in frames
     double correlation = 0;        // at that lag
     // When the two cannot be compared, the kind in words: "unreadable", "tables-inconsistent"
     // (the time table and the chunks disagree), "rate-differs", "channels-differ",
-    // "length-differs", "sound-stops-early" (before what its tables promise) or "sound-differs".
+    // "format-differs" (another depth or kind of sample), "length-differs", "sound-stops-early"
+    // (before what its tables promise) or "sound-differs".
     std::string reason;
 };
 
-// Sees every block of both sounds as it streams by (interleaved frames from `first` on).
-using SoundBlockSink = std::function<void(const int16_t* source, const int16_t* destination, uint64_t first,
+// Sees every block of both sounds as it streams by (interleaved frames from `first` on, on the
+// 16-bit scale whatever the format).
+using SoundBlockSink = std::function<void(const double* source, const double* destination, uint64_t first,
                                           uint64_t frames)>;
 
 // Empty on success, else why the two cannot be compared (then the movie is not the processed

@@ -4,6 +4,8 @@
 #include <cstring>
 
 #include <algorithm>
+#include <cmath>
+#include <optional>
 
 #include "atom/CTqovixAtomControl.h"
 #include "atom/TqovixEndian.h"
@@ -101,11 +103,22 @@ std::string SoundStream::Open(const std::string& path)
     m_bAac = information.GetAudioSpecificConfigSize() != 0;
     m_rate = information.GetSampleRateHz();
     m_channels = information.GetChannel();
-    const bool pcm16 = !m_bAac && information.GetSize() == 16 && information.GetFrameBytes() == 2 * m_channels;
-    if (chunks.empty() || m_rate == 0 || m_channels == 0 || m_channels > 8 || (!m_bAac && !pcm16)) {
-        return "sound that is neither 16-bit PCM nor AAC";
+    if (chunks.empty() || m_rate == 0 || m_channels == 0 || m_channels > 8) {
+        return "sound that is neither PCM nor AAC of 1 to 8 channels";
     }
-    if (TqovixFailed(m_audio->Initialize(*m_file, chunks, information.IsBigEndianFormat()))) {
+    if (!m_bAac) {
+        std::string why;
+        const auto layout = TqovixSoundEntry::IsPcmFormat(information.GetEntry())
+                                ? TqovixSoundEntry::ReadPcmLayout(information.GetEntry(), why)
+                                : std::nullopt;
+        if (!layout) {
+            return why.empty() ? "sound that is neither PCM nor AAC" : why;
+        }
+        m_bits = layout->bits;
+        m_bFloatingPoint = layout->floating;
+        m_bLittleEndianTrack = layout->littleEndian;
+    }
+    if (TqovixFailed(m_audio->Initialize(*m_file, chunks, information.IsBigEndianFormat(), m_bits / 8))) {
         return "the sound cannot be read";
     }
     // The decoder gives up its first packet: what stays is the track less one packet.
@@ -130,20 +143,58 @@ std::string SoundStream::Open(const std::string& path)
     return "";
 }
 
-uint64_t SoundStream::Read(int16_t* samples, uint64_t frames)
+uint64_t SoundStream::Read(uint8_t* samples, uint64_t frames)
 {
     frames = std::min(frames, m_frames - m_position);
-    const uint64_t bytes = frames * m_channels * sizeof(int16_t);
+    const uint64_t frameBytes = FrameBytes();
+    const uint64_t bytes = frames * frameBytes;
+    // Whole frames a call, so that no sample is cut between two.
+    const uint64_t piece = (1 << 20) / frameBytes * frameBytes;
     uint64_t done = 0;
     while (done < bytes) {
         unsigned long got = 0;
-        const auto wanted = static_cast<unsigned long>(std::min<uint64_t>(bytes - done, 1 << 20));
-        if (TqovixFailed(m_audio->PopAudioData(reinterpret_cast<uint8_t*>(samples) + done, &got, wanted)) || got == 0) {
+        const auto wanted = static_cast<unsigned long>(std::min<uint64_t>(bytes - done, piece));
+        if (TqovixFailed(m_audio->PopAudioData(samples + done, &got, wanted)) || got == 0) {
             break;
         }
         done += got;
     }
-    const uint64_t read = done / (m_channels * sizeof(int16_t));
+    const uint64_t read = done / frameBytes;
     m_position += read;
     return read;
+}
+
+void SoundStream::Levels(const uint8_t* samples, uint64_t frames, double* out) const
+{
+    const uint64_t count = frames * m_channels;
+    const uint32_t width = m_bits / 8;
+    for (uint64_t k = 0; k < count; ++k) {
+        const uint8_t* at = samples + k * width;
+        if (m_bFloatingPoint && width == 4) {
+            float value;
+            std::memcpy(&value, at, 4);
+            out[k] = static_cast<double>(value) * 32768.0;
+        } else if (m_bFloatingPoint) {
+            double value;
+            std::memcpy(&value, at, 8);
+            out[k] = value * 32768.0;
+        } else {
+            // Little-endian two's complement of any width, scaled to 16 bits.
+            uint64_t bits = 0;
+            for (uint32_t b = 0; b < width; ++b) {
+                bits |= uint64_t{at[b]} << (8 * b);
+            }
+            const unsigned shift = 64 - 8 * width;
+            out[k] = std::ldexp(static_cast<double>(static_cast<int64_t>(bits << shift) >> shift), 16 - static_cast<int>(m_bits));
+        }
+    }
+}
+
+std::string SoundStream::Describe() const
+{
+    if (m_bAac) {
+        return "AAC";
+    }
+    return std::to_string(m_bits) + (m_bFloatingPoint ? "-bit float" : "-bit") +
+           (m_bLittleEndianTrack ? " little-endian" : " big-endian") + " PCM";
 }

@@ -1,6 +1,7 @@
 // The sound of a movie as the processing library is served it: the first sound track,
-// decoded through our own pipeline (byte-swapped PCM or AAC through the codecs), frame
-// by frame, with the AF intervals of its maker block placed on the same frames.
+// decoded through our own pipeline (byte-swapped PCM of any depth we process, or AAC
+// through the codecs), frame by frame, with the AF intervals of its maker block placed on
+// the same frames.
 #pragma once
 
 #include <cstdint>
@@ -31,13 +32,20 @@ public:
     uint32_t Channels() const { return m_channels; }
     uint64_t Frames() const { return m_frames; }
     bool IsAac() const { return m_bAac; }
+    // How the frames Read gives are stored (AAC: the decoder's 16-bit integers), and in words.
+    uint32_t Bits() const { return m_bits; }
+    bool IsFloatingPoint() const { return m_bFloatingPoint; }
+    uint32_t FrameBytes() const { return m_channels * (m_bits / 8); }
+    std::string Describe() const;
     // Open refused the movie because its sound tables disagree with its chunks.
     bool HasInconsistentTables() const { return m_bInconsistentTables; }
     // The AF intervals of the "AFR1" maker block, on this stream's frames; none for a foreign block.
     const std::vector<SoundInterval>& Intervals() const { return m_intervals; }
-    // Up to `frames` interleaved frames; fewer at the end, or where the sound stops short of
-    // Frames() (a chunk that cannot be read or decoded).
-    uint64_t Read(int16_t* samples, uint64_t frames);
+    // Up to `frames` interleaved frames, FrameBytes() each, samples in host order; fewer at the
+    // end, or where the sound stops short of Frames() (a chunk that cannot be read or decoded).
+    uint64_t Read(uint8_t* samples, uint64_t frames);
+    // Read's samples on the 16-bit scale (full scale 32768), whatever their format.
+    void Levels(const uint8_t* samples, uint64_t frames, double* out) const;
     // Frames read so far.
     uint64_t Position() const { return m_position; }
 
@@ -51,5 +59,8 @@ private:
     uint64_t m_position = 0;
     bool m_bAac = false;
     bool m_bInconsistentTables = false;
+    uint32_t m_bits = 16;
+    bool m_bFloatingPoint = false;
+    bool m_bLittleEndianTrack = false;
     std::vector<SoundInterval> m_intervals;
 };

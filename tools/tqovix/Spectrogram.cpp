@@ -114,17 +114,18 @@ std::string Spectrogram::Begin(uint32_t rate, uint32_t channels, uint64_t frames
     return "";
 }
 
-void Spectrogram::Add(const int16_t* source, const int16_t* processed, uint64_t, uint64_t frames)
+void Spectrogram::Add(const double* source, const double* processed, uint64_t, uint64_t frames)
 {
     for (uint64_t f = 0; f < frames && m_column < kPlotWidth; ++f) {
-        float a = 0;
-        float b = 0;
+        double sumA = 0;
+        double sumB = 0;
         for (uint32_t c = 0; c < m_channels; ++c) {
-            a += source[f * m_channels + c];
-            b += processed[f * m_channels + c];
+            sumA += source[f * m_channels + c];
+            sumB += processed[f * m_channels + c];
         }
-        a /= static_cast<float>(m_channels);
-        b /= static_cast<float>(m_channels);
+        // Floats may be louder than full scale, or not numbers at all: the picture shows what it can.
+        const auto a = static_cast<float>(std::isfinite(sumA) ? std::clamp(sumA / m_channels, -1e6, 1e6) : 0.0);
+        const auto b = static_cast<float>(std::isfinite(sumB) ? std::clamp(sumB / m_channels, -1e6, 1e6) : 0.0);
         m_sourceRing[m_ringAt] = a;
         m_processedRing[m_ringAt] = b;
         m_ringAt = (m_ringAt + 1) % kFftSize;

@@ -29,7 +29,8 @@ public:
 
     // Empty on success; otherwise why no picture can be made (no FFT to be had).
     std::string Begin(uint32_t rate, uint32_t channels, uint64_t frames, const std::vector<SoundInterval>& intervals);
-    void Add(const int16_t* source, const int16_t* processed, uint64_t first, uint64_t frames);
+    // Interleaved frames on the 16-bit scale, whatever the sound's format.
+    void Add(const double* source, const double* processed, uint64_t first, uint64_t frames);
     // Draws the axes, the legend and the marks, and writes the PNG; empty on success.
     std::string Save(const std::string& path);
 

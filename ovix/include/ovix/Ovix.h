@@ -14,14 +14,19 @@
 inline constexpr unsigned long kOvixMaxBlockSize = 16ul << 20;
 
 // Library-form records: a size field first, so a host built against another layout is refused.
+// Sound moves interleaved and packed, in host byte order (little-endian), each sample
+// bitsPerSample bits wide; what the library pushes back has the format it pulled.
 struct TqovixAudioInformation {
-    unsigned long size;  // 48
+    unsigned long size;  // 64; 48 from hosts of the first layout, which ends at `padding`
     unsigned long sampleRate;  // kHz, integer: 48 for 48 000 Hz, 44 for 44 100 Hz
     unsigned long channels;
-    unsigned long bitsPerSample;
+    unsigned long bitsPerSample;  // 16, 24 or 32 for signed integers; 32 or 64 for floats
     unsigned long sampleCount;  // PCM sample frames of the track
     unsigned int startOffset;  // frames; a wrapped negative difference is taken as negative
     unsigned int padding;
+    // Added to the first layout (a 48-byte record means 16-bit integers at sampleRate's kHz):
+    unsigned long sampleRateHz;  // the exact rate; 0 takes it from sampleRate
+    unsigned long floatingPoint;  // 1: IEEE floats; 0: signed integers
 };
 
 struct TqovixTrimInformation {
@@ -32,7 +37,10 @@ struct TqovixTrimInformation {
     unsigned long removedFrameBackward;
 };
 
-static_assert(sizeof(TqovixAudioInformation) == 48 && offsetof(TqovixAudioInformation, startOffset) == 40);
+static_assert(sizeof(TqovixAudioInformation) == 64 && offsetof(TqovixAudioInformation, startOffset) == 40 &&
+              offsetof(TqovixAudioInformation, sampleRateHz) == 48);
+// The first layout's size: hosts that send it are served 16-bit integer sound.
+inline constexpr unsigned long kOvixFirstAudioRecordSize = 48;
 static_assert(sizeof(TqovixTrimInformation) == 40 && offsetof(TqovixTrimInformation, removedFrameBackward) == 32);
 
 // Input: buffer (null asks for the total size), out: bytes delivered, buffer size, bytes to skip.
