@@ -36,6 +36,9 @@ public:
     virtual eConverterErrorCode EncodeDone();
 
     eConverterErrorCode SetEncodeBitRate(unsigned int bitRate);
+    // After Initialize, before the first push: how many frames to drop instead of kDroppedFrames
+    // (a span re-encoded from within the track keeps them all and places itself).
+    void SetDroppedFrames(unsigned int frames);
 
     static OSStatus EncoderDataProc(AudioConverterRef converter, UInt32* ioNumberDataPackets,
                                     AudioBufferList* ioData, AudioStreamPacketDescription** outPacketDescription,
