@@ -143,6 +143,8 @@ void CTqovixMovControl::Close()
     m_outputAudioChunkIndex = 0;
     m_outputMovieDataChunkIndex = 0;
     m_samplesInOutputChunk = 0;
+    m_sourceBytesInChunk = 0;
+    m_chunkFirstPacket.clear();
     m_bytesInOutputChunk = 0;
     m_mediaDataSize = 0;
     m_mediaDataSizePosition = 0;
@@ -243,6 +245,15 @@ eTqovixErrorCode CTqovixMovControl::GetAudioInformation(TqovixInterfaceConvert::
     if (TqovixFailed(opened)) {
         return opened;
     }
+    try {
+        m_chunkFirstPacket.assign(1, 0);
+        for (const TqovixChunkInformation& chunk : m_audioChunks) {
+            m_chunkFirstPacket.push_back(m_chunkFirstPacket.back() + chunk.sampleCount);
+        }
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    m_audioDataControl.PlanSplicing(m_chunkFirstPacket.back(), false);
     record.sampleRate /= 1000;
     record.sampleCount *= 1024;
     return eTqovixSuccess;

@@ -30,7 +30,7 @@ enum class eTqovixRefusal {
     Malformed,          // tables that contradict each other or point past the end
 };
 
-class CTqovixMovControl {
+class CTqovixMovControl : public CTqovixAacSplicer::Sink {
 public:
     CTqovixMovControl() = default;
     CTqovixMovControl(const CTqovixMovControl&) = delete;
@@ -63,7 +63,10 @@ public:
     eTqovixErrorCode WriteMovieMetaData();
     // Source position to destination position through m_copyBuffer, for files the kernel cannot copy between.
     eTqovixErrorCode CopyThroughBuffer(uint32_t size);
-    static void EncodeCallback(void* user, unsigned char* packet, int size);
+    // The AAC splicer's writer: packets in track order, the source's own or re-encoded.
+    eTqovixErrorCode CarrySourcePackets(uint64_t count) override;
+    eTqovixErrorCode WriteEncodedPacket(const uint8_t* packet, uint32_t size) override;
+    eTqovixErrorCode ReadSourcePacket(uint64_t index, std::vector<uint8_t>& packet) override;
     eTqovixErrorCode SetMovieDataInformation(const void* afInformation, unsigned long size);
     // Every sound and video chunk is in the destination (the moov may still be missing).
     bool IsMediaDataComplete() const;
@@ -71,7 +74,7 @@ public:
     bool IsDestinationComplete() const { return m_bDestinationComplete; }
     // Gives the complete destination its name, replacing what stood there in one step.
     eTqovixErrorCode PublishDestination() { return m_destinationFile.Publish(false, &m_sourceFile); }
-    // True once after EncodeCallback has written the last packet. The job is finished
+    // True once after the splicer has handed over the last packet. The job is finished
     // only after the encoder has returned, so that no codec is closed under its own feet.
     bool TakeFinishPending();
     // AAC: makes the encoder give up what it holds when the library has ended early.
@@ -118,6 +121,11 @@ private:
     eTqovixErrorCode WriteMediaDataHeader(const TqovixAtomList& atoms);
     eTqovixErrorCode WritePcm(const uint8_t* data, unsigned long size, bool swap);
     eTqovixErrorCode WriteAacPacket(const uint8_t* packet, unsigned long size);
+    // Where the next packet of the current sound chunk starts, opening the chunk when it is new.
+    eTqovixErrorCode BeginAacPacket(TqovixChunkInformation*& output);
+    void EndAacPackets(uint64_t count);
+    // Counts a packet write's answer: 0 once the last sound chunk is complete.
+    eTqovixErrorCode NotePacketResult(eTqovixErrorCode result);
     eTqovixErrorCode CopyPrecedingVideo();
     eTqovixErrorCode CopyRemainingVideo();
     eTqovixErrorCode CopySourceSoundTail();
@@ -155,6 +163,8 @@ private:
     uint64_t m_outputAudioChunkIndex = 0;
     uint64_t m_outputMovieDataChunkIndex = 0;
     uint32_t m_samplesInOutputChunk = 0;
+    uint64_t m_sourceBytesInChunk = 0;  // AAC: bytes of the source chunk's packets written so far
+    std::vector<uint64_t> m_chunkFirstPacket;  // AAC: each sound chunk's first packet, then the count
     uint32_t m_bytesInOutputChunk = 0;
     uint64_t m_mediaDataSize = 0;
     int64_t m_mediaDataSizePosition = 0;

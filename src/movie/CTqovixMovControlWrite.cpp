@@ -82,6 +82,49 @@ eTqovixErrorCode CTqovixMovControl::WriteMetaData(const void* data, unsigned lon
     return WriteAacPacket(static_cast<const uint8_t*>(data), size);
 }
 
+eTqovixErrorCode CTqovixMovControl::BeginAacPacket(TqovixChunkInformation*& output)
+{
+    const eTqovixErrorCode result = CopyPrecedingVideo();
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    const uint64_t a = m_outputAudioChunkIndex;
+    try {
+        if (a >= m_outputAudioChunks.size()) {
+            m_outputAudioChunks.resize(a + 1);
+        }
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    output = &m_outputAudioChunks[a];
+    if (m_samplesInOutputChunk == 0) {
+        long long position = 0;
+        const eTqovixErrorCode found = m_destinationFile.GetPosition(&position);
+        if (TqovixFailed(found)) {
+            return found;
+        }
+        output->size = 0;
+        output->offset = static_cast<uint64_t>(position);
+        output->sampleSizes.clear();
+        m_sourceBytesInChunk = 0;
+    }
+    return eTqovixSuccess;
+}
+
+void CTqovixMovControl::EndAacPackets(uint64_t count)
+{
+    const uint64_t a = m_outputAudioChunkIndex;
+    const TqovixChunkInformation& source = m_audioChunks[a];
+    m_samplesInOutputChunk += static_cast<uint32_t>(count);
+    if (m_samplesInOutputChunk >= source.sampleCount) {
+        m_outputAudioChunks[a].chunkNumber = source.chunkNumber;
+        m_outputAudioChunks[a].sampleCount = source.sampleCount;
+        m_samplesInOutputChunk = 0;
+        m_outputAudioChunkIndex = a + 1;
+        m_audioDataControl.SetOutputChunkIndex(m_outputAudioChunkIndex);
+    }
+}
+
 eTqovixErrorCode CTqovixMovControl::WriteAacPacket(const uint8_t* packet, unsigned long size)
 {
     const uint64_t count = m_audioChunks.size();
@@ -91,60 +134,145 @@ eTqovixErrorCode CTqovixMovControl::WriteAacPacket(const uint8_t* packet, unsign
     if (packet == nullptr || size == 0 || size > kMax32) {
         return eTqovixErrorInternal;
     }
-    eTqovixErrorCode result = CopyPrecedingVideo();
+    TqovixChunkInformation* output = nullptr;
+    eTqovixErrorCode result = BeginAacPacket(output);
     if (TqovixFailed(result)) {
         return result;
     }
-    const uint64_t a = m_outputAudioChunkIndex;
+    const TqovixChunkInformation& source = m_audioChunks[m_outputAudioChunkIndex];
+    if (uint64_t{output->size} + size > kMax32 || m_samplesInOutputChunk >= source.sampleSizes.size()) {
+        return eTqovixErrorInternal;
+    }
     try {
-        if (a >= m_outputAudioChunks.size()) {
-            m_outputAudioChunks.resize(a + 1);
-        }
-        TqovixChunkInformation& output = m_outputAudioChunks[a];
-        if (m_samplesInOutputChunk == 0) {
-            long long position = 0;
-            result = m_destinationFile.GetPosition(&position);
-            if (TqovixFailed(result)) {
-                return result;
-            }
-            output.size = 0;
-            output.offset = static_cast<uint64_t>(position);
-            output.sampleSizes.clear();
-        }
-        if (uint64_t{output.size} + size > kMax32) {
-            return eTqovixErrorInternal;
-        }
-        output.sampleSizes.resize(m_samplesInOutputChunk + 1);
-        output.sampleSizes.back() = static_cast<uint32_t>(size);
-        result = m_destinationFile.Write(packet, static_cast<unsigned int>(size));
-        if (TqovixFailed(result)) {
-            return result;
-        }
-        output.size += static_cast<uint32_t>(size);
+        output->sampleSizes.push_back(static_cast<uint32_t>(size));
     } catch (const std::bad_alloc&) {
         return eTqovixErrorOutOfMemory;
     }
+    result = m_destinationFile.Write(packet, static_cast<unsigned int>(size));
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    output->size += static_cast<uint32_t>(size);
     m_mediaDataSize += size;
-    ++m_samplesInOutputChunk;
-    const TqovixChunkInformation& source = m_audioChunks[a];
-    if (m_samplesInOutputChunk >= source.sampleCount) {
-        m_outputAudioChunks[a].chunkNumber = source.chunkNumber;
-        m_outputAudioChunks[a].sampleCount = source.sampleCount;
-        m_samplesInOutputChunk = 0;
-        m_outputAudioChunkIndex = a + 1;
-        m_audioDataControl.SetOutputChunkIndex(m_outputAudioChunkIndex);
-    }
-    // Within two packets of the end the encoder may flush; a chunk of fewer than two
-    // packets must not wrap the count around.
-    const uint32_t lastCount = m_audioChunks.back().sampleCount;
-    if (m_outputAudioChunkIndex == count - 1 && m_samplesInOutputChunk >= (lastCount >= 2 ? lastCount - 2 : 0)) {
-        m_audioDataControl.SetOutputChunkIndex(count);
-    }
+    m_sourceBytesInChunk += source.sampleSizes[m_samplesInOutputChunk];
+    EndAacPackets(1);
     if (m_outputAudioChunkIndex >= count) {
         result = CopyRemainingVideo();
         return TqovixFailed(result) ? result : eTqovixSuccess;
     }
     return eTqovixRunning;
+}
+
+eTqovixErrorCode CTqovixMovControl::CarrySourcePackets(uint64_t count)
+{
+    eTqovixErrorCode result = eTqovixRunning;
+    while (count != 0 && !TqovixFailed(result)) {
+        if (m_outputAudioChunkIndex >= m_audioChunks.size()) {
+            return NotePacketResult(eTqovixErrorInternal);  // more packets than the track holds
+        }
+        TqovixChunkInformation* output = nullptr;
+        result = BeginAacPacket(output);
+        if (TqovixFailed(result)) {
+            break;
+        }
+        const TqovixChunkInformation& source = m_audioChunks[m_outputAudioChunkIndex];
+        const uint64_t first = m_samplesInOutputChunk;
+        const uint64_t n = std::min<uint64_t>(count, source.sampleCount - first);
+        if (first + n > source.sampleSizes.size()) {
+            return NotePacketResult(eTqovixErrorInternal);
+        }
+        uint64_t bytes = 0;
+        for (uint64_t k = first; k < first + n; ++k) {
+            bytes += source.sampleSizes[k];
+        }
+        if (uint64_t{output->size} + bytes > kMax32) {
+            return NotePacketResult(eTqovixErrorInternal);
+        }
+        // A run of the source's packets lies in one piece: the kernel copies it.
+        result = m_sourceFile.Seek(static_cast<long long>(source.offset + m_sourceBytesInChunk),
+                                   CTqovixFile::eTqovixSeekBegin);
+        bool copied = false;
+        if (!TqovixFailed(result) && bytes != 0) {
+            result = m_destinationFile.CopyFrom(m_sourceFile, bytes, &copied);
+            if (!TqovixFailed(result) && !copied) {
+                result = CopyThroughBuffer(static_cast<uint32_t>(bytes));
+            }
+        }
+        if (TqovixFailed(result)) {
+            break;
+        }
+        try {
+            output->sampleSizes.insert(output->sampleSizes.end(), source.sampleSizes.begin() + static_cast<std::ptrdiff_t>(first),
+                                       source.sampleSizes.begin() + static_cast<std::ptrdiff_t>(first + n));
+        } catch (const std::bad_alloc&) {
+            return NotePacketResult(eTqovixErrorOutOfMemory);
+        }
+        output->size += static_cast<uint32_t>(bytes);
+        m_mediaDataSize += bytes;
+        m_sourceBytesInChunk += bytes;
+        count -= n;
+        EndAacPackets(n);
+        result = eTqovixRunning;
+    }
+    if (!TqovixFailed(result) && m_outputAudioChunkIndex >= m_audioChunks.size()) {
+        result = CopyRemainingVideo();
+        result = TqovixFailed(result) ? result : eTqovixSuccess;
+    }
+    return NotePacketResult(result);
+}
+
+eTqovixErrorCode CTqovixMovControl::WriteEncodedPacket(const uint8_t* packet, uint32_t size)
+{
+    const eTqovixErrorCode result = WriteAacPacket(packet, size);
+    // More packets than the track holds is the splicer's mistake, not a finished movie.
+    return NotePacketResult(result == eTqovixFinished ? eTqovixErrorInternal : result);
+}
+
+eTqovixErrorCode CTqovixMovControl::NotePacketResult(eTqovixErrorCode result)
+{
+    // A failed packet must stay failed: later packets of the same push would hide it.
+    if (TqovixFailed(result)) {
+        m_encodeResult = TqovixFailed(m_encodeResult) ? m_encodeResult : result;
+        return result;
+    }
+    if (result == eTqovixSuccess) {
+        m_bFinishPending = true;
+    }
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::ReadSourcePacket(uint64_t index, std::vector<uint8_t>& packet)
+{
+    if (m_chunkFirstPacket.size() != m_audioChunks.size() + 1 || index >= m_chunkFirstPacket.back()) {
+        return eTqovixErrorInternal;
+    }
+    const auto after = std::upper_bound(m_chunkFirstPacket.begin(), m_chunkFirstPacket.end(), index);
+    const auto chunkIndex = static_cast<size_t>(after - m_chunkFirstPacket.begin() - 1);
+    const TqovixChunkInformation& chunk = m_audioChunks[chunkIndex];
+    const uint64_t k = index - m_chunkFirstPacket[chunkIndex];
+    if (k >= chunk.sampleSizes.size()) {
+        return eTqovixErrorInternal;
+    }
+    uint64_t offset = chunk.offset;
+    for (uint64_t i = 0; i < k; ++i) {
+        offset += chunk.sampleSizes[i];
+    }
+    const uint32_t size = chunk.sampleSizes[k];
+    // What the decoder took from this packet, a moment ago, was no larger.
+    if (size == 0 || size > CTqovixAudioDataControl::kReadPieceBytes) {
+        return eTqovixErrorInternal;
+    }
+    try {
+        packet.resize(size);
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    unsigned int got = 0;
+    const eTqovixErrorCode result = m_sourceFile.ReadAt(offset, packet.data(), size, &got);
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    return got == size ? eTqovixSuccess : eTqovixErrorInternal;
 }
 
 eTqovixErrorCode CTqovixMovControl::WritePcm(const uint8_t* data, unsigned long size, bool swap)
@@ -315,26 +443,6 @@ eTqovixErrorCode CTqovixMovControl::CopyThroughBuffer(uint32_t size)
         done += got;
     }
     return eTqovixSuccess;
-}
-
-void CTqovixMovControl::EncodeCallback(void* user, unsigned char* packet, int size)
-{
-    auto* self = static_cast<CTqovixMovControl*>(user);
-    if (self == nullptr || packet == nullptr || size <= 0) {
-        return;
-    }
-    if (size >= 7 && packet[0] == 0xFF && packet[1] >= 0xF0) {
-        packet += 7;
-        size -= 7;
-    }
-    // A failed packet must stay failed: later packets of the same push would hide it.
-    if (size == 0 || TqovixFailed(self->m_encodeResult)) {
-        return;
-    }
-    self->m_encodeResult = self->WriteMetaData(packet, static_cast<unsigned long>(size));
-    if (self->m_encodeResult == eTqovixSuccess) {
-        self->m_bFinishPending = true;
-    }
 }
 
 bool CTqovixMovControl::TakeFinishPending()
