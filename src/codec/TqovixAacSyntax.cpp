@@ -110,9 +110,18 @@ std::optional<DecoderConfig> ReadDecoderConfig(const uint8_t* data, size_t size)
         }
         config.shortFrames = *shortFrames == 1;
         config.dependsOnCoreCoder = *core == 1;
-        // A program configuration or a signalled extension (spectral band replication) after it
-        // is something our encoder does not write.
-        config.extension = *extension == 1 || config.channelConfiguration == 0 || !bits.RestIsZero();
+        // Writers may say outright that no spectral band replication follows (ffmpeg does); one
+        // that is present, a program configuration or anything else after it, ours does not write.
+        bool replication = false;
+        BitReader ahead = bits;
+        if (ahead.Read(11) == 0x2B7U) {
+            const std::optional<uint32_t> type = ReadObjectType(ahead);
+            const std::optional<uint32_t> present = type == 5U ? ahead.Read(1) : std::nullopt;
+            replication = present != 0U;
+            bits = ahead;
+        }
+        config.extension =
+            *extension == 1 || config.channelConfiguration == 0 || replication || !bits.RestIsZero();
     }
     return config;
 }

@@ -53,6 +53,7 @@ eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const cha
 {
     m_refusal.clear();
     m_refusalKind = eTqovixRefusal::None;
+    m_aacWholeReason.clear();
     if (sourcePath == nullptr || sourcePath[0] == '\0') {
         return eTqovixErrorSourceNotFound;
     }
@@ -245,15 +246,10 @@ eTqovixErrorCode CTqovixMovControl::GetAudioInformation(TqovixInterfaceConvert::
     if (TqovixFailed(opened)) {
         return opened;
     }
-    try {
-        m_chunkFirstPacket.assign(1, 0);
-        for (const TqovixChunkInformation& chunk : m_audioChunks) {
-            m_chunkFirstPacket.push_back(m_chunkFirstPacket.back() + chunk.sampleCount);
-        }
-    } catch (const std::bad_alloc&) {
-        return eTqovixErrorOutOfMemory;
+    if (m_chunkFirstPacket.empty()) {
+        return eTqovixErrorInternal;
     }
-    m_audioDataControl.PlanSplicing(m_chunkFirstPacket.back(), false);
+    m_audioDataControl.PlanSplicing(m_chunkFirstPacket.back(), !m_aacWholeReason.empty());
     record.sampleRate /= 1000;
     record.sampleCount *= 1024;
     return eTqovixSuccess;

@@ -42,6 +42,10 @@ public:
     // Why the last Initialize refused the movie, in words for people; empty when it did not.
     const std::string& GetRefusal() const { return m_refusal; }
     eTqovixRefusal GetRefusalKind() const { return m_refusalKind; }
+    // AAC: why the whole track is re-encoded rather than only the spans around the changes, in
+    // words; empty when the source's packets are kept wherever the sound comes back unchanged
+    // (and for PCM). Known after Initialize.
+    const std::string& GetAacWholeReason() const { return m_aacWholeReason; }
     void Close();
 
     eTqovixErrorCode GetAFInformation(void* buffer, unsigned long* delivered, unsigned long size,
@@ -101,6 +105,9 @@ private:
     // Fragments keep their samples outside the tables: such a movie is refused before anything else.
     eTqovixErrorCode RefuseFragmented();
     eTqovixErrorCode AnalyzeSoundFormat(const CTqovixAudioInformationVisitor& information);
+    // Whether our encoder's packets can stand between the source's: the same profile, rate and
+    // channel elements, and the windows' shape a decoder carries across a joint.
+    eTqovixErrorCode ExamineAacSplicing(const CTqovixAudioInformationVisitor& information);
     eTqovixErrorCode GatherCarriedTracks(uint32_t soundTrack, uint32_t soundFrameBytes, uint64_t fileSize);
     eTqovixErrorCode Refuse(eTqovixErrorCode code, eTqovixRefusal kind, std::string reason);
     // Planning the destination: the mdat header's form from what will go in.
@@ -156,6 +163,7 @@ private:
     uint32_t m_sampleBytes = 2;
     bool m_bFloatingPoint = false;
     std::string m_refusal;
+    std::string m_aacWholeReason;
     eTqovixRefusal m_refusalKind = eTqovixRefusal::None;
     std::vector<TqovixChunkInformation> m_outputAudioChunks;
     std::vector<TqovixChunkInformation> m_outputMovieDataChunks;
