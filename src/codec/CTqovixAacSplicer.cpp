@@ -566,7 +566,17 @@ eTqovixErrorCode CTqovixAacSplicer::TryEnd(bool final)
             outside = Hear(*source, *next, end + 1);
         }
         double ratio = 0;
-        if (Accept(joint, inside, outside, ratio)) {
+        if (!Accept(joint, inside, outside, ratio)) {
+            continue;
+        }
+        m_pendingSizes.clear();
+        for (uint64_t index = m_committed; index < end; ++index) {
+            const Packet* packet = Encoded(index);
+            if (packet != nullptr) {
+                m_pendingSizes.push_back(static_cast<uint32_t>(packet->bytes.size()));
+            }
+        }
+        if (m_pSink->EndFits(end, m_pendingSizes)) {
             ++m_statistics.joints;
             m_statistics.endsMoved += end != static_cast<uint64_t>(m_lastChanged) + 1 + m_tuning.margin ? 1 : 0;
             m_statistics.worstJointRatio = std::max(m_statistics.worstJointRatio, ratio);

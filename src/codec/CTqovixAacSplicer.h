@@ -25,6 +25,10 @@ public:
         virtual eTqovixErrorCode WriteEncodedPacket(const uint8_t* packet, uint32_t size) = 0;
         // Source packet `index`, for hearing a joint before it is made.
         virtual eTqovixErrorCode ReadSourcePacket(uint64_t index, std::vector<uint8_t>& packet) = 0;
+        // Whether a span may end before packet `end` as far as the writer goes: one that gives
+        // re-encoded packets the bytes of those they replace asks for more of them while they do
+        // not fit. `pending` are the sizes of the re-encoded packets not yet handed over, up to `end`.
+        virtual bool EndFits(uint64_t /*end*/, const std::vector<uint32_t>& /*pending*/) const { return true; }
     };
 
     struct Tuning {
@@ -166,5 +170,6 @@ private:
     std::vector<uint8_t> m_firstPacket;
     std::vector<uint8_t> m_secondPacket;
     std::vector<uint8_t> m_zeros;
+    std::vector<uint32_t> m_pendingSizes;
     Statistics m_statistics;
 };

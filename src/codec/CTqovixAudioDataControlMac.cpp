@@ -80,6 +80,9 @@ eTqovixErrorCode CTqovixAudioDataControlMac::OpenEncoderAAC(
         const double perChannel = std::min(kFloorBitRatePerChannel, m_pAACFormat->sampleRate * 4 / 3);
         const auto floor = static_cast<unsigned int>(perChannel * m_pAACFormat->channelsPerFrame);
         bitRate = std::max(bitRate, floor);
+        // No more than a packet may carry: 6144 bits a channel.
+        const double ceiling = 6 * m_pAACFormat->sampleRate * m_pAACFormat->channelsPerFrame;
+        bitRate = std::min(bitRate, static_cast<unsigned int>(ceiling));
     }
     auto* sink = static_cast<CTqovixAacSplicer::Sink*>(const_cast<CTqovixMovControl*>(movControl));
     const eTqovixErrorCode opened = m_splicer.Open(*m_pPCMFormat, *m_pAACFormat, bitRate, sink);

@@ -1,6 +1,8 @@
 #include "codec/TqovixAacSyntax.h"
 
+#include <algorithm>
 #include <iterator>
+#include <new>
 
 namespace TqovixAacSyntax {
 
@@ -183,6 +185,100 @@ std::optional<FrameHeader> ReadFrameHeader(const uint8_t* packet, size_t size)
         header.windowShape = static_cast<uint8_t>(*shape);
         return header;
     }
+}
+
+namespace {
+
+// Big-endian bits appended to a byte vector.
+class BitWriter {
+public:
+    explicit BitWriter(std::vector<uint8_t>& bytes) : m_bytes(bytes) { m_bytes.clear(); }
+    void Write(uint32_t value, unsigned count)
+    {
+        for (unsigned k = count; k-- > 0;) {
+            if (m_bits % 8 == 0) {
+                m_bytes.push_back(0);
+            }
+            m_bytes.back() |= static_cast<uint8_t>(((value >> k) & 1U) << (7 - m_bits % 8));
+            ++m_bits;
+        }
+    }
+    uint64_t Bits() const { return m_bits; }
+
+private:
+    std::vector<uint8_t>& m_bytes;
+    uint64_t m_bits = 0;
+};
+
+// A fill element of `count` payload bytes: its count (escaped past 14), then an extension of the
+// kind that only fills.
+void WriteFill(BitWriter& out, uint32_t count)
+{
+    out.Write(kFil, 3);
+    if (count < 15) {
+        out.Write(count, 4);
+    } else {
+        out.Write(15, 4);
+        out.Write(count - 14, 8);
+    }
+    for (uint32_t k = 0; k < count; ++k) {
+        out.Write(k == 0 ? 0x00 : 0xA5, 8);
+    }
+}
+
+}  // namespace
+
+bool PadToSize(const uint8_t* packet, size_t size, size_t target, std::vector<uint8_t>& padded)
+{
+    if (packet == nullptr || size == 0 || target < size) {
+        return false;
+    }
+    // The end element is the last three bits set; only zero bits may follow it.
+    uint64_t last = uint64_t{size} * 8;
+    while (last > 0 && ((packet[(last - 1) / 8] >> (7 - (last - 1) % 8)) & 1U) == 0) {
+        --last;
+    }
+    if (last < 3 || uint64_t{size} * 8 - last >= 8) {
+        return false;
+    }
+    const uint64_t end = last - 3;
+    for (uint64_t bit = end; bit < last; ++bit) {
+        if (((packet[bit / 8] >> (7 - bit % 8)) & 1U) == 0) {
+            return false;
+        }
+    }
+    if (target == size) {
+        padded.assign(packet, packet + size);
+        return true;
+    }
+    // Fill elements of 7 + 8 c bits (c below 15) or 15 + 8 c bits (c from 15 to 269), largest first,
+    // until fewer than 7 bits are left, which the alignment takes up.
+    const uint64_t targetBits = uint64_t{target} * 8;
+    uint64_t left = targetBits - end - 3;
+    std::vector<uint32_t> fills;
+    while (left >= 7) {
+        const uint32_t count = left >= 15 + 8 * 15 ? static_cast<uint32_t>(std::min<uint64_t>(269, (left - 15) / 8))
+                                                   : static_cast<uint32_t>(std::min<uint64_t>(14, (left - 7) / 8));
+        fills.push_back(count);
+        left -= count < 15 ? 7 + 8 * uint64_t{count} : 15 + 8 * uint64_t{count};
+    }
+    try {
+        BitWriter out(padded);
+        padded.reserve(target);
+        for (uint64_t bit = 0; bit < end; ++bit) {
+            out.Write((packet[bit / 8] >> (7 - bit % 8)) & 1U, 1);
+        }
+        for (const uint32_t count : fills) {
+            WriteFill(out, count);
+        }
+        out.Write(kEnd, 3);
+        if (out.Bits() > targetBits || out.Bits() + 8 <= targetBits) {
+            return false;
+        }
+    } catch (const std::bad_alloc&) {
+        return false;
+    }
+    return padded.size() == target;
 }
 
 }  // namespace TqovixAacSyntax

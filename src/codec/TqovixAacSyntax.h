@@ -5,6 +5,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <optional>
+#include <vector>
 
 namespace TqovixAacSyntax {
 
@@ -31,5 +32,10 @@ struct FrameHeader {
 // Fill and data stream elements before it are passed over; nullopt when the packet is cut
 // short or begins with anything else.
 std::optional<FrameHeader> ReadFrameHeader(const uint8_t* packet, size_t size);
+
+// The packet made exactly `target` bytes long by fill elements before its closing element, which
+// decoders pass over. False when it is longer already or does not end as an encoder closes a
+// raw data block (the end element, then zero bits to the byte).
+bool PadToSize(const uint8_t* packet, size_t size, size_t target, std::vector<uint8_t>& padded);
 
 }  // namespace TqovixAacSyntax

@@ -71,6 +71,7 @@ public:
     eTqovixErrorCode CarrySourcePackets(uint64_t count) override;
     eTqovixErrorCode WriteEncodedPacket(const uint8_t* packet, uint32_t size) override;
     eTqovixErrorCode ReadSourcePacket(uint64_t index, std::vector<uint8_t>& packet) override;
+    bool EndFits(uint64_t end, const std::vector<uint32_t>& pending) const override;
     eTqovixErrorCode SetMovieDataInformation(const void* afInformation, unsigned long size);
     // Every sound and video chunk is in the destination (the moov may still be missing).
     bool IsMediaDataComplete() const;
@@ -83,10 +84,12 @@ public:
     bool TakeFinishPending();
     // AAC: makes the encoder give up what it holds when the library has ended early.
     eTqovixErrorCode FlushEncoder();
-    // Copy, then patch: a PCM source laid out as leading atoms, one mdat that its chunks fill
+    // Copy, then patch: a source laid out as leading atoms, one mdat that its chunks fill
     // exactly, then the moov, becomes a kernel copy of itself (sharing extents where the file
-    // system can) with only changed sound and the new moov written over it. The result is
-    // byte for byte what the general writer gives. Tests turn it off to compare the two.
+    // system can) with only changed sound and the new moov written over it: PCM samples that
+    // changed, AAC packets re-encoded (filled out to the bytes of the packets they replace; a
+    // chunk they outgrow is laid out from there on as the general writer lays it out). The
+    // result is byte for byte what the general writer gives. Tests turn it off to compare the two.
     static void SetPatchWriting(bool enabled);
     // How much served sound is kept to compare with what comes back before the file is read
     // instead; 0 restores the default. Tests make it small to compare with the file.
@@ -128,6 +131,16 @@ private:
     eTqovixErrorCode WriteMediaDataHeader(const TqovixAtomList& atoms);
     eTqovixErrorCode WritePcm(const uint8_t* data, unsigned long size, bool swap);
     eTqovixErrorCode WriteAacPacket(const uint8_t* packet, unsigned long size);
+    // The next `count` source packets written at the destination's position (the general writer).
+    eTqovixErrorCode CarryAacPackets(uint64_t count);
+    // A gathered AAC chunk: its re-encoded packets filled out where they fit the source's bytes,
+    // then written in place (patching) or in order (the general writer).
+    eTqovixErrorCode LayOutAacChunk();
+    eTqovixErrorCode WriteAacChunkInOrder();
+    // Patching: from sound chunk `chunk` on, the general writer's way, over the copy.
+    eTqovixErrorCode StopPatchingAt(const TqovixChunkInformation& chunk);
+    // Patching: bytes written over the copy, which is kept off them.
+    eTqovixErrorCode PatchBytes(uint64_t at, const uint8_t* data, uint32_t size);
     // Where the next packet of the current sound chunk starts, opening the chunk when it is new.
     eTqovixErrorCode BeginAacPacket(TqovixChunkInformation*& output);
     void EndAacPackets(uint64_t count);
@@ -173,6 +186,18 @@ private:
     uint32_t m_samplesInOutputChunk = 0;
     uint64_t m_sourceBytesInChunk = 0;  // AAC: bytes of the source chunk's packets written so far
     std::vector<uint64_t> m_chunkFirstPacket;  // AAC: each sound chunk's first packet, then the count
+    // AAC: the sound chunk being gathered before it is laid out, as runs of the source's own
+    // packets and of re-encoded ones; only when every chunk is small enough to be held.
+    struct AacRun {
+        bool encoded = false;
+        uint32_t count = 0;
+        uint64_t sourceBytes = 0;      // what the run's packets take in the source
+        std::vector<uint8_t> bytes;    // re-encoded: the packets back to back
+        std::vector<uint32_t> sizes;   // re-encoded: each packet's size
+    };
+    std::vector<AacRun> m_aacRuns;
+    uint32_t m_aacGathered = 0;
+    bool m_bGatherAacChunks = false;
     uint32_t m_bytesInOutputChunk = 0;
     uint64_t m_mediaDataSize = 0;
     int64_t m_mediaDataSizePosition = 0;
@@ -189,6 +214,9 @@ private:
     bool m_bPatching = false;
     bool m_bPatchCandidate = false;        // the layout allows it: the served sound is kept
     uint64_t m_moovOffset = 0;            // patching: where the source's moov starts
+    uint64_t m_mediaDataStart = 0;        // patching: where the source's media data begins
+    int64_t m_sourceSizePosition = 0;     // patching: where the source's mdat size field lies
+    bool m_bPatchStopped = false;         // patched up to a chunk, laid out in order after it
     uint64_t m_patchEnd = UINT64_MAX;     // patching: where the last patch ended (no seek needed there)
     std::vector<uint8_t> m_compareBuffer;  // patching: the source's sound, to find what changed
     // Patching: the PCM served to the processing library and not yet handed back, so that

@@ -126,6 +126,12 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
         if (TqovixFailed(result)) {
             return result;
         }
+        // A chunk is held whole before it is laid out, so its size bounds what is held.
+        constexpr uint64_t kMaxGatheredBytes = 4 << 20;
+        constexpr uint32_t kMaxGatheredPackets = 8192;
+        m_bGatherAacChunks = std::ranges::all_of(m_audioChunks, [](const TqovixChunkInformation& chunk) {
+            return chunk.size <= kMaxGatheredBytes && chunk.sampleCount <= kMaxGatheredPackets;
+        });
     }
     if (!forJob) {
         // The property query sets the sound up as a job's start does, so that it refuses what
