@@ -79,10 +79,11 @@ public:
     bool IsDestinationComplete() const { return m_bDestinationComplete; }
     // Gives the complete destination its name, replacing what stood there in one step.
     eTqovixErrorCode PublishDestination() { return m_destinationFile.Publish(false, &m_sourceFile); }
-    // True once after the splicer has handed over the last packet. The job is finished
-    // only after the encoder has returned, so that no codec is closed under its own feet.
+    // True once after the splicer has handed over the last packet. The job is finished when the
+    // library reports its end, never inside a push, so that no codec is closed under its own feet.
     bool TakeFinishPending();
-    // AAC: makes the encoder give up what it holds when the library has ended early.
+    // AAC: hands over what the splicer holds when the library has ended (the rest of a track it
+    // stopped short of goes out as it came).
     eTqovixErrorCode FlushEncoder();
     // Copy, then patch: a source laid out as leading atoms, one mdat that its chunks fill
     // exactly, then the moov, becomes a kernel copy of itself (sharing extents where the file
@@ -94,7 +95,8 @@ public:
     // How much served sound is kept to compare with what comes back before the file is read
     // instead; 0 restores the default. Tests make it small to compare with the file.
     static void SetServedSoundLimit(uint64_t bytes);
-    bool IsPatching() const { return m_bPatching; }
+    // The destination began as a copy (patched still, or laid out in order after a chunk).
+    bool IsPatching() const { return m_bPatching || m_bPatchStopped; }
     // Asked between the pieces of long copies (the patching copy, large carried chunks) with
     // the bytes copied and in all: a failure code stops the job with it. The engine answers
     // with aborts and the host's progress callback, which the library cannot ask meanwhile.

@@ -35,14 +35,10 @@ eTqovixErrorCode CTqovixMovControl::SetMovieMetaData(const void* data, unsigned 
             return m_encodeResult;
         }
         const eTqovixErrorCode result = m_audioDataControl.PushAudioData(data, size);
-        if (TqovixFailed(result) || TqovixFailed(m_encodeResult)) {
-            return TqovixFailed(result) ? result : m_encodeResult;
-        }
-        if (TakeFinishPending() && m_pMainFrame != nullptr) {
-            // Last call on this object: finishing may close the controller.
-            return m_pMainFrame->SetAFInformation();
-        }
-        return result;
+        // The movie is finished as PCM's is, when the library reports its end: a stop asked
+        // before that still stops the job, and the wait for a copy is seen as such.
+        return TqovixFailed(result) || TqovixFailed(m_encodeResult) ? (TqovixFailed(result) ? result : m_encodeResult)
+                                                                   : result;
     }
     if (size != 0 && data == nullptr) {
         return eTqovixErrorInternal;
