@@ -148,8 +148,8 @@ int main(int argc, char** argv)
             testsupport::Sum(testsupport::Chord(frames, channels, static_cast<uint32_t>(rate), 1200.0),
                              testsupport::Ambience(frames, channels, 300.0)),
             motorSound));
-        const std::string raw = "/tmp/splice_bench.raw";
-        adts = "/tmp/splice_bench.aac";
+        const std::string raw = "splice_bench.raw";
+        adts = "splice_bench.aac";
         std::ofstream(raw, std::ios::binary).write(reinterpret_cast<const char*>(mixed.data()),
                                                     static_cast<std::streamsize>(mixed.size() * 2));
         const std::string command = "ffmpeg -v error -nostdin -y -f s16le -ar " + std::to_string(static_cast<int>(rate)) +
@@ -243,6 +243,9 @@ int main(int argc, char** argv)
                 static_cast<unsigned long long>(s.startsMoved), static_cast<unsigned long long>(s.endsMoved),
                 s.worstJointRatio, s.worstJointPeak, seconds);
     // Each joint: the region both sides sound in, beside the re-encoded regions next to it.
+    double worstJointDb = 999;
+    double worstJointPeak = 0;
+    double worstBesideDb = 999;
     for (size_t p = 1; p < collector.carried.size(); ++p) {
         if (collector.carried[p] == collector.carried[p - 1]) {
             continue;
@@ -250,10 +253,16 @@ int main(int argc, char** argv)
         const size_t joint = p - 1;  // served region where packets p - 1 and p meet
         const bool startOfSpan = !collector.carried[p];
         const size_t inside = startOfSpan ? std::min(joint + 1, regions - 1) : (joint > 0 ? joint - 1 : 0);
+        worstJointDb = std::min(worstJointDb, Db(signal[joint], noise[joint]));
+        worstJointPeak = std::max(worstJointPeak, peak[joint]);
+        worstBesideDb = std::min(worstBesideDb, Db(signal[inside], noise[inside]));
         std::printf("  %s at packet %zu: joint %.1f dB SNR, peak %.0f; re-encoded beside it %.1f dB, peak %.0f\n",
                     startOfSpan ? "span starts" : "span ends", p, Db(signal[joint], noise[joint]), peak[joint],
                     Db(signal[inside], noise[inside]), peak[inside]);
     }
+    std::printf("joints: worst %.1f dB SNR, largest sample difference %.0f (16-bit steps); the re-encoded region "
+                "beside a joint at worst %.1f dB\n",
+                worstJointDb, worstJointPeak, worstBesideDb);
     // Over every span's first packets: their sound and their size against the source's.
     double firstNoise = 0, firstSignal = 0, firstBytes = 0, firstSourceBytes = 0, allBytes = 0, allSourceBytes = 0;
     for (size_t p = 1; p + 4 < collector.carried.size(); ++p) {
