@@ -23,6 +23,8 @@ using Path = TqovixAtomPath;
 
 namespace {
 
+using testsupport::PrintTo;
+
 Bytes Ftyp(const std::string& brand) { return Atom("ftyp", Bytes(brand.begin(), brand.end())); }
 
 // `depth` "moov" atoms one inside the other around an empty "free"; the innermost is too small to be a container.
@@ -114,7 +116,6 @@ struct FileRow {
     Bytes (*bytes)();
     bool accepted;
 };
-void PrintTo(const FileRow& row, std::ostream* os) { *os << row.name; }
 
 class AtomFileRowTest : public AtomFileTest, public ::testing::WithParamInterface<FileRow> {};
 
@@ -158,13 +159,7 @@ INSTANTIATE_TEST_SUITE_P(
         // With ftyp, one too many.
         FileRow{"MoreAtomsThanTheBound",
                 [] { return Qt(Concat(std::vector<Bytes>(CTqovixAtomControl::kMaxAtoms, Atom("free", {})))); }, false}),
-    [](const ::testing::TestParamInfo<FileRow>& info) { return std::string(info.param.name); });
-
-TEST_F(AtomFileTest, AClosedFileIsNotParsed)
-{
-    CTqovixFile closed;
-    EXPECT_EQ(m_tree.Initialize(closed), eTqovixErrorInternal);
-}
+    testsupport::ByName);
 
 TEST_F(AtomFileTest, WalksFollowTrackRulesAndTheVisitorsAnswers)
 {
@@ -216,9 +211,12 @@ TEST_F(AtomFileTest, WalksFollowTrackRulesAndTheVisitorsAnswers)
         EXPECT_EQ(m_tree.Update(steered), c.updateResult);
     }
 
+    // A tree never read walks nothing, and a closed file gives none.
     CTqovixAtomControl empty;
     EXPECT_EQ(empty.Analyze(visitor), eTqovixErrorGeneral);
     EXPECT_EQ(empty.Update(visitor), eTqovixErrorGeneral);
+    CTqovixFile closed;
+    EXPECT_EQ(empty.Initialize(closed), eTqovixErrorInternal);
 }
 
 }  // namespace

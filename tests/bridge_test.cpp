@@ -5,6 +5,7 @@
 #include "MakerData.h"
 #include "bridge/TqovixInterfaceConvert.h"
 #include "support/OvixHarness.h"
+#include "support/TestSupport.h"
 
 #include <cstring>
 #include <ostream>
@@ -17,6 +18,8 @@ using UL = unsigned long;
 using Audio = TC::TqovixAudioInformation;
 
 namespace {
+
+using testsupport::PrintTo;
 
 TEST(BridgeConversion, CodesBothWays)
 {
@@ -112,7 +115,6 @@ struct SessionRow {
     Bytes (*block)();
     eTqovixErrorCode isEnable;  // and the end of the session when it is a verdict
 };
-void PrintTo(const SessionRow& row, std::ostream* os) { *os << row.name; }
 
 class BridgeSessionRow : public BridgeSession, public testing::WithParamInterface<SessionRow> {};
 
@@ -146,6 +148,6 @@ INSTANTIATE_TEST_SUITE_P(
                     SessionRow{"NotAnAfBlock", [] { return AfBlock({}, false, "OP02"); }, eTqovixVerdict8},
                     SessionRow{"Malformed", [] { return AfBlock({{5, 6, 1}, {1, 2, 1}}); }, eTqovixVerdict9},
                     SessionRow{"AlreadyProcessed", [] { return AfBlock({}, true); }, eTqovixVerdict20}),
-    [](const testing::TestParamInfo<SessionRow>& info) { return std::string(info.param.name); });
+    testsupport::ByName);
 
 }  // namespace

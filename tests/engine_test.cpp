@@ -64,6 +64,8 @@ unsigned long TqovixSetCallbackNotifyProgress(TqovixProgressCallback c) { Curren
 
 namespace {
 
+using testsupport::PrintTo;
+
 class EngineTest : public ::testing::Test {
 protected:
     void SetUp() override
@@ -118,7 +120,6 @@ struct SessionEndRow {
     eTqovixErrorCode expected;
     int hostAnswer;  // heard only while the library reports no end of its own
 };
-void PrintTo(const SessionEndRow& row, std::ostream* os) { *os << row.name; }
 
 class SessionEndTest : public EngineTest, public ::testing::WithParamInterface<SessionEndRow> {};
 
@@ -157,8 +158,7 @@ INSTANTIATE_TEST_SUITE_P(
                       SessionEndRow{"EmptyProcessedAfInformation", 1, kOk, {}, eTqovixErrorInternal, 131},
                       SessionEndRow{"ProcessedAfInformationUnreadable", 1, ovix::kOutOfMemory, {1},
                                     eTqovixErrorOutOfMemory, 131},
-                      SessionEndRow{"UnknownHostAnswer", 0, kOk, {1}, eTqovixErrorGeneral, 5}),
-    [](const ::testing::TestParamInfo<SessionEndRow>& info) { return std::string(info.param.name); });
+                      SessionEndRow{"UnknownHostAnswer", 0, kOk, {1}, eTqovixErrorGeneral, 5}), testsupport::ByName);
 
 // A close ends a running job at once.
 TEST_F(EngineTest, CloseMidJob)

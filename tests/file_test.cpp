@@ -8,12 +8,10 @@
 #include <cstring>
 #include <fcntl.h>
 #include <filesystem>
-#include <grp.h>
 #include <ostream>
 #include <string>
 #include <sys/stat.h>
 #include <sys/utsname.h>
-#include <sys/wait.h>
 #include <tuple>
 #include <unistd.h>
 #include <vector>
@@ -27,6 +25,8 @@ namespace fs = std::filesystem;
 using testsupport::TempDir;
 
 namespace {
+
+using testsupport::PrintTo;
 
 constexpr long long kGiB = 1LL << 30;
 
@@ -99,7 +99,6 @@ struct CopyRow {
     const char* name;
     bool otherVolume;  // where the kernel will not copy
 };
-void PrintTo(const CopyRow& row, std::ostream* os) { *os << row.name; }
 
 class FileCopyTest : public ::testing::TestWithParam<CopyRow> {};
 
@@ -172,7 +171,7 @@ TEST_P(FileCopyTest, CopiedRangeLandsWhereTheStreamsStand)
 
 INSTANTIATE_TEST_SUITE_P(Volumes, FileCopyTest,
                          ::testing::Values(CopyRow{"SameVolume", false}, CopyRow{"OtherVolume", true}),
-                         [](const ::testing::TestParamInfo<CopyRow>& info) { return std::string(info.param.name); });
+                         testsupport::ByName);
 
 // A volume the test describes, standing in for statfs.
 TqovixVolumeInformation g_volume;
@@ -201,7 +200,6 @@ struct VolumeRow {
     long long size;
     eTqovixErrorCode expected;
 };
-void PrintTo(const VolumeRow& row, std::ostream* os) { *os << row.name; }
 
 class VolumeTest : public ::testing::TestWithParam<VolumeRow> {
 protected:
@@ -229,7 +227,7 @@ INSTANTIATE_TEST_SUITE_P(
                       VolumeRow{"Fat4_5GiB", 4096, 1ULL << 30, "msdos", 45 * kGiB / 10, eTqovixErrorFileTooLarge},
                       VolumeRow{"ExFat4_5GiB", 4096, 1ULL << 30, "exfat", 45 * kGiB / 10, eTqovixSuccess},
                       VolumeRow{"FatLimitBeforeSpace", 1, 1000, "msdos", 4 * kGiB, eTqovixErrorFileTooLarge}),
-    [](const ::testing::TestParamInfo<VolumeRow>& info) { return std::string(info.param.name); });
+    testsupport::ByName);
 
 TEST(FileComfirmWritable, ThroughTheVolumeSeamAndForReal)
 {
@@ -253,71 +251,55 @@ TEST(FileComfirmWritable, ThroughTheVolumeSeamAndForReal)
     EXPECT_EQ(Check(1, 0, "ext4", 1000, temp.File("missing/out.mov").c_str()), eTqovixErrorDestinationNotFound);
 }
 
-// Each error number as the user meets it: the internal code for the source (opened
-// read-only) and the destination, and what a host is told of each.
+// Error numbers as the user meets them: the internal code for the source (opened read-only)
+// and the destination, and what a host is told of each.
 struct ErrnoRow {
     const char* name;
-    int error;
+    std::vector<int> errors;
     int source;
     int destination;
     int sourceExported;
     int destinationExported;
 };
-void PrintTo(const ErrnoRow& row, std::ostream* os) { *os << row.name; }
 
 class FileConvertErrnoTest : public ::testing::TestWithParam<ErrnoRow> {};
 
 TEST_P(FileConvertErrnoTest, SourceAndDestinationCodes)
 {
     const ErrnoRow& row = GetParam();
-    const eTqovixErrorCode source = CTqovixFile::ConvertErrnoToLocalError(row.error, true);
-    const eTqovixErrorCode destination = CTqovixFile::ConvertErrnoToLocalError(row.error, false);
-    EXPECT_EQ(source, row.source);
-    EXPECT_EQ(destination, row.destination);
-    EXPECT_EQ(TqovixCodes::Exported(source), row.sourceExported);
-    EXPECT_EQ(TqovixCodes::Exported(destination), row.destinationExported);
+    for (const int error : row.errors) {
+        const eTqovixErrorCode source = CTqovixFile::ConvertErrnoToLocalError(error, true);
+        const eTqovixErrorCode destination = CTqovixFile::ConvertErrnoToLocalError(error, false);
+        EXPECT_EQ(source, row.source) << error;
+        EXPECT_EQ(destination, row.destination) << error;
+        EXPECT_EQ(TqovixCodes::Exported(source), row.sourceExported) << error;
+        EXPECT_EQ(TqovixCodes::Exported(destination), row.destinationExported) << error;
+    }
 }
 
 INSTANTIATE_TEST_SUITE_P(
     Errno, FileConvertErrnoTest,
     ::testing::Values(
-        ErrnoRow{"Eperm", EPERM, eTqovixErrorSourceAccessDenied, eTqovixErrorDestinationAccessDenied, 120, 121},
-        ErrnoRow{"Eacces", EACCES, eTqovixErrorSourceAccessDenied, eTqovixErrorDestinationAccessDenied, 120, 121},
-        // Only opening for writing meets these: whichever side asked, the destination cannot be written.
-        ErrnoRow{"ReadOnlyVolume", EROFS, eTqovixErrorDestinationAccessDenied, eTqovixErrorDestinationAccessDenied, 121, 121},
-        ErrnoRow{"RunningProgram", ETXTBSY, eTqovixErrorDestinationAccessDenied, eTqovixErrorDestinationAccessDenied, 121, 121},
-        ErrnoRow{"Enoent", ENOENT, eTqovixErrorSourceNotFound, eTqovixErrorDestinationNotFound, 110, 111},
+        ErrnoRow{"Denied", {EPERM, EACCES}, eTqovixErrorSourceAccessDenied, eTqovixErrorDestinationAccessDenied, 120, 121},
+        // A read-only volume, a running program: only opening for writing meets these, so whichever
+        // side asked, the destination cannot be written.
+        ErrnoRow{"NotWritable", {EROFS, ETXTBSY}, eTqovixErrorDestinationAccessDenied, eTqovixErrorDestinationAccessDenied, 121, 121},
         // A name that cannot be reached is not found as a source and cannot be created as a destination.
-        ErrnoRow{"NotADirectoryOnTheWay", ENOTDIR, eTqovixErrorSourceNotFound, eTqovixErrorDestinationNotFound, 110, 111},
-        ErrnoRow{"NameTooLong", ENAMETOOLONG, eTqovixErrorSourceNotFound, eTqovixErrorDestinationNotFound, 110, 111},
-        ErrnoRow{"LinkLoop", ELOOP, eTqovixErrorSourceNotFound, eTqovixErrorDestinationNotFound, 110, 111},
-        ErrnoRow{"Enomem", ENOMEM, eTqovixErrorOutOfMemory, eTqovixErrorOutOfMemory, 100, 100},
-        ErrnoRow{"Enospc", ENOSPC, eTqovixErrorDiskFull, eTqovixErrorDiskFull, 130, 130},
-        ErrnoRow{"QuotaIsAFullDisk", EDQUOT, eTqovixErrorDiskFull, eTqovixErrorDiskFull, 130, 130},
-        ErrnoRow{"Efbig", EFBIG, eTqovixErrorFileTooLarge, eTqovixErrorFileTooLarge, 131, 131},
+        ErrnoRow{"NotFound", {ENOENT, ENOTDIR, ENAMETOOLONG, ELOOP}, eTqovixErrorSourceNotFound, eTqovixErrorDestinationNotFound, 110, 111},
+        ErrnoRow{"Enomem", {ENOMEM}, eTqovixErrorOutOfMemory, eTqovixErrorOutOfMemory, 100, 100},
+        ErrnoRow{"DiskFullOrQuota", {ENOSPC, EDQUOT}, eTqovixErrorDiskFull, eTqovixErrorDiskFull, 130, 130},
+        ErrnoRow{"Efbig", {EFBIG}, eTqovixErrorFileTooLarge, eTqovixErrorFileTooLarge, 131, 131},
         // The tool names a directory for what it is; hosts hear the general code, as for the
         // directories the file layer refuses before asking the system.
-        ErrnoRow{"Eisdir", EISDIR, eTqovixErrorIsDirectory, eTqovixErrorIsDirectory, 190, 190},
-        ErrnoRow{"Eexist", EEXIST, eTqovixErrorFileExists, eTqovixErrorFileExists, 190, 190},
-        ErrnoRow{"Enfile", ENFILE, eTqovixErrorTooManyFiles, eTqovixErrorTooManyFiles, 190, 190},
-        ErrnoRow{"Emfile", EMFILE, eTqovixErrorTooManyFiles, eTqovixErrorTooManyFiles, 190, 190},
-        ErrnoRow{"Einval", EINVAL, eTqovixErrorInvalidArgument, eTqovixErrorInvalidArgument, 190, 190},
-        ErrnoRow{"Espipe", ESPIPE, eTqovixErrorInvalidArgument, eTqovixErrorInvalidArgument, 190, 190},
-        ErrnoRow{"Eoverflow", EOVERFLOW, eTqovixErrorInvalidArgument, eTqovixErrorInvalidArgument, 190, 190},
-        ErrnoRow{"Enxio", ENXIO, eTqovixErrorDevice, eTqovixErrorDevice, 190, 190},
-        ErrnoRow{"Ebusy", EBUSY, eTqovixErrorDevice, eTqovixErrorDevice, 190, 190},
-        ErrnoRow{"Exdev", EXDEV, eTqovixErrorDevice, eTqovixErrorDevice, 190, 190},
-        ErrnoRow{"Enodev", ENODEV, eTqovixErrorDevice, eTqovixErrorDevice, 190, 190},
-        ErrnoRow{"Eio", EIO, eTqovixErrorGeneral, eTqovixErrorGeneral, 190, 190},
-        ErrnoRow{"Eagain", EAGAIN, eTqovixErrorGeneral, eTqovixErrorGeneral, 190, 190},
+        ErrnoRow{"Eisdir", {EISDIR}, eTqovixErrorIsDirectory, eTqovixErrorIsDirectory, 190, 190},
+        ErrnoRow{"Eexist", {EEXIST}, eTqovixErrorFileExists, eTqovixErrorFileExists, 190, 190},
+        ErrnoRow{"TooManyFiles", {ENFILE, EMFILE}, eTqovixErrorTooManyFiles, eTqovixErrorTooManyFiles, 190, 190},
+        ErrnoRow{"InvalidArgument", {EINVAL, ESPIPE, EOVERFLOW}, eTqovixErrorInvalidArgument, eTqovixErrorInvalidArgument, 190, 190},
+        ErrnoRow{"Device", {ENXIO, EBUSY, EXDEV, ENODEV}, eTqovixErrorDevice, eTqovixErrorDevice, 190, 190},
         // EHWPOISON is the highest error number Linux defines.
-        ErrnoRow{"HighestErrno", EHWPOISON, eTqovixErrorGeneral, eTqovixErrorGeneral, 190, 190},
-        ErrnoRow{"Enotempty", ENOTEMPTY, eTqovixErrorInternal, eTqovixErrorInternal, 190, 190},
-        ErrnoRow{"PastTheHighest", EHWPOISON + 1, eTqovixErrorInternal, eTqovixErrorInternal, 190, 190},
-        ErrnoRow{"Zero", 0, eTqovixErrorInternal, eTqovixErrorInternal, 190, 190},
-        ErrnoRow{"Negative", -1, eTqovixErrorInternal, eTqovixErrorInternal, 190, 190},
-        ErrnoRow{"IntMin", INT_MIN, eTqovixErrorInternal, eTqovixErrorInternal, 190, 190}),
-    [](const ::testing::TestParamInfo<ErrnoRow>& info) { return std::string(info.param.name); });
+        ErrnoRow{"General", {EIO, EAGAIN, EHWPOISON}, eTqovixErrorGeneral, eTqovixErrorGeneral, 190, 190},
+        ErrnoRow{"Unknown", {ENOTEMPTY, EHWPOISON + 1, 0, -1, INT_MIN}, eTqovixErrorInternal, eTqovixErrorInternal, 190, 190}),
+    testsupport::ByName);
 
 // ---- Opening the destination and giving it its name, each step failed through the seam ----
 
@@ -365,7 +347,6 @@ struct PublishFaultRow {
     int exported;    // what a host is told
     bool named;      // the new file has its name all the same (only past the rename)
 };
-void PrintTo(const PublishFaultRow& row, std::ostream* os) { *os << row.name; }
 
 class PublishFaultTest : public ::testing::TestWithParam<PublishFaultRow> {
 protected:
@@ -431,8 +412,7 @@ INSTANTIATE_TEST_SUITE_P(
         PublishFaultRow{"SyncDataIo", Op::Sync, 1, EIO, true, true, true, 190, false},
         PublishFaultRow{"SyncDataNoSpace", Op::Sync, 1, ENOSPC, false, false, true, 130, false},
         // The directory is synced once the name is given: the error still reaches the caller.
-        PublishFaultRow{"SyncDirectoryIo", Op::Sync, 2, EIO, true, true, true, 190, true}),
-    [](const ::testing::TestParamInfo<PublishFaultRow>& info) { return std::string(info.param.name); });
+        PublishFaultRow{"SyncDirectoryIo", Op::Sync, 2, EIO, true, true, true, 190, true}), testsupport::ByName);
 
 // ---- Names near the file system's limit of 255 bytes ----
 
@@ -441,7 +421,6 @@ struct LongNameRow {
     bool unnamed;
     bool replacing;
 };
-void PrintTo(const LongNameRow& row, std::ostream* os) { *os << row.name; }
 
 class LongNameTest : public ::testing::TestWithParam<LongNameRow> {
 protected:
@@ -497,7 +476,7 @@ INSTANTIATE_TEST_SUITE_P(
     Names, LongNameTest,
     ::testing::Values(LongNameRow{"UnnamedNew", true, false}, LongNameRow{"UnnamedReplacing", true, true},
                       LongNameRow{"HiddenNew", false, false}, LongNameRow{"HiddenReplacing", false, true}),
-    [](const ::testing::TestParamInfo<LongNameRow>& info) { return std::string(info.param.name); });
+    testsupport::ByName);
 
 // ---- Sources that are not regular files ----
 
@@ -505,26 +484,7 @@ INSTANTIATE_TEST_SUITE_P(
 // when it blocked.
 int OpenSourceWithWatchdog(const std::string& path)
 {
-    int channel[2] = {-1, -1};
-    if (pipe(channel) != 0) {
-        return -2;
-    }
-    const pid_t child = fork();
-    if (child == 0) {
-        alarm(10);
-        CTqovixFile file;
-        const int code = file.Open(path.c_str(), 1);
-        _exit(write(channel[1], &code, sizeof code) == sizeof code ? 0 : 1);
-    }
-    close(channel[1]);
-    int code = -1;
-    if (read(channel[0], &code, sizeof code) != static_cast<ssize_t>(sizeof code)) {
-        code = -1;
-    }
-    close(channel[0]);
-    int status = 0;
-    waitpid(child, &status, 0);
-    return code;
+    return testsupport::InChild([&] { return static_cast<int>(CTqovixFile().Open(path.c_str(), 1)); }, 10).value_or(-1);
 }
 
 TEST(FileOpen, SourcesThatAreNotRegularFilesAreRefusedAtOnce)
@@ -555,23 +515,12 @@ TEST(FileAccess, DestinationPermissionFailures)
     const std::string sealed = temp.File("sealed");
     ASSERT_TRUE(fs::create_directory(sealed) && testsupport::WriteFile(sealed + "/kept.mov", Pattern(8, 1)));
     ASSERT_EQ(chmod(temp.Path().c_str(), 0755) | chmod(sealed.c_str(), 0555), 0);
-    int channel[2] = {-1, -1};
-    ASSERT_EQ(pipe(channel), 0);
-    const pid_t child = fork();
-    if (child == 0) {
-        const bool dropped = geteuid() != 0 || (setgroups(0, nullptr) == 0 && setgid(65534) == 0 && setuid(65534) == 0);
-        CTqovixFile destination;
-        const int codes[2] = {dropped ? destination.Open((sealed + "/new.mov").c_str(), 2) : -1,
-                              CTqovixFile::Delete((sealed + "/kept.mov").c_str())};
-        _exit(write(channel[1], codes, sizeof(codes)) == sizeof(codes) ? 0 : 1);
-    }
-    close(channel[1]);
-    int codes[2] = {-1, -1}, status = 0;
-    EXPECT_EQ(read(channel[0], codes, sizeof(codes)), static_cast<ssize_t>(sizeof(codes)));
-    close(channel[0]);
-    ASSERT_TRUE(child > 0 && waitpid(child, &status, 0) == child && WIFEXITED(status)) << status;
-    EXPECT_EQ(codes[0], eTqovixErrorDestinationAccessDenied);
-    EXPECT_EQ(codes[1], eTqovixErrorDestinationAccessDenied);
+    const auto codes = testsupport::InChild([&] {
+        const int opened = testsupport::DropRoot() ? CTqovixFile().Open((sealed + "/new.mov").c_str(), 2) : -1;
+        return std::pair(opened, static_cast<int>(CTqovixFile::Delete((sealed + "/kept.mov").c_str())));
+    });
+    const int denied = eTqovixErrorDestinationAccessDenied;
+    EXPECT_EQ(codes, std::pair(denied, denied));
     EXPECT_TRUE(fs::exists(sealed + "/kept.mov"));
 }
 

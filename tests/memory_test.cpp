@@ -1,10 +1,6 @@
 // Memory a job takes on movies whose chunk and atom sizes the file chooses: a job runs in a
 // child process and its peak resident size, less what it held before, must stay far below
 // the sizes in the file.
-#include <fcntl.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
 #include <cstdint>
 #include <cstdio>
 #include <filesystem>
@@ -27,6 +23,8 @@ constexpr bool kSanitized = true;
 #else
 constexpr bool kSanitized = false;
 #endif
+
+using testsupport::PrintTo;
 
 constexpr int kDone = 1;
 constexpr uint64_t kMiB = 1 << 20;
@@ -55,13 +53,7 @@ struct Measured {
 // The job in a child process, so that its high-water mark is its own.
 Measured RunMeasured(const std::string& source, const std::string& destination)
 {
-    int channel[2];
-    if (pipe(channel) != 0) {
-        return {};
-    }
-    const pid_t child = fork();
-    if (child == 0) {
-        close(channel[0]);
+    return testsupport::InChild([&] {
         const uint64_t before = StatusKiB("VmRSS");
         int state = -2;
         if (TqExecuteOVIX(source.c_str(), destination.c_str()) == 0) {
@@ -69,21 +61,8 @@ Measured RunMeasured(const std::string& source, const std::string& destination)
         }
         TqCloseOVIX();  // joins the library's threads before the child goes
         const uint64_t peak = StatusKiB("VmHWM");
-        const Measured measured{state, (peak > before ? peak - before : 0) * 1024};
-        const bool sent = write(channel[1], &measured, sizeof measured) == static_cast<ssize_t>(sizeof measured);
-        _exit(sent ? 0 : 1);
-    }
-    close(channel[1]);
-    Measured measured;
-    if (child < 0 || read(channel[0], &measured, sizeof measured) != static_cast<ssize_t>(sizeof measured)) {
-        measured = {};
-    }
-    close(channel[0]);
-    int status = 0;
-    if (child > 0) {
-        waitpid(child, &status, 0);
-    }
-    return measured;
+        return Measured{state, (peak > before ? peak - before : 0) * 1024};
+    }).value_or(Measured{});
 }
 
 class MemoryTest : public jobtest::HostTest {
@@ -134,7 +113,6 @@ struct VolumeRow {
     const char* name;
     bool otherVolume;  // the destination where the kernel cannot copy from the source
 };
-void PrintTo(const VolumeRow& row, std::ostream* os) { *os << row.name; }
 
 class LeadingAtomMemoryTest : public MemoryTest, public ::testing::WithParamInterface<VolumeRow> {};
 
@@ -185,6 +163,6 @@ TEST_P(LeadingAtomMemoryTest, HugeFreeAtomIsCopiedInPieces)
 
 INSTANTIATE_TEST_SUITE_P(Volumes, LeadingAtomMemoryTest,
                          ::testing::Values(VolumeRow{"SameVolume", false}, VolumeRow{"OtherVolume", true}),
-                         [](const auto& info) { return std::string(info.param.name); });
+                         testsupport::ByName);
 
 }  // namespace

@@ -10,6 +10,8 @@
 
 namespace {
 
+using testsupport::PrintTo;
+
 using moviekit::Bytes;
 using moviekit::MovieLayout;
 using Recipe = moviekit::MovieRecipe;
@@ -99,7 +101,6 @@ struct InvalidRecipe {
     const char* name;
     void (*apply)(Recipe&);
 };
-void PrintTo(const InvalidRecipe& row, std::ostream* os) { *os << row.name; }
 
 class InvalidRecipeTest : public testing::TestWithParam<InvalidRecipe> {};
 
@@ -127,7 +128,6 @@ INSTANTIATE_TEST_SUITE_P(
         InvalidRecipe{"GeneratedSixChannelAac",
                       [](Recipe& r) { r.sound.codec = SoundCodec::Aac; r.sound.channels = 6; }},
         InvalidRecipe{"NoFrames", [](Recipe& r) { r.video.frameCount = 0; }},
-        InvalidRecipe{"MovieTimeScale0", [](Recipe& r) { r.movieTimeScale = 0; }}),
-    [](const testing::TestParamInfo<InvalidRecipe>& info) { return std::string(info.param.name); });
+        InvalidRecipe{"MovieTimeScale0", [](Recipe& r) { r.movieTimeScale = 0; }}), testsupport::ByName);
 
 }  // namespace

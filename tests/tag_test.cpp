@@ -22,6 +22,8 @@ using moviekit::Container;
 
 namespace {
 
+using testsupport::PrintTo;
+
 // A tag of LONG values whose type and count may disagree with them.
 Bytes Tag(uint16_t group, uint16_t number, uint16_t type, uint16_t count, const std::vector<uint32_t>& values)
 {
@@ -68,7 +70,6 @@ struct TrimRow {
     Bytes (*tags)();
     std::vector<uint32_t> read;  // forward, backward, rate; none when refused
 };
-void PrintTo(const TrimRow& row, std::ostream* os) { *os << row.name; }
 
 class TrimTagTest : public TagTreeTest, public ::testing::WithParamInterface<TrimRow> {};
 
@@ -99,8 +100,7 @@ INSTANTIATE_TEST_SUITE_P(
         TrimRow{"CountPastThePayload", [] { return Concat({kForward, Tag(0, 21, 4, 65535, {1, 2})}); }, {}},
         // Tags behind the third acceptance are never read, even a broken one.
         TrimRow{"StopsAfterTheThird", [] { return Concat({kForward, kBackward, kRate, Tag(0, 20, 4, 65535, {})}); },
-                {12, 7, 30000, 1001}}),
-    [](const ::testing::TestParamInfo<TrimRow>& info) { return std::string(info.param.name); });
+                {12, 7, 30000, 1001}}), testsupport::ByName);
 
 TEST_F(TagTreeTest, SoftwareNameReplacesTheFirstOldOneAndKeepsEverythingElse)
 {

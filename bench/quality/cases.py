@@ -72,21 +72,29 @@ def _intervals(rate, rng, count, shortest=0.5, longest=2.0):
         return out
 
 
-def all_cases(seed_base=1000):
+def _grid(materials, kinds, snrs, seed_base, codec_of, layout, quiet_parity):
+    """Each material meets each motor once, the SNRs rotating; `layout(rate, rng)` draws the
+    intervals; every other case (by `quiet_parity`) has one interval without the motor."""
     cases = []
-    for m, (mname, kind, rate, channels) in enumerate(MATERIALS):
-        for k, motor in enumerate(KINDS):
-            index = m * len(KINDS) + k
-            snr = SNRS[(m + k) % 3]
-            codec = "aac" if index % 6 == 5 else ("sowt" if index % 4 == 1 else "twos")
+    for m, (mname, kind, rate, channels) in enumerate(materials):
+        for k, motor in enumerate(kinds):
+            index = m * len(kinds) + k
+            snr = snrs[(m + k) % 3]
+            codec = codec_of(index)
             rng = np.random.default_rng(seed_base + index)
-            intervals = _intervals(rate, rng, 3)
-            motor_in = [True, True, True]
-            if index % 2 == 0:
-                motor_in[int(rng.integers(3))] = False
+            intervals = layout(rate, rng)
+            motor_in = [True] * len(intervals)
+            if index % 2 == quiet_parity:
+                motor_in[int(rng.integers(len(intervals)))] = False
             cases.append(Case(f"{mname}/{motor}/{snr}dB/{codec}", mname, kind, rate, channels, motor, snr, codec,
                               seed_base + index, intervals, motor_in))
     return cases
+
+
+def all_cases(seed_base=1000):
+    return _grid(MATERIALS, KINDS, SNRS, seed_base,
+                 lambda i: "aac" if i % 6 == 5 else ("sowt" if i % 4 == 1 else "twos"),
+                 lambda rate, rng: _intervals(rate, rng, 3), 0)
 
 
 def quick_cases():
@@ -96,18 +104,8 @@ def quick_cases():
 
 
 def holdout_cases(seed_base=5000):
-    cases = []
-    for m, (mname, kind, rate, channels) in enumerate(HOLDOUT_MATERIALS):
-        for k, motor in enumerate(HOLDOUT_KINDS):
-            index = m * len(HOLDOUT_KINDS) + k
-            snr = HOLDOUT_SNRS[(m + k) % 3]
-            codec = "aac" if index % 7 == 3 else ("sowt" if index % 3 == 1 else "twos")
-            rng = np.random.default_rng(seed_base + index)
-            count = int(rng.integers(2, 5))
-            intervals = _intervals(rate, rng, count, 0.3, 6.0 / count)
-            motor_in = [True] * count
-            if index % 2 == 1:
-                motor_in[int(rng.integers(count))] = False
-            cases.append(Case(f"{mname}/{motor}/{snr}dB/{codec}", mname, kind, rate, channels, motor, snr, codec,
-                              seed_base + index, intervals, motor_in))
-    return cases
+    def layout(rate, rng):
+        count = int(rng.integers(2, 5))
+        return _intervals(rate, rng, count, 0.3, 6.0 / count)
+    return _grid(HOLDOUT_MATERIALS, HOLDOUT_KINDS, HOLDOUT_SNRS, seed_base,
+                 lambda i: "aac" if i % 7 == 3 else ("sowt" if i % 3 == 1 else "twos"), layout, 1)

@@ -365,25 +365,32 @@ bool NoiseSuppressor::Adjoins(size_t index) const
 void NoiseSuppressor::ProcessSegment(const Segment& segment)
 {
     const size_t index = segment.index;
+    const bool whole = IsWhole(index);
+    const size_t lastAhead = std::min(LastAhead(index), m_surveyed > 0 ? m_surveyed - 1 : 0);
+    // A surveyed interval is judged before its spectra are looked at again: one left as it came
+    // costs nothing more.
+    if (whole && (!m_lens.Decide(index, lastAhead) || segment.span->strength <= 0.0f)) {
+        m_lastShare = 0.0;
+        return;
+    }
     SegmentSpectra& kept = m_surveys[index % m_surveys.size()];
-    SegmentSpectra& spectra = IsWhole(index) && kept.span == index ? kept : m_work;
+    SegmentSpectra& spectra = whole && kept.span == index ? kept : m_work;
     if (&spectra == &m_work) {
         Analyse(segment, m_work);
     }
     m_estimator.SetSurroundings(spectra.around, spectra.before, segment.first, segment.last,
-                                IsWhole(index) ? m_lens.Evidence(index) : nullptr);
+                                whole ? m_lens.Evidence(index) : nullptr);
     // A long interval is judged by its start, with the intervals before it.
-    if (!IsWhole(index) && segment.first) {
+    if (!whole && segment.first) {
         IntervalEvidence& evidence = m_lens.Record(index);
         m_estimator.Survey(spectra.power, spectra.roles.data(), evidence);
         evidence.adjoins = Adjoins(index);
+        if (!m_lens.Decide(index, lastAhead)) {
+            m_lastShare = 0.0;
+            return;
+        }
     }
-    const size_t lastAhead = std::min(LastAhead(index), m_surveyed > 0 ? m_surveyed - 1 : 0);
-    if (segment.first && !m_lens.Decide(index, lastAhead)) {
-        m_lastShare = 0.0;
-        return;
-    }
-    if ((!segment.first && !m_lens.Shown(index)) || segment.span->strength <= 0.0f) {
+    if (!m_lens.Shown(index) || segment.span->strength <= 0.0f) {
         return;
     }
     m_lens.Spectrum(index, lastAhead, m_motor);

@@ -6,8 +6,9 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <grp.h>
 #include <iterator>
-#include <sys/wait.h>
+#include <sstream>
 
 namespace testsupport {
 
@@ -94,6 +95,30 @@ size_t ThreadCount()
 size_t DescriptorCount()
 {
     return static_cast<size_t>(std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {}));
+}
+
+std::set<std::string> ExportedNames(const std::string& library)
+{
+    std::string output;
+    std::set<std::string> names;
+    if (RunCommand("nm -D --defined-only " + ShellQuote(library), &output) != 0) {
+        return names;
+    }
+    std::istringstream lines(output);
+    for (std::string line; std::getline(lines, line);) {
+        std::istringstream fields(line);
+        std::string address, kind, name;
+        fields >> address >> kind >> name;
+        if (kind != "A") {
+            names.insert(name);
+        }
+    }
+    return names;
+}
+
+bool DropRoot()
+{
+    return geteuid() != 0 || (setgroups(0, nullptr) == 0 && setgid(65534) == 0 && setuid(65534) == 0);
 }
 
 uint32_t GetBE32(const std::vector<uint8_t>& bytes, size_t at)
