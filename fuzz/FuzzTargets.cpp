@@ -15,6 +15,7 @@
 #include "atom/TqovixSoundEntry.h"
 #include "atom/TqovixTrackAtoms.h"
 #include "bridge/TqovixCodeTable.h"
+#include "codec/TqovixAacSyntax.h"
 #include "engine/CTqovixMainFrame.h"
 #include "file/CTqovixFile.h"
 #include "visitor/CTqovixAudioDataVisitor.h"
@@ -232,6 +233,17 @@ int Esds(const uint8_t* data, size_t size)
             (configSize > 0 && std::search(data, data + size, config, config + configSize) == data + size)) {
             std::abort();
         }
+        TqovixAacSyntax::ReadDecoderConfig(config, configSize);
+    }
+    const std::vector<uint8_t> frame(data, data + size);
+    TqovixAacSyntax::ReadFrameHeader(frame.data(), frame.size());
+    std::vector<uint8_t> padded;
+    const size_t target = size + (size != 0 ? data[size - 1] % 300 : 0);
+    if (TqovixAacSyntax::PadToSize(frame.data(), frame.size(), target, padded)) {
+        if (padded.size() != target) {
+            std::abort();
+        }
+        TqovixAacSyntax::ReadFrameHeader(padded.data(), padded.size());
     }
     return 0;
 }

@@ -28,7 +28,9 @@ int AtomTree(const uint8_t* data, size_t size);
 // tag writer, must give the input's own bytes (aborts otherwise).
 int TagCursor(const uint8_t* data, size_t size);
 // The "esds" descriptor chain (version and flags included); a decoder configuration it
-// accepts must lie inside the input (aborts otherwise).
+// accepts must lie inside the input (aborts otherwise), and is read as the splicing reads it.
+// The input is a raw AAC frame too: its first window read, and filled out to a longer size,
+// which must come out exactly that long (aborts otherwise).
 int Esds(const uint8_t* data, size_t size);
 // Every typed reader of the track atoms and the sound description over the input as a
 // payload; what a table reader accepts must fit the input and write back as its bytes.

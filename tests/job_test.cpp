@@ -38,6 +38,14 @@ constexpr double kAacKeptDb = 20.0;
 constexpr double kAacChangedDb = 10.0;
 // Inside the default movie's sound (48 048 PCM frames, 47 AAC packets).
 const std::vector<AfInterval> kIntervals = {{8000, 18000, 1000}, {28000, 40000, 500}};
+// The AAC movies run 3 s, so that most packets lie away from their intervals.
+constexpr uint32_t kAacRate = 48000;
+constexpr uint64_t kAacPackets = 141;
+const std::vector<AfInterval> kAacIntervals = {{kAacRate, kAacRate * 5 / 4, 1000}, {2 * kAacRate, kAacRate * 7 / 3, 500}};
+// Packets whose frames end further than this before an interval, or begin further after it, are
+// the source's own; a joint between the source's and re-encoded packets never clicks.
+constexpr uint64_t kAacAway = 8192;
+constexpr double kAacJointPeakShare = 0.1;
 
 // The same places at any rate, in the track's own frames.
 std::vector<AfInterval> IntervalsAt(uint32_t rate)
@@ -72,23 +80,23 @@ std::vector<int16_t> VoiceLike(uint64_t frames, uint32_t rate)
     return pcm;
 }
 
-// 47 AAC packets, what the default movie holds: voice-like tones, and loud rumble over the
-// intervals, so that processing there cannot leave the sound as it was.
+// 3 s of AAC packets: voice-like tones, and loud rumble over the intervals, so that processing
+// there cannot leave the sound as it was.
 const std::vector<moviekit::Bytes>& RumblingAacPackets()
 {
     static const std::vector<moviekit::Bytes> packets = [] {
-        constexpr uint32_t kRate = 48000;
-        constexpr uint64_t kFrames = 47 * 1024;
-        std::vector<int16_t> pcm = VoiceLike(kFrames, kRate);
-        const std::vector<int16_t> motor = testsupport::MotorOverSpans(kFrames, 2, kRate, Spans(IntervalsAt(kRate)), 0.6, 0);
+        constexpr uint64_t kFrames = kAacPackets * 1024;
+        std::vector<int16_t> pcm = VoiceLike(kFrames, kAacRate);
+        const std::vector<int16_t> motor =
+            testsupport::MotorOverSpans(kFrames, 2, kAacRate, Spans(kAacIntervals), 0.6, 0);
         for (size_t k = 0; k < pcm.size(); ++k) {
             pcm[k] = static_cast<int16_t>(std::clamp(pcm[k] + motor[k], -32767, 32767));
         }
         std::vector<moviekit::Bytes> encoded;
-        if (!jobtest::EncodeAacPackets(pcm, kRate, 2, 192000, encoded) || encoded.size() < 47) {
+        if (!testsupport::EncodeAacPackets(pcm, kAacRate, 2, 192000, encoded) || encoded.size() < kAacPackets) {
             return std::vector<moviekit::Bytes>{};
         }
-        encoded.resize(47);
+        encoded.resize(kAacPackets);
         return encoded;
     }();
     return packets;
@@ -164,11 +172,13 @@ TEST_P(JobMatrix, WritesACompleteMovie)
     recipe.sound.codec = GetParam().codec;
     GetParam().shape(recipe);
     const uint32_t rate = recipe.sound.sampleRate;
-    const std::vector<AfInterval> intervals = IntervalsAt(rate);
+    const bool aac = recipe.sound.codec == SoundCodec::Aac;
+    const std::vector<AfInterval> intervals = aac ? kAacIntervals : IntervalsAt(rate);
     recipe.maker.afIntervals = intervals;
-    if (recipe.sound.codec == SoundCodec::Aac) {
+    if (aac) {
         ASSERT_FALSE(RumblingAacPackets().empty());
         recipe.sound.aacPackets = RumblingAacPackets();
+        recipe.video.frameCount = 90;
     } else {
         // Loud rumble over the intervals, where the edit list puts them in the track.
         const uint64_t shift = recipe.sound.edts ? recipe.sound.mediaTime.value_or(0) : 0;
@@ -191,10 +201,16 @@ TEST_P(JobMatrix, WritesACompleteMovie)
         std::vector<int16_t> destinationSound;
         ASSERT_TRUE(jobtest::DecodeSound(source, sourceSound));
         ASSERT_TRUE(jobtest::DecodeSound(destination, destinationSound));
-        // ffmpeg judges: every channel within coding noise outside, and the rumble gone inside.
+        // ffmpeg judges: every channel within coding noise outside, and the rumble gone inside;
+        // away from the intervals the source's own packets, whatever chunks they lie in.
         EXPECT_EQ(jobtest::CheckReencodedSound(sourceSound, destinationSound, 2, Spans(intervals), kMargin, 2048,
                                                kAacKeptDb, kAacChangedDb),
                   "");
+        double kept = 0;
+        EXPECT_EQ(jobtest::CheckSplicedAac(source, destination, 2, intervals, kAacAway, kAacKeptDb,
+                                           kAacJointPeakShare, &kept),
+                  "");
+        EXPECT_GT(kept, 0.5);
     } else {
         ExpectPcmProcessedOnlyInside(source, destination, intervals, recipe.sound.channels, rate);
     }
@@ -214,7 +230,7 @@ const Layout kLayouts[] = {
      [](moviekit::MovieRecipe& r) { r.sound.chunkSampleCounts = {1, 7001, 20000, 3, 21043}; }},
     {"AacSmallChunks", SoundCodec::Aac, [](moviekit::MovieRecipe& r) { r.sound.samplesPerChunk = 3; }},
     {"AacUnevenChunksLastOfOne", SoundCodec::Aac,
-     [](moviekit::MovieRecipe& r) { r.sound.chunkSampleCounts = {1, 20, 25, 1}; }},
+     [](moviekit::MovieRecipe& r) { r.sound.chunkSampleCounts = {1, 60, 79, 1}; }},
     {"TwosCo64", SoundCodec::Twos, [](moviekit::MovieRecipe& r) { r.co64 = true; }},
     {"AacCo64MoovFirst", SoundCodec::Aac, [](moviekit::MovieRecipe& r) { r.co64 = r.moovBeforeMdat = true; }},
     {"SowtMoovFirst", SoundCodec::Sowt, [](moviekit::MovieRecipe& r) { r.moovBeforeMdat = true; }},
@@ -371,7 +387,7 @@ TEST_F(JobTest, AacSoundKeptOutsideAfIntervals)
         pcm[k] = static_cast<int16_t>(std::clamp(pcm[k] + motor[k], -32767, 32767));
     }
     std::vector<moviekit::Bytes> packets;
-    ASSERT_TRUE(jobtest::EncodeAacPackets(pcm, kRate, 2, 192000, packets));
+    ASSERT_TRUE(testsupport::EncodeAacPackets(pcm, kRate, 2, 192000, packets));
     moviekit::MovieRecipe recipe;
     recipe.sound.codec = SoundCodec::Aac;
     recipe.sound.aacPackets = packets;
@@ -402,7 +418,12 @@ TEST_F(JobTest, AacSoundKeptOutsideAfIntervals)
         }
     }
     EXPECT_LT(std::abs(lag), 1024) << "the sound moved against the video by more than a packet";
-    // The encoder gives up its first block of processed sound, so the first 1024 frames go quiet.
+    // Away from the interval the source's own packets, and every joint within coding noise.
+    double kept = 0;
+    EXPECT_EQ(jobtest::CheckSplicedAac(source, destination, 2, {interval}, kAacAway, kAacKeptDb, kAacJointPeakShare,
+                                       &kept),
+              "");
+    EXPECT_GT(kept, 0.5);
     auto outside = [&](int64_t f) { return !jobtest::NearInterval(static_cast<uint64_t>(f), {interval}, kMargin); };
     const auto end = static_cast<int64_t>(a.size());
     EXPECT_GT(Correlation(a, b, lag, kEncoderLeadIn, end, outside), 0.99) << "lag " << lag;

@@ -28,6 +28,7 @@ struct StopRow {
     // where the job still has to write would hold the job too.
     int heldCall;
     bool existing;  // a file already stands at the destination
+    moviekit::SoundCodec codec = moviekit::SoundCodec::Twos;
 };
 void PrintTo(const StopRow& row, std::ostream* out) { *out << row.name; }
 
@@ -137,6 +138,14 @@ TEST_P(StopTest, NothingIsPublishedAndTheProgressWaitsForTheCopy)
     recipe.video.framesPerChunk = 15;
     // Sound changes only in the first chunk: the copy is never held where the sound is written.
     recipe.maker.afIntervals = std::vector<moviekit::AfInterval>{{4800, 12000, 1000}};
+    if (row.codec == moviekit::SoundCodec::Aac) {
+        // Re-encoded packets over the copy, in the first chunk, which leads the media data.
+        constexpr uint64_t kPackets = 94;  // as long as the video
+        recipe.sound.codec = row.codec;
+        recipe.sound.aacPackets = testsupport::MotorAacPackets(kPackets, 48000, {4800, 12000}, 192000);
+        ASSERT_EQ(recipe.sound.aacPackets.size(), kPackets);
+        recipe.soundFirstInPeriod = true;
+    }
     const std::string source = m_dir.File("source.mov");
     const std::string destination = m_dir.File("destination.mov");
     std::string error;
@@ -212,7 +221,11 @@ INSTANTIATE_TEST_SUITE_P(
                       StopRow{"AbortAtTheFirstPiece", Stop::AbortRequest, 1, false},
                       StopRow{"AbortLaterOverAFile", Stop::AbortRequest, 4, true},
                       StopRow{"CloseAtTheFirstPiece", Stop::Close, 1, true},
-                      StopRow{"CloseLater", Stop::Close, 4, false}),
+                      StopRow{"CloseLater", Stop::Close, 4, false},
+                      StopRow{"AacNoStop", Stop::None, 1, false, moviekit::SoundCodec::Aac},
+                      StopRow{"AacHostAnswerAtTheFirstPiece", Stop::HostAnswer, 1, false, moviekit::SoundCodec::Aac},
+                      StopRow{"AacAbortLaterOverAFile", Stop::AbortRequest, 4, true, moviekit::SoundCodec::Aac},
+                      StopRow{"AacCloseLater", Stop::Close, 4, false, moviekit::SoundCodec::Aac}),
     [](const ::testing::TestParamInfo<StopRow>& info) { return std::string(info.param.name); });
 
 }  // namespace

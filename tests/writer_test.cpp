@@ -60,10 +60,14 @@ struct Source {
     uint64_t mediaEnd = 0;  // where the source's media data ends: before it, only processed sound may change
 };
 
+// What the copy writes against the general writer: fewer writes where the layout lets the copy be
+// taken, the same where it does not; AAC whose packets outgrow their chunks stops patching there.
+enum class Writes { Fewer, Same, Any };
+
 struct WriterRow {
     const char* name;
     std::function<Source(const testsupport::TempDir&)> make;  // writes the source
-    bool patched;  // the layout lets the copy be taken
+    Writes writes;
     bool motor = false;  // the interval holds a motor, so the job changes samples there
     uint64_t servedLimit = 0;  // if set, the served sound kept to compare with; past it the file is read
 };
@@ -106,6 +110,21 @@ void DeepWithMotor(Recipe& r, uint16_t bits, uint32_t rate, bool floatingPoint =
     r.video.frameCount = 60;
 }
 
+// AAC that processing changes over the interval, encoded at `bitRate`; the description may claim
+// another rate, which the job's encoder takes, so that its packets outgrow the source's.
+void AacWithMotor(Recipe& r, uint32_t bitRate, uint32_t claimed = 0)
+{
+    constexpr uint64_t kPackets = 47;
+    constexpr uint64_t kStart = 12000, kEnd = 26000;  // long enough for the motor to be heard
+    r.sound.codec = SoundCodec::Aac;
+    r.maker.afIntervals = {{kStart, kEnd, 1000}};
+    r.sound.aacPackets = testsupport::MotorAacPackets(kPackets, 48000, {kStart, kEnd}, bitRate);
+    EXPECT_EQ(r.sound.aacPackets.size(), kPackets);
+    if (claimed != 0) {
+        r.sound.esds.averageBitRate = claimed;
+    }
+}
+
 // A movie the ffmpeg command writes, given the maker atoms.
 std::function<Source(const testsupport::TempDir&)> Ffmpeg(std::string sound)
 {
@@ -125,6 +144,26 @@ std::function<Source(const testsupport::TempDir&)> Ffmpeg(std::string sound)
         EXPECT_TRUE(moviekit::AddMakerData(path, recipe, 48000, &error)) << error;
         return Source{path};
     };
+}
+
+// The size of the first media data atom at the top level; 0 when there is none.
+uint64_t MediaDataSize(const std::vector<uint8_t>& file)
+{
+    for (uint64_t at = 0; at + 8 <= file.size();) {
+        uint64_t size = testsupport::GetBE32(file, at);
+        if (size == 1 && at + 16 <= file.size()) {
+            size = uint64_t{testsupport::GetBE32(file, at + 8)} << 32 | testsupport::GetBE32(file, at + 12);
+        }
+        if (std::equal(file.begin() + static_cast<std::ptrdiff_t>(at + 4), file.begin() + static_cast<std::ptrdiff_t>(at + 8),
+                       "mdat")) {
+            return size;
+        }
+        if (size < 8) {
+            return 0;
+        }
+        at += size;
+    }
+    return 0;
 }
 
 class WriterTest : public ::testing::TestWithParam<WriterRow> {
@@ -159,11 +198,23 @@ TEST_P(WriterTest, BothWritersGiveTheSameBytes)
         ASSERT_TRUE(made.mediaEnd != 0 && made.mediaEnd <= std::min(a.size(), before.size()));
         EXPECT_FALSE(std::equal(before.begin(), before.begin() + static_cast<std::ptrdiff_t>(made.mediaEnd), a.begin()))
             << "the job changed no sound: the writers were not put to the test";
+        // Re-encoded packets that fit keep every chunk in place; outgrown chunks push the rest on.
+        if (GetParam().writes == Writes::Any) {
+            EXPECT_GT(MediaDataSize(a), MediaDataSize(before)) << "no chunk was outgrown";
+        } else {
+            EXPECT_EQ(MediaDataSize(a), MediaDataSize(before));
+        }
+        std::string said;
+        EXPECT_EQ(testsupport::RunCommand("ffprobe -v error -show_packets -of compact " + testsupport::ShellQuote(copied) +
+                                              " 2>&1 >/dev/null",
+                                          &said),
+                  0);
+        EXPECT_EQ(said, "");
     }
     // The copy writes only the changed sound and the movie atom; the general writer every chunk.
-    if (GetParam().patched) {
+    if (GetParam().writes == Writes::Fewer) {
         EXPECT_LT(copiedWrites, laidOutWrites);
-    } else {
+    } else if (GetParam().writes == Writes::Same) {
         EXPECT_EQ(copiedWrites, laidOutWrites);
     }
 }
@@ -171,29 +222,36 @@ TEST_P(WriterTest, BothWritersGiveTheSameBytes)
 INSTANTIATE_TEST_SUITE_P(
     Layouts, WriterTest,
     ::testing::Values(
-        WriterRow{"Twos", Kit([](Recipe&) {}), true},
-        WriterRow{"Sowt", Kit([](Recipe& r) { r.sound.codec = SoundCodec::Sowt; }), true},
-        WriterRow{"TwosUnevenChunks", Kit([](Recipe& r) { r.sound.chunkSampleCounts = {1, 7001, 20000, 3, 21043}; }), true},
-        WriterRow{"SowtSoundFirstCo64", Kit([](Recipe& r) { r.soundFirstInPeriod = r.co64 = true; }), true},
-        WriterRow{"Twos44100Mono", Kit([](Recipe& r) { r.sound.sampleRate = 44100; r.sound.channels = 1; }), true},
-        WriterRow{"FfmpegBigEndianWithTimecode", Ffmpeg("-c:a pcm_s16be -timecode 10:00:00:00"), true},
-        WriterRow{"FfmpegLittleEndianMono", Ffmpeg("-c:a pcm_s16le -ac 1"), true},
+        WriterRow{"Twos", Kit([](Recipe&) {}), Writes::Fewer},
+        WriterRow{"Sowt", Kit([](Recipe& r) { r.sound.codec = SoundCodec::Sowt; }), Writes::Fewer},
+        WriterRow{"TwosUnevenChunks", Kit([](Recipe& r) { r.sound.chunkSampleCounts = {1, 7001, 20000, 3, 21043}; }), Writes::Fewer},
+        WriterRow{"SowtSoundFirstCo64", Kit([](Recipe& r) { r.soundFirstInPeriod = r.co64 = true; }), Writes::Fewer},
+        WriterRow{"Twos44100Mono", Kit([](Recipe& r) { r.sound.sampleRate = 44100; r.sound.channels = 1; }), Writes::Fewer},
+        WriterRow{"FfmpegBigEndianWithTimecode", Ffmpeg("-c:a pcm_s16be -timecode 10:00:00:00"), Writes::Fewer},
+        WriterRow{"FfmpegLittleEndianMono", Ffmpeg("-c:a pcm_s16le -ac 1"), Writes::Fewer},
         // Every width, either byte order: changed samples written whole, nothing else.
-        WriterRow{"In24LittleEndianMotor", Kit([](Recipe& r) { DeepWithMotor(r, 24, 48000); r.sound.codec = SoundCodec::Sowt; }), true, true},
-        WriterRow{"Lpcm24Bit96kMotor", Kit([](Recipe& r) { DeepWithMotor(r, 24, 96000); }), true, true},
+        WriterRow{"In24LittleEndianMotor", Kit([](Recipe& r) { DeepWithMotor(r, 24, 48000); r.sound.codec = SoundCodec::Sowt; }), Writes::Fewer, true},
+        WriterRow{"Lpcm24Bit96kMotor", Kit([](Recipe& r) { DeepWithMotor(r, 24, 96000); }), Writes::Fewer, true},
         // What was served is gone: the copy compares with the file, reversed sample by sample.
-        WriterRow{"Lpcm24Bit96kMotorComparedWithTheFile", Kit([](Recipe& r) { DeepWithMotor(r, 24, 96000); }), true, true,
+        WriterRow{"Lpcm24Bit96kMotorComparedWithTheFile", Kit([](Recipe& r) { DeepWithMotor(r, 24, 96000); }), Writes::Fewer, true,
                   64 << 10},
-        WriterRow{"In32UnevenChunksMotor", Kit([](Recipe& r) { DeepWithMotor(r, 32, 48000); r.sound.chunkSampleCounts = {1, 7001, 20000, 3, 68995}; }), true, true},
-        WriterRow{"Fl32Motor", Kit([](Recipe& r) { DeepWithMotor(r, 32, 48000, true); }), true, true},
-        WriterRow{"Fl64LittleEndianMotor", Kit([](Recipe& r) { DeepWithMotor(r, 64, 44100, true); r.sound.codec = SoundCodec::Sowt; }), true, true},
-        WriterRow{"FfmpegFloatBigEndian", Ffmpeg("-c:a pcm_f32be"), true},
-        WriterRow{"In24MotorMoovFirst", Kit([](Recipe& r) { DeepWithMotor(r, 24, 48000); r.moovBeforeMdat = true; }), false},
+        WriterRow{"In32UnevenChunksMotor", Kit([](Recipe& r) { DeepWithMotor(r, 32, 48000); r.sound.chunkSampleCounts = {1, 7001, 20000, 3, 68995}; }), Writes::Fewer, true},
+        WriterRow{"Fl32Motor", Kit([](Recipe& r) { DeepWithMotor(r, 32, 48000, true); }), Writes::Fewer, true},
+        WriterRow{"Fl64LittleEndianMotor", Kit([](Recipe& r) { DeepWithMotor(r, 64, 44100, true); r.sound.codec = SoundCodec::Sowt; }), Writes::Fewer, true},
+        WriterRow{"FfmpegFloatBigEndian", Ffmpeg("-c:a pcm_f32be"), Writes::Fewer},
+        WriterRow{"In24MotorMoovFirst", Kit([](Recipe& r) { DeepWithMotor(r, 24, 48000); r.moovBeforeMdat = true; }), Writes::Same},
         // Layouts the general writer changes: the copy would not be its result.
-        WriterRow{"MoovFirst", Kit([](Recipe& r) { r.moovBeforeMdat = true; }), false},
-        WriterRow{"ThreeMdats", Kit([](Recipe& r) { r.mdatCount = 3; }), false},
-        WriterRow{"LargeMdatHeader", Kit([](Recipe& r) { r.largeMdatHeader = true; }), false},
-        WriterRow{"Aac", Kit([](Recipe& r) { r.sound.codec = SoundCodec::Aac; }), false}),
+        WriterRow{"MoovFirst", Kit([](Recipe& r) { r.moovBeforeMdat = true; }), Writes::Same},
+        WriterRow{"ThreeMdats", Kit([](Recipe& r) { r.mdatCount = 3; }), Writes::Same},
+        WriterRow{"LargeMdatHeader", Kit([](Recipe& r) { r.largeMdatHeader = true; }), Writes::Same},
+        // AAC: re-encoded packets filled out to the bytes of those they replace, run by run or over
+        // the chunk; packets that outgrow their chunk move it and everything after it.
+        WriterRow{"Aac", Kit([](Recipe& r) { r.sound.codec = SoundCodec::Aac; }), Writes::Fewer},
+        WriterRow{"AacMotor", Kit([](Recipe& r) { AacWithMotor(r, 192000); }), Writes::Fewer, true},
+        WriterRow{"AacMotorSmallChunks", Kit([](Recipe& r) { AacWithMotor(r, 192000); r.sound.samplesPerChunk = 3; }),
+                  Writes::Fewer, true},
+        WriterRow{"AacMotorOutgrowingItsChunks", Kit([](Recipe& r) { AacWithMotor(r, 32000, 256000); }), Writes::Any,
+                  true}),
     [](const ::testing::TestParamInfo<WriterRow>& info) { return std::string(info.param.name); });
 
 }  // namespace

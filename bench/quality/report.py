@@ -124,10 +124,10 @@ def render(entries, methods, total_seconds, quick, tool, rnnoise_module, section
     lines.append("")
     lines.append("Inside the AF intervals, against the clean sound (bench/quality/README.md says how the material,"
                  " the motors and the scores are made). SI-SDR change = result minus noisy input, mean over cases;"
-                 " worst = the lowest change of any interval (PCM cases; AAC given apart: ours re-encodes the whole"
-                 " track, which costs a few hundredths of a decibel even where nothing is removed);"
+                 " worst = the lowest change of any interval (PCM cases; AAC given apart: ours re-encodes the"
+                 " packets around the sound it changes, a second generation of coding there);"
                  " no motor noise = AF intervals where the motor is silent,"
-                 " result against input (PCM cases; AAC is re-encoded by ours and given apart);"
+                 " result against input (PCM cases; AAC given apart);"
                  " log-spectral distance = mean over cases, lower is better.")
     lines.append("")
     lines.append("| method | mean SI-SDR change | worst | interval with no motor noise (SI-SDR of the result) "

@@ -78,6 +78,11 @@ eConverterErrorCode AACEncoder::SetEncodeBitRate(unsigned int bitRate)
     return SetACProperty(kAudioConverterEncodeBitRate, sizeof bitRate, &bitRate);
 }
 
+void AACEncoder::SetDroppedFrames(unsigned int frames)
+{
+    m_dropBytes = uint64_t{frames} * m_inputDescription.mBytesPerFrame;
+}
+
 unsigned int AACEncoder::HeldSize() const
 {
     return m_pRemainder != nullptr ? m_remainderSize : 0;

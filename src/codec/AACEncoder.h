@@ -19,6 +19,10 @@ public:
     // Room for one packet, whatever the channel count.
     static constexpr unsigned int kBlockSize = 4096;
     static constexpr unsigned int kOwnBufferSize = 32768;
+    // The shape the platform encoder gives its plain long windows (Kaiser-Bessel derived); a
+    // decoder carries a frame's shape into the next one's first half, so packets of ours only
+    // follow those of an encoder that shapes its long windows alike.
+    static constexpr uint8_t kLongWindowShape = 1;
 
     AACEncoder();
     ~AACEncoder() override;
@@ -36,6 +40,9 @@ public:
     virtual eConverterErrorCode EncodeDone();
 
     eConverterErrorCode SetEncodeBitRate(unsigned int bitRate);
+    // After Initialize, before the first push: how many frames to drop instead of kDroppedFrames
+    // (a span re-encoded from within the track keeps them all and places itself).
+    void SetDroppedFrames(unsigned int frames);
 
     static OSStatus EncoderDataProc(AudioConverterRef converter, UInt32* ioNumberDataPackets,
                                     AudioBufferList* ioData, AudioStreamPacketDescription** outPacketDescription,

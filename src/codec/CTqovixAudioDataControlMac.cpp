@@ -5,12 +5,10 @@
 
 #include "bridge/TqovixInterfaceConvert.h"
 #include "codec/AACDecoder.h"
-#include "codec/AACEncoder.h"
 #include "movie/CTqovixMovControl.h"
 
 namespace {
 
-constexpr unsigned int kStreamBufferSize = 4096;
 constexpr uint32_t kPcmFlags = 12;  // signed integer, packed, host order
 constexpr double kFloorBitRatePerChannel = 64000;
 
@@ -75,22 +73,6 @@ eTqovixErrorCode CTqovixAudioDataControlMac::OpenEncoderAAC(
     if (!m_pAACFormat || !m_pPCMFormat) {
         return eTqovixErrorInternal;
     }
-    try {
-        m_pEncoder = std::make_unique<AACEncoder>();
-        m_pBinding = std::make_unique<EncodeCallbackBinding>();
-        m_pStreamBuffer = std::make_unique<unsigned char[]>(kStreamBufferSize);
-        m_pEncoderStream = std::make_unique<ACEncoderStream>();
-    } catch (const std::bad_alloc&) {
-        CloseEncoderAAC();
-        return eTqovixErrorOutOfMemory;
-    }
-    m_pBinding->object = const_cast<CTqovixMovControl*>(movControl);
-    m_pBinding->function = &CTqovixMovControl::EncodeCallback;
-    m_pEncoderStream->requestProc = EncoderRequestProc;
-    m_pEncoderStream->resultProc = EncoderResultProc;
-    m_pEncoderStream->buffer = m_pStreamBuffer.get();
-    m_pEncoderStream->bufferSize = kStreamBufferSize;
-    m_pEncoderStream->userData = m_pBinding.get();
     // The source's average rate says what its sound cost, not what the processed sound needs:
     // a track of near silence averages a few kb/s, which no encoder takes. Quality has a floor.
     if (bitRate != 0) {
@@ -98,12 +80,13 @@ eTqovixErrorCode CTqovixAudioDataControlMac::OpenEncoderAAC(
         const double perChannel = std::min(kFloorBitRatePerChannel, m_pAACFormat->sampleRate * 4 / 3);
         const auto floor = static_cast<unsigned int>(perChannel * m_pAACFormat->channelsPerFrame);
         bitRate = std::max(bitRate, floor);
+        // No more than a packet may carry: 6144 bits a channel.
+        const double ceiling = 6 * m_pAACFormat->sampleRate * m_pAACFormat->channelsPerFrame;
+        bitRate = std::min(bitRate, static_cast<unsigned int>(ceiling));
     }
-    const eTqovixErrorCode opened =
-        ConvertOVIXResult(m_pEncoder->Initialize(*m_pPCMFormat, *m_pAACFormat, bitRate, m_pEncoderStream.get()));
-    if (TqovixFailed(opened)) {
-        CloseEncoderAAC();
-    }
+    auto* sink = static_cast<CTqovixAacSplicer::Sink*>(const_cast<CTqovixMovControl*>(movControl));
+    const eTqovixErrorCode opened = m_splicer.Open(*m_pPCMFormat, *m_pAACFormat, bitRate, sink);
+    m_bEncoderOpen = !TqovixFailed(opened);
     return opened;
 }
 
@@ -111,11 +94,17 @@ void CTqovixAudioDataControlMac::CloseDecoderAAC() { m_pDecoder.reset(); }
 
 void CTqovixAudioDataControlMac::CloseEncoderAAC()
 {
-    // The encoder refers to the stream, so it goes first.
-    m_pEncoder.reset();
-    m_pEncoderStream.reset();
-    m_pBinding.reset();
-    m_pStreamBuffer.reset();
+    m_splicer.Close();
+    m_bEncoderOpen = false;
+}
+
+eTqovixErrorCode CTqovixAudioDataControlMac::PopAudioData(void* buffer, unsigned long* size, unsigned long requested)
+{
+    const eTqovixErrorCode result = CTqovixAudioDataControl::PopAudioData(buffer, size, requested);
+    if (!TqovixFailed(result) && m_bEncoderOpen) {
+        m_splicer.KeepServed(buffer, *size);
+    }
+    return result;
 }
 
 eTqovixErrorCode CTqovixAudioDataControlMac::DecodeAAC2PCM(void* pcm, unsigned int* pcmSize, unsigned int* usedSize,
@@ -130,35 +119,16 @@ eTqovixErrorCode CTqovixAudioDataControlMac::DecodeAAC2PCM(void* pcm, unsigned i
 
 eTqovixErrorCode CTqovixAudioDataControlMac::EncodePCM2AAC(void* pcm, unsigned int pcmSize)
 {
-    if (pcm == nullptr || pcmSize == 0 || !m_pEncoder) {
+    if (pcm == nullptr || pcmSize == 0 || !m_bEncoderOpen) {
         return eTqovixErrorInternal;
     }
-    return ConvertOVIXResult(m_pEncoder->Encode(pcm, pcmSize));
+    return m_splicer.Push(pcm, pcmSize);
 }
 
 eTqovixErrorCode CTqovixAudioDataControlMac::EncodeDone()
 {
-    if (!m_pEncoder) {
+    if (!m_bEncoderOpen) {
         return eTqovixErrorInternal;
     }
-    return ConvertOVIXResult(m_pEncoder->EncodeDone());
-}
-
-unsigned char* EncoderRequestProc(void* stream, unsigned int size)
-{
-    const auto* encoderStream = static_cast<const ACEncoderStream*>(stream);
-    if (encoderStream == nullptr || size == 0 || encoderStream->bufferSize <= size) {
-        return nullptr;
-    }
-    return encoderStream->buffer;
-}
-
-eTqovixErrorCode EncoderResultProc(void* stream, unsigned char* data, unsigned int size)
-{
-    const auto* encoderStream = static_cast<const ACEncoderStream*>(stream);
-    const auto* binding = encoderStream ? static_cast<const EncodeCallbackBinding*>(encoderStream->userData) : nullptr;
-    if (binding != nullptr && binding->function != nullptr) {
-        binding->function(binding->object, data, static_cast<int>(size));
-    }
-    return eTqovixSuccess;
+    return m_splicer.Finish();
 }

@@ -1,5 +1,6 @@
 // The audio data control with real AAC codecs: decodes the source's packets for the
-// processing library and encodes its processed PCM, each packet going straight to
+// processing library, and hands its processed PCM to the splicer, which carries the
+// source's packets where the sound came back as it went and re-encodes the rest for
 // the movie controller's writer. For a PCM track it is the plain control.
 #pragma once
 
@@ -10,14 +11,9 @@
 #include "codec/AACEncoder.h"
 #include "codec/ACEncoderStream.h"
 #include "codec/ACFormat.h"
+#include "codec/CTqovixAacSplicer.h"
 #include "codec/eConverterErrorCode.h"
 
-
-// What the encoder stream's userData points at: the packet's way to the writer.
-struct EncodeCallbackBinding {
-    void* object = nullptr;
-    void (*function)(void* object, unsigned char* packet, int size) = nullptr;
-};
 
 class CTqovixAudioDataControlMac : public CTqovixAudioDataControl {
 public:
@@ -41,7 +37,12 @@ public:
                                    unsigned int packetSize) override;
     eTqovixErrorCode EncodePCM2AAC(void* pcm, unsigned int pcmSize) override;
     eTqovixErrorCode EncodeDone() override;
-    bool IsAACCodec() override { return m_pDecoder != nullptr || m_pEncoder != nullptr; }
+    bool IsAACCodec() override { return m_pDecoder != nullptr || m_bEncoderOpen; }
+    // Serves as the base does, and keeps what it served for the splicer to compare with.
+    eTqovixErrorCode PopAudioData(void* buffer, unsigned long* size, unsigned long requested) override;
+    // The track's packets; `whole` re-encodes them all, for streams we cannot splice into.
+    void PlanSplicing(uint64_t packetCount, bool whole) { m_splicer.Plan(packetCount, whole); }
+    const CTqovixAacSplicer::Statistics& GetSplicingStatistics() const { return m_splicer.GetStatistics(); }
 
     const ACFormat* GetAACFormat() const { return m_pAACFormat.get(); }
     const ACFormat* GetPCMFormat() const { return m_pPCMFormat.get(); }
@@ -52,13 +53,8 @@ public:
 
 private:
     std::unique_ptr<AACDecoder> m_pDecoder;
-    std::unique_ptr<AACEncoder> m_pEncoder;
     std::unique_ptr<ACFormat> m_pAACFormat;
     std::unique_ptr<ACFormat> m_pPCMFormat;
-    std::unique_ptr<ACEncoderStream> m_pEncoderStream;
-    std::unique_ptr<unsigned char[]> m_pStreamBuffer;
-    std::unique_ptr<EncodeCallbackBinding> m_pBinding;
+    CTqovixAacSplicer m_splicer;
+    bool m_bEncoderOpen = false;
 };
-
-unsigned char* EncoderRequestProc(void* stream, unsigned int size);
-eTqovixErrorCode EncoderResultProc(void* stream, unsigned char* data, unsigned int size);

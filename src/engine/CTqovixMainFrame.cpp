@@ -372,6 +372,10 @@ void CTqovixMainFrame::NotifyProgress(unsigned long first, unsigned long second)
                 }
             } else {
                 engine->FinishAACJob();
+                // Ended otherwise while it waited for its copy: what was to be shown is stale.
+                if (engine->m_progressDataControl.GetErrorResult() != eTqovixFinished) {
+                    return;
+                }
             }
         }
     } else if (finished != eTqovixRunning) {

@@ -35,17 +35,17 @@ void CTqovixBackgroundCopy::Start(CTqovixFile& destination, CTqovixFile& source,
         return;
     }
     try {
-        m_thread = std::thread([this, from, end] { Run(from, end); });
+        m_thread = std::thread([this, from] { Run(from); });
     } catch (const std::system_error&) {
-        Run(from, end);  // no thread to be had: the copy is simply not beside anything
+        Run(from);  // no thread to be had: the copy is simply not beside anything
     }
 }
 
-void CTqovixBackgroundCopy::Run(uint64_t from, uint64_t end)
+void CTqovixBackgroundCopy::Run(uint64_t from)
 {
     eTqovixErrorCode result = eTqovixSuccess;
-    for (uint64_t begin = from; begin < end && !TqovixFailed(result);) {
-        const uint64_t stop = std::min(end, begin + kPiece);
+    for (uint64_t begin = from; !TqovixFailed(result);) {
+        uint64_t stop = 0;
         std::map<uint64_t, uint64_t> claims;
         {
             std::lock_guard lock(m_mutex);
@@ -53,6 +53,11 @@ void CTqovixBackgroundCopy::Run(uint64_t from, uint64_t end)
                 result = eTqovixErrorAborted;
                 break;
             }
+            // The end may have been brought forward meanwhile.
+            if (begin >= m_end) {
+                break;
+            }
+            stop = std::min(m_end, begin + kPiece);
             // Claims made until now stand; later ones lie past what the copy owns.
             m_claimedEnd = stop;
             std::vector<std::pair<uint64_t, uint64_t>> beyond;
@@ -155,6 +160,15 @@ void CTqovixBackgroundCopy::GetProgress(uint64_t& done, uint64_t& total)
     std::lock_guard lock(m_mutex);
     done = m_reached - m_from;
     total = m_end - m_from;
+}
+
+eTqovixErrorCode CTqovixBackgroundCopy::JoinUpTo(uint64_t end, const KeepGoing& keepGoing)
+{
+    {
+        std::lock_guard lock(m_mutex);
+        m_end = std::max(m_from, std::min(m_end, end));
+    }
+    return Join(keepGoing);
 }
 
 void CTqovixBackgroundCopy::Stop()

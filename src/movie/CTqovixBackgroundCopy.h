@@ -35,11 +35,13 @@ public:
     eTqovixErrorCode Join(const KeepGoing& keepGoing = nullptr);
     // Asks the copy to stop and waits for it.
     void Stop();
+    // The copy ends at `end` instead (where it has not passed it yet); then as Join.
+    eTqovixErrorCode JoinUpTo(uint64_t end, const KeepGoing& keepGoing = nullptr);
     // Bytes copied so far and in all (both 0 when no copy was started).
     void GetProgress(uint64_t& done, uint64_t& total);
 
 private:
-    void Run(uint64_t from, uint64_t end);
+    void Run(uint64_t from);
     eTqovixErrorCode CopyPiece(uint64_t begin, uint64_t end, const std::map<uint64_t, uint64_t>& claims);
 
     CTqovixFile* m_pDestination = nullptr;

@@ -53,6 +53,7 @@ eTqovixErrorCode CTqovixMovControl::Initialize(const char* sourcePath, const cha
 {
     m_refusal.clear();
     m_refusalKind = eTqovixRefusal::None;
+    m_aacWholeReason.clear();
     if (sourcePath == nullptr || sourcePath[0] == '\0') {
         return eTqovixErrorSourceNotFound;
     }
@@ -143,6 +144,8 @@ void CTqovixMovControl::Close()
     m_outputAudioChunkIndex = 0;
     m_outputMovieDataChunkIndex = 0;
     m_samplesInOutputChunk = 0;
+    m_sourceBytesInChunk = 0;
+    m_chunkFirstPacket.clear();
     m_bytesInOutputChunk = 0;
     m_mediaDataSize = 0;
     m_mediaDataSizePosition = 0;
@@ -172,6 +175,12 @@ void CTqovixMovControl::Close()
     m_carriedBytes = 0;
     std::vector<uint8_t>().swap(m_copyBuffer);
     m_bPatching = false;
+    m_bPatchStopped = false;
+    m_mediaDataStart = 0;
+    m_sourceSizePosition = 0;
+    m_aacRuns.clear();
+    m_aacGathered = 0;
+    m_bGatherAacChunks = false;
     m_bPatchCandidate = false;
     m_servedSound.Clear();
     m_bServedOverflow = false;
@@ -237,12 +246,30 @@ eTqovixErrorCode CTqovixMovControl::GetAudioInformation(TqovixInterfaceConvert::
     }
     m_bPCM = false;
     record.sampleRate *= 1000;
+    // Spans are re-encoded a little below what the source spends on average, so that they mostly
+    // fit in the bytes of the packets they replace; a whole re-encode takes the rate the
+    // description claims, as it always did.
+    uint64_t bitRate = information.GetAverageBitRate();
+    if (m_aacWholeReason.empty() && !m_chunkFirstPacket.empty() && m_chunkFirstPacket.back() != 0) {
+        constexpr double kSpanShare = 0.9;
+        uint64_t bytes = 0;
+        for (const TqovixChunkInformation& chunk : m_audioChunks) {
+            bytes += chunk.size;
+        }
+        const double spent = 8.0 * static_cast<double>(bytes) * information.GetSampleRateHz() /
+                             (1024.0 * static_cast<double>(m_chunkFirstPacket.back()));
+        bitRate = static_cast<uint64_t>(std::min(kSpanShare * spent, 4e9));
+    }
     const eTqovixErrorCode opened = m_audioDataControl.SetAACInformation(
         this, information.GetAudioSpecificConfigData(), information.GetAudioSpecificConfigSize(), record,
-        information.GetAverageBitRate());
+        static_cast<unsigned int>(bitRate));
     if (TqovixFailed(opened)) {
         return opened;
     }
+    if (m_chunkFirstPacket.empty()) {
+        return eTqovixErrorInternal;
+    }
+    m_audioDataControl.PlanSplicing(m_chunkFirstPacket.back(), !m_aacWholeReason.empty());
     record.sampleRate /= 1000;
     record.sampleCount *= 1024;
     return eTqovixSuccess;

@@ -57,7 +57,8 @@ eTqovixErrorCode CTqovixMovControl::WriteLeadingAtoms()
         }
     }
     try {
-        if (m_bPCM) {
+        // A patched copy holds every chunk where it was; the general writer places AAC's anew.
+        if (m_bPCM || patching) {
             m_outputAudioChunks = m_audioChunks;
         }
         m_outputMovieDataChunks = m_movieDataChunks;
@@ -164,6 +165,12 @@ eTqovixErrorCode CTqovixMovControl::WriteMovieAtom()
             }
             end += atom->GetSize();
         }
+    }
+    if (m_bPatchStopped) {
+        // Laid out anew after a chunk, the media may end before the copy did.
+        long long position = 0;
+        result = m_destinationFile.GetPosition(&position);
+        return TqovixFailed(result) ? result : m_destinationFile.SetFileSize(position);
     }
     return m_bPatching ? m_destinationFile.SetFileSize(static_cast<long long>(end)) : eTqovixSuccess;
 }

@@ -30,8 +30,9 @@ void CTqovixMovControl::SetServedSoundLimit(uint64_t bytes) { g_maxServedBytes =
 
 bool CTqovixMovControl::CanPatch(const TqovixAtomList& atoms, uint64_t& moovOffset) const
 {
-    // Leading atoms, then the one mdat, then the moov, ending the file.
-    if (!m_bPCM || atoms.size() < 2 || atoms.back()->GetType() != TqovixAtom::kMoov ||
+    // Leading atoms, then the one mdat, then the moov, ending the file; AAC chunks small enough to
+    // be held while their packets are filled out.
+    if ((!m_bPCM && !m_bGatherAacChunks) || atoms.size() < 2 || atoms.back()->GetType() != TqovixAtom::kMoov ||
         atoms[atoms.size() - 2]->GetType() != TqovixAtom::kMdat) {
         return false;
     }
@@ -108,10 +109,56 @@ eTqovixErrorCode CTqovixMovControl::BeginPatching(bool& started)
     }
     m_bPatching = true;
     m_moovOffset = moovOffset;
+    for (size_t k = 0; k + 2 < atoms.size(); ++k) {
+        m_mediaDataStart += atoms[k]->GetSize();
+    }
+    const CTqovixAtom& mdat = *atoms[atoms.size() - 2];
+    m_sourceSizePosition = static_cast<int64_t>(m_mediaDataStart) + (m_bLargeMediaDataHeader ? 8 : 0);
+    m_mediaDataStart += mdat.GetSize() - mdat.GetDataSize();
     m_outputMovieDataChunkIndex = m_movieDataChunks.size();
     started = true;
     // The rest beside the sound processing: the two take different cores.
     m_copy.Start(m_destinationFile, m_sourceFile, first, total);
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::PatchBytes(uint64_t at, const uint8_t* data, uint32_t size)
+{
+    // The copy must never write over them: claimed first, they are passed over.
+    eTqovixErrorCode result = m_copy.Claim(at, size);
+    // Runs of changed sound go out through the stream's buffer: a seek would flush it.
+    if (!TqovixFailed(result) && m_patchEnd != at) {
+        result = m_destinationFile.Seek(static_cast<long long>(at), CTqovixFile::eTqovixSeekBegin);
+    }
+    if (!TqovixFailed(result)) {
+        result = m_destinationFile.Write(data, size);
+    }
+    m_patchEnd = TqovixFailed(result) ? UINT64_MAX : at + size;
+    return result;
+}
+
+eTqovixErrorCode CTqovixMovControl::StopPatchingAt(const TqovixChunkInformation& chunk)
+{
+    // Everything before the chunk stays where the copy put it; from the chunk on, media is laid
+    // out in order over what the copy would have brought, which it need not bring any more.
+    eTqovixErrorCode result = m_copy.JoinUpTo(chunk.offset, m_keepGoing);
+    if (!TqovixFailed(result)) {
+        result = m_destinationFile.Seek(static_cast<long long>(chunk.offset), CTqovixFile::eTqovixSeekBegin);
+    }
+    if (TqovixFailed(result)) {
+        return result;
+    }
+    m_bPatching = false;
+    m_bPatchStopped = true;
+    m_patchEnd = UINT64_MAX;
+    m_mediaDataSizePosition = m_sourceSizePosition;
+    m_mediaDataSize = chunk.offset - m_mediaDataStart;
+    m_outputMovieDataChunkIndex = 0;
+    while (m_outputMovieDataChunkIndex < m_movieDataChunks.size() &&
+           m_movieDataChunks[m_outputMovieDataChunkIndex].offset < chunk.offset) {
+        ++m_outputMovieDataChunkIndex;
+    }
+    m_samplesInOutputChunk = 0;
     return eTqovixSuccess;
 }
 
@@ -128,7 +175,9 @@ double CTqovixMovControl::GetCopyFraction()
 void CTqovixMovControl::KeepServedSound(eTqovixErrorCode served, const void* buffer,
                                         const unsigned long* delivered) const
 {
-    if (!m_bPatchCandidate || m_bServedOverflow || TqovixFailed(served) || delivered == nullptr || *delivered == 0) {
+    // AAC's splicer keeps its own.
+    if (!m_bPCM || !m_bPatchCandidate || m_bServedOverflow || TqovixFailed(served) || delivered == nullptr ||
+        *delivered == 0) {
         return;
     }
     if (m_servedSound.Size() + *delivered > g_maxServedBytes ||
@@ -199,16 +248,7 @@ eTqovixErrorCode CTqovixMovControl::PatchSound(uint64_t offset, const uint8_t* d
                 TqovixSwapSamples(m_copyBuffer.data(), count, width);
                 bytes = m_copyBuffer.data();
             }
-            // The copy must never write over it: claimed first, it is passed over.
-            result = m_copy.Claim(at, count);
-            // Runs of changed sound go out through the stream's buffer: a seek would flush it.
-            if (!TqovixFailed(result) && m_patchEnd != at) {
-                result = m_destinationFile.Seek(static_cast<long long>(at), CTqovixFile::eTqovixSeekBegin);
-            }
-            if (!TqovixFailed(result)) {
-                result = m_destinationFile.Write(bytes, count);
-            }
-            m_patchEnd = TqovixFailed(result) ? UINT64_MAX : at + count;
+            result = PatchBytes(at, bytes, count);
             if (TqovixFailed(result)) {
                 return result;
             }

@@ -7,6 +7,8 @@
 #include <string_view>
 
 #include "atom/CTqovixContainerAtom.h"
+#include "codec/AACEncoder.h"
+#include "codec/TqovixAacSyntax.h"
 #include "movie/CTqovixMovControl.h"
 #include "visitor/CTqovixAudioInformationVisitor.h"
 #include "visitor/CTqovixMovieDataVisitor.h"
@@ -120,6 +122,16 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeTracks(bool forJob)
                               Words({"AAC sound chunk ", std::to_string(chunk.chunkNumber), " holds no packets"}));
             }
         }
+        result = ExamineAacSplicing(information);
+        if (TqovixFailed(result)) {
+            return result;
+        }
+        // A chunk is held whole before it is laid out, so its size bounds what is held.
+        constexpr uint64_t kMaxGatheredBytes = 4 << 20;
+        constexpr uint32_t kMaxGatheredPackets = 8192;
+        m_bGatherAacChunks = std::ranges::all_of(m_audioChunks, [](const TqovixChunkInformation& chunk) {
+            return chunk.size <= kMaxGatheredBytes && chunk.sampleCount <= kMaxGatheredPackets;
+        });
     }
     if (!forJob) {
         // The property query sets the sound up as a job's start does, so that it refuses what
@@ -185,6 +197,64 @@ eTqovixErrorCode CTqovixMovControl::AnalyzeSoundFormat(const CTqovixAudioInforma
     m_sampleBits = layout->bits;
     m_sampleBytes = layout->SampleBytes();
     m_frameBytes = m_sampleBytes * channels;
+    return eTqovixSuccess;
+}
+
+eTqovixErrorCode CTqovixMovControl::ExamineAacSplicing(const CTqovixAudioInformationVisitor& information)
+{
+    // A few packets from the start, the middle and the end show how the source's encoder works.
+    constexpr uint64_t kLooked = 16;
+    try {
+        m_chunkFirstPacket.assign(1, 0);
+        for (const TqovixChunkInformation& chunk : m_audioChunks) {
+            m_chunkFirstPacket.push_back(m_chunkFirstPacket.back() + chunk.sampleCount);
+        }
+    } catch (const std::bad_alloc&) {
+        return eTqovixErrorOutOfMemory;
+    }
+    const uint32_t channels = information.GetChannel();
+    const std::optional<TqovixAacSyntax::DecoderConfig> config = TqovixAacSyntax::ReadDecoderConfig(
+        information.GetAudioSpecificConfigData(), information.GetAudioSpecificConfigSize());
+    if (!config || config->objectType != 2) {
+        m_aacWholeReason = "its decoder configuration is not the low complexity profile our encoder writes";
+    } else if (config->sampleRate != information.GetSampleRateHz()) {
+        m_aacWholeReason = Words({"its decoder configuration says ", std::to_string(config->sampleRate),
+                                  " Hz where the track has ", std::to_string(information.GetSampleRateHz()), " Hz"});
+    } else if (config->channelConfiguration != channels) {
+        m_aacWholeReason = Words({"its decoder configuration lays out the channels as configuration ",
+                                  std::to_string(config->channelConfiguration), ", not as ", std::to_string(channels),
+                                  channels == 1 ? " channel" : " channels", " the way our encoder does"});
+    } else if (config->shortFrames || config->dependsOnCoreCoder || config->extension) {
+        m_aacWholeReason = "its decoder configuration asks for frames of 960 samples, a core coder or extensions our "
+                           "encoder does not write";
+    }
+    const uint64_t packets = m_chunkFirstPacket.back();
+    const uint8_t element = channels == 1 ? TqovixAacSyntax::kSce : TqovixAacSyntax::kCpe;
+    std::vector<uint8_t> packet;
+    for (const uint64_t from : {uint64_t{0}, packets / 2, packets > kLooked ? packets - kLooked : 0}) {
+        for (uint64_t index = from; index < std::min(packets, from + kLooked) && m_aacWholeReason.empty(); ++index) {
+            const eTqovixErrorCode result = ReadSourcePacket(index, packet);
+            // A file that cannot be read fails here as it would a moment later; a packet the
+            // tables cannot give is the decoder's to refuse.
+            if (TqovixFailed(result) && result != eTqovixErrorInternal) {
+                return result;
+            }
+            const std::optional<TqovixAacSyntax::FrameHeader> header =
+                TqovixFailed(result) ? std::nullopt : TqovixAacSyntax::ReadFrameHeader(packet.data(), packet.size());
+            if (!header || header->element != element) {
+                m_aacWholeReason = Words({"packet ", std::to_string(index + 1), channels == 1
+                                                                                    ? " does not begin with one channel"
+                                                                                    : " does not begin with a channel pair"});
+            } else if (header->windowSequence == TqovixAacSyntax::kOnlyLong &&
+                       header->windowShape != AACEncoder::kLongWindowShape) {
+                // A decoder shapes the first half of a frame as the frame before it said: after one
+                // of the source's, ours would not cancel what its overlap leaves.
+                m_aacWholeReason = AACEncoder::kLongWindowShape == 1
+                                       ? "its long frames use sine windows where our encoder uses Kaiser-Bessel ones"
+                                       : "its long frames use Kaiser-Bessel windows where our encoder uses sine ones";
+            }
+        }
+    }
     return eTqovixSuccess;
 }
 

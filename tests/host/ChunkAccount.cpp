@@ -132,8 +132,11 @@ bool ReadTrack(const Bytes& b, const Box& trak, TrackChunks& track, bool& inFile
             if (common != 0) {
                 size = perChunk * (frameBytes != 0 ? frameBytes : common);
             } else {
+                const uint64_t chunkOffset = Be(b, offsetsBegin + 8 + width * (chunk - 1), width);
                 for (uint64_t k = 0; k < perChunk; ++k) {
-                    size += Be(b, stsz->begin + 12 + 4 * (sample + k), 4);
+                    const uint64_t sampleSize = Be(b, stsz->begin + 12 + 4 * (sample + k), 4);
+                    track.samples.emplace_back(chunkOffset + size, sampleSize);
+                    size += sampleSize;
                 }
             }
             sample += perChunk;
@@ -170,6 +173,30 @@ bool ReadTrackChunks(const std::string& path, std::vector<TrackChunks>& tracks, 
         }
     }
     return true;
+}
+
+std::vector<std::vector<uint8_t>> SoundPackets(const std::string& path)
+{
+    std::vector<TrackChunks> tracks;
+    std::vector<std::vector<uint8_t>> packets;
+    if (!ReadTrackChunks(path, tracks, nullptr)) {
+        return packets;
+    }
+    std::ifstream in(path, std::ios::binary);
+    const Bytes b((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    for (const TrackChunks& track : tracks) {
+        if (track.handler != "soun") {
+            continue;
+        }
+        for (const auto& [offset, size] : track.samples) {
+            if (offset > b.size() || size > b.size() - offset) {
+                return {};
+            }
+            packets.emplace_back(b.begin() + static_cast<long>(offset), b.begin() + static_cast<long>(offset + size));
+        }
+        break;
+    }
+    return packets;
 }
 
 std::string AccountForEveryByte(const std::string& path)

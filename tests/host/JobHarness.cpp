@@ -12,6 +12,7 @@
 #include <utility>
 
 #include "MovieWriter.h"
+#include "host/ChunkAccount.h"
 
 namespace jobtest {
 
@@ -213,6 +214,79 @@ std::string CheckReencodedSound(const std::vector<int16_t>& source, const std::v
     return problems.str();
 }
 
+std::string CheckSplicedAac(const std::string& source, const std::string& destination, unsigned channels,
+                            const std::vector<moviekit::AfInterval>& intervals, uint64_t away, double jointDb,
+                            double peakShare, double* kept, uint64_t priming)
+{
+    constexpr uint64_t kPacketFrames = 1024;
+    const std::vector<std::vector<uint8_t>> before = SoundPackets(source);
+    const std::vector<std::vector<uint8_t>> after = SoundPackets(destination);
+    const std::vector<std::string> hashesBefore = PacketHashes(source, "a:0");
+    const std::vector<std::string> hashesAfter = PacketHashes(destination, "a:0");
+    if (before.empty() || after.size() != before.size() || hashesBefore.size() != before.size() ||
+        hashesAfter.size() != after.size()) {
+        return "the packets cannot be compared: " + std::to_string(before.size()) + " and " +
+               std::to_string(after.size()) + " in the tables, " + std::to_string(hashesBefore.size()) + " and " +
+               std::to_string(hashesAfter.size()) + " to ffmpeg";
+    }
+    std::vector<int16_t> a;
+    std::vector<int16_t> b;
+    if (!DecodeSound(source, a) || !DecodeSound(destination, b) || a.size() != b.size()) {
+        return "the sound does not decode to the same length";
+    }
+    std::ostringstream problems;
+    std::vector<bool> same(before.size());
+    uint64_t sameCount = 0;
+    for (size_t k = 0; k < before.size(); ++k) {
+        same[k] = before[k] == after[k];
+        sameCount += same[k] ? 1 : 0;
+        // Packet k's frame, in frames of the decoded sound: [1024 k - priming, 1024 (k + 2) - priming).
+        const auto first = static_cast<int64_t>(k * kPacketFrames) - static_cast<int64_t>(priming);
+        const bool isAway = std::ranges::none_of(intervals, [&](const moviekit::AfInterval& interval) {
+            return first + static_cast<int64_t>(2 * kPacketFrames + away) > static_cast<int64_t>(interval.startFrame) &&
+                   first < static_cast<int64_t>(interval.endFrame + away);
+        });
+        if (isAway && (!same[k] || hashesBefore[k] != hashesAfter[k])) {
+            problems << "packet " << k << " is away from every interval but not the source's own ("
+                     << (same[k] ? "ffmpeg's hashes differ" : "its bytes differ") << "); ";
+        }
+    }
+    if (kept != nullptr) {
+        *kept = static_cast<double>(sameCount) / static_cast<double>(before.size());
+    }
+    const uint64_t frames = a.size() / channels;
+    for (size_t k = 1; k < same.size(); ++k) {
+        if (same[k] == same[k - 1]) {
+            continue;
+        }
+        // Packets k - 1 and k meet in the decoder's output for packet k.
+        const auto from = static_cast<int64_t>(k * kPacketFrames) - static_cast<int64_t>(priming);
+        if (from < 0 || static_cast<uint64_t>(from) + kPacketFrames > frames) {
+            continue;
+        }
+        for (unsigned c = 0; c < channels; ++c) {
+            double signal = 0;
+            double difference = 0;
+            double peak = 0;
+            double loudest = 0;
+            for (auto f = static_cast<uint64_t>(from); f < static_cast<uint64_t>(from) + kPacketFrames; ++f) {
+                const double x = a[f * channels + c];
+                const double d = b[f * channels + c] - x;
+                signal += x * x;
+                difference += d * d;
+                peak = std::max(peak, std::fabs(d));
+                loudest = std::max(loudest, std::fabs(x));
+            }
+            const double db = difference == 0 ? 999.0 : signal == 0 ? -999.0 : 10.0 * std::log10(signal / difference);
+            if (db < jointDb || peak > peakShare * loudest) {
+                problems << "joint before packet " << k << ", channel " << c << ": " << db << " dB, a sample off by "
+                         << peak << " where the loudest is " << loudest << "; ";
+            }
+        }
+    }
+    return problems.str();
+}
+
 std::vector<testsupport::FrameSpan> Spans(const std::vector<moviekit::AfInterval>& intervals, uint64_t shift)
 {
     std::vector<testsupport::FrameSpan> spans;
@@ -402,48 +476,6 @@ bool WriteSparseMovie(const std::string& path, const moviekit::MovieRecipe& reci
         return false;
     }
     return true;
-}
-
-bool EncodeAacPackets(const std::vector<int16_t>& pcm, uint32_t sampleRate, uint16_t channels, uint32_t bitRate,
-                      std::vector<std::vector<uint8_t>>& packets)
-{
-    testsupport::TempDir scratch;
-    const std::string raw = scratch.File("in.raw");
-    const std::string adts = scratch.File("out.aac");
-    std::vector<uint8_t> bytes(pcm.size() * 2);
-    for (size_t k = 0; k < pcm.size(); ++k) {
-        const auto bits = static_cast<uint16_t>(pcm[k]);
-        bytes[2 * k] = static_cast<uint8_t>(bits);
-        bytes[2 * k + 1] = static_cast<uint8_t>(bits >> 8);
-    }
-    if (!testsupport::WriteFile(raw, bytes)) {
-        return false;
-    }
-    std::string output;
-    const std::string command = "ffmpeg -v error -nostdin -f s16le -ar " + std::to_string(sampleRate) + " -ac " +
-                                std::to_string(channels) + " -i " + ShellQuote(raw) + " -c:a aac -b:a " +
-                                std::to_string(bitRate) + " -f adts " + ShellQuote(adts) + " 2>&1";
-    if (RunCommand(command, &output) != 0 || !output.empty()) {
-        return false;
-    }
-    const std::vector<uint8_t> stream = testsupport::ReadFile(adts);
-    packets.clear();
-    for (size_t at = 0; at + 7 <= stream.size();) {
-        const uint8_t* h = stream.data() + at;
-        // Sync word, one raw data block per frame, header of 7 bytes or 9 with its CRC.
-        if (h[0] != 0xFF || (h[1] & 0xF0) != 0xF0 || (h[6] & 0x03) != 0) {
-            return false;
-        }
-        const size_t header = (h[1] & 0x01) != 0 ? 7 : 9;
-        const size_t length = (size_t{h[3] & 0x03u} << 11) | (size_t{h[4]} << 3) | (h[5] >> 5);
-        if (length <= header || at + length > stream.size()) {
-            return false;
-        }
-        packets.emplace_back(stream.begin() + static_cast<std::ptrdiff_t>(at + header),
-                             stream.begin() + static_cast<std::ptrdiff_t>(at + length));
-        at += length;
-    }
-    return !packets.empty();
 }
 
 void HostTest::SetUp()

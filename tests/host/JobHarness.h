@@ -53,6 +53,18 @@ std::string CheckReencodedSound(const std::vector<int16_t>& source, const std::v
                                 unsigned channels, const std::vector<testsupport::FrameSpan>& spans, uint64_t margin,
                                 uint64_t leadIn, double keptDb, double changedDb);
 
+// AAC re-encoded only around the AF intervals (frames of the decoded sound, which begins
+// `priming` frames into the track's packets): every packet whose frame lies farther than `away`
+// frames from each interval is the source's own, by the tests' own walk of the tables and by
+// ffmpeg's packet hashes; and decoding across every joint between the source's packets and
+// re-encoded ones stays within coding noise of the source's decode: per channel at least
+// `jointDb` of signal over difference, and no sample off by more than `peakShare` of the
+// loudest sample around the joint. Empty when that holds, else what does not; `kept` receives
+// the share of packets that are the source's own.
+std::string CheckSplicedAac(const std::string& source, const std::string& destination, unsigned channels,
+                            const std::vector<moviekit::AfInterval>& intervals, uint64_t away, double jointDb,
+                            double peakShare, double* kept = nullptr, uint64_t priming = 1024);
+
 // AF intervals as frame spans, moved `shift` frames on.
 std::vector<testsupport::FrameSpan> Spans(const std::vector<moviekit::AfInterval>& intervals, uint64_t shift = 0);
 // Whether `frame` lies within `margin` frames of an interval or inside one.
@@ -82,9 +94,6 @@ bool Contains(const std::vector<uint8_t>& bytes, const std::string& text);
 // (video frames, when they are that large) becomes a hole that reads as zeros.
 bool WriteSparseMovie(const std::string& path, const moviekit::MovieRecipe& recipe, uint64_t holeBytes,
                       moviekit::MovieLayout* layout, std::string* error);
-// Raw AAC-LC packets (ADTS headers removed) that ffmpeg's encoder makes of interleaved s16.
-bool EncodeAacPackets(const std::vector<int16_t>& pcm, uint32_t sampleRate, uint16_t channels, uint32_t bitRate,
-                      std::vector<std::vector<uint8_t>>& packets);
 
 class HostTest : public ::testing::Test {
 protected:

@@ -1,5 +1,7 @@
 #include "support/TestSupport.h"
 
+#include "support/ProcessedRegions.h"
+
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
@@ -129,6 +131,64 @@ void PutBE32(std::vector<uint8_t>& bytes, size_t at, uint32_t value)
     for (int k = 0; k < 4; ++k) {
         bytes[at + k] = static_cast<uint8_t>(value >> (24 - 8 * k));
     }
+}
+
+bool EncodeAacPackets(const std::vector<int16_t>& pcm, uint32_t sampleRate, uint16_t channels, uint32_t bitRate,
+                      std::vector<std::vector<uint8_t>>& packets)
+{
+    TempDir scratch;
+    const std::string raw = scratch.File("in.raw");
+    const std::string adts = scratch.File("out.aac");
+    std::vector<uint8_t> bytes(pcm.size() * 2);
+    for (size_t k = 0; k < pcm.size(); ++k) {
+        const auto bits = static_cast<uint16_t>(pcm[k]);
+        bytes[2 * k] = static_cast<uint8_t>(bits);
+        bytes[2 * k + 1] = static_cast<uint8_t>(bits >> 8);
+    }
+    if (!WriteFile(raw, bytes)) {
+        return false;
+    }
+    std::string output;
+    const std::string command = "ffmpeg -v error -nostdin -f s16le -ar " + std::to_string(sampleRate) + " -ac " +
+                                std::to_string(channels) + " -i " + ShellQuote(raw) + " -c:a aac -b:a " +
+                                std::to_string(bitRate) + " -f adts " + ShellQuote(adts) + " 2>&1";
+    if (RunCommand(command, &output) != 0 || !output.empty()) {
+        return false;
+    }
+    const std::vector<uint8_t> stream = ReadFile(adts);
+    packets.clear();
+    for (size_t at = 0; at + 7 <= stream.size();) {
+        const uint8_t* h = stream.data() + at;
+        // Sync word, one raw data block per frame, header of 7 bytes or 9 with its CRC.
+        if (h[0] != 0xFF || (h[1] & 0xF0) != 0xF0 || (h[6] & 0x03) != 0) {
+            return false;
+        }
+        const size_t header = (h[1] & 0x01) != 0 ? 7 : 9;
+        const size_t length = (size_t{h[3] & 0x03u} << 11) | (size_t{h[4]} << 3) | (h[5] >> 5);
+        if (length <= header || at + length > stream.size()) {
+            return false;
+        }
+        packets.emplace_back(stream.begin() + static_cast<std::ptrdiff_t>(at + header),
+                             stream.begin() + static_cast<std::ptrdiff_t>(at + length));
+        at += length;
+    }
+    return !packets.empty();
+}
+
+std::vector<std::vector<uint8_t>> MotorAacPackets(uint64_t count, uint32_t rate, const std::vector<uint64_t>& spans,
+                                                  uint32_t bitRate)
+{
+    std::vector<FrameSpan> frames;
+    for (size_t k = 0; k + 1 < spans.size(); k += 2) {
+        frames.push_back({spans[k], spans[k + 1]});
+    }
+    std::vector<std::vector<uint8_t>> packets;
+    if (!EncodeAacPackets(MotorOverSpans(count * 1024, 2, rate, frames, 0.6), rate, 2, bitRate, packets) ||
+        packets.size() < count) {
+        return {};
+    }
+    packets.resize(count);
+    return packets;
 }
 
 }  // namespace testsupport

@@ -52,6 +52,15 @@ std::string Shell(const std::string& command);
 size_t ThreadCount();
 size_t DescriptorCount();
 
+// Raw AAC-LC packets (ADTS headers removed) that ffmpeg's encoder makes of interleaved s16.
+bool EncodeAacPackets(const std::vector<int16_t>& pcm, uint32_t sampleRate, uint16_t channels, uint32_t bitRate,
+                      std::vector<std::vector<uint8_t>>& packets);
+// `count` packets of stereo sound that processing must change inside each span (frames of the
+// decoded sound: loud motor-like rumble, see MotorOverSpans) and leave alone elsewhere,
+// encoded by ffmpeg; empty when ffmpeg fails.
+std::vector<std::vector<uint8_t>> MotorAacPackets(uint64_t count, uint32_t rate, const std::vector<uint64_t>& spans,
+                                                  uint32_t bitRate);
+
 // The names a shared library defines for the dynamic linker, version nodes aside.
 std::set<std::string> ExportedNames(const std::string& library);
 

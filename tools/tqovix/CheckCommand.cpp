@@ -13,7 +13,8 @@ namespace {
 constexpr const char* kUsage =
     "usage: tqovix check [-r] [--json] PATH...\n"
     "  asks the library, for each movie, whether it can remove the AF noise of its sound,\n"
-    "  and prints \"FILE: processable\" or \"FILE: not processable: REASON\". A folder PATH\n"
+    "  and prints \"FILE: processable\" or \"FILE: not processable: REASON\"; an AAC movie whose\n"
+    "  sound must be re-encoded whole (not only around the AF intervals) says why. A folder PATH\n"
     "  is searched for movies (by their content, not their names; other files are passed over)\n"
     "  -r, --recursive   search folders and their subfolders\n"
     "  --json            one JSON object with a row per file instead of text\n"
@@ -44,6 +45,7 @@ int CheckCommand(const Arguments& arguments)
         const int code = TqGetPropertyOVIX(file.c_str());
         const Verdict verdict = Explain(code, file);
         allProcessable = allProcessable && code == 0;
+        const std::string whole = code == 0 ? AacWholeReason(file) : std::string();
         if (line.Has("json")) {
             JsonObject row;
             row.Add("file", file).Add("processable", code == 0).Add("code", code).Add("reason", verdict.Key());
@@ -52,10 +54,17 @@ int CheckCommand(const Arguments& arguments)
             } else {
                 row.Add("message", verdict.text);
             }
+            if (whole.empty()) {
+                row.AddNull("aacReencodedWhole");
+            } else {
+                row.Add("aacReencodedWhole", whole);
+            }
             rows.push_back(row.Text());
         } else if (code == 0) {
-            if (!line.Quiet()) {
+            if (!line.Quiet() && whole.empty()) {
                 std::printf("%s: processable\n", file.c_str());
+            } else if (!line.Quiet()) {
+                std::printf("%s: processable; its AAC sound is re-encoded whole: %s\n", file.c_str(), whole.c_str());
             }
         } else {
             std::printf("%s: not processable: %s\n", file.c_str(), verdict.text.c_str());

@@ -127,6 +127,9 @@ Inspection Inspect(const std::string& path)
         TqCloseOVIX();
     }
     inspection.verdict = answer == 0 ? Verdict{} : Explain(answer, path);
+    if (answer == 0) {
+        inspection.aacWhole = AacWholeReason(path);
+    }
     CTqovixFile file;
     CTqovixAtomControl tree;
     if (TqovixFailed(file.Open(path.c_str(), 1)) || TqovixFailed(tree.Initialize(file))) {
@@ -136,6 +139,10 @@ Inspection Inspect(const std::string& path)
     TqovixAtomList atoms;
     tree.GetAtoms(atoms);
     inspection.tracks = CollectTracks(tree, atoms);
+    CTqovixAudioInformationVisitor sound;
+    inspection.aacProcessable = answer == 0 && !TqovixFailed(tree.Analyze(sound)) &&
+                                sound.GetTrackIndex() < inspection.tracks.size() &&
+                                inspection.tracks[sound.GetTrackIndex()].aac;
     inspection.seconds = MovieSeconds(atoms);
     CTqovixTrimInformationVisitor trim;
     if (tree.Analyze(trim) == eTqovixSuccess) {

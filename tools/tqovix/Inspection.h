@@ -45,6 +45,10 @@ struct Inspection {
     uint64_t afBytes = 0;
     uint64_t levelBytes = 0;
     Verdict verdict;  // the library's answer (0, 20 processed, or why not) and its reason
+    // A processable AAC movie: whether a job keeps the source's packets outside the spans it
+    // re-encodes around the AF intervals, or re-encodes the whole track, and why.
+    bool aacProcessable = false;
+    std::string aacWhole;
 };
 
 Inspection Inspect(const std::string& path);

@@ -84,6 +84,11 @@ std::string InspectionJson(const Inspection& in, bool whole)
     } else {
         report.Add("message", in.verdict.text);
     }
+    if (in.aacWhole.empty()) {
+        report.AddNull("aacReencodedWhole");
+    } else {
+        report.Add("aacReencodedWhole", in.aacWhole);
+    }
     return report.Text();
 }
 
@@ -118,6 +123,11 @@ void PrintInspectionText(const Inspection& in, bool summaryOnly)
     std::printf("  AF information processed: %s\n", processed != nullptr ? processed : "unknown");
     if (in.verdict.reason != Reason::None && in.verdict.reason != Reason::AlreadyProcessed) {
         std::printf("  the library would refuse it: %s\n", in.verdict.text.c_str());
+    }
+    if (!in.aacWhole.empty()) {
+        std::printf("  AAC sound: re-encoded whole, because %s\n", in.aacWhole.c_str());
+    } else if (in.aacProcessable) {
+        std::printf("  AAC sound: the source's packets kept, re-encoded only around the AF intervals\n");
     }
     // The atoms of a still or a note are noise.
     if (summaryOnly || (!in.structure.atomic && in.structure.atoms.empty())) {

@@ -229,6 +229,15 @@ Verdict CheckDestination(const std::string& source, const std::string& destinati
     return verdict;
 }
 
+std::string AacWholeReason(const std::string& source)
+{
+    CTqovixMovControl control;
+    const bool opened = !TqovixFailed(control.Initialize(source.c_str(), nullptr));
+    std::string reason = opened ? control.GetAacWholeReason() : std::string();
+    control.Close();
+    return reason;
+}
+
 Verdict Explain(int code, const std::string& source, const std::string& destination)
 {
     if (code == 0) {

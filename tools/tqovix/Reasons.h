@@ -66,6 +66,9 @@ Verdict MakeVerdict(int code, Reason reason, const std::string& detail = {});
 // The reason behind exported code `code` (0: none) for a job from `source` to
 // `destination` (empty: a property query).
 Verdict Explain(int code, const std::string& source, const std::string& destination = {});
+// For a processable AAC movie whose sound is re-encoded whole rather than only around the AF
+// intervals (an encoder configuration ours cannot splice into): why, in words; empty otherwise.
+std::string AacWholeReason(const std::string& source);
 // Whether the reason is about the destination rather than the source.
 bool AboutDestination(Reason reason);
 // Whether a job may write `destination`: not the source itself, not a directory, and not a
