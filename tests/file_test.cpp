@@ -316,16 +316,6 @@ int FailOneOperation(eTqovixFileOperation operation)
     return ++g_faultSeen == g_faultOccurrence.load() ? g_faultErrno.load() : 0;
 }
 
-// Whether `directory` takes unnamed files, and /proc is there to name them through.
-bool UnnamedFilesIn(const std::string& directory)
-{
-    const int descriptor = open(directory.c_str(), O_TMPFILE | O_RDWR | O_CLOEXEC, 0600);
-    if (descriptor >= 0) {
-        close(descriptor);
-    }
-    return descriptor >= 0 && access("/proc/self/fd", X_OK) == 0;
-}
-
 std::vector<std::string> Entries(const std::string& directory)
 {
     std::vector<std::string> names;
@@ -361,7 +351,7 @@ TEST_P(PublishFaultTest, TheErrorComesBackAndTheNameKeepsWhatItHeld)
 {
     const PublishFaultRow& row = GetParam();
     TempDir temp;
-    if (row.unnamed && !UnnamedFilesIn(temp.Path())) {
+    if (row.unnamed && !testsupport::UnnamedFilesIn(temp.Path())) {
         GTEST_SKIP() << "no unnamed files on this volume";
     }
     CTqovixFile::SetUnnamedDestinations(row.unnamed);
@@ -431,7 +421,7 @@ TEST_P(LongNameTest, DestinationOf250BytesIsWrittenAndReplaced)
 {
     const LongNameRow& row = GetParam();
     TempDir temp;
-    if (row.unnamed && !UnnamedFilesIn(temp.Path())) {
+    if (row.unnamed && !testsupport::UnnamedFilesIn(temp.Path())) {
         GTEST_SKIP() << "no unnamed files on this volume";
     }
     CTqovixFile::SetUnnamedDestinations(row.unnamed);
