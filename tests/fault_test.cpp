@@ -193,17 +193,6 @@ struct NamingRow {
 };
 void PrintTo(const NamingRow& row, std::ostream* out) { *out << row.name; }
 
-// Whether the scratch volume takes unnamed files, and /proc is there to name them through.
-bool UnnamedFilesHere()
-{
-    testsupport::TempDir dir;
-    const int descriptor = open(dir.Path().c_str(), O_TMPFILE | O_RDWR | O_CLOEXEC, 0600);
-    if (descriptor >= 0) {
-        close(descriptor);
-    }
-    return descriptor >= 0 && access("/proc/self/fd", X_OK) == 0;
-}
-
 std::atomic<int> g_namingOperation{-1};
 std::atomic<long> g_namingCalls{0};
 
@@ -254,7 +243,7 @@ TEST_P(NamingFaultTest, TheHostHearsWhatTheErrorMeansAndTheNameKeepsItsFile)
         EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.Path()), {}), row.replacing ? 2 : 1)
             << "a file left behind";
     }
-    if (row.operation == Op::Link && !UnnamedFilesHere()) {
+    if (row.operation == Op::Link && !testsupport::UnnamedFilesIn(testsupport::TempDir().Path())) {
         GTEST_SKIP() << "no unnamed files on this volume: nothing is named by a link";
     }
     EXPECT_TRUE(reached) << "no job named its destination by this operation";

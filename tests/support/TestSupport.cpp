@@ -3,6 +3,7 @@
 #include "support/ProcessedRegions.h"
 
 #include <cstdio>
+#include <fcntl.h>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -114,6 +115,15 @@ std::set<std::string> ExportedNames(const std::string& library)
         }
     }
     return names;
+}
+
+bool UnnamedFilesIn(const std::string& directory)
+{
+    const int descriptor = open(directory.c_str(), O_TMPFILE | O_RDWR | O_CLOEXEC, 0600);
+    if (descriptor >= 0) {
+        close(descriptor);
+    }
+    return descriptor >= 0 && access("/proc/self/fd", X_OK) == 0;
 }
 
 bool DropRoot()

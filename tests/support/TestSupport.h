@@ -90,6 +90,8 @@ auto InChild(Body body, unsigned seconds = 300) -> std::optional<decltype(body()
     }
     return got ? std::optional(result) : std::nullopt;
 }
+// Whether `directory` takes unnamed files, and /proc is there to name them through.
+bool UnnamedFilesIn(const std::string& directory);
 // In such a child: gives up root for "nobody", so that file modes apply. False when that fails.
 bool DropRoot();
 
