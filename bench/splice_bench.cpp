@@ -24,6 +24,7 @@
 #include "codec/AACDecoder.h"
 #include "codec/CTqovixAacSplicer.h"
 #include "support/MotorSound.h"
+#include "support/SpliceCollector.h"
 
 namespace {
 
@@ -56,36 +57,6 @@ std::vector<Packet> ReadAdts(const char* path)
     }
     return packets;
 }
-
-// Collects what the splicer writes.
-class Collector : public CTqovixAacSplicer::Sink {
-public:
-    explicit Collector(const std::vector<Packet>& source) : m_source(source) {}
-    eTqovixErrorCode CarrySourcePackets(uint64_t count) override
-    {
-        for (uint64_t k = 0; k < count; ++k) {
-            written.push_back(m_source[written.size()]);
-            carried.push_back(true);
-        }
-        return eTqovixSuccess;
-    }
-    eTqovixErrorCode WriteEncodedPacket(const uint8_t* packet, uint32_t size) override
-    {
-        written.emplace_back(packet, packet + size);
-        carried.push_back(false);
-        return eTqovixSuccess;
-    }
-    eTqovixErrorCode ReadSourcePacket(uint64_t index, std::vector<uint8_t>& packet) override
-    {
-        packet = m_source[index];
-        return eTqovixSuccess;
-    }
-    std::vector<Packet> written;
-    std::vector<bool> carried;
-
-private:
-    const std::vector<Packet>& m_source;
-};
 
 // Decodes a packet stream as a job serves it: the first packet's sound dropped, one packet late.
 std::vector<int16_t> Decode(const std::vector<Packet>& packets, const ACFormat& aac, const ACFormat& pcm)
@@ -193,7 +164,7 @@ int main(int argc, char** argv)
         }
     }
 
-    Collector collector(source);
+    testsupport::SpliceCollector collector(source);
     CTqovixAacSplicer splicer;
     splicer.SetTuning(tuning);
     if (TqovixFailed(splicer.Open(pcm, aac, bitRate, &collector))) {

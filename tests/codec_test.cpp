@@ -18,6 +18,7 @@
 #include "codec/CTqovixAacSplicer.h"
 #include "codec/CTqovixAudioDataControlMac.h"
 #include "codec/TqovixAacSyntax.h"
+#include "support/SpliceCollector.h"
 #include "support/TestSupport.h"
 
 namespace {
@@ -570,37 +571,6 @@ TEST(AacPaddingTest, FilledOutPacketsSoundTheSame)
     EXPECT_FALSE(TqovixAacSyntax::PadToSize(unended.data(), unended.size(), unended.size() + 10, out));
 }
 
-// What the splicer hands its writer: the source's packets where the sound came back unchanged,
-// re-encoded ones around the change, in order.
-class SpliceCollector : public CTqovixAacSplicer::Sink {
-public:
-    explicit SpliceCollector(const Packets& source) : m_source(source) {}
-    eTqovixErrorCode CarrySourcePackets(uint64_t count) override
-    {
-        for (uint64_t k = 0; k < count && written.size() < m_source.size(); ++k) {
-            written.push_back(m_source[written.size()]);
-            carried.push_back(true);
-        }
-        return eTqovixSuccess;
-    }
-    eTqovixErrorCode WriteEncodedPacket(const uint8_t* packet, uint32_t size) override
-    {
-        written.emplace_back(packet, packet + size);
-        carried.push_back(false);
-        return eTqovixSuccess;
-    }
-    eTqovixErrorCode ReadSourcePacket(uint64_t index, std::vector<uint8_t>& packet) override
-    {
-        packet = m_source.at(index);
-        return eTqovixSuccess;
-    }
-    Packets written;
-    std::vector<bool> carried;
-
-private:
-    const Packets& m_source;
-};
-
 struct SpliceRun {
     Packets written;
     std::vector<bool> carried;
@@ -617,7 +587,7 @@ SpliceRun Splice(const Packets& source, uint64_t from, uint64_t to, bool whole =
     for (uint64_t k = from * kBlockSamples; k < std::min(to * kBlockSamples, processed.size()); ++k) {
         processed[k] = static_cast<int16_t>(processed[k] / 2);
     }
-    SpliceCollector collector(source);
+    testsupport::SpliceCollector collector(source);
     CTqovixAacSplicer splicer;
     SpliceRun run;
     run.result = splicer.Open(PcmFormat(), AacFormat(), 128000 * kChannels, &collector);
