@@ -4,6 +4,8 @@
 #include <cerrno>
 #include <chrono>
 #include <cstdio>
+#include <csignal>
+#include <cstdlib>
 #include <fcntl.h>
 #include <filesystem>
 #include <sys/stat.h>
@@ -22,6 +24,25 @@ constexpr int kReserveAttempts = 1000;
 // for the one the library adds where it writes under a hidden name itself (255 bytes in all).
 constexpr size_t kKeptNameBytes = 160;
 
+// The writer's process id from a hidden name's ".<pid>-<n>" before the suffix: whether it still
+// runs. A job gives its movie the source's dates before the movie takes its name, so a day-old
+// date alone does not tell a partial left behind from one a running job is about to publish.
+bool WriterRuns(const std::string& name)
+{
+    const std::string stem = name.substr(0, name.size() - std::char_traits<char>::length(kPartialSuffix));
+    const size_t dash = stem.rfind('-');
+    const size_t dot = dash == std::string::npos ? std::string::npos : stem.rfind('.', dash);
+    if (dot == std::string::npos || dash == dot + 1) {
+        return false;
+    }
+    char* end = nullptr;
+    const long pid = std::strtol(stem.c_str() + dot + 1, &end, 10);
+    if (end != stem.c_str() + dash || pid <= 0) {
+        return false;
+    }
+    return pid == getpid() || kill(static_cast<pid_t>(pid), 0) == 0 || errno == EPERM;
+}
+
 }  // namespace
 
 void RemoveStalePartials(const std::string& destination)
@@ -35,7 +56,7 @@ void RemoveStalePartials(const std::string& destination)
         std::error_code ignored;
         // Younger ones may belong to a job running right now, in this process or another.
         if (name.size() > 1 && name[0] == '.' && name.ends_with(kPartialSuffix) && it->is_regular_file(ignored) &&
-            now - it->last_write_time(ignored) > kStaleAfter && fs::remove(it->path(), ignored)) {
+            now - it->last_write_time(ignored) > kStaleAfter && !WriterRuns(name) && fs::remove(it->path(), ignored)) {
             std::fprintf(stderr, "tqovix: removed %s, left by a job that was stopped before it ended\n",
                          it->path().c_str());
         }
