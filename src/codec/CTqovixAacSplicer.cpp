@@ -12,9 +12,9 @@ namespace {
 
 constexpr uint64_t kFrames = 1024;
 // A fresh encoder's own packets 0 to 2 hold some of its priming silence; fed from 64 frames
-// into a packet's sound, its packet 3 is the first of the track's packets with nothing else.
+// into a packet's sound, its packet 3 is the first of the track's packets with nothing else
+// (which is why a span's feed starts a packet before the first it may keep).
 constexpr int64_t kFeedOffset = 64;
-constexpr int64_t kFreshPackets = 3;
 constexpr unsigned int kStreamBufferSize = 4096;
 // Decoding through a joint may differ from the sound wanted by a few times the coding noise
 // heard on either side of it (a second generation here, the source's own noise there), never
